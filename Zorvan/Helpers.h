@@ -1,0 +1,33 @@
+#pragma once
+
+#include <optional>
+#include <string_view>
+#include <utility>
+
+#include "platform/Value.h"
+
+namespace zorvan {
+
+/// A new array of what `transform` answers for each element, in order, without the absent answers.
+/// `transform` takes an element and answers std::optional<platform::Value>.
+template <class Collection, class Transform>
+platform::Array arrayWithValues(const Collection& collection, Transform&& transform) {
+    platform::Array result;
+    for (const auto& element : collection) {
+        if (std::optional<platform::Value> value = transform(element))
+            result.append(*std::move(value));
+    }
+    return result;
+}
+
+/// A copy of `dictionary` with `value` under `key`, or without that key when there is no value.
+platform::Dictionary dictionaryChanging(const platform::Dictionary& dictionary,
+                                        std::string_view key, std::optional<platform::Value> value);
+
+/// Compares two version texts, `receiver` with `other`: -1 ascending, 0 same, +1 descending. Runs
+/// of the digits 0 to 9 compare by their numeric value, however long and with or without leading
+/// zeros; every other byte compares by value, case-sensitively; the first difference decides, and a
+/// text that ends first comes first.
+int compareVersionString(std::string_view receiver, std::string_view other);
+
+}  // namespace zorvan

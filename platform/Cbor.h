@@ -1,0 +1,65 @@
+#pragma once
+
+#include <memory>
+#include <string>
+#include <string_view>
+
+#include "platform/Error.h"
+#include "platform/Value.h"
+
+namespace platform {
+
+/// The encoding of values in messages and in the catalogue: CBOR (RFC 8949), a subset of it.
+///
+/// | value | item |
+/// |---|---|
+/// | boolean | true, false |
+/// | integer | unsigned or negative integer |
+/// | real | float (every width is read, 64 bits are written) |
+/// | string | text string: UTF-8 without NUL |
+/// | data | byte string |
+/// | date | tag 1, then an integer or a float: seconds since 1970 |
+/// | UUID | tag 37, then a byte string of 16 bytes |
+/// | packed property list | tag 24, then a byte string that holds one encoded item |
+/// | array | array |
+/// | dictionary | map whose keys are text strings, each once; written in the byte order of the keys
+/// |
+///
+/// Lengths are definite. Everything else (null, undefined, other tags, other simple values,
+/// indefinite lengths) is refused.
+
+/// Deepest nesting of arrays and maps that is read: what stands at the top has depth 1.
+inline constexpr int kMaxCborDepth = 128;
+
+/// Appends the encoding of `value` to `out`. A dictionary that carries its encoded bytes is copied,
+/// not walked. Never fails.
+void encodeCbor(const Value& value, std::string& out);
+void encodeCbor(const Dictionary& value, std::string& out);
+/// Appends the heads of an array or map, an unsigned integer and a text string, for callers that
+/// write the parts of an item one by one.
+void encodeCborArrayHead(std::size_t count, std::string& out);
+void encodeCborUnsigned(std::uint64_t value, std::string& out);
+
+/// Gives a dictionary its encoded bytes, unless it carries them already. Safe on shared
+/// dictionaries.
+void keepCborEncoded(const Dictionary& dictionary);
+
+enum class CborOptions {
+    Plain,
+    /// Every dictionary made carries its slice of the bytes as its encoded form, and keeps all of
+    /// the bytes alive. For bytes that came from `encodeCbor` (the catalogue), not for a peer's.
+    KeepEncoded,
+};
+
+/// Reads the one item that `bytes` holds. Checks counts and lengths against what is left of the
+/// bytes before it allocates, the depth, UTF-8 and duplicate keys; nothing may follow the item. The
+/// error says what is wrong and at which offset (domain "Cbor").
+Result<Value> decodeCbor(std::shared_ptr<const std::string> bytes,
+                         CborOptions options = CborOptions::Plain);
+Result<Value> decodeCbor(const EncodedBytes& bytes, CborOptions options = CborOptions::Plain);
+
+/// The value of a packed property list: the one it was made from, or its bytes decoded. Errors: as
+/// `decodeCbor`; a value that is no property list.
+Result<Value> unpack(const Packed& packed);
+
+}  // namespace platform

@@ -1,0 +1,42 @@
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "platform/Error.h"
+#include "platform/Value.h"
+#include "platform/lum/AuditToken.h"
+
+namespace platform {
+
+/// What a process may do: a handle for entitlement queries. Usable from any thread.
+class CodeSigningTask {
+  public:
+    struct Answer {
+        std::optional<Value> value;
+        std::optional<Error> error;  // the entitlements could not be read
+    };
+
+    virtual ~CodeSigningTask() = default;
+    virtual Answer entitlement(const std::string& name) = 0;
+};
+
+class CodeSigning {
+  public:
+    virtual ~CodeSigning() = default;
+    virtual std::unique_ptr<CodeSigningTask> makeTask(const AuditToken& token) = 0;
+};
+
+/// Entitlements from files. A process's are those of `Entitlements.plist` of the bundle around its
+/// executable, or of `<executable>.entitlements` beside an executable that lies in no bundle; read
+/// once, at the task's first query.
+///
+/// The file is trusted when it and every directory above it are owned by root or by this user and
+/// writable by nobody else (a sticky directory passes); for a sandboxed process, only when all are
+/// root's. From an untrusted file only "com.orbel.developer.zorvan.allowedplugins" counts, which
+/// takes rights away. A process in another user or mount namespace never holds an entitlement that
+/// begins with "com.orbel.private.".
+std::unique_ptr<CodeSigning> makeFileCodeSigning();
+
+}  // namespace platform

@@ -1,0 +1,33 @@
+#pragma once
+
+#include <memory>
+#include <mutex>
+
+#include "platform/Value.h"
+
+namespace platform {
+
+/// A dictionary that was made from one, or from its encoded bytes and is then decoded at its first
+/// use. Immutable; copies share it; usable from any thread.
+class LazyDictionary {
+  public:
+    LazyDictionary() : LazyDictionary(Dictionary()) {}
+    LazyDictionary(Dictionary dictionary);
+    /// Bytes of `encodeCbor`. Should they turn out not to be a dictionary's, an error line is
+    /// logged and the dictionary is empty.
+    explicit LazyDictionary(EncodedBytes bytes);
+
+    /// The dictionary; the reference is good as long as this object. Made from bytes, it and every
+    /// dictionary inside it carry their encoded bytes.
+    const Dictionary& get() const;
+
+  private:
+    struct State {
+        EncodedBytes bytes;
+        std::once_flag decoded;
+        Dictionary dictionary;
+    };
+    std::shared_ptr<State> state_;
+};
+
+}  // namespace platform

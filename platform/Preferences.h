@@ -1,0 +1,41 @@
+#pragma once
+
+#include <map>
+#include <optional>
+#include <string>
+
+#include "platform/Files.h"
+#include "platform/Value.h"
+
+namespace platform {
+
+struct Directories;
+
+/// Preferences of the current user on the current host, by domain:
+/// <config>/zorvan/ByHost/<domain>.<machine id>.plist, a dictionary of keys. Use from one thread at
+/// a time.
+class Preferences {
+  public:
+    explicit Preferences(const Directories& directories);
+
+    /// Makes values that other processes have written since visible: re-reads the domain's file
+    /// when its stamp has changed. A file that cannot be read, or is no dictionary, counts as
+    /// empty, with one error line each time it changes.
+    void synchronize(const std::string& domain);
+    /// The value of a key as of the last `synchronize`; none when it is absent.
+    std::optional<Value> value(const std::string& domain, const std::string& key) const;
+
+    /// The file of a domain.
+    std::string path(const std::string& domain) const;
+
+  private:
+    struct Domain {
+        std::string stamp;
+        Dictionary values;
+    };
+    std::string folder_;
+    std::string host_;
+    std::map<std::string, Domain> domains_;
+};
+
+}  // namespace platform

@@ -1,0 +1,37 @@
+#pragma once
+
+#include <map>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/Value.h"
+
+namespace platform {
+
+struct Directories;
+
+/// The SDK dictionaries registered for extension points: <data dir>/zorvan/SDKs/<name>.plist, the
+/// user's directory first. Usable from any thread; what was read is kept until `clear`, or until
+/// the file's stamp changes.
+class SdkDictionaries {
+  public:
+    explicit SdkDictionaries(const Directories& directories);
+
+    /// The dictionary registered for a name. None when there is none, the name could not be a
+    /// file's name, or the file is no dictionary (which is logged).
+    std::optional<Dictionary> copyExtensionSdkEntry(const std::string& name);
+    /// The files that `copyExtensionSdkEntry` would look at for a name, first the one that counts
+    /// when it exists; empty for a name that could not be a file's.
+    std::vector<std::string> candidateFiles(const std::string& name) const;
+    void clear();
+
+  private:
+    struct Entry;
+    std::vector<std::string> folders_;
+    std::mutex mutex_;  // guards entries_
+    std::map<std::string, std::shared_ptr<const Entry>> entries_;
+};
+
+}  // namespace platform

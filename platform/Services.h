@@ -1,0 +1,29 @@
+#pragma once
+
+#include <memory>
+
+#include "platform/CodeSigning.h"
+#include "platform/Consent.h"
+#include "platform/Directories.h"
+#include "platform/Notifications.h"
+#include "platform/RunLoop.h"
+#include "platform/Sandbox.h"
+#include "platform/Types.h"
+#include "platform/tandry/Workspace.h"
+
+namespace platform {
+
+/// What the daemon needs of the system, built by its entry point; tests replace single members.
+/// Shared with whoever uses a service.
+struct Services {
+    Directories directories;
+    std::shared_ptr<RunLoop> mainLoop;
+    std::shared_ptr<Workspace> workspace;  // null when the registry could not be opened
+    std::shared_ptr<CodeSigning> codeSigning;
+    std::shared_ptr<Sandbox> sandbox;
+    std::shared_ptr<Consent> consent;
+    std::shared_ptr<Notifications> notifications;
+    std::shared_ptr<Types> types;
+};
+
+}  // namespace platform

@@ -1,0 +1,34 @@
+#pragma once
+
+#include <memory>
+#include <string>
+
+#include "platform/Value.h"
+
+namespace platform {
+
+struct Directories;
+
+/// The hierarchy of type identifiers.
+class Types {
+  public:
+    virtual ~Types() = default;
+    /// Whether `type` equals `ancestor` or descends from it. From any thread.
+    virtual bool conforms(const std::string& type, const std::string& ancestor) = 0;
+};
+
+/// MIME types with the hierarchy of the shared MIME database (<data dir>/mime: aliases and
+/// subclasses, the user's directory first): every text/* descends from text/plain, and everything
+/// but inode/* from application/octet-stream. Types compare without regard to ASCII case. Read at
+/// the first question.
+std::unique_ptr<Types> makeMimeTypes(const Directories& directories);
+
+/// Whether an activation rule accepts what a host offers. The rule is a boolean, which answers at
+/// once, or a dictionary from type to the most items of it (a number). The offer is
+/// {"items": [{"types": [type, ...]}, ...]}. It is accepted when it has at least one item, every
+/// item has a type that conforms to a listed type, and no listed type has more items than its
+/// count; an item counts for every listed type that one of its types conforms to. Rules and offers
+/// of other shapes are not accepted.
+bool evaluateActivationRule(const Value& rule, const Dictionary& offer, Types& types);
+
+}  // namespace platform

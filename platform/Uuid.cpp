@@ -1,0 +1,41 @@
+#include "platform/Uuid.h"
+
+#include <uuid/uuid.h>
+
+#include <cstring>
+
+namespace platform {
+
+Uuid Uuid::random() {
+    Uuid uuid;
+    uuid_generate_random(uuid.bytes.data());
+    return uuid;
+}
+
+std::optional<Uuid> Uuid::parse(std::string_view text) {
+    Uuid uuid;
+    if (text.size() != UUID_STR_LEN - 1 ||
+        uuid_parse_range(text.data(), text.data() + text.size(), uuid.bytes.data()) != 0) {
+        return std::nullopt;
+    }
+    return uuid;
+}
+
+std::string Uuid::string() const {
+    char text[UUID_STR_LEN];
+    uuid_unparse_upper(bytes.data(), text);
+    return text;
+}
+
+std::string describe(const Uuid& uuid) {
+    return uuid.string();
+}
+
+}  // namespace platform
+
+std::size_t std::hash<platform::Uuid>::operator()(const platform::Uuid& uuid) const noexcept {
+    // Identifiers are random already: any eight bytes of them are a good hash.
+    std::size_t hash = 0;
+    std::memcpy(&hash, uuid.bytes.data(), sizeof hash);
+    return hash;
+}

@@ -1,0 +1,36 @@
+#pragma once
+
+#include <array>
+#include <compare>
+#include <cstdint>
+#include <functional>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace platform {
+
+/// A 16-byte universally unique identifier (RFC 4122). A plain value: copy it freely.
+struct Uuid {
+    std::array<std::uint8_t, 16> bytes{};
+
+    /// A new random (version 4) identifier.
+    static Uuid random();
+
+    /// Reads the 36-character text form, in either case. None for anything else.
+    static std::optional<Uuid> parse(std::string_view text);
+
+    /// The 36-character text form in upper case, with hyphens.
+    std::string string() const;
+
+    auto operator<=>(const Uuid&) const = default;
+};
+
+std::string describe(const Uuid& uuid);
+
+}  // namespace platform
+
+template <>
+struct std::hash<platform::Uuid> {
+    std::size_t operator()(const platform::Uuid& uuid) const noexcept;
+};

@@ -1,0 +1,42 @@
+#pragma once
+
+#include <sys/types.h>
+
+#include <memory>
+#include <optional>
+#include <string>
+
+namespace platform {
+
+/// Who a peer process is, pinned: its process id cannot come to mean another process while a token
+/// lives. Immutable; copies share it; usable from any thread.
+class AuditToken {
+  public:
+    /// The process that connected the other end of `socket` (borrowed, AF_UNIX). Reads, in the
+    /// order that pins them to one process: its credentials, a pidfd, its /proc directory, and
+    /// through that its executable. None when the process is gone already or cannot be told for
+    /// sure (on kernels without SO_PEERPIDFD: when it has not started before the connection was
+    /// accepted).
+    static std::optional<AuditToken> ofPeer(int socket);
+    /// This process itself.
+    static std::optional<AuditToken> ofSelf();
+
+    pid_t pid() const;
+    uid_t uid() const;
+
+    /// Borrowed descriptors: the process's pidfd and its pinned /proc/<pid> directory (O_PATH).
+    int pidFd() const;
+    int procDirectory() const;
+
+    /// Where the executable lies, when the path that the process runs from names, here, the very
+    /// file (device and inode) that it runs; otherwise, or when it cannot be read, none. Read when
+    /// the token was made.
+    const std::optional<std::string>& executablePath() const;
+
+  private:
+    struct State;
+    explicit AuditToken(std::shared_ptr<const State> state) : state_(std::move(state)) {}
+    std::shared_ptr<const State> state_;
+};
+
+}  // namespace platform

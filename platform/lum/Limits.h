@@ -1,0 +1,21 @@
+#pragma once
+
+#include <cstddef>
+
+namespace platform::lum {
+
+/// Largest payload of a frame that is a request, and of one that is a reply, in bytes.
+inline constexpr std::size_t kMaxRequestPayload = 16u << 20;
+inline constexpr std::size_t kMaxReplyPayload = 256u << 20;
+
+/// A connection's next request is not served while more than this many bytes of its own replies, or
+/// of the replies of all connections together, wait to be read by their hosts.
+inline constexpr std::size_t kMaxUnsentPerConnection = 8u << 20;
+inline constexpr std::size_t kMaxUnsentTotal = 256u << 20;
+
+/// A connection is not read on while this many requests, or this many bytes of requests, wait in
+/// it.
+inline constexpr std::size_t kMaxWaitingRequests = 64;
+inline constexpr std::size_t kMaxWaitingBytes = 16u << 20;
+
+}  // namespace platform::lum

@@ -1,0 +1,42 @@
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <string_view>
+
+#include "platform/Value.h"
+
+namespace platform {
+
+/// A typed dictionary of the messaging service: one request or reply. A value type; see
+/// `Dictionary` for what copies share.
+class Message {
+  public:
+    Message() = default;
+    explicit Message(Dictionary contents) : contents_(std::move(contents)) {}
+
+    /// An empty reply to `request`: it carries the request's serial.
+    static Message replyTo(const Message& request);
+
+    const Dictionary& contents() const { return contents_; }
+    /// The value under a key, or null.
+    const Value* find(std::string_view key) const { return contents_.find(key); }
+    void set(std::string_view key, Value value) { contents_.set(key, std::move(value)); }
+
+    std::uint64_t serial() const { return serial_; }
+    void setSerial(std::uint64_t serial) { serial_ = serial; }
+
+    /// A received request holds its connection's turn: the connection delivers its next message
+    /// only when the last copy of this one is gone. Replies hold nothing.
+    void setTurn(std::shared_ptr<void> turn) { turn_ = std::move(turn); }
+
+  private:
+    Dictionary contents_;
+    std::uint64_t serial_ = 0;
+    std::shared_ptr<void> turn_;
+};
+
+std::string describe(const Message& message);
+
+}  // namespace platform

@@ -1,0 +1,27 @@
+#pragma once
+
+#include <functional>
+#include <memory>
+
+#include "platform/Error.h"
+#include "platform/tandry/Workspace.h"
+
+namespace platform {
+
+struct Directories;
+class SdkDictionaries;
+
+/// Merges an SDK dictionary (first) under a bundle's Info.plist (second); answers the merged one.
+using SdkMerge = std::function<Dictionary(const Dictionary& sdk, const Dictionary& infoPlist)>;
+
+namespace tandry {
+
+/// The registry over this user's disk, with a catalogue at <data>/zorvan/Tandry.db. `sdks` must
+/// outlive it. Error: the catalogue's directory cannot be used, or another process owns it
+/// (EADDRINUSE).
+Result<std::unique_ptr<Workspace>> openDiskWorkspace(const Directories& directories,
+                                                     SdkDictionaries& sdks, SdkMerge merge);
+
+}  // namespace tandry
+
+}  // namespace platform

@@ -1,0 +1,56 @@
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "platform/LazyDictionary.h"
+#include "platform/Uuid.h"
+#include "platform/Value.h"
+#include "platform/tandry/TDApplicationProxy.h"
+
+namespace platform {
+
+/// The registry's record of one installed plug-in. Immutable once shared; tests build it directly.
+///
+/// Its dictionaries are the bundle's, completed (see tandry/Workspace.h). Values of unexpected
+/// types are passed on as they are.
+struct TDPlugInProxy {
+    /// Which dictionary `lookup` reads.
+    enum class Scope {
+        Attributes = 0,        // "VXExtensionAttributes" of the plug-in dictionary
+        PlugInDictionary = 1,  // "VXExtension" of the Info.plist
+        InfoPlist = 2,         // the top level of the Info.plist
+    };
+
+    Uuid plugInUuid;
+    std::optional<std::string> bundlePath;  // canonical path of the bundle directory
+    std::string bundleIdentifier;           // "QFBundleIdentifier"; may be empty
+    std::optional<std::string> plugInIdentifier;
+    std::optional<std::string> originalIdentifier;
+    std::string bundleVersion;  // may be empty
+    Date registrationDate;
+    bool onSystemPartition = false;
+    TDApplicationProxyRef containingApplication;  // null outside an application
+    LazyDictionary infoPlist;
+    LazyDictionary entitlements;
+    std::optional<std::string> localizedName;
+    std::optional<std::string> localizedShortName;
+    std::optional<std::string> dataContainerPath;
+
+    /// The value of a key in one of the three dictionaries, or null. Good as long as the record.
+    const Value* lookup(std::string_view key, Scope scope) const;
+    /// "VXExtension" of the Info.plist when that is a dictionary, else null; likewise its
+    /// attributes.
+    const Dictionary* plugInDictionary() const;
+    const Dictionary* attributes() const;
+};
+
+using TDPlugInProxyRef = std::shared_ptr<const TDPlugInProxy>;
+
+/// "<plug-in UUID> <identifier> at <path>"
+std::string describe(const TDPlugInProxy& proxy);
+
+}  // namespace platform
