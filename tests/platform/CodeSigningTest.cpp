@@ -105,8 +105,9 @@ bool withFilter() {
 
 class Tool : public testing::Test {
   protected:
+    static void SetUpTestSuite() { ::umask(022); }
+
     Tool() : tool_(files_.makeDirectory("bin") + "/tool") {
-        ::umask(022);
         std::filesystem::copy_file("/bin/cat", tool_);
     }
 
