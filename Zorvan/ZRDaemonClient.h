@@ -86,9 +86,10 @@ class ZRDaemonClient {
     /// The plug-ins that satisfy `rules`, as forms; the reply has them, packed, under "matches".
     /// `flags`: ZRDiscover… in Keys.h.
     void matchPlugIns(const platform::Dictionary& rules, std::uint64_t flags, ReplyCallback reply);
-    /// Records the user's choices, the same for each plug-in, or a dictionary for each UUID's text.
+    /// Records the user's choices: one change ("election", "extension") for every plug-in listed.
     void setPluginAnnotations(const std::vector<platform::Uuid>& uuids,
                               const platform::Dictionary& annotations, ReplyCallback reply);
+    /// Records a dictionary as the "extension" of each plug-in; the keys are UUIDs as text.
     void bulkSetPluginAnnotations(const platform::Dictionary& annotations, ReplyCallback reply);
     /// Takes the plug-ins at these paths out of service until the hold is released or this
     /// connection ends; the reply has the token of the hold under "uuids".
