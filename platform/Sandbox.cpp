@@ -62,6 +62,8 @@ class KernelSandbox : public Sandbox {
 
 }  // namespace
 
-std::unique_ptr<Sandbox> makeKernelSandbox() { return std::make_unique<KernelSandbox>(); }
+std::unique_ptr<Sandbox> makeKernelSandbox() {
+    return std::make_unique<KernelSandbox>();
+}
 
 }  // namespace platform
