@@ -16,7 +16,8 @@ struct Directories {
     std::string stateHome;  // $XDG_STATE_HOME, else ~/.local/state; empty without a home
 
     /// Reads the environment. Values that are not absolute paths count as unset; without HOME the
-    /// home is the one of the user database.
+    /// home is the one of the user database; without that either, there is no state home and the
+    /// other places lie under a directory that does not exist.
     static Directories fromEnvironment();
 
     /// <runtime>/zorvan

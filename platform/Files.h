@@ -5,6 +5,7 @@
 #include <cstddef>
 #include <optional>
 #include <string>
+#include <string_view>
 
 #include "platform/Error.h"
 
@@ -20,7 +21,9 @@ Result<std::string> readFileAt(int dirfd, const std::string& name, std::size_t l
 /// Replaces the file at `path` by one that holds `bytes`, in one rename, so that whoever opens the
 /// path sees either the old file or the new one, also after a crash: file and directory are synced.
 /// The temporary file lies in the same directory under a random name of its own; no other file is
-/// touched. A new file gets mode 0600; an existing one keeps its mode. None on success.
+/// touched. A new file gets mode 0600; an existing one keeps its mode. A symbolic link stays, and
+/// the file that it leads to is replaced. None on success. Errors: the system's; EINVAL when
+/// something other than a regular file is there.
 std::optional<Error> writeFileAtomically(const std::string& path, const std::string& bytes);
 
 /// Makes the directory and its missing parents, each with `mode`. An existing directory is fine.
@@ -39,7 +42,8 @@ std::string joinPath(std::string_view directory, std::string_view name);
 
 /// The part of a path after its last "/" (of "/a/b/" it is "b").
 std::string_view lastPathComponent(std::string_view path);
-/// The part of a path before its last component; "/" for one directly under the root.
+/// The part of a path before its last component: "/" for one directly under the root, "." for a
+/// lone name.
 std::string_view parentPath(std::string_view path);
 
 }  // namespace platform

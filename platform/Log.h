@@ -5,6 +5,7 @@
 #include <atomic>
 #include <concepts>
 #include <functional>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <type_traits>
@@ -34,8 +35,8 @@ Public<T> pub(const T& argument) {
 
 namespace detail {
 
-/// The text of a string argument for the log: control characters escaped; "(null)" for a null
-/// pointer.
+/// The text of a string argument for the log: control characters and bytes that are not UTF-8
+/// escaped ("\n", else "\xNN"); "(null)" for a null pointer.
 std::string escaped(std::string_view text);
 inline std::string escaped(const char* text) {
     return escaped(text ? std::string_view(text) : std::string_view("(null)"));
@@ -44,12 +45,30 @@ inline std::string escaped(const char* text) {
 /// "<private>" where private arguments are hidden (the journal), else null.
 const char* privateMask();
 
+/// The level that a value of ZR_LOG gives to a category: the one named for it, else the one that
+/// stands alone, else `Default`. Words that name no level count for nothing.
+LogLevel levelInSetting(std::string_view setting, std::string_view category);
+
+/// Numbers and addresses, which are written in full wherever the log goes.
 template <class T>
-std::string shown(const T& argument) {
-    if constexpr (std::is_convertible_v<const T&, const char*>) {
+inline constexpr bool isPlain =
+    std::is_arithmetic_v<T> || std::is_same_v<T, const void*> || std::is_same_v<T, void*>;
+
+template <class T>
+struct IsOptional : std::false_type {};
+template <class T>
+struct IsOptional<std::optional<T>> : std::true_type {};
+
+template <class T>
+auto shown(const T& argument) {
+    if constexpr (isPlain<T>) {
+        return argument;
+    } else if constexpr (std::is_convertible_v<const T&, const char*>) {
         return escaped(static_cast<const char*>(argument));
     } else if constexpr (std::is_convertible_v<const T&, std::string_view>) {
         return escaped(std::string_view(argument));
+    } else if constexpr (std::is_pointer_v<T> || IsOptional<T>::value) {
+        return argument ? fmt::format("{}", shown(*argument)) : std::string("(null)");
     } else {
         static_assert(Describable<T>, "a log argument is a number, a string or has describe()");
         return escaped(describe(argument));
@@ -63,19 +82,13 @@ struct IsPublic<Public<T>> : std::true_type {};
 
 template <class T>
 auto loggable(const T& argument) {
-    if constexpr (std::is_arithmetic_v<T>) {
-        return argument;
-    } else if constexpr (std::is_same_v<T, const void*>) {
+    if constexpr (isPlain<T>) {
         return argument;
     } else if constexpr (IsPublic<T>::value) {
-        if constexpr (std::is_arithmetic_v<std::remove_cvref_t<decltype(argument.argument)>>) {
-            return argument.argument;
-        } else {
-            return shown(argument.argument);
-        }
+        return shown(argument.argument);
     } else {
         const char* mask = privateMask();
-        return mask ? std::string(mask) : shown(argument);
+        return mask ? std::string(mask) : std::string(shown(argument));
     }
 }
 
@@ -88,14 +101,14 @@ auto loggable(const T& argument) {
 /// is the journal; else to standard error with time, category and level. Strings and objects that
 /// are not wrapped in `pub` appear as "<private>" in the journal, unless the environment has
 /// ZR_LOG_PRIVATE=1. The level of a category comes from ZR_LOG: "debug" for all, or a list like
-/// "ops=debug,td=info".
+/// "ops=debug,td=info". Both variables are read once.
 ///
 /// Write through the macros below: they evaluate nothing while the level is off.
 class Log {
   public:
     /// The handle of a category, made at its first use.
     static const Log& make(const std::string& subsystem, const std::string& category);
-    /// The handle outside any subsystem.
+    /// The handle outside any subsystem; its category is "default".
     static const Log& defaultHandle();
 
     bool enabled(LogLevel level) const { return level >= level_.load(std::memory_order_relaxed); }
