@@ -182,7 +182,7 @@ void measureDecoded(const Run& run, LibraryClient& library, const Question& ques
                                            fail("an empty reply");
                                    })});
     run.report.add({.key = name + "+decode/p50",
-                    .title = name + " through the library, visited, p50",
+                    .title = name + " through the library, p50",
                     .value = p50[0],
                     .besideSource = "echo",
                     .beside = p50[1],

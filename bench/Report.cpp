@@ -73,12 +73,12 @@ std::string Report::tsv() const {
 std::string Report::table() const {
     std::string out;
     for (const Section& section : sections_) {
-        out += fmt::format("\n{}\n{:<44}{:>13}{:>13}{:>9}  {:<15}{:<5}{}\n", section.title,
+        out += fmt::format("\n{}\n{:<46}{:>13}{:>13}{:>9}  {:<15}{:<5}{}\n", section.title,
                            "figure", "zrd", "beside", "ratio", "to reach now", "met", "goal");
         for (const Figure& figure : section.figures) {
             const auto ratio = figure.ratio();
             const auto met = figure.met();
-            out += fmt::format("{:<44}{:>13}{:>13}{:>9}  {:<15}{:<5}{}\n", figure.title,
+            out += fmt::format("{:<46}{:>13}{:>13}{:>9}  {:<15}{:<5}{}\n", figure.title,
                                readable(figure.value, figure.unit),
                                figure.beside ? readable(*figure.beside, figure.unit) : "",
                                ratio ? fmt::format("{:.2f} x", *ratio) : "",
