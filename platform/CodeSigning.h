@@ -19,6 +19,7 @@ class CodeSigningTask {
     };
 
     virtual ~CodeSigningTask() = default;
+    /// The value of an entitlement; none when the process does not hold it.
     virtual Answer entitlement(const std::string& name) = 0;
 };
 
@@ -37,6 +38,10 @@ class CodeSigning {
 /// root's. From an untrusted file only "com.orbel.developer.zorvan.allowedplugins" counts, which
 /// takes rights away. A process in another user or mount namespace never holds an entitlement that
 /// begins with "com.orbel.private.".
+///
+/// A missing file holds no entitlements. One that is there but cannot be read, is no regular file
+/// or is no dictionary makes every query an error; the restriction, which such a file may have
+/// meant to set, then has a value that is no restriction, so that everything is denied.
 std::unique_ptr<CodeSigning> makeFileCodeSigning();
 
 }  // namespace platform

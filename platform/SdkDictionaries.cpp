@@ -46,7 +46,7 @@ SdkDictionaries::SdkDictionaries(const Directories& directories) {
 std::vector<std::string> SdkDictionaries::candidateFiles(const std::string& name) const {
     std::vector<std::string> result;
     const std::string file = name + ".plist";
-    if (!isSafeName(name) || !isSafeName(file)) return result;
+    if (!isSafeName(file)) return result;
     for (const std::string& folder : folders_) result.push_back(joinPath(folder, file));
     return result;
 }

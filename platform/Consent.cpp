@@ -1,0 +1,64 @@
+#include "platform/Consent.h"
+
+#include <cerrno>
+
+#include "platform/Directories.h"
+#include "platform/Files.h"
+#include "platform/Log.h"
+#include "platform/PropertyList.h"
+
+namespace platform {
+
+namespace {
+
+const Log& ops() {
+    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
+    return handle;
+}
+
+class FileConsent : public Consent {
+  public:
+    explicit FileConsent(const Directories& directories)
+        : folder_(directories.configHome + "/zorvan/Consent") {}
+
+    std::optional<std::vector<Dictionary>> copyConsentInformation(
+        const LumBundle& application) override {
+        const std::optional<Dictionary> info = application.infoDictionary();
+        const Value* value = info ? info->find("QFBundleIdentifier") : nullptr;
+        const std::string* identifier = value ? value->string() : nullptr;
+        if (!identifier || !isSafeName(*identifier + ".plist")) return std::nullopt;
+        return readRecords(joinPath(folder_, *identifier + ".plist"));
+    }
+
+  private:
+    static std::optional<std::vector<Dictionary>> readRecords(const std::string& path) {
+        std::vector<Dictionary> records;
+        const Result<Value> list = readPropertyListFile(path);
+        if (!list) {
+            const Error& error = list.error();
+            if (error.domain == "POSIX" && (error.code == ENOENT || error.code == ENOTDIR))
+                return records;
+            EVLOG_ERROR(ops(), "cannot read consent records: {}", pub(error));
+            return std::nullopt;
+        }
+        const Array* elements = list->array();
+        if (!elements) {
+            EVLOG_ERROR(ops(), "consent file {} is not a list", pub(path));
+            return std::nullopt;
+        }
+        // What is not a record grants nothing.
+        for (const Value& element : *elements)
+            if (const Dictionary* record = element.dictionary()) records.push_back(*record);
+        return records;
+    }
+
+    const std::string folder_;
+};
+
+}  // namespace
+
+std::unique_ptr<Consent> makeFileConsent(const Directories& directories) {
+    return std::make_unique<FileConsent>(directories);
+}
+
+}  // namespace platform

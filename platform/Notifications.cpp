@@ -1,0 +1,83 @@
+#include "platform/Notifications.h"
+
+#include <fcntl.h>
+#include <stdlib.h>
+
+#include <cerrno>
+#include <charconv>
+#include <cstdint>
+#include <cstdio>
+#include <mutex>
+#include <optional>
+
+#include "platform/Directories.h"
+#include "platform/Files.h"
+#include "platform/Log.h"
+#include "platform/UniqueFd.h"
+
+namespace platform {
+
+namespace {
+
+const Log& ops() {
+    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
+    return handle;
+}
+
+std::uint64_t readCount(const std::string& path) {
+    std::uint64_t count = 0;
+    if (const Result<std::string> text = readFile(path, 64))
+        std::from_chars(text->data(), text->data() + text->size(), count);
+    return count;
+}
+
+/// Replaces a file by rename, like `writeFileAtomically`, but without the syncs: counts live in
+/// memory-backed runtime state and mean nothing after a crash.
+std::optional<Error> replaceFile(const std::string& folder, const std::string& name,
+                                 const std::string& bytes) {
+    std::string temporary = joinPath(folder, ".post-XXXXXX");
+    const UniqueFd file(::mkostemp(temporary.data(), O_CLOEXEC));
+    if (!file) return Error::posix(errno, temporary);
+    const std::string path = joinPath(folder, name);
+    const ssize_t written = ::write(file.get(), bytes.data(), bytes.size());
+    int failure = written < 0 ? errno : ENOSPC;
+    if (written == static_cast<ssize_t>(bytes.size())) {
+        if (::rename(temporary.c_str(), path.c_str()) == 0) return std::nullopt;
+        failure = errno;
+    }
+    ::unlink(temporary.c_str());
+    return Error::posix(failure, path);
+}
+
+class FileNotifications : public Notifications {
+  public:
+    explicit FileNotifications(const Directories& directories)
+        : folder_(directories.zorvanRuntime() + "/notify") {}
+
+    void post(const std::string& name) override {
+        if (!isSafeName(name)) {
+            EVLOG_ERROR(ops(), "cannot post notification {}: not a file name", pub(name));
+            return;
+        }
+        // Two posts at once must not write the same count.
+        const std::lock_guard lock(mutex_);
+        std::optional<Error> error = makeDirectories(folder_, 0700);
+        if (!error) {
+            const std::uint64_t count = readCount(joinPath(folder_, name)) + 1;
+            error = replaceFile(folder_, name, std::to_string(count));
+        }
+        if (error) EVLOG_ERROR(ops(), "cannot post notification {}: {}", pub(name), pub(*error));
+    }
+
+  private:
+    const std::string folder_;
+    std::mutex mutex_;
+};
+
+}  // namespace
+
+std::unique_ptr<Notifications> makeFileNotifications(const Directories& directories) {
+    return std::make_unique<FileNotifications>(directories);
+}
+
+}  // namespace platform

@@ -1,0 +1,121 @@
+#include "platform/Types.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <functional>
+#include <mutex>
+#include <string_view>
+#include <unordered_map>
+#include <unordered_set>
+#include <vector>
+
+#include "platform/Directories.h"
+#include "platform/Files.h"
+#include "platform/Log.h"
+
+namespace platform {
+
+namespace {
+
+const Log& ops() {
+    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
+    return handle;
+}
+
+/// The real files hold some tens of kilobytes.
+constexpr std::size_t kMaxMimeFile = 4u << 20;
+
+constexpr const char* kAnyText = "text/plain";
+constexpr const char* kAnyContent = "application/octet-stream";
+
+std::string lowerCase(std::string_view text) {
+    std::string result(text);
+    for (char& c : result)
+        if (c >= 'A' && c <= 'Z') c = static_cast<char>(c - 'A' + 'a');
+    return result;
+}
+
+/// Calls `use` with the two types of every line of a file of the database. A missing file has none.
+void forEachPair(const std::string& path,
+                 const std::function<void(std::string first, std::string second)>& use) {
+    const Result<std::string> text = readFile(path, kMaxMimeFile);
+    if (!text) {
+        if (text.error().code != ENOENT && text.error().code != ENOTDIR)
+            EVLOG_ERROR(ops(), "cannot read MIME types: {}", pub(text.error()));
+        return;
+    }
+    std::string_view rest = *text;
+    while (!rest.empty()) {
+        const std::string_view line = rest.substr(0, rest.find('\n'));
+        rest.remove_prefix(std::min(line.size() + 1, rest.size()));
+        const std::size_t space = line.find(' ');
+        if (space == 0 || space == line.npos || space + 1 == line.size()) continue;
+        use(lowerCase(line.substr(0, space)), lowerCase(line.substr(space + 1)));
+    }
+}
+
+class MimeTypes : public Types {
+  public:
+    explicit MimeTypes(const Directories& directories) {
+        folders_.push_back(directories.dataHome + "/mime");
+        for (const std::string& folder : directories.dataDirs) folders_.push_back(folder + "/mime");
+    }
+
+    bool conforms(const std::string& type, const std::string& ancestor) override {
+        std::call_once(read_, [this] { read(); });
+        const std::string start = canonical(lowerCase(type));
+        const std::string goal = canonical(lowerCase(ancestor));
+        if (start == goal) return true;
+        if (goal == kAnyContent) return !start.starts_with("inode/");
+        return descends(start, goal);
+    }
+
+  private:
+    void read() {
+        for (const std::string& folder : folders_) {
+            forEachPair(folder + "/aliases", [this](std::string alias, std::string type) {
+                aliases_.emplace(std::move(alias), std::move(type));
+            });
+            forEachPair(folder + "/subclasses", [this](std::string type, std::string parent) {
+                parents_[std::move(type)].push_back(std::move(parent));
+            });
+        }
+    }
+
+    const std::string& canonical(const std::string& type) const {
+        const auto alias = aliases_.find(type);
+        return alias != aliases_.end() ? alias->second : type;
+    }
+
+    /// Whether a walk from `start` towards the ancestors meets `goal`. Files may hold cycles, so
+    /// each type is walked once.
+    bool descends(const std::string& start, const std::string& goal) const {
+        std::unordered_set<std::string_view> seen{start};
+        std::vector<std::string_view> open{start};
+        while (!open.empty()) {
+            const std::string type(open.back());
+            open.pop_back();
+            if (type == goal || (goal == kAnyText && type.starts_with("text/"))) return true;
+            const auto parents = parents_.find(type);
+            if (parents == parents_.end()) continue;
+            for (const std::string& parent : parents->second) {
+                const std::string_view next = canonical(parent);
+                if (seen.insert(next).second) open.push_back(next);
+            }
+        }
+        return false;
+    }
+
+    std::vector<std::string> folders_;
+    std::once_flag read_;  // what follows does not change any more afterwards
+    std::unordered_map<std::string, std::string> aliases_;
+    std::unordered_map<std::string, std::vector<std::string>> parents_;
+};
+
+}  // namespace
+
+std::unique_ptr<Types> makeMimeTypes(const Directories& directories) {
+    return std::make_unique<MimeTypes>(directories);
+}
+
+}  // namespace platform
