@@ -12,8 +12,8 @@ namespace platform::lum {
 bool FrameSocket::write(const std::string& frame, std::size_t& offset, std::size_t most) {
     const std::size_t end = std::min(frame.size() - offset, most) + offset;
     while (offset < end) {
-        const ssize_t count = ::send(socket_.get(), frame.data() + offset, end - offset,
-                                     MSG_NOSIGNAL | MSG_DONTWAIT);
+        const ssize_t count =
+            ::send(socket_.get(), frame.data() + offset, end - offset, MSG_NOSIGNAL | MSG_DONTWAIT);
         if (count >= 0) {
             offset += static_cast<std::size_t>(count);
         } else if (errno != EINTR) {
