@@ -5,6 +5,8 @@
 #include <algorithm>
 #include <cmath>
 
+#include "platform/Utf8.h"
+
 namespace platform {
 
 namespace {
@@ -414,7 +416,7 @@ class Describer {
 };
 
 /// Whether text holds only characters of XML 1.0: no control character but tab, line feed and
-/// carriage return, and not U+FFFE or U+FFFF. The text is valid UTF-8 already.
+/// carriage return, not U+FFFE or U+FFFF, and nothing that is not UTF-8.
 bool isXmlText(std::string_view text) {
     for (std::size_t i = 0; i < text.size(); ++i) {
         auto byte = static_cast<unsigned char>(text[i]);
@@ -424,7 +426,7 @@ bool isXmlText(std::string_view text) {
             if (last == "\xBE" || last == "\xBF") return false;
         }
     }
-    return true;
+    return isValidUtf8(text);
 }
 
 bool isPropertyListAt(const Value& value, int depth) {
