@@ -49,13 +49,6 @@ TEST(SdkMerge, FollowsTheRuleOfEachKeyAtEveryLevel) {
     }
 }
 
-TEST(SdkMerge, OfLongListsOfNamesIsFast) {
-    std::vector<Value> names;
-    for (int i = 0; i < 300'000; ++i) names.emplace_back("resource " + std::to_string(i));
-    Array list(names);
-    EXPECT_EQ(ZRPlugInCore::mergeSharedResources(list, list).size(), names.size());
-}
-
 class SdkResolution : public testing::Test {
   protected:
     SdkResolution() { directories_.dataHome = directory_.path(); }
