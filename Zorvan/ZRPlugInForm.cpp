@@ -70,8 +70,7 @@ std::optional<Dictionary> ZRPlugInCore::exportForm(std::optional<ZRError>& error
                           : !plugInDictionary_ ? "plug-in dictionary"
                                                : nullptr;
     if (missing) {
-        error = ZRErrorWithFormat(kZRErrorPlugIn, "plug-in {} at {} has no {}", identifier_, path_,
-                                  missing);
+        error = ZRErrorWithFormat(kZRErrorPlugIn, "plug-in {} has no {}", identifier_, missing);
         return std::nullopt;
     }
     Dictionary bundleInfo = *infoPlist;

@@ -379,7 +379,8 @@ Result<Value> decodeCbor(const EncodedBytes& bytes, CborOptions options) {
 
 Result<Value> unpack(const Packed& packed) {
     auto value = packed.value() ? Result<Value>(*packed.value()) : decodeCbor(packed.bytes());
-    if (value && !isPropertyList(*value)) return Error{"Cbor", 2, "not a property list"};
+    if (value && !isPropertyList(*value, kMaxCborDepth))
+        return Error{"Cbor", 2, "not a property list"};
     return value;
 }
 

@@ -318,7 +318,8 @@ Result<Value> readPropertyListFile(const std::string& path, std::size_t limit) {
 }
 
 Result<std::string> writeXmlPropertyList(const Value& value) {
-    if (!isPropertyList(value)) return Error{"PropertyList", 2, "not a property list"};
+    if (!isPropertyList(value, kMaxPropertyListFileDepth))
+        return Error{"PropertyList", 2, "not a property list"};
     // One of the reader's objects is the element around them all.
     std::size_t objectsLeft = kMaxPropertyListObjects - 1;
     if (!isReadable(value, objectsLeft))

@@ -29,9 +29,9 @@ Result<Value> parsePropertyList(std::string_view bytes);
 Result<Value> readPropertyListFile(const std::string& path,
                                    std::size_t limit = kMaxPropertyListFile);
 
-/// The XML form of a value. Errors: the value is not a property list (`isPropertyList`), or larger
-/// than the limits above. What this writes, `parsePropertyList` reads back equal (dates lose the
-/// fraction of their second).
+/// The XML form of a value. Errors: the value is not a property list (`isPropertyList`, at the
+/// depth that is read), or larger than the limits above. What this writes, `parsePropertyList`
+/// reads back equal (dates lose the fraction of their second).
 Result<std::string> writeXmlPropertyList(const Value& value);
 
 }  // namespace platform

@@ -12,7 +12,6 @@ namespace platform {
 namespace {
 
 constexpr std::size_t kMaxDescription = 64 * 1024;
-constexpr int kMaxPropertyListDepth = 64;
 /// The years 1 to 9999, in seconds since 1970.
 constexpr double kFirstStorableDate = -62135596800.0;
 constexpr double kEndOfStorableDates = 253402300800.0;
@@ -429,7 +428,7 @@ bool isXmlText(std::string_view text) {
     return isValidUtf8(text);
 }
 
-bool isPropertyListAt(const Value& value, int depth) {
+bool isPropertyListWithin(const Value& value, int levels) {
     switch (value.kind()) {
         case Value::Kind::Uuid:
         case Value::Kind::Packed:
@@ -441,16 +440,16 @@ bool isPropertyListAt(const Value& value, int depth) {
             return seconds >= kFirstStorableDate && seconds < kEndOfStorableDates;
         }
         case Value::Kind::Array:
-            return depth < kMaxPropertyListDepth &&
-                   std::ranges::all_of(*value.array(), [depth](const Value& element) {
-                       return isPropertyListAt(element, depth + 1);
+            return levels > 0 &&
+                   std::ranges::all_of(*value.array(), [levels](const Value& element) {
+                       return isPropertyListWithin(element, levels - 1);
                    });
         case Value::Kind::Dictionary:
-            return depth < kMaxPropertyListDepth &&
-                   std::ranges::all_of(*value.dictionary(), [depth](
-                                                                const Dictionary::Entry& entry) {
-                       return isXmlText(entry.first) && isPropertyListAt(entry.second, depth + 1);
-                   });
+            return levels > 0 && std::ranges::all_of(
+                                     *value.dictionary(), [levels](const Dictionary::Entry& entry) {
+                                         return isXmlText(entry.first) &&
+                                                isPropertyListWithin(entry.second, levels - 1);
+                                     });
         default:
             return true;
     }
@@ -476,8 +475,21 @@ std::string describe(const Array& value) {
     return describer.take();
 }
 
-bool isPropertyList(const Value& value) {
-    return isPropertyListAt(value, 0);
+bool isPropertyList(const Value& value, int levels) {
+    return isPropertyListWithin(value, levels);
+}
+
+std::size_t countValues(const Value& value, std::size_t limit) {
+    std::size_t count = 1;
+    auto add = [&](const Value& element) {
+        if (count <= limit) count += countValues(element, limit - count);
+    };
+    if (const Array* array = value.array()) {
+        for (const Value& element : *array) add(element);
+    } else if (const Dictionary* dictionary = value.dictionary()) {
+        for (const auto& [key, element] : *dictionary) add(element);
+    }
+    return count;
 }
 
 }  // namespace platform

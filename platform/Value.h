@@ -223,7 +223,13 @@ std::string describe(const Array& value);
 
 /// Whether the value could be stored in a property-list file and read back: no UUID and no packed
 /// value at any depth, no text (keys included) with characters that XML 1.0 forbids, no date
-/// outside the years 1 to 9999, at most 64 levels of containers.
-bool isPropertyList(const Value& value);
+/// outside the years 1 to 9999, at most `levels` levels of containers. What comes in messages is
+/// held to the narrow limit, so that it can stand deeper in our files and replies.
+inline constexpr int kMessagePropertyListLevels = 64;
+bool isPropertyList(const Value& value, int levels = kMessagePropertyListLevels);
+
+/// The number of values in `value`, itself and dictionary keys' values included; counting stops
+/// above `limit`.
+std::size_t countValues(const Value& value, std::size_t limit);
 
 }  // namespace platform

@@ -24,7 +24,8 @@ std::optional<CommandLine> CommandLine::parse(int argc, char* const argv[]) {
     line.serviceName = kDefaultServiceName;
     optind = 0;  // starts the scanner afresh
     opterr = 0;  // the usage text says it all
-    for (int option; (option = getopt(argc, argv, "c:d:S:v")) != -1;) {
+    // The "+" keeps the scanner from looking for options behind an operand.
+    for (int option; (option = getopt(argc, argv, "+c:d:S:v")) != -1;) {
         switch (option) {
             case 'c':
                 // No range check: whatever the text holds, a number comes of it.

@@ -18,7 +18,8 @@ class HostProcess {
 
     /// 0 when its connection is gone.
     virtual pid_t pid() const = 0;
-    /// The bundle around its executable; null for a bare executable's process and an unknown one.
+    /// The bundle around its executable, or a bundle made of the bare executable's own path; null
+    /// when the executable cannot be told.
     virtual const std::shared_ptr<ZRBundle>& bundle() const = 0;
     /// The value of an entitlement, of any property-list type, or none.
     virtual std::optional<platform::Value> entitlementValueForKey(

@@ -18,6 +18,14 @@ using platform::Value;
 
 namespace {
 
+/// Matching costs candidates times rules, and everybody waits for it.
+constexpr std::size_t kMaxRuleValues = 4096;
+
+bool areRules(const Value& value) {
+    return value.dictionary() && platform::countValues(value, kMaxRuleValues) <= kMaxRuleValues &&
+           platform::isPropertyList(value);
+}
+
 /// The dictionaries of a stored exclusions value; anything else in it excludes nothing.
 std::vector<Dictionary> exclusionRules(const std::optional<Value>& stored) {
     std::vector<Dictionary> rules;
@@ -32,7 +40,7 @@ std::vector<Dictionary> exclusionRules(const std::optional<Value>& stored) {
 
 void Transaction::matchPlugIns() {
     const Value* rules = request_.find(message::kRules);
-    if (rules && (!rules->dictionary() || !platform::isPropertyList(*rules))) {
+    if (rules && !areRules(*rules)) {
         return fail(kZRErrorInvalidRequest, "invalid request format (bad rules dictionary)");
     }
     CandidateQuery query;

@@ -39,6 +39,8 @@ bool MatchResult::wins(const ZRDPlugIn& plugIn, const Dictionary& accepted,
 }
 
 bool MatchResult::admit(const ZRDPlugIn& plugIn) {
+    constexpr std::uint64_t kKeepAll = ZRDiscoverVersions | ZRDiscoverDuplicates;
+    if ((flags_ & kKeepAll) == kKeepAll) return true;
     auto rivals = byIdentifier_.find(plugIn.identifier());
     if (rivals == byIdentifier_.end()) return true;
     std::size_t next = kNone;
@@ -47,9 +49,7 @@ bool MatchResult::admit(const ZRDPlugIn& plugIn) {
         next = rival.nextOfIdentifier;
         if (rival.displaced) continue;
         int order = compareVersions(plugIn.version(), rival.form.find(form::kVersion));
-        bool keepsBoth =
-            (flags_ & ZRDiscoverVersions) && (order != 0 || (flags_ & ZRDiscoverDuplicates));
-        if (keepsBoth) continue;
+        if ((flags_ & ZRDiscoverVersions) && order != 0) continue;
         rival.displaced = wins(plugIn, rival.form, order);
         return rival.displaced;
     }
@@ -58,7 +58,8 @@ bool MatchResult::admit(const ZRDPlugIn& plugIn) {
 
 void MatchResult::append(std::shared_ptr<ZRDPlugIn> plugIn, Dictionary form) {
     std::size_t index = accepted_.size();
-    auto [rivals, isFirst] = byIdentifier_.try_emplace(plugIn->identifier(), index, index);
+    auto [rivals, isFirst] =
+        byIdentifier_.try_emplace(plugIn->identifier(), SameIdentifier{index, index});
     if (!isFirst) {
         accepted_[rivals->second.last].nextOfIdentifier = index;
         rivals->second.last = index;

@@ -34,7 +34,7 @@ void Transaction::removePlugIns() {
             EVLOG_DEFAULT(platform::Log::defaultHandle(),
                           "refused request from pid={} to remove plug-in at {} - client lacks "
                           "required entitlement",
-                          client_->pid(), path);
+                          client_->pid(), pub(path));
             fail(kZRErrorDenied, "caller lacks entitlement for this operation");
             return Walk::Stop;
         }

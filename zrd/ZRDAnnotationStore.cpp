@@ -49,6 +49,18 @@ std::optional<ZRError> readRoot(const Value& root, Dictionary& data) {
     return std::nullopt;
 }
 
+/// Takes out what a binary file can hold but our own file and replies cannot: one such entry would
+/// keep every other from being saved.
+void dropUnstorable(Dictionary& data, const std::string& file) {
+    const Dictionary entries = data;
+    for (const auto& [key, annotation] : entries) {
+        if (platform::isPropertyList(annotation) && platform::isPropertyList(Value(key))) continue;
+        EVLOG_ERROR(ops(), "leaving out an annotation that cannot be stored: {} in {}", key,
+                    pub(file));
+        data.remove(key);
+    }
+}
+
 }  // namespace
 
 std::unique_ptr<ZRDAnnotationStore> ZRDAnnotationStore::initWithDatabase(
@@ -88,6 +100,7 @@ std::optional<ZRError> ZRDAnnotationStore::loadDb() {
         error = zrError(root.error());
     } else {
         error = readRoot(*root, annotations_);
+        if (!error) dropUnstorable(annotations_, annotationsURL_);
     }
     if (error) probes::dbLoad(error->domain.c_str(), static_cast<std::uint64_t>(error->code));
     return error;

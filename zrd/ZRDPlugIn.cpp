@@ -69,8 +69,9 @@ bool ZRDPlugIn::fillFromProxy() {
 
 std::uint32_t ZRDPlugIn::declaredHubProtocolVersion() const {
     if (const Value* declared = pluginKey(key::kHubProtocolVersion)) {
-        auto version = declared->unsignedInteger();
-        if (version && *version <= UINT32_MAX) return static_cast<std::uint32_t>(*version);
+        if (auto number = declared->numberAsInteger()) {
+            return static_cast<std::uint32_t>(std::clamp<std::int64_t>(*number, 0, UINT32_MAX));
+        }
     }
     return infoKey(key::kOldStylePlugIn) ? 1 : 2;
 }
@@ -116,6 +117,7 @@ std::optional<std::string> ZRDPlugIn::localizedContainingName() const {
 void ZRDPlugIn::setName(std::optional<std::string>& cache, std::optional<std::string> value) {
     std::lock_guard lock(mutex_);
     cache = std::move(value);
+    ++nameChanges_;
     form_.reset();
 }
 
@@ -132,15 +134,17 @@ void ZRDPlugIn::setLocalizedContainingName(std::optional<std::string> value) {
 }
 
 std::optional<Dictionary> ZRDPlugIn::form(std::optional<ZRError>& error) const {
+    std::uint64_t namesAtStart = 0;
     {
         std::lock_guard lock(mutex_);
         if (form_) return form_;
+        namesAtStart = nameChanges_;
     }
     auto made = exportForm(error);
     if (!made) return std::nullopt;
     platform::keepCborEncoded(*made);
     std::lock_guard lock(mutex_);
-    form_ = made;
+    if (namesAtStart == nameChanges_) form_ = made;
     return made;
 }
 

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstdint>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -94,10 +95,11 @@ class ZRDPlugIn final : public ZRPlugInCore {
     const platform::Dictionary* const registeredPlugIn_;
     const platform::Dictionary* const registeredAttributes_;
     const std::shared_ptr<const PlugInContext> context_;
-    mutable std::mutex mutex_;  // guards the three names and the form
+    mutable std::mutex mutex_;  // guards what follows
     mutable std::optional<std::string> localizedName_;
     mutable std::optional<std::string> localizedShortName_;
     mutable std::optional<std::string> localizedContainingName_;
+    std::uint64_t nameChanges_ = 0;
     mutable std::optional<platform::Dictionary> form_;
 };
 

@@ -1,6 +1,7 @@
 // The candidates of a discovery query. The rules themselves are judged later, by matching.
 
 #include <algorithm>
+#include <cctype>
 #include <cwctype>
 #include <string>
 #include <unordered_set>
@@ -51,8 +52,9 @@ std::optional<std::string> electionPattern(const Value& pattern) {
     if (text->front() == '=') return text->substr(1);
     // Letters and digits in the sense of Unicode, whatever the process's locale is.
     static const locale_t unicode = newlocale(LC_CTYPE_MASK, "C.UTF-8", nullptr);
-    if (!iswalnum_l(static_cast<wint_t>(firstCharacter(*text)), unicode)) return std::nullopt;
-    return *text;
+    auto first = static_cast<wint_t>(firstCharacter(*text));
+    bool usable = unicode ? iswalnum_l(first, unicode) : first < 0x80 && std::isalnum(first);
+    return usable ? std::optional(*text) : std::nullopt;
 }
 
 /// The elections that a query admits, or none when it does not narrow by election.
