@@ -31,6 +31,10 @@ namespace platform {
 /// Deepest nesting of arrays and maps that is read: what stands at the top has depth 1.
 inline constexpr int kMaxCborDepth = 128;
 
+/// Most values that are read from one item: this many, and one more for every eight of its bytes.
+/// A value in memory is larger than the byte that is enough to encode it.
+inline constexpr std::size_t kMaxCborValues = 1u << 20;
+
 /// Appends the encoding of `value` to `out`. A dictionary that carries its encoded bytes is copied,
 /// not walked. Never fails.
 void encodeCbor(const Value& value, std::string& out);

@@ -118,29 +118,25 @@ namespace detail {
 std::string escaped(std::string_view text) {
     std::string result;
     result.reserve(text.size());
-    while (!text.empty()) {
-        std::size_t valid = validUtf8Prefix(text);
-        for (std::size_t i = 0; i < valid; ++i) {
-            auto byte = static_cast<unsigned char>(text[i]);
+    std::size_t valid = validUtf8Prefix(text);
+    bool inHighControl = false;
+    for (std::size_t i = 0; i < text.size(); ++i) {
+        auto byte = static_cast<unsigned char>(text[i]);
+        bool escapes = byte < 0x20 || byte == 0x7F || std::exchange(inHighControl, false);
+        if (i == valid) {
+            escapes = true;
+            valid = i + 1 + validUtf8Prefix(text.substr(i + 1));
+        } else if (byte == 0xC2 && static_cast<unsigned char>(text[i + 1]) < 0xA0) {
             // Terminals obey the controls U+0080 to U+009F as well.
-            bool highControl = byte == 0xC2 && static_cast<unsigned char>(text[i + 1]) < 0xA0;
-            if (byte == '\n') {
-                result += "\\n";
-            } else if (byte < 0x20 || byte == 0x7F) {
-                fmt::format_to(std::back_inserter(result), "\\x{:02X}", byte);
-            } else if (highControl) {
-                ++i;
-                fmt::format_to(std::back_inserter(result), "\\x{:02X}",
-                               static_cast<unsigned char>(text[i]));
-            } else {
-                result += text[i];
-            }
+            escapes = inHighControl = true;
         }
-        text.remove_prefix(valid);
-        if (text.empty()) break;
-        fmt::format_to(std::back_inserter(result), "\\x{:02X}",
-                       static_cast<unsigned char>(text.front()));
-        text.remove_prefix(1);
+        if (byte == '\n') {
+            result += "\\n";
+        } else if (escapes) {
+            fmt::format_to(std::back_inserter(result), "\\x{:02X}", byte);
+        } else {
+            result += text[i];
+        }
     }
     return result;
 }
@@ -196,8 +192,9 @@ void Log::writeLine(LogLevel level, const std::string& text) const {
     if (all.capturing.load(std::memory_order_relaxed)) {
         std::lock_guard lock(all.captureMutex);
         if (all.sink) all.sink(category_, level, text);
-        if (level < configured_) return;
     }
+    // Only a capture wanted it, perhaps one that has gone meanwhile.
+    if (level < configured_) return;
     // A line must not be lost because the journal is away.
     if (destination().journal && sendToJournal(subsystem_, category_, level, text)) return;
     writeToStandardError(category_, level, text);

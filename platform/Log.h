@@ -113,7 +113,7 @@ class Log {
 
     bool enabled(LogLevel level) const { return level >= level_.load(std::memory_order_relaxed); }
 
-    /// Writes a line whatever the level; call it through the macros below.
+    /// Writes a line; call it through the macros below, which look at the level first.
     template <class... Arguments>
     void write(
         LogLevel level,

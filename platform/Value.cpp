@@ -5,12 +5,27 @@
 #include <algorithm>
 #include <cmath>
 
+#include "platform/Utf8.h"
+
 namespace platform {
 
 namespace {
 
 constexpr std::size_t kMaxDescription = 64 * 1024;
 constexpr int kMaxPropertyListDepth = 64;
+/// The years 1 to 9999, in seconds since 1970.
+constexpr double kFirstStorableDate = -62135596800.0;
+constexpr double kEndOfStorableDates = 253402300800.0;
+
+/// Whether no other copy shares the storage, which its holder may then change.
+template <class T>
+bool isUnshared(const std::shared_ptr<T>& storage) {
+    if (storage.use_count() != 1) return false;
+    // The count alone orders nothing. Taking a reference and dropping it does: what another thread
+    // read before it dropped the last other copy happens before what we write now.
+    std::shared_ptr<T>(storage).reset();
+    return true;
+}
 
 const std::shared_ptr<std::vector<Value>>& emptyArray() {
     static const auto empty = std::make_shared<std::vector<Value>>();
@@ -52,7 +67,7 @@ void Array::remove(std::size_t index) {
 }
 
 std::vector<Value>& Array::unshared() {
-    if (values_.use_count() != 1) values_ = std::make_shared<std::vector<Value>>(*values_);
+    if (!isUnshared(values_)) values_ = std::make_shared<std::vector<Value>>(*values_);
     return *values_;
 }
 
@@ -88,11 +103,15 @@ Dictionary::Dictionary(std::initializer_list<Entry> entries)
 }
 
 std::optional<Dictionary> Dictionary::fromEntries(std::vector<Entry> entries) {
-    if (!std::ranges::is_sorted(entries, {}, &Entry::first)) {
+    auto strictlySorted = [&entries] {
+        return std::ranges::adjacent_find(entries, std::ranges::greater_equal(), &Entry::first) ==
+               entries.end();
+    };
+    // What encoders write is sorted already.
+    if (!strictlySorted()) {
         std::ranges::sort(entries, {}, &Entry::first);
+        if (!strictlySorted()) return std::nullopt;
     }
-    if (std::ranges::adjacent_find(entries, {}, &Entry::first) != entries.end())
-        return std::nullopt;
     Dictionary dictionary;
     if (!entries.empty()) dictionary.storage_ = std::make_shared<Storage>(std::move(entries));
     return dictionary;
@@ -135,6 +154,8 @@ const EncodedBytes* Dictionary::encoded() const {
 }
 
 void Dictionary::keepEncoded(EncodedBytes bytes) const {
+    // All empty dictionaries share their storage, which would keep the bytes' owner for ever.
+    if (empty()) return;
     auto* kept = new EncodedBytes(std::move(bytes));
     const EncodedBytes* none = nullptr;
     if (!storage_->encoded.compare_exchange_strong(none, kept, std::memory_order_acq_rel))
@@ -142,10 +163,10 @@ void Dictionary::keepEncoded(EncodedBytes bytes) const {
 }
 
 Dictionary::Storage& Dictionary::unshared() {
-    if (storage_.use_count() != 1) {
-        storage_ = std::make_shared<Storage>(*storage_);
-    } else {
+    if (isUnshared(storage_)) {
         storage_->dropEncoded();
+    } else {
+        storage_ = std::make_shared<Storage>(*storage_);
     }
     return *storage_;
 }
@@ -154,12 +175,27 @@ bool Dictionary::operator==(const Dictionary& other) const {
     return storage_ == other.storage_ || storage_->entries == other.storage_->entries;
 }
 
-Packed::Packed(Value value) : value_(std::make_shared<const Value>(std::move(value))) {}
-Packed::Packed(EncodedBytes bytes) : bytes_(std::move(bytes)) {}
+/// Either the value or the bytes.
+struct Packed::Content {
+    std::optional<Value> value;
+    EncodedBytes bytes;
+};
+
+Packed::Packed(Value value)
+    : content_(std::make_shared<const Content>(Content{std::move(value), {}})) {}
+Packed::Packed(EncodedBytes bytes)
+    : content_(std::make_shared<const Content>(Content{std::nullopt, std::move(bytes)})) {}
+
+const Value* Packed::value() const {
+    return content_->value ? &*content_->value : nullptr;
+}
+const EncodedBytes& Packed::bytes() const {
+    return content_->bytes;
+}
 
 bool Packed::operator==(const Packed& other) const {
-    if (value_ && other.value_) return *value_ == *other.value_;
-    return !value_ && !other.value_ && bytes_.bytes == other.bytes_.bytes;
+    return content_ == other.content_ ||
+           (content_->value == other.content_->value && bytes().bytes == other.bytes().bytes);
 }
 
 Value::Kind Value::kind() const {
@@ -380,7 +416,7 @@ class Describer {
 };
 
 /// Whether text holds only characters of XML 1.0: no control character but tab, line feed and
-/// carriage return, and not U+FFFE or U+FFFF. The text is valid UTF-8 already.
+/// carriage return, not U+FFFE or U+FFFF, and nothing that is not UTF-8.
 bool isXmlText(std::string_view text) {
     for (std::size_t i = 0; i < text.size(); ++i) {
         auto byte = static_cast<unsigned char>(text[i]);
@@ -390,7 +426,7 @@ bool isXmlText(std::string_view text) {
             if (last == "\xBE" || last == "\xBF") return false;
         }
     }
-    return true;
+    return isValidUtf8(text);
 }
 
 bool isPropertyListAt(const Value& value, int depth) {
@@ -400,6 +436,10 @@ bool isPropertyListAt(const Value& value, int depth) {
             return false;
         case Value::Kind::String:
             return isXmlText(*value.string());
+        case Value::Kind::Date: {
+            double seconds = value.date()->secondsSince1970;
+            return seconds >= kFirstStorableDate && seconds < kEndOfStorableDates;
+        }
         case Value::Kind::Array:
             return depth < kMaxPropertyListDepth &&
                    std::ranges::all_of(*value.array(), [depth](const Value& element) {

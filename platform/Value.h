@@ -105,7 +105,8 @@ class Dictionary {
     /// The encoded bytes that this storage carries, or null.
     const EncodedBytes* encoded() const;
     /// Gives this storage its encoded bytes, which must be the encoding of just these entries. Safe
-    /// to call while other threads read; does nothing when the storage carries bytes already.
+    /// to call while other threads read; does nothing when the storage carries bytes already, and
+    /// nothing for an empty dictionary.
     void keepEncoded(EncodedBytes bytes) const;
 
     bool operator==(const Dictionary& other) const;
@@ -127,15 +128,16 @@ class Packed {
     explicit Packed(EncodedBytes bytes);
 
     /// The value it was made from, or null when it was made from bytes.
-    const Value* value() const { return value_.get(); }
+    const Value* value() const;
     /// The bytes it was made from; empty when it was made from a value.
-    const EncodedBytes& bytes() const { return bytes_; }
+    const EncodedBytes& bytes() const;
 
     bool operator==(const Packed& other) const;
 
   private:
-    std::shared_ptr<const Value> value_;
-    EncodedBytes bytes_;
+    struct Content;
+
+    std::shared_ptr<const Content> content_;
 };
 
 /// The one value type of the system, which property lists and messages share. There is no null: an
@@ -147,11 +149,14 @@ class Value {
   public:
     enum class Kind { Boolean, Integer, Real, Date, Data, String, Uuid, Array, Dictionary, Packed };
 
-    Value(bool value) : content_(value) {}
+    /// Only real booleans and reals: a pointer or a character must not turn into one.
+    template <std::same_as<bool> T>
+    Value(T value) : content_(value) {}
+    template <std::floating_point T>
+    Value(T value) : content_(static_cast<double>(value)) {}
     template <std::integral T>
     requires(!std::same_as<T, bool> && !std::same_as<T, char>) Value(T value)
         : content_(integer(value)) {}
-    Value(double value) : content_(value) {}
     Value(Date value) : content_(value) {}
     Value(Data value) : content_(std::move(value)) {}
     Value(std::string value) : content_(std::make_shared<const std::string>(std::move(value))) {}
@@ -217,8 +222,8 @@ std::string describe(const Dictionary& value);
 std::string describe(const Array& value);
 
 /// Whether the value could be stored in a property-list file and read back: no UUID and no packed
-/// value at any depth, no text (keys included) with characters that XML 1.0 forbids, at most 64
-/// levels of containers.
+/// value at any depth, no text (keys included) with characters that XML 1.0 forbids, no date
+/// outside the years 1 to 9999, at most 64 levels of containers.
 bool isPropertyList(const Value& value);
 
 }  // namespace platform

@@ -1,0 +1,41 @@
+#include "platform/LazyDictionary.h"
+
+#include "platform/Cbor.h"
+#include "platform/Log.h"
+
+namespace platform {
+
+namespace {
+
+const Log& ops() {
+    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
+    return handle;
+}
+
+}  // namespace
+
+LazyDictionary::LazyDictionary(Dictionary dictionary) : state_(std::make_shared<State>()) {
+    state_->dictionary = std::move(dictionary);
+    std::call_once(state_->decoded, [] {});
+}
+
+LazyDictionary::LazyDictionary(EncodedBytes bytes) : state_(std::make_shared<State>()) {
+    state_->bytes = std::move(bytes);
+}
+
+const Dictionary& LazyDictionary::get() const {
+    std::call_once(state_->decoded, [&state = *state_] {
+        auto value = decodeCbor(state.bytes, CborOptions::KeepEncoded);
+        if (!value) {
+            EVLOG_ERROR(ops(), "unreadable encoded dictionary: {}", value.error());
+        } else if (const Dictionary* dictionary = value->dictionary()) {
+            state.dictionary = *dictionary;
+        } else {
+            EVLOG_ERROR(ops(), "unreadable encoded dictionary: it holds another kind of value");
+        }
+        state.bytes = {};
+    });
+    return state_->dictionary;
+}
+
+}  // namespace platform
