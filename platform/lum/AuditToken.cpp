@@ -1,0 +1,148 @@
+#include "platform/lum/AuditToken.h"
+
+#include <fcntl.h>
+#include <fmt/format.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <climits>
+#include <cstdint>
+#include <cstdlib>
+#include <ctime>
+#include <string_view>
+#include <utility>
+
+#include "platform/UniqueFd.h"
+
+namespace platform {
+
+namespace {
+
+#ifdef SO_PEERPIDFD
+constexpr int kPeerPidFd = SO_PEERPIDFD;
+#else
+constexpr int kPeerPidFd = 77;
+#endif
+
+UniqueFd openPidFd(pid_t pid) {
+    return UniqueFd(static_cast<int>(syscall(SYS_pidfd_open, pid, 0)));
+}
+
+/// Whether the process of the pidfd still has its process id. Somebody else's process may refuse
+/// the signal, but it is there then.
+bool isAlive(int pidFd) {
+    return syscall(SYS_pidfd_send_signal, pidFd, 0, nullptr, 0) == 0 || errno == EPERM;
+}
+
+UniqueFd openProc(pid_t pid) {
+    return UniqueFd(open(fmt::format("/proc/{}", pid).c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+}
+
+/// When the process started, in clock ticks since boot: the 22nd field of `stat`, counted from
+/// behind the name, which may hold anything.
+std::optional<std::uint64_t> startTicks(int procDirectory) {
+    UniqueFd file(openat(procDirectory, "stat", O_RDONLY | O_CLOEXEC));
+    char buffer[1024];
+    const ssize_t count = file ? read(file.get(), buffer, sizeof buffer) : -1;
+    if (count <= 0) return std::nullopt;
+    std::string_view text(buffer, static_cast<std::size_t>(count));
+    text.remove_prefix(std::min(text.rfind(')'), text.size()));
+    constexpr int kFieldsFromName = 20;
+    for (int i = 0; i < kFieldsFromName; ++i) {
+        const std::size_t space = text.find(' ');
+        if (space == std::string_view::npos) return std::nullopt;
+        text.remove_prefix(space + 1);
+    }
+    return std::strtoull(std::string(text.substr(0, text.find(' '))).c_str(), nullptr, 10);
+}
+
+std::uint64_t ticksSinceBoot() {
+    timespec now{};
+    clock_gettime(CLOCK_BOOTTIME, &now);
+    const auto perSecond = static_cast<std::uint64_t>(sysconf(_SC_CLK_TCK));
+    return static_cast<std::uint64_t>(now.tv_sec) * perSecond +
+           static_cast<std::uint64_t>(now.tv_nsec) * perSecond / 1'000'000'000;
+}
+
+std::optional<std::string> readExecutable(int procDirectory) {
+    struct stat running {};
+    struct stat named {};
+    char path[PATH_MAX];
+    if (fstatat(procDirectory, "exe", &running, 0) != 0) return std::nullopt;
+    const ssize_t length = readlinkat(procDirectory, "exe", path, sizeof path);
+    if (length <= 0 || length == sizeof path || path[0] != '/') return std::nullopt;
+    std::string result(path, static_cast<std::size_t>(length));
+    // Also no match: the path of another mount namespace, and "/x (deleted)".
+    if (stat(result.c_str(), &named) != 0 || named.st_dev != running.st_dev ||
+        named.st_ino != running.st_ino)
+        return std::nullopt;
+    return result;
+}
+
+}  // namespace
+
+struct AuditToken::State {
+    pid_t pid;
+    uid_t uid;
+    UniqueFd pidFd;
+    UniqueFd proc;
+    std::optional<std::string> executable;
+};
+
+std::optional<AuditToken> AuditToken::ofPeer(int socket) {
+    const std::uint64_t accepted = ticksSinceBoot();
+    int rawPidFd = -1;
+    socklen_t size = sizeof rawPidFd;
+    const bool pinnedByKernel = getsockopt(socket, SOL_SOCKET, kPeerPidFd, &rawPidFd, &size) == 0;
+    if (!pinnedByKernel && errno != ENOPROTOOPT) return std::nullopt;
+    UniqueFd pidFd(pinnedByKernel ? rawPidFd : -1);
+
+    ucred peer{};
+    size = sizeof peer;
+    if (getsockopt(socket, SOL_SOCKET, SO_PEERCRED, &peer, &size) != 0 || peer.pid <= 0)
+        return std::nullopt;
+    if (!pinnedByKernel) pidFd = openPidFd(peer.pid);
+
+    // The directory is opened by number: it is the peer's if the number was still the peer's after
+    // that.
+    UniqueFd proc = openProc(peer.pid);
+    if (!pidFd || !proc || !isAlive(pidFd.get())) return std::nullopt;
+    if (!pinnedByKernel) {
+        const auto started = startTicks(proc.get());
+        if (!started || *started >= accepted) return std::nullopt;
+    }
+
+    auto executable = readExecutable(proc.get());
+    return AuditToken(std::make_shared<const State>(
+        State{peer.pid, peer.uid, std::move(pidFd), std::move(proc), std::move(executable)}));
+}
+
+std::optional<AuditToken> AuditToken::ofSelf() {
+    UniqueFd pidFd = openPidFd(getpid());
+    UniqueFd proc = openProc(getpid());
+    if (!pidFd || !proc) return std::nullopt;
+    auto executable = readExecutable(proc.get());
+    return AuditToken(std::make_shared<const State>(
+        State{getpid(), geteuid(), std::move(pidFd), std::move(proc), std::move(executable)}));
+}
+
+pid_t AuditToken::pid() const {
+    return state_->pid;
+}
+uid_t AuditToken::uid() const {
+    return state_->uid;
+}
+int AuditToken::pidFd() const {
+    return state_->pidFd.get();
+}
+int AuditToken::procDirectory() const {
+    return state_->proc.get();
+}
+const std::optional<std::string>& AuditToken::executablePath() const {
+    return state_->executable;
+}
+
+}  // namespace platform

@@ -1,0 +1,52 @@
+#pragma once
+
+#include <array>
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <string_view>
+#include <variant>
+
+#include "platform/Error.h"
+#include "platform/lum/Connection.h"
+#include "platform/lum/Message.h"
+
+namespace platform::lum {
+
+/// On the socket a message is a frame: the payload's length as 4 bytes, big-endian, then the
+/// payload, one CBOR item: the array [kind, serial, body].
+enum class FrameKind : std::uint64_t { Request = 0, Reply = 1 };
+
+inline constexpr std::size_t kFrameHeaderSize = 4;
+
+/// A whole frame. Error (domain "Lum"): the payload would be over `limit` bytes.
+Result<std::string> encodeFrame(FrameKind kind, const Message& message, std::size_t limit);
+
+/// What a payload is to a receiver of frames of the kind `expected`: a message; a well-formed item
+/// that is no such message; or, for anything else, an error that says what is wrong with it.
+using DecodedPayload = std::variant<Message, UnknownObject, Error>;
+DecodedPayload decodePayload(std::shared_ptr<const std::string> payload, FrameKind expected);
+
+/// Cuts a stream of bytes into payloads. A payload's memory is taken as its bytes arrive, not when
+/// they are announced.
+class FrameReader {
+  public:
+    explicit FrameReader(std::size_t maxPayload) : maxPayload_(maxPayload) {}
+
+    /// Takes bytes off the front of `input` until a frame is complete, and answers its payload;
+    /// null when all of `input` is taken and the frame is not complete. Error (domain "Lum"): the
+    /// frame is announced with more bytes than the limit; the stream cannot be read on.
+    Result<std::shared_ptr<const std::string>> take(std::string_view& input);
+
+    /// Whether part of a frame has been taken.
+    bool insideFrame() const { return headerSize_ > 0; }
+
+  private:
+    std::size_t maxPayload_;
+    std::array<unsigned char, kFrameHeaderSize> header_{};
+    std::size_t headerSize_ = 0;
+    std::string payload_;
+};
+
+}  // namespace platform::lum

@@ -1,0 +1,70 @@
+#pragma once
+
+#include <atomic>
+#include <cstddef>
+#include <deque>
+#include <mutex>
+#include <optional>
+#include <string>
+
+#include "platform/UniqueFd.h"
+
+namespace platform::lum {
+
+/// A connected stream socket. Frames are sent from any thread and never block it; receiving,
+/// flushing and closing belong to the one thread that watches the socket.
+class FrameSocket {
+  public:
+    explicit FrameSocket(UniqueFd socket) : socket_(std::move(socket)) {}
+
+    /// Borrows. -1 once closed.
+    int fd() const { return socket_.get(); }
+
+    struct Sent {
+        std::size_t kept = 0;        // bytes of frames that this call has added to `held`
+        bool awaitWritable = false;  // somebody has to call `flush` once the socket is writable
+    };
+    /// Writes what the socket takes at once and keeps the frame while a rest of it is unsent. On a
+    /// closed or broken socket the frame vanishes.
+    Sent send(std::string frame);
+
+    struct Flushed {
+        std::size_t freed = 0;       // bytes of frames that are held no more
+        bool awaitWritable = false;  // more is left
+    };
+    /// Writes on, at most about a megabyte, so that a fast reader does not occupy the thread.
+    Flushed flush();
+
+    /// Bytes of frames that are not sent whole: what their memory costs.
+    std::size_t held() const { return held_.load(std::memory_order_relaxed); }
+
+    /// Receives into `buffer`: the number of bytes, 0 at the end of the stream (or when the peer is
+    /// gone); none when there is nothing to be had now.
+    std::optional<std::size_t> receive(char* buffer, std::size_t size);
+
+    /// Whether both ends are closed, or the socket cannot be used on for another reason.
+    bool isHungUp() const;
+
+    /// Closes and drops what is unsent; answers how many bytes were held.
+    std::size_t close();
+
+  private:
+    /// Sends at most `most` bytes of `frame` from `offset` on, and moves it; false when the socket
+    /// takes no more for now.
+    bool write(const std::string& frame, std::size_t& offset, std::size_t most);
+    std::size_t dropUnsent();
+
+    struct Unsent {
+        std::string frame;
+        std::size_t offset;
+    };
+
+    mutable std::mutex mutex_;
+    // Written under the mutex, so that nobody sends on a descriptor number that has been closed.
+    UniqueFd socket_;
+    std::deque<Unsent> unsent_;  // guarded by mutex_
+    bool broken_ = false;        // guarded by mutex_: the peer reads no more
+    std::atomic<std::size_t> held_ = 0;
+};
+
+}  // namespace platform::lum

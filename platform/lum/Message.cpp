@@ -1,0 +1,15 @@
+#include "platform/lum/Message.h"
+
+namespace platform {
+
+Message Message::replyTo(const Message& request) {
+    Message reply;
+    reply.serial_ = request.serial_;
+    return reply;
+}
+
+std::string describe(const Message& message) {
+    return describe(message.contents());
+}
+
+}  // namespace platform

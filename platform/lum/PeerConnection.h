@@ -1,0 +1,94 @@
+#pragma once
+
+#include <atomic>
+#include <cstddef>
+#include <deque>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "platform/RunLoop.h"
+#include "platform/SerialQueue.h"
+#include "platform/UniqueFd.h"
+#include "platform/lum/Connection.h"
+#include "platform/lum/Frame.h"
+#include "platform/lum/FrameSocket.h"
+#include "platform/lum/ReplyBudget.h"
+
+namespace platform::lum {
+
+/// The connection over a socket. Everything but `send` and the end of a turn happens on the queue;
+/// members are the queue's unless they say otherwise.
+///
+/// What keeps it alive from `resume` to its invalid event is the callback that waits for the
+/// hang-up. So a loop that is destroyed takes its connections along.
+class PeerConnection final : public Connection,
+                             public std::enable_shared_from_this<PeerConnection> {
+  public:
+    PeerConnection(UniqueFd socket, AuditToken token, SerialQueue& queue,
+                   std::shared_ptr<ReplyBudget> budget);
+    ~PeerConnection() override;
+
+    pid_t pid() const override { return token_.pid(); }
+    const AuditToken& auditToken() const override { return token_; }
+    void setContext(std::shared_ptr<void> context) override { context_ = std::move(context); }
+    void setEventHandler(EventHandler handler) override { handler_ = std::move(handler); }
+    void resume() override;
+    void send(const Message& reply) override;
+    std::string description() const override;
+
+  private:
+    class Turn;
+    enum TurnState { Free, Taken, Awaited };
+
+    void start();
+    void readable();
+    void hungUp();
+    void writable();
+
+    /// One receive; false when there was nothing more to be had.
+    bool receiveSome();
+    void cutFrames(std::string_view input);
+    void endOfStream();
+
+    /// Delivers what may be delivered, reads on when there is room: after every change.
+    void proceed();
+    void deliverWaiting();
+    void deliver(std::shared_ptr<const std::string> payload, std::shared_ptr<void> turn);
+    bool hasRoomForRequests() const;
+    bool mayReadOn() const;
+    void awaitReadable();
+    void awaitWritable();
+
+    std::shared_ptr<void> takeTurn();
+    void endTurn();
+
+    void breakOff(const std::string& reason);
+    void becomeInvalid(const std::string& reason);
+
+    SerialQueue& queue_;
+    RunLoop& loop_;
+    const AuditToken token_;
+    const std::shared_ptr<ReplyBudget> budget_;
+    std::shared_ptr<void> context_;
+    EventHandler handler_;
+
+    FrameSocket socket_;  // its own mutex guards sending
+    FrameReader reader_;
+    std::optional<RunLoop::Watch> watch_;  // from `resume` to the invalid event
+    bool invalid_ = false;
+    bool ended_ = false;  // the peer sends nothing more
+    bool announcedEnd_ = false;
+    bool awaitsReadable_ = false;
+    bool awaitsBudget_ = false;
+
+    // Requests that wait for their turn, still encoded, and bytes behind the last one that fitted.
+    std::deque<std::shared_ptr<const std::string>> waiting_;
+    std::size_t waitingBytes_ = 0;
+    std::string uncut_;
+
+    std::atomic<TurnState> turn_ = Free;  // taken on the queue, given back on any thread
+};
+
+}  // namespace platform::lum

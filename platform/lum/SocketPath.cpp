@@ -1,0 +1,19 @@
+#include <sys/un.h>
+
+#include <cerrno>
+
+#include "platform/Directories.h"
+#include "platform/Files.h"
+#include "platform/lum/Listener.h"
+
+namespace platform::lum {
+
+Result<std::string> socketPath(const Directories& directories, const std::string& serviceName) {
+    if (!isSafeName(serviceName))
+        return Error::posix(EINVAL, "service name \"" + serviceName + "\"");
+    std::string path = joinPath(directories.zorvanRuntime() + "/services", serviceName);
+    if (path.size() >= sizeof(sockaddr_un::sun_path)) return Error::posix(ENAMETOOLONG, path);
+    return path;
+}
+
+}  // namespace platform::lum
