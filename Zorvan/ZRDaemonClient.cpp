@@ -17,7 +17,18 @@ using platform::Uuid;
 using platform::Value;
 
 std::shared_ptr<ZRDaemonClient> ZRDaemonClient::initWithServiceName(const char* serviceName) {
-    return std::shared_ptr<ZRDaemonClient>(new ZRDaemonClient(serviceName));
+    return std::shared_ptr<ZRDaemonClient>(new ZRDaemonClient(serviceName), destroy);
+}
+
+/// A queue cannot join its own thread, so a client whose last reference goes in a callback is
+/// destroyed on a thread kept for that.
+void ZRDaemonClient::destroy(ZRDaemonClient* client) {
+    if (client->replyQueue_.isCurrent()) {
+        static platform::SerialQueue reaper("zrd_client end");
+        reaper.async([client] { delete client; });
+    } else {
+        delete client;
+    }
 }
 
 ZRDaemonClient::ZRDaemonClient(const char* serviceName)
