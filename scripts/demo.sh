@@ -78,13 +78,15 @@ show "Versions compare by number: 1.9 is less than 1.10." \
 show "Rules look at attributes: what takes pictures of one of two types? (The same key twice: either.)" \
     zrctl match InputTypes=image/gif InputTypes=image/svg+xml
 show "Types have a hierarchy: what takes any kind of text? Most have that from the dictionary of their
-extension point, not from their own Info.plist." \
+extension point, not from their own Info.plist. (SVG pictures are XML, and that is text.)" \
     zrctl match --all 'InputTypes=?UT-CONFORMS:text/plain'
 show "A host that offers two PNG pictures to share asks with a rules file; the plug-ins' own activation
 rules decide:" \
     zrctl match --rules examples/share-rules.plist
-show "One plug-in replaces another; both are listed and marked:" \
+show "One plug-in replaces another; both are listed and marked, and share one election:" \
     zrctl match --long InputTypes=image/png
+show "It asked to be elected when it was installed. What is elected?" \
+    zrctl match VXUserElection=1
 show "A manager may also see what it could not use itself: a plug-in made for its own application only
 (Outline), and one that demands an entitlement of its host (Sealed Letter). The Telegraph is
 excluded by the user's preferences and stays out." \
@@ -101,7 +103,8 @@ show "... until it is added again:" \
     zrctl add "$applications/Scribe.app/PlugIns/WordCount.appex"
 show "There it is:" \
     zrctl match VXExtensionIdentifier=com.example.scribe.word-count
-show "Two bundles were refused; the log says which and why:" \
-    grep -E 'Tracer|Damaged' "$home/log"
+say "Two bundles were refused; the log says which and why:"
+sed -n -e 's/.*\(leaving out a plug-in.*\)/\1/p' -e 's/.*\(ignoring mis-configured.*\)/\1/p' "$home/log" |
+    sort -u
 
 say "Stopping zrd. Try it yourself: README.md says how."

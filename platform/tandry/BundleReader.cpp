@@ -19,6 +19,9 @@ namespace {
 /// Levels of containers that stand around a bundle's dictionary in a reply, generously.
 constexpr int kReplyLevels = 8;
 
+/// Most bytes that a record's encoded dictionaries may have.
+constexpr std::size_t kMaxRecordSize = 2 * kMaxBundleFile;
+
 constexpr const char* kInfoPlist = "Info.plist";
 constexpr const char* kEntitlements = "Entitlements.plist";
 constexpr const char* kLocalized = "Localized.plist";
@@ -236,6 +239,8 @@ std::optional<Error> BundleReader::fill(const BundleFolder& folder, PlugInEntry&
     Result<Dictionary> entitlements = readDictionary(folder, kEntitlements);
     if (!entitlements && !isMissing(entitlements.error())) return entitlements.error();
     encodeCbor(entitlements ? *entitlements : Dictionary(), *dictionaries);
+    // A small binary list may have expanded to something large.
+    if (dictionaries->size() > kMaxRecordSize) return malformed(file, "too large when expanded");
     entry.dictionaries = std::move(dictionaries);
     entry.attachDictionaries();
     return describePlugIn(folder, info, entry);

@@ -69,6 +69,7 @@ class DiskWorkspace final : public Workspace {
     void firstScan();
     std::optional<Error> registerOnQueue(const std::string& bundlePath);
     std::optional<Error> unregisterOnQueue(const std::string& bundlePath);
+    bool dropRegistrations(const std::string& path);
     bool forgetWithin(const std::string& path, RegistryChanges& changes);
     void apply(const RegistryChanges& changes);
 
@@ -249,11 +250,22 @@ bool DiskWorkspace::forgetWithin(const std::string& path, RegistryChanges& chang
     return !changes.uninstalled.empty();
 }
 
+/// Drops the registrations of a path and of the plug-ins inside; answers whether there were any.
+bool DiskWorkspace::dropRegistrations(const std::string& path) {
+    return std::erase_if(state_.registrations, [&path](const std::string& registered) {
+               return isWithin(registered, path);
+           }) != 0;
+}
+
 std::optional<Error> DiskWorkspace::unregisterOnQueue(const std::string& bundlePath) {
     RegistryChanges changes;
     changes.lists = true;
-    const bool wasRegistered = state_.registrations.erase(bundlePath) != 0;
-    const bool hadPlugIns = forgetWithin(bundlePath, changes);
+    // Only what a path names goes, never what merely lies below some directory.
+    const bool isKnown = state_.plugIns.contains(bundlePath) ||
+                         state_.applications.contains(bundlePath) ||
+                         state_.registrations.contains(bundlePath);
+    const bool wasRegistered = isKnown && dropRegistrations(bundlePath);
+    const bool hadPlugIns = isKnown && forgetWithin(bundlePath, changes);
     if (!wasRegistered && !hadPlugIns)
         return Error{"Registry", 0, fmt::format("{}: nothing is registered there", bundlePath)};
     if (!scanner_.isHeld(bundlePath))
