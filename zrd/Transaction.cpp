@@ -5,6 +5,7 @@
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
 #include "platform/Files.h"
+#include "platform/Utf8.h"
 #include "platform/Value.h"
 #include "zrd/Probes.h"
 #include "zrd/ZRDLumClient.h"
@@ -89,6 +90,8 @@ bool Transaction::marshalPaths(
             return false;
         }
         auto resolved = platform::canonicalPath(*path, kMaxResolvedPath);
+        // A reply could not carry other paths, and the registry has no bundles there.
+        if (resolved && !platform::isValidUtf8(*resolved)) resolved.reset();
         if (callback(resolved ? *resolved : *path, resolved.has_value()) == Walk::Stop)
             return false;
     }

@@ -7,8 +7,6 @@
 #include <future>
 
 #include "Zorvan/Keys.h"
-#include "Zorvan/ZRDaemonClient.h"
-#include "platform/PropertyList.h"
 #include "tests/Zorvan/LogLines.h"
 #include "tests/support/TemporaryDirectory.h"
 #include "tests/zrd/Fakes.h"
@@ -64,7 +62,7 @@ class TransactionTest : public testing::Test {
         connection_->sent.clear();
         return reply;
     }
-    static Dictionary error(int code, const char* text) {
+    static Dictionary error(int code, const std::string& text) {
         return {{"errorcode", code}, {"error", text}};
     }
     ZRDLumClient& client() { return *static_cast<ZRDLumClient*>(connection_->context.get()); }
@@ -111,6 +109,8 @@ TEST_F(TransactionTest, PathsAreWalkedUpToTheFirstFailure) {
     const std::string real = directory_.makeDirectory("real"), link = directory_.path("link");
     std::filesystem::create_directory_symlink(real, link);
     const std::string gone = directory_.path("gone"), refused = directory_.makeDirectory("refused");
+    const std::string odd = directory_.path("odd");  // leads to a name that no reply can carry
+    std::filesystem::create_directory_symlink(directory_.makeDirectory("\xff"), odd);
     workspace_->refused = {refused, gone};
     struct Case {
         const char* type;
@@ -118,8 +118,6 @@ TEST_F(TransactionTest, PathsAreWalkedUpToTheFirstFailure) {
         Dictionary reply;
         std::vector<std::string> changes;
     };
-    const std::string unable = "unable to register plug-in at " + refused;
-    const std::string invalid = "invalid plugin path: " + gone, missing = "no plugin at " + gone;
     const Dictionary format = error(4, "invalid request format");
     const Dictionary relative = error(9, "absolute path required: a/b");
     const Case cases[] = {
@@ -129,14 +127,15 @@ TEST_F(TransactionTest, PathsAreWalkedUpToTheFirstFailure) {
         {"add", Array{link, 7, real}, format, {"add " + real}},
         {"add", Array{link, "a/b", real}, relative, {"add " + real}},
         {"add", Array{""}, error(9, "absolute path required: "), {}},
-        {"add", Array{real, gone}, error(9, invalid.c_str()), {"add " + real}},
+        {"add", Array{real, gone}, error(9, "invalid plugin path: " + gone), {"add " + real}},
+        {"add", Array{odd}, error(9, "invalid plugin path: " + odd), {}},
         {"add",
          Array{real, refused, link},
-         error(2, unable.c_str()),
+         error(2, "unable to register plug-in at " + refused),
          {"add " + real, "add " + refused}},
         {"remove",
          Array{link, gone, real},
-         error(9, missing.c_str()),
+         error(9, "no plugin at " + gone),
          {"remove " + real, "remove " + gone}},
         {"remove", Array{}, {}, {}},
     };
@@ -207,22 +206,6 @@ TEST_F(TransactionTest, BadRulesAndForbiddenFlagsAreRefusedBeforeAnyQuery) {
     EXPECT_EQ(workspace_->queries, 0);
 }
 
-TEST_F(TransactionTest, ExclusionsAreReadForEveryRequest) {
-    workspace_->installed = {makeProxy("com.a"), makeProxy("com.b")};
-    platform::Preferences preferences(services_.directories);
-    const std::string file =
-        preferences.path("com.orbel.zorvan.userprefs").substr(directory_.path().size() + 1);
-    auto store = [&](Value exclusions) {
-        directory_.write(file, *platform::writeXmlPropertyList(
-                                   Dictionary{{"exclusions", std::move(exclusions)}}));
-    };
-    EXPECT_THAT(match({}), ElementsAre("com.a", "com.b"));
-    store(Array{"odd", Dictionary{{"VXExtensionIdentifier", "com.a"}}});
-    EXPECT_THAT(match({}), ElementsAre("com.b"));
-    store("everything");
-    EXPECT_THAT(match({}), ElementsAre("com.a", "com.b"));
-}
-
 TEST_F(TransactionTest, QueuedRequestsOfADeadClientAreDropped) {
     std::promise<void> go;
     server_->submitWork([blocked = go.get_future().share()] { blocked.wait(); });
@@ -260,15 +243,6 @@ TEST_F(TransactionTest, ClientsCountTheirRequestsAndReportOddEvents) {
     EXPECT_THAT(survivor->description(), HasSubstr(" NO CONNECTION>"));
     EXPECT_EQ(survivor->pid(), 0);
     EXPECT_TRUE(survivor->isSandboxed());
-}
-
-TEST_F(TransactionTest, AServiceNameHasOneOwner) {
-    LogLines log;
-    EXPECT_FALSE(ZRDServer::initForService("zrd", std::nullopt, services_));
-    EXPECT_FALSE(ZRDServer::initForService("a/b", std::nullopt, services_));
-    EXPECT_THAT(log.take(), ElementsAre(HasSubstr("ops E: cannot listen on service zrd: "),
-                                        HasSubstr("ops E: cannot listen on service a/b: ")));
-    EXPECT_EQ(ZRDServer::server(), server_);
 }
 
 }  // namespace

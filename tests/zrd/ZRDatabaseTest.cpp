@@ -56,8 +56,7 @@ class ZRDatabaseTest : public testing::Test {
     std::vector<std::string> find(const Dictionary& query) {
         std::vector<std::string> identifiers;
         const auto found = database_->findPlugIns(&query);
-        for (const auto& plugIn : found.value())
-            identifiers.push_back(plugIn->identifier());
+        for (const auto& plugIn : found.value()) identifiers.push_back(plugIn->identifier());
         return identifiers;
     }
 
