@@ -13,7 +13,6 @@ namespace test {
 namespace {
 
 using testing::ElementsAre;
-using testing::EndsWith;
 using testing::HasSubstr;
 using testing::IsEmpty;
 
@@ -88,7 +87,7 @@ TEST_F(Discovery, ReplacersAreMarkedAndElectThemselves) {
                  {"com.orbel.developer.auto-elect-plugin", true}});
     const std::string database = home_.path("chosen");
     for (int run : {1, 2}) {
-        start({"-d", database});
+        start({"-d", database, "-c", "1"});
         const auto found = forms({{"VXUserElection", "1"}});
         // In the second run the election is stored, and shared with what is replaced.
         EXPECT_EQ(found.size(), run == 1 ? 1u : 2u);

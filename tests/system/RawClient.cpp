@@ -23,17 +23,7 @@ RawClient::RawClient(const std::string& socketPath)
 }
 
 void RawClient::send(std::string_view bytes) const {
-    while (!bytes.empty()) {
-        const ssize_t count = ::send(socket_.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL);
-        if (count <= 0) return;  // the other end has seen enough
-        bytes.remove_prefix(static_cast<std::size_t>(count));
-    }
-}
-
-std::size_t RawClient::sendSome(std::string_view bytes) const {
-    const ssize_t count =
-        ::send(socket_.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL | MSG_DONTWAIT);
-    return count > 0 ? static_cast<std::size_t>(count) : 0;
+    ::send(socket_.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL | MSG_DONTWAIT);
 }
 
 void RawClient::sendNothingMore() const {

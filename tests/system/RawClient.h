@@ -15,9 +15,8 @@ class RawClient {
     explicit RawClient(const std::string& socketPath);
 
     bool isConnected() const { return bool(socket_); }
+    /// Sends as much as the socket takes without waiting.
     void send(std::string_view bytes) const;
-    /// As much as the socket takes without waiting.
-    std::size_t sendSome(std::string_view bytes) const;
     void sendNothingMore() const;
 
     /// The next frame's payload; empty at the end of the stream (or after half a minute without

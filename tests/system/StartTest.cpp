@@ -11,8 +11,6 @@ namespace test {
 namespace {
 
 using testing::ElementsAre;
-using testing::EndsWith;
-using testing::HasSubstr;
 using testing::IsEmpty;
 using namespace std::string_literals;
 
@@ -26,7 +24,7 @@ class Start : public SystemTest {
 
 TEST_F(Start, WrongUsageGetsTheUsageTextAlone) {
     for (std::vector<std::string> arguments :
-         {std::vector<std::string>{"-x"}, {"-S"}, {"operand"}, {"-d", "x", "--", "-S"}}) {
+         {std::vector<std::string>{"-x"}, {"-S"}, {"operand", "-S", "a"}, {"-c1", "--", "-c"}}) {
         auto zrd = spawn(ZRD_PROGRAM, arguments);
         EXPECT_EQ(zrd->wait(), 2);
         EXPECT_EQ(zrd->err(), "Usage: zrd [-S servicename] [-v]\n");

@@ -9,8 +9,6 @@
 
 namespace test {
 
-using zorvan::ZRDiscoverAll;
-
 SystemTest::SystemTest() {
     const std::pair<const char*, std::string> environment[] = {
         {"XDG_RUNTIME_DIR", home_.makeDirectory("run")},

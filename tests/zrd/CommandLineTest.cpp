@@ -41,16 +41,6 @@ TEST(CommandLineTest, CacheLimitsAreWhateverNumberTheTextStartsWith) {
     for (const auto& [text, limit] : cases) EXPECT_EQ(parse({"-c", text})->cacheLimit, limit);
 }
 
-TEST(CommandLineTest, EverythingElseGetsTheUsageText) {
-    for (const auto& arguments : std::vector<std::vector<std::string>>{
-             {"-x"}, {"-S"}, {"operand"}, {"-v", "--", "-v"}, {"--help"}, {"operand", "-S", "a"}}) {
-        testing::internal::CaptureStderr();
-        EXPECT_FALSE(parse(arguments));
-        EXPECT_THAT(testing::internal::GetCapturedStderr(),
-                    testing::EndsWith("Usage: zrd [-S servicename] [-v]\n"));
-    }
-}
-
 }  // namespace
 
 }  // namespace zorvan
