@@ -3,8 +3,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <cerrno>
 #include <fcntl.h>
+#include <cerrno>
 #include <mutex>
 #include <string_view>
 
@@ -131,6 +131,8 @@ class FileCodeSigning : public CodeSigning {
 
 }  // namespace
 
-std::unique_ptr<CodeSigning> makeFileCodeSigning() { return std::make_unique<FileCodeSigning>(); }
+std::unique_ptr<CodeSigning> makeFileCodeSigning() {
+    return std::make_unique<FileCodeSigning>();
+}
 
 }  // namespace platform

@@ -37,8 +37,8 @@ class Workspace {
 
     virtual ~Workspace() = default;
 
-    /// An observation, which ends when the handle is destroyed (not from inside a callback):
-    /// afterwards no callback runs any more.
+    /// An observation, which ends when the handle is destroyed (not from inside a callback, and
+    /// before the workspace is): afterwards no callback runs any more.
     class Observation {
       public:
         virtual ~Observation() = default;

@@ -9,25 +9,28 @@ namespace zrctl {
 
 namespace {
 
-constexpr const char* kMatchHelp =
-    R"(Lists the plug-ins that fit all rules, one plug-in per identifier: its newest version.
-
-A rule is KEY=PATTERN. KEY is an attribute of the plug-in, a key of its Info.plist,
-VXExtensionPointIdentifier, VXExtensionIdentifier, VXUserElection, VXExtensionContainingApp,
-com.orbel.uuid or ENTITLEMENT:<name>. PATTERN is a text, or an operator and a text:
+constexpr const char* kMatchFooter =
+    R"(A rule is KEY=PATTERN; a plug-in must fit all of them. KEY is an attribute of the plug-in, a key
+of its Info.plist, or one of VXExtensionPointIdentifier, VXExtensionIdentifier, VXUserElection,
+VXExtensionContainingApp, com.orbel.uuid and ENTITLEMENT:<name>. PATTERN is a text, or an operator
+and a text:
   KEY=1.2  KEY==1.2  KEY=<>1.2  KEY=<1.2  KEY=<=1.2  KEY=>1.2  KEY=>=1.2
-  KEY=?UT-CONFORMS:text/plain   the value is that type or one that descends from it
-  KEY=?UT-IS:text/html          the value is that type or one of its ancestors
-  KEY=true  KEY=false           present and not false; absent or false
-The same KEY given again adds an alternative. Quote rules with < and > for the shell.)";
+  KEY=?UT-CONFORMS:text/plain    the value is that type or one that descends from it
+  KEY=?UT-IS:text/html           the value is that type or one of its ancestors
+  KEY=true  KEY=false            present and not false; absent or false
+The same KEY given again adds an alternative. Quote rules with "<", ">" and "?" for the shell.
+
+Exit status: 0 plug-ins found; 1 none found; 2 wrong usage; 3 failure.)";
 
 constexpr const char* kFooter =
-    R"(Exit status: 0 done, or plug-ins found; 1 none found; 2 wrong usage; 3 failure.)";
+    "Exit status: 0 done, or plug-ins found; 1 none found; 2 wrong usage; 3 failure.";
 
 void addMatch(CLI::App& app, Options& options) {
-    CLI::App* match = app.add_subcommand("match", "List the plug-ins that fit rules");
-    match->description(kMatchHelp);
-    match->add_option("rule", options.rules, "Rules")->type_name("KEY=PATTERN");
+    CLI::App* match = app.add_subcommand(
+        "match", "List the plug-ins that fit rules, of each identifier the newest version");
+    match->footer(kMatchFooter);
+    match->add_option("rule", options.rules, "What the plug-ins must be like")
+        ->type_name("KEY=PATTERN");
     match
         ->add_option("--rules", options.rulesFile,
                      "Property list with a dictionary of rules; rules of the command line replace "
@@ -39,22 +42,22 @@ void addMatch(CLI::App& app, Options& options) {
             name, [&options, bit] { options.flags |= bit; }, help);
     };
     flag("--all", zorvan::ZRDiscoverAll,
-         "Also what this caller may not use: dedicated plug-ins, those outside applications, those "
-         "that demand an entitlement");
+         "Also plug-ins that this caller could not use (for managers)");
     flag("--versions", zorvan::ZRDiscoverVersions, "Every version of each identifier");
     flag("--duplicates", zorvan::ZRDiscoverDuplicates,
          "With --versions: plug-ins of equal versions too");
     flag("--system-only", zorvan::ZRDiscoverSystemOnly, "Only plug-ins of the system volume");
 
-    CLI::Option_group* formats = match->add_option_group("Output");
+    std::vector<CLI::Option*> formats;
     const auto format = [&](const char* name, Format value, const char* help) {
-        formats->add_flag_callback(
+        CLI::Option* option = match->add_flag_callback(
             name, [&options, value] { options.format = value; }, help);
+        for (CLI::Option* other : formats) option->excludes(other);
+        formats.push_back(option);
     };
-    format("--long", Format::Long, "All that is known of each plug-in, for people");
-    format("--json", Format::Json, "The plug-ins' forms as a JSON array");
-    format("--plist", Format::PropertyList, "The plug-ins' forms as an XML property list");
-    formats->require_option(0, 1);
+    format("--long", Format::Long, "Write all that people want to know of each plug-in");
+    format("--json", Format::Json, "Write the plug-ins' forms as a JSON array");
+    format("--plist", Format::PropertyList, "Write the plug-ins' forms as an XML property list");
 
     match->callback([&options] { options.command = Options::Command::Match; });
 }

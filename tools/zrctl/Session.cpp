@@ -1,11 +1,6 @@
 #include "tools/zrctl/Session.h"
 
-#include <fmt/core.h>
-
 #include <future>
-
-#include "platform/Directories.h"
-#include "platform/lum/Listener.h"
 
 using platform::ConnectionError;
 using platform::Error;
@@ -13,9 +8,20 @@ using zorvan::ZRDaemonClient;
 
 namespace zrctl {
 
-Session::Session(std::string service)
-    : service_(std::move(service)),
-      client_(ZRDaemonClient::initWithServiceName(service_.c_str())) {}
+namespace {
+
+Error whyNoAnswer(const ConnectionError& error) {
+    if (error.kind == ConnectionError::Kind::Interrupted)
+        return {"zrctl", 0, "zrd ended the connection: " + error.text};
+    // The text names the socket, or says what is wrong with the service's name or the request.
+    const bool noService = error.text.starts_with("no service at ");
+    return {"zrctl", 0, noService ? "zrd is not running: " + error.text : error.text};
+}
+
+}  // namespace
+
+Session::Session(const std::string& service)
+    : client_(ZRDaemonClient::initWithServiceName(service.c_str())) {}
 
 platform::Result<platform::Message> Session::ask(const Question& question) {
     // Shared with the callback: the reply queue may still be leaving it when this returns.
@@ -28,14 +34,6 @@ platform::Result<platform::Message> Session::ask(const Question& question) {
     if (const auto refused = ZRDaemonClient::errorInReply(reply))
         return Error{refused->domain, refused->code, describe(*refused)};
     return std::get<platform::Message>(reply);
-}
-
-Error Session::whyNoAnswer(const ConnectionError& error) const {
-    const auto path = platform::lum::socketPath(platform::Directories::fromEnvironment(), service_);
-    if (!path) return path.error();
-    if (error.kind == ConnectionError::Kind::Invalid)
-        return {"zrctl", 0, fmt::format("zrd is not running: no service at {}", *path)};
-    return {"zrctl", 0, fmt::format("zrd ended the connection at {}: {}", *path, error.text)};
 }
 
 }  // namespace zrctl

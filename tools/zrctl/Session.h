@@ -15,7 +15,7 @@ namespace zrctl {
 class Session {
   public:
     /// Connects to a named service of this user.
-    explicit Session(std::string service);
+    explicit Session(const std::string& service);
 
     using Question =
         std::function<void(zorvan::ZRDaemonClient&, const zorvan::ZRDaemonClient::ReplyCallback&)>;
@@ -29,9 +29,6 @@ class Session {
     }
 
   private:
-    platform::Error whyNoAnswer(const platform::ConnectionError& error) const;
-
-    std::string service_;
     std::shared_ptr<zorvan::ZRDaemonClient> client_;
 };
 

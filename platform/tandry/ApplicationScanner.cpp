@@ -1,0 +1,254 @@
+#include "platform/tandry/ApplicationScanner.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <chrono>
+
+#include "platform/Files.h"
+#include "platform/Log.h"
+#include "platform/tandry/FolderEntries.h"
+
+namespace platform::tandry {
+
+namespace {
+
+constexpr std::string_view kApplicationSuffix = ".app";
+constexpr std::string_view kPlugIns = "PlugIns";
+
+const Log& ops() {
+    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
+    return handle;
+}
+
+Date now() {
+    using Seconds = std::chrono::duration<double>;
+    return {Seconds(std::chrono::system_clock::now().time_since_epoch()).count()};
+}
+
+std::optional<FolderEntries> entriesOf(const std::string& path) {
+    Result<FolderEntries> entries = FolderEntries::read(path);
+    if (entries) return std::move(*entries);
+    if (entries.error().code != ENOENT)
+        EVLOG_ERROR(ops(), "cannot look for plug-ins: {}", pub(entries.error().text));
+    return std::nullopt;
+}
+
+}  // namespace
+
+ApplicationScanner::ApplicationScanner(RegistryState& state, BundleReader& reader,
+                                       DataContainers& containers,
+                                       std::vector<std::string> applicationFolders)
+    : state_(state),
+      reader_(reader),
+      containers_(containers),
+      folders_(std::move(applicationFolders)) {}
+
+bool ApplicationScanner::isApplication(std::string_view path) {
+    std::string_view name = lastPathComponent(path);
+    return name.size() > kApplicationSuffix.size() && name.ends_with(kApplicationSuffix);
+}
+
+std::string ApplicationScanner::applicationAbove(std::string_view path) {
+    for (path = parentPath(path); path.size() > 1; path = parentPath(path))
+        if (isApplication(path)) return std::string(path);
+    return {};
+}
+
+bool ApplicationScanner::isHeld(const std::string& path) const {
+    std::string_view application = path;
+    if (!isApplication(path)) {
+        std::string_view folder = parentPath(path);
+        if (lastPathComponent(folder) != kPlugIns) return false;
+        application = parentPath(folder);
+    }
+    return isApplication(application) && std::ranges::any_of(folders_, [&](const auto& folder) {
+               return canonicalPath(folder) == parentPath(application);
+           });
+}
+
+void ApplicationScanner::begin() {
+    ++pass_;
+    reader_.beginPass();
+}
+
+RegistryChanges ApplicationScanner::scanAll() {
+    begin();
+    visitAll();
+    return finish({});
+}
+
+RegistryChanges ApplicationScanner::scanPath(const std::string& path) {
+    begin();
+    bool isKnown = state_.applications.contains(applicationAbove(path));
+    visitPath(path);
+    // An application that changed is part of its other plug-ins' records too.
+    if (isKnown && !isApplication(path) && !changes_.applications.empty()) {
+        visitAll();
+        return finish({});
+    }
+    return finish(path);
+}
+
+void ApplicationScanner::visitAll() {
+    for (const std::string& folder : folders_)
+        if (std::optional<std::string> canonical = canonicalPath(folder)) visitFolder(*canonical);
+    for (const std::string& path : state_.registrations)
+        if (canonicalPath(path) == path)
+            visitPath(path);
+        else
+            EVLOG_INFO(ops(), "nothing at registered path {}", path);
+}
+
+void ApplicationScanner::visitFolder(const std::string& folder) {
+    std::optional<FolderEntries> found = entriesOf(folder);
+    if (!found) return;
+    for (const auto& [name, target] : found->entries) {
+        if (!isApplication(name)) continue;
+        std::string path = target.empty() ? joinPath(folder, name) : target;
+        if (isApplication(path))
+            visitApplication(path);
+        else
+            EVLOG_ERROR(ops(), "skipping {}: {} is not an application directory",
+                        pub(joinPath(folder, name)), pub(path));
+    }
+}
+
+void ApplicationScanner::visitPath(const std::string& path) {
+    if (isApplication(path))
+        visitApplication(path);
+    else
+        visitPlugIn(BundleFolder(path), applicationOf(path));
+}
+
+void ApplicationScanner::visitApplication(const std::string& path) {
+    TDApplicationProxyRef application = applicationAt(path);
+    // Two links may lead to one application.
+    if (std::exchange(state_.applications[path].plugInsPass, pass_) == pass_) return;
+    const std::string folder = joinPath(path, kPlugIns);
+    std::optional<FolderEntries> found = entriesOf(folder);
+    if (!found) return;
+    for (const auto& [name, target] : found->entries)
+        if (target.empty())
+            visitPlugIn(BundleFolder(found->directory(), folder, name), application);
+        else
+            visitPlugIn(BundleFolder(target), applicationOf(target));
+}
+
+TDApplicationProxyRef ApplicationScanner::applicationAt(const std::string& path) {
+    ApplicationEntry& entry = state_.applications[path];
+    if (std::exchange(entry.pass, pass_) == pass_) return entry.record;
+    BundleFolder folder(path);
+    if (!entry.record || reader_.applicationStamps(folder) != entry.stamps) {
+        entry = reader_.readApplication(folder);
+        entry.pass = pass_;
+        changes_.applications.insert(path);
+    }
+    return entry.record;
+}
+
+TDApplicationProxyRef ApplicationScanner::applicationOf(const std::string& plugInPath) {
+    std::string path = applicationAbove(plugInPath);
+    return path.empty() ? nullptr : applicationAt(path);
+}
+
+bool ApplicationScanner::isForgotten(const BundleFolder& folder) {
+    auto found = state_.forgotten.find(folder.path);
+    if (found == state_.forgotten.end()) return false;
+    if (reader_.isUnchanged(folder, found->second.print)) {
+        found->second.pass = pass_;
+        return true;
+    }
+    state_.forgotten.erase(found);
+    changes_.lists = true;
+    return false;
+}
+
+bool ApplicationScanner::isRefused(const BundleFolder& folder) {
+    auto found = state_.refusals.find(folder.path);
+    if (found == state_.refusals.end()) return false;
+    Refusal& refusal = found->second;
+    if (refusal.pass == pass_) return true;
+    if (!reader_.isUnchanged(folder, refusal.print)) {
+        state_.refusals.erase(found);
+        changes_.lists = true;
+        return false;
+    }
+    // Remembered from an earlier run: its author has to be told in this one as well.
+    if (std::exchange(refusal.pass, pass_) == 0)
+        EVLOG_ERROR(ops(), "leaving out a plug-in: {}", pub(refusal.reason));
+    if (changes_.refusal.empty()) changes_.refusal = refusal.reason;
+    return true;
+}
+
+void ApplicationScanner::visitPlugIn(const BundleFolder& folder,
+                                     const TDApplicationProxyRef& application) {
+    auto found = state_.plugIns.find(folder.path);
+    if (found != state_.plugIns.end()) {
+        PlugInEntry& entry = found->second;
+        if (entry.pass == pass_) return;
+        if (entry.record->containingApplication == application &&
+            reader_.isUnchanged(folder, entry.print)) {
+            if (entry.pass == 0 && entry.needsContainer)
+                entry.record->dataContainerPath =
+                    containers_.prepare(*entry.record->plugInIdentifier);
+            entry.pass = pass_;
+            return;
+        }
+    }
+    if (isForgotten(folder) || isRefused(folder)) return;
+    BundleReader::Reading reading = reader_.readPlugIn(folder);
+    if (reading.refusal)
+        refuse(folder, std::move(reading));
+    else
+        install(folder, std::move(reading.entry), application);
+}
+
+void ApplicationScanner::refuse(const BundleFolder& folder, BundleReader::Reading reading) {
+    EVLOG_ERROR(ops(), "leaving out a plug-in: {}", pub(*reading.refusal));
+    if (changes_.refusal.empty()) changes_.refusal = *reading.refusal;
+    if (!reading.lasting) return;
+    state_.refusals[folder.path] = {std::move(reading.entry.print), std::move(*reading.refusal),
+                                    pass_};
+    changes_.lists = true;
+}
+
+void ApplicationScanner::install(const BundleFolder& folder, PlugInEntry entry,
+                                 const TDApplicationProxyRef& application) {
+    TDPlugInProxy& record = *entry.record;
+    record.plugInUuid = Uuid::random();
+    record.registrationDate = now();
+    record.containingApplication = application;
+    if (entry.needsContainer)
+        record.dataContainerPath = containers_.prepare(*record.plugInIdentifier);
+    entry.pass = pass_;
+    changes_.installed.push_back(entry.record);
+    auto [place, isNew] = state_.plugIns.try_emplace(folder.path);
+    if (!isNew) changes_.uninstalled.push_back(place->second.record);
+    place->second = std::move(entry);
+}
+
+/// Drops what lies within `scope` and was not met by this walk.
+RegistryChanges ApplicationScanner::finish(const std::string& scope) {
+    forEachWithin(state_.plugIns, scope, [&](auto entry) {
+        if (entry->second.pass == pass_) return;
+        changes_.uninstalled.push_back(entry->second.record);
+        state_.plugIns.erase(entry);
+    });
+    forEachWithin(state_.applications, scope, [&](auto entry) {
+        if (entry->second.pass == pass_) return;
+        changes_.applications.insert(entry->first);
+        state_.applications.erase(entry);
+    });
+    auto dropUnmet = [&](auto& list) {
+        forEachWithin(list, scope, [&](auto entry) {
+            if (entry->second.pass == pass_) return;
+            list.erase(entry);
+            changes_.lists = true;
+        });
+    };
+    dropUnmet(state_.forgotten);
+    dropUnmet(state_.refusals);
+    return std::exchange(changes_, {});
+}
+
+}  // namespace platform::tandry

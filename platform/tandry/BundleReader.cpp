@@ -1,0 +1,317 @@
+#include "platform/tandry/BundleReader.h"
+
+#include <fcntl.h>
+#include <fmt/format.h>
+
+#include <cerrno>
+
+#include "platform/Cbor.h"
+#include "platform/Files.h"
+#include "platform/Log.h"
+#include "platform/PropertyList.h"
+#include "platform/tandry/FileStamps.h"
+#include "platform/tandry/LocalizedNames.h"
+
+namespace platform::tandry {
+
+namespace {
+
+/// Levels of containers that stand around a bundle's dictionary in a reply, generously.
+constexpr int kReplyLevels = 8;
+
+/// Most bytes that a record's encoded dictionaries may have.
+constexpr std::size_t kMaxRecordSize = 2 * kMaxBundleFile;
+
+constexpr const char* kInfoPlist = "Info.plist";
+constexpr const char* kEntitlements = "Entitlements.plist";
+constexpr const char* kLocalized = "Localized.plist";
+constexpr const char* kPlaceholder = ".placeholder";
+constexpr const char* kBundleIdentifier = "QFBundleIdentifier";
+constexpr const char* kExtension = "VXExtension";
+constexpr const char* kAttributes = "VXExtensionAttributes";
+constexpr const char* kPointIdentifier = "VXExtensionPointIdentifier";
+constexpr const char* kShortVersion = "QFBundleShortVersionString";
+
+const Log& ops() {
+    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
+    return handle;
+}
+
+/// Whether a reply can carry the value: hosts refuse a whole reply for one value that is no
+/// property list.
+bool fitsReplies(Value value) {
+    for (int level = 0; level < kReplyLevels; ++level) value = Array{std::move(value)};
+    return isPropertyList(value);
+}
+
+Error malformed(const std::string& file, std::string_view reason) {
+    return {"PropertyList", 0, fmt::format("{}: {}", file, reason)};
+}
+
+/// The dictionary in a bundle's file. Error ENOENT when there is none.
+Result<Dictionary> readDictionary(const BundleFolder& folder, const char* name) {
+    std::string file = joinPath(folder.path, name);
+    Result<std::string> bytes =
+        readFileAt(folder.dirfd, joinPath(folder.name, name), kMaxBundleFile);
+    if (!bytes) {
+        if (bytes.error().domain != "POSIX") return bytes.error();
+        return Error::posix(bytes.error().code, file);
+    }
+    Result<Value> value = parsePropertyList(*bytes);
+    if (!value) return malformed(file, value.error().text);
+    const Dictionary* dictionary = value->dictionary();
+    if (!dictionary) return malformed(file, "not a dictionary");
+    if (!fitsReplies(*value)) return malformed(file, "nested too deeply, or control characters");
+    return *dictionary;
+}
+
+bool isMissing(const Error& error) {
+    return error.domain == "POSIX" && (error.code == ENOENT || error.code == ENOTDIR);
+}
+
+const Dictionary* dictionaryAt(const Dictionary& dictionary, std::string_view key) {
+    const Value* value = dictionary.find(key);
+    return value ? value->dictionary() : nullptr;
+}
+
+const std::string* stringAt(const Dictionary& dictionary, std::string_view key) {
+    const Value* value = dictionary.find(key);
+    return value ? value->string() : nullptr;
+}
+
+/// The first string under one of the keys: of the plug-in dictionary, then of the top level.
+const std::string* identifierAt(const Dictionary& plugIn, const Dictionary& info,
+                                std::string_view key) {
+    const std::string* text = stringAt(plugIn, key);
+    return text ? text : stringAt(info, key);
+}
+
+/// Names from files become parts of paths.
+std::optional<Error> unsafeName(const std::string& file, std::string_view key,
+                                const std::string* name) {
+    if (!name || isSafeName(*name)) return std::nullopt;
+    return malformed(file, fmt::format("{} \"{}\" cannot be a file name", key, *name));
+}
+
+void appendPoint(const Value& value, std::string& points) {
+    if (const std::string* text = value.string()) points.append(*text).push_back('\0');
+}
+
+/// The texts that the matcher would compare with a rule on the extension point.
+std::string pointsOf(const Dictionary& info, const Dictionary* attributes) {
+    const Value* value = attributes ? attributes->find(kPointIdentifier) : nullptr;
+    if (!value) value = info.find(kPointIdentifier);
+    std::string points;
+    if (!value) return points;
+    appendPoint(*value, points);
+    if (const Array* array = value->array())
+        for (const Value& element : *array) appendPoint(element, points);
+    return points;
+}
+
+}  // namespace
+
+void PlugInEntry::attachDictionaries() {
+    std::string_view all = *dictionaries;
+    record->infoPlist = LazyDictionary(EncodedBytes{dictionaries, all.substr(0, infoPlistSize)});
+    record->entitlements = LazyDictionary(EncodedBytes{dictionaries, all.substr(infoPlistSize)});
+}
+
+BundleFolder::BundleFolder(std::string canonical)
+    : dirfd(AT_FDCWD), name(canonical), path(std::move(canonical)) {}
+
+BundleFolder::BundleFolder(int directory, const std::string& parent, std::string entry)
+    : dirfd(directory), name(std::move(entry)), path(joinPath(parent, name)) {}
+
+BundleReader::BundleReader(SdkDictionaries& sdks, SdkMerge merge,
+                           std::vector<std::string> languages)
+    : sdks_(sdks), merge_(std::move(merge)), languages_(std::move(languages)) {}
+
+void BundleReader::beginPass() {
+    sdkStamps_.clear();
+}
+
+bool BundleReader::appendStamp(const BundleFolder& folder, std::string_view file,
+                               std::string& stamps) {
+    scratch_.assign(folder.name).append("/").append(file);
+    return appendFileStamp(folder.dirfd, scratch_.c_str(), stamps);
+}
+
+/// Names from the file depend on the user's languages as well.
+void BundleReader::appendLocalizedStamp(const BundleFolder& folder, std::string& stamps) {
+    if (!appendStamp(folder, kLocalized, stamps)) return;
+    for (const std::string& language : languages_) stamps.append(language).push_back('\0');
+}
+
+void BundleReader::appendFixedStamps(const BundleFolder& folder, std::string& stamps) {
+    appendStamp(folder, kInfoPlist, stamps);
+    appendStamp(folder, kEntitlements, stamps);
+    appendLocalizedStamp(folder, stamps);
+}
+
+const std::string& BundleReader::sdkStamps(const std::string& sdk) {
+    auto [entry, isNew] = sdkStamps_.try_emplace(sdk);
+    if (isNew)
+        for (const std::string& file : sdks_.candidateFiles(sdk))
+            appendFileStamp(AT_FDCWD, file.c_str(), entry->second);
+    return entry->second;
+}
+
+void BundleReader::appendNamedStamps(const BundleFolder& folder, const Fingerprint& print,
+                                     std::string& stamps) {
+    if (!print.executable.empty()) appendStamp(folder, print.executable, stamps);
+    if (!print.sdk.empty()) stamps += sdkStamps(print.sdk);
+}
+
+bool BundleReader::isUnchanged(const BundleFolder& folder, const Fingerprint& print) {
+    return refreshed(folder, {print.executable, print.sdk, {}}).stamps == print.stamps;
+}
+
+Fingerprint BundleReader::refreshed(const BundleFolder& folder, Fingerprint print) {
+    print.stamps.clear();
+    appendFixedStamps(folder, print.stamps);
+    appendNamedStamps(folder, print, print.stamps);
+    return print;
+}
+
+BundleReader::Reading BundleReader::readPlugIn(const BundleFolder& folder) {
+    Reading reading;
+    reading.entry.record = std::make_shared<TDPlugInProxy>();
+    // Stamps are older than what is read, so a change in between is seen by the next walk.
+    appendFixedStamps(folder, reading.entry.print.stamps);
+    if (std::optional<Error> error = fill(folder, reading.entry)) {
+        reading.refusal = error->text;
+        reading.lasting = error->domain != "POSIX";
+    }
+    return reading;
+}
+
+void BundleReader::complete(Dictionary& info, const std::string& sdk) {
+    if (!sdk.empty())
+        if (std::optional<Dictionary> defaults = sdks_.copyExtensionSdkEntry(sdk))
+            info = merge_(*defaults, info);
+    const Dictionary* foundPlugIn = dictionaryAt(info, kExtension);
+    const Dictionary* foundAttributes =
+        foundPlugIn ? dictionaryAt(*foundPlugIn, kAttributes) : nullptr;
+    if (!foundAttributes) return;
+
+    Dictionary plugIn = *foundPlugIn;
+    Dictionary attributes = *foundAttributes;
+    if (!attributes.contains("VXExtensionVersion")) {
+        const Value* version = info.find(kShortVersion);
+        attributes.set("VXExtensionVersion", version ? *version : Value("1"));
+    }
+    const Value* point = plugIn.find(kPointIdentifier);
+    if (point && !attributes.contains(kPointIdentifier)) attributes.set(kPointIdentifier, *point);
+    plugIn.set(kAttributes, std::move(attributes));
+    info.set(kExtension, std::move(plugIn));
+}
+
+Dictionary BundleReader::localizations(const BundleFolder& folder) {
+    if (languages_.empty()) return {};
+    Result<Dictionary> dictionary = readDictionary(folder, kLocalized);
+    if (dictionary) return *dictionary;
+    if (!isMissing(dictionary.error()))
+        EVLOG_ERROR(ops(), "ignoring names of a bundle: {}", pub(dictionary.error().text));
+    return {};
+}
+
+std::optional<Error> BundleReader::fill(const BundleFolder& folder, PlugInEntry& entry) {
+    const std::string file = joinPath(folder.path, kInfoPlist);
+    Result<Dictionary> read = readDictionary(folder, kInfoPlist);
+    if (!read) return read.error();
+    Dictionary info = *read;
+    const Dictionary* extension = dictionaryAt(info, kExtension);
+    if (!extension) return malformed(file, "no \"VXExtension\" dictionary, so not a plug-in");
+
+    const std::string* executable = stringAt(info, "QFBundleExecutable");
+    if (auto error = unsafeName(file, "QFBundleExecutable", executable)) return error;
+    if (executable) entry.print.executable = *executable;
+    const std::string* sdk = stringAt(*extension, kPointIdentifier);
+    if (sdk && isSafeName(*sdk)) entry.print.sdk = *sdk;
+    appendNamedStamps(folder, entry.print, entry.print.stamps);
+
+    complete(info, entry.print.sdk);
+    if (!fitsReplies(info)) return malformed(file, "nested too deeply with its SDK dictionary");
+    auto dictionaries = std::make_shared<std::string>();
+    encodeCbor(info, *dictionaries);
+    entry.infoPlistSize = dictionaries->size();
+    Result<Dictionary> entitlements = readDictionary(folder, kEntitlements);
+    if (!entitlements && !isMissing(entitlements.error())) return entitlements.error();
+    encodeCbor(entitlements ? *entitlements : Dictionary(), *dictionaries);
+    // A small binary list may have expanded to something large.
+    if (dictionaries->size() > kMaxRecordSize) return malformed(file, "too large when expanded");
+    entry.dictionaries = std::move(dictionaries);
+    entry.attachDictionaries();
+    return describePlugIn(folder, info, entry);
+}
+
+std::optional<Error> BundleReader::describePlugIn(const BundleFolder& folder,
+                                                  const Dictionary& info, PlugInEntry& entry) {
+    const std::string file = joinPath(folder.path, kInfoPlist);
+    const Dictionary* extension = dictionaryAt(info, kExtension);
+    if (!extension) return malformed(file, "the merge lost the \"VXExtension\" dictionary");
+    const Dictionary& plugIn = *extension;
+    const std::string* bundle = stringAt(info, kBundleIdentifier);
+    const std::string* identifier = identifierAt(plugIn, info, "VXExtensionIdentifier");
+    if (!identifier) identifier = bundle;
+    const std::string* original = identifierAt(plugIn, info, "VXOriginalIdentifier");
+    if (!original) original = identifier;
+    if (auto error = unsafeName(file, kBundleIdentifier, bundle)) return error;
+    if (auto error = unsafeName(file, "VXExtensionIdentifier", identifier)) return error;
+
+    TDPlugInProxy& record = *entry.record;
+    record.bundlePath = folder.path;
+    if (bundle) record.bundleIdentifier = *bundle;
+    if (identifier) record.plugInIdentifier = *identifier;
+    if (original) record.originalIdentifier = *original;
+    const std::string* version = stringAt(info, "QFBundleVersion");
+    if (!version) version = stringAt(info, kShortVersion);
+    if (version) record.bundleVersion = *version;
+    record.onSystemPartition = isOnSystemPartition(folder.path);
+    LocalizedNames names = localizedNames(info, localizations(folder), languages_);
+    record.localizedName = std::move(names.display);
+    record.localizedShortName = std::move(names.brief);
+
+    entry.points = pointsOf(info, dictionaryAt(plugIn, kAttributes));
+    const Value* protocol = plugIn.find("VXExtensionProtocol");
+    bool isData = protocol && *protocol == Value("#Data");
+    entry.needsContainer = identifier && !isData;
+    return std::nullopt;
+}
+
+std::string BundleReader::applicationStamps(const BundleFolder& folder) {
+    std::string stamps;
+    appendStamp(folder, kInfoPlist, stamps);
+    appendLocalizedStamp(folder, stamps);
+    appendStamp(folder, kPlaceholder, stamps);
+    return stamps;
+}
+
+ApplicationEntry BundleReader::readApplication(const BundleFolder& folder) {
+    ApplicationEntry entry;
+    entry.stamps = applicationStamps(folder);
+    auto record = std::make_shared<TDApplicationProxy>();
+    record->bundlePath = folder.path;
+    std::string ignored;
+    scratch_ = joinPath(folder.name, kPlaceholder);
+    record->isPlaceholder = appendFileStamp(folder.dirfd, scratch_.c_str(), ignored);
+
+    const std::string file = joinPath(folder.path, kInfoPlist);
+    Result<Dictionary> info = readDictionary(folder, kInfoPlist);
+    if (info) {
+        const std::string* identifier = stringAt(*info, kBundleIdentifier);
+        if (auto error = unsafeName(file, kBundleIdentifier, identifier))
+            EVLOG_ERROR(ops(), "application without identifier: {}", pub(error->text));
+        else if (identifier)
+            record->bundleIdentifier = *identifier;
+        record->localizedName =
+            localizedNames(*info, localizations(folder), languages_).display.value_or("");
+    } else if (!record->isPlaceholder) {
+        EVLOG_ERROR(ops(), "application without name and identifier: {}", pub(info.error().text));
+    }
+    entry.record = std::move(record);
+    return entry;
+}
+
+}  // namespace platform::tandry

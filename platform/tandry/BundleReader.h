@@ -1,0 +1,81 @@
+#pragma once
+
+#include <map>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/SdkDictionaries.h"
+#include "platform/tandry/DiskWorkspace.h"
+#include "platform/tandry/RegistryState.h"
+
+namespace platform::tandry {
+
+/// Largest property list that is read from a bundle. Real ones have a few KiB; each of them travels
+/// in replies.
+inline constexpr std::size_t kMaxBundleFile = 1u << 20;
+
+/// Where a bundle lies: its canonical path, and how its files are reached with few look-ups.
+struct BundleFolder {
+    explicit BundleFolder(std::string canonical);
+    /// The folder `entry` of the open directory `directory` (borrowed) at `parent`.
+    BundleFolder(int directory, const std::string& parent, std::string entry);
+
+    int dirfd;
+    std::string name;  // relative to `dirfd`
+    std::string path;
+};
+
+/// Reads the bundles' files. Belongs to the registry's thread.
+class BundleReader {
+  public:
+    /// What reading a plug-in bundle gave.
+    struct Reading {
+        /// When not refused, complete but for UUID, registration date, application and container.
+        PlugInEntry entry;
+        /// Why the bundle is refused, naming the file; none when it is good.
+        std::optional<std::string> refusal;
+        /// Whether reading again would give the same as long as the fingerprint is the same.
+        bool lasting = true;
+    };
+
+    BundleReader(SdkDictionaries& sdks, SdkMerge merge, std::vector<std::string> languages);
+
+    /// To be called before each walk: the stamps of SDK dictionaries are taken once a walk.
+    void beginPass();
+
+    /// Whether the bundle's files still have the stamps of `print`.
+    bool isUnchanged(const BundleFolder& folder, const Fingerprint& print);
+    /// `print` with the stamps that the bundle's files have now.
+    Fingerprint refreshed(const BundleFolder& folder, Fingerprint print);
+
+    /// Reads a plug-in bundle: an Info.plist with a "VXExtension" dictionary.
+    Reading readPlugIn(const BundleFolder& folder);
+
+    /// The stamps of the files that go into an application's record.
+    std::string applicationStamps(const BundleFolder& folder);
+    /// Reads an application. One without a readable Info.plist, which is logged, has no identifier
+    /// and no name.
+    ApplicationEntry readApplication(const BundleFolder& folder);
+
+  private:
+    bool appendStamp(const BundleFolder& folder, std::string_view file, std::string& stamps);
+    void appendLocalizedStamp(const BundleFolder& folder, std::string& stamps);
+    void appendFixedStamps(const BundleFolder& folder, std::string& stamps);
+    void appendNamedStamps(const BundleFolder& folder, const Fingerprint& print,
+                           std::string& stamps);
+    const std::string& sdkStamps(const std::string& sdk);
+    std::optional<Error> fill(const BundleFolder& folder, PlugInEntry& entry);
+    std::optional<Error> describePlugIn(const BundleFolder& folder, const Dictionary& info,
+                                        PlugInEntry& entry);
+    void complete(Dictionary& info, const std::string& sdk);
+    Dictionary localizations(const BundleFolder& folder);
+
+    SdkDictionaries& sdks_;
+    SdkMerge merge_;
+    std::vector<std::string> languages_;
+    std::map<std::string, std::string> sdkStamps_;
+    std::string scratch_;
+};
+
+}  // namespace platform::tandry

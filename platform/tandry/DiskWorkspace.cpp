@@ -1,0 +1,290 @@
+#include "platform/tandry/DiskWorkspace.h"
+
+#include <fmt/format.h>
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <atomic>
+#include <cerrno>
+#include <future>
+
+#include "platform/Directories.h"
+#include "platform/Files.h"
+#include "platform/Log.h"
+#include "platform/ProgrammingError.h"
+#include "platform/SdkDictionaries.h"
+#include "platform/SerialQueue.h"
+#include "platform/tandry/ApplicationScanner.h"
+#include "platform/tandry/Catalogue.h"
+#include "platform/tandry/CurrentSnapshot.h"
+#include "platform/tandry/FolderEntries.h"
+#include "platform/tandry/LocalizedNames.h"
+
+namespace platform::tandry {
+
+namespace {
+
+const Log& ops() {
+    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
+    return handle;
+}
+
+std::vector<std::string> applicationFolders(const Directories& directories) {
+    std::vector<std::string> folders{directories.zorvanData() + "/Applications"};
+    for (const std::string& folder : directories.dataDirs)
+        folders.push_back(folder + "/zorvan/Applications");
+    return folders;
+}
+
+/// The registry's thread owns the state, everything that reads and writes it, and the observers.
+/// Lookups run on their callers' threads, on the current snapshot alone.
+class DiskWorkspace final : public Workspace {
+  public:
+    DiskWorkspace(const Directories& directories, SdkDictionaries& sdks, SdkMerge merge,
+                  std::unique_ptr<Catalogue> catalogue);
+    ~DiskWorkspace() override;
+
+    std::unique_ptr<Observation> addObserver(WorkspaceObserver& observer) override;
+    void activate() override;
+
+    TDPlugInProxyRef plugInWithUuid(const Uuid& uuid) override;
+    TDPlugInProxyRef plugInAtPath(const std::string& bundlePath) override;
+    TDApplicationProxyRef applicationAtPath(const std::string& bundlePath) override;
+    TDPlugInProxyList plugInsOfApplication(const std::string& bundlePath) override;
+    TDPlugInProxyList installedPlugIns() override;
+    std::optional<TDPlugInProxyList> plugInsMatching(const Dictionary& query,
+                                                     const Filter& filter) override;
+
+    std::optional<Error> registerPlugIn(const std::string& bundlePath) override;
+    std::optional<Error> unregisterPlugIn(const std::string& bundlePath) override;
+    void clearSchemaCaches() override { sdks_.clear(); }
+
+  private:
+    class DiskObservation;
+
+    template <class Work>
+    auto onQueue(Work work) -> decltype(work());
+    std::optional<Error> afterFirstScan(const std::function<std::optional<Error>()>& work);
+
+    void firstScan();
+    std::optional<Error> registerOnQueue(const std::string& bundlePath);
+    std::optional<Error> unregisterOnQueue(const std::string& bundlePath);
+    bool dropRegistrations(const std::string& path);
+    bool forgetWithin(const std::string& path, RegistryChanges& changes);
+    void apply(const RegistryChanges& changes);
+
+    SdkDictionaries& sdks_;
+    CurrentSnapshot current_;
+    std::atomic<bool> closing_ = false;
+
+    // Of the registry's thread:
+    std::unique_ptr<Catalogue> catalogue_;
+    BundleReader reader_;
+    DataContainers containers_;
+    RegistryState state_;
+    ApplicationScanner scanner_;
+    std::vector<WorkspaceObserver*> observers_;
+
+    SerialQueue queue_;  // the last member: nothing runs on it once the others go
+};
+
+class DiskWorkspace::DiskObservation final : public Workspace::Observation {
+  public:
+    DiskObservation(DiskWorkspace& workspace, WorkspaceObserver& observer)
+        : workspace_(workspace), observer_(&observer) {}
+    /// Waits behind a callback that is running.
+    ~DiskObservation() override {
+        workspace_.onQueue([this] { return std::erase(workspace_.observers_, observer_); });
+    }
+
+  private:
+    DiskWorkspace& workspace_;
+    WorkspaceObserver* observer_;
+};
+
+DiskWorkspace::DiskWorkspace(const Directories& directories, SdkDictionaries& sdks, SdkMerge merge,
+                             std::unique_ptr<Catalogue> catalogue)
+    : sdks_(sdks),
+      catalogue_(std::move(catalogue)),
+      reader_(sdks, std::move(merge), userLanguages()),
+      containers_(joinPath(directories.zorvanData(), "Containers")),
+      scanner_(state_, reader_, containers_, applicationFolders(directories)),
+      queue_("tandry") {}
+
+DiskWorkspace::~DiskWorkspace() {
+    closing_ = true;
+    current_.close();
+}
+
+/// Runs work on the registry's thread and waits for its answer.
+template <class Work>
+auto DiskWorkspace::onQueue(Work work) -> decltype(work()) {
+    if (queue_.isCurrent()) programmingError("the registry was changed from its own callback");
+    std::promise<decltype(work())> promise;
+    auto answer = promise.get_future();
+    queue_.async([&] { promise.set_value(work()); });
+    return answer.get();
+}
+
+std::unique_ptr<Workspace::Observation> DiskWorkspace::addObserver(WorkspaceObserver& observer) {
+    queue_.async([this, &observer] { observers_.push_back(&observer); });
+    return std::make_unique<DiskObservation>(*this, observer);
+}
+
+void DiskWorkspace::activate() {
+    queue_.async([this] { firstScan(); });
+}
+
+void DiskWorkspace::firstScan() {
+    queue_.assertCurrent();
+    if (closing_) return;
+    // Filled in place: the scanner refers to the state.
+    state_ = catalogue_->load();
+    const RegistryChanges changes = scanner_.scanAll();
+    EVLOG_INFO(ops(), "{} plug-ins in {} applications, {} new, {} gone", state_.plugIns.size(),
+               state_.applications.size(), changes.installed.size(), changes.uninstalled.size());
+    if (!changes.records()) current_.publish(std::make_shared<const Snapshot>(state_));
+    apply(changes);
+}
+
+/// The record that goes is hidden before its observers hear of it, so that what they drop is not
+/// built again; the catalogue changes after them.
+void DiskWorkspace::apply(const RegistryChanges& changes) {
+    if (!changes.records() && !changes.lists) return;
+    if (changes.records()) current_.publish(std::make_shared<const Snapshot>(state_));
+    if (!changes.uninstalled.empty())
+        for (WorkspaceObserver* observer : observers_)
+            observer->pluginsWillUninstall(changes.uninstalled);
+    catalogue_->save(state_, changes);
+    if (!changes.installed.empty())
+        for (WorkspaceObserver* observer : observers_)
+            observer->pluginsDidInstall(changes.installed);
+}
+
+TDPlugInProxyRef DiskWorkspace::plugInWithUuid(const Uuid& uuid) {
+    auto snapshot = current_.get();
+    return snapshot ? snapshot->plugInWithUuid(uuid) : nullptr;
+}
+
+TDPlugInProxyRef DiskWorkspace::plugInAtPath(const std::string& bundlePath) {
+    auto snapshot = current_.get();
+    return snapshot ? snapshot->plugInAtPath(bundlePath) : nullptr;
+}
+
+TDApplicationProxyRef DiskWorkspace::applicationAtPath(const std::string& bundlePath) {
+    auto snapshot = current_.get();
+    return snapshot ? snapshot->applicationAtPath(bundlePath) : nullptr;
+}
+
+TDPlugInProxyList DiskWorkspace::plugInsOfApplication(const std::string& bundlePath) {
+    auto snapshot = current_.get();
+    return snapshot ? snapshot->plugInsOfApplication(bundlePath) : TDPlugInProxyList();
+}
+
+TDPlugInProxyList DiskWorkspace::installedPlugIns() {
+    auto snapshot = current_.get();
+    return snapshot ? snapshot->plugIns() : TDPlugInProxyList();
+}
+
+std::optional<TDPlugInProxyList> DiskWorkspace::plugInsMatching(const Dictionary& query,
+                                                                const Filter& filter) {
+    auto snapshot = current_.get();
+    if (!snapshot) return std::nullopt;
+    TDPlugInProxyList list = snapshot->candidates(query);
+    if (filter)
+        std::erase_if(list, [&filter](const TDPlugInProxyRef& plugIn) {
+            return !filter(plugIn->plugInIdentifier, plugIn->entitlements.get());
+        });
+    return list;
+}
+
+std::optional<Error> DiskWorkspace::afterFirstScan(
+    const std::function<std::optional<Error>()>& work) {
+    if (!current_.get()) return Error{"POSIX", ECANCELED, "the registry is being closed"};
+    return onQueue(work);
+}
+
+std::optional<Error> DiskWorkspace::registerPlugIn(const std::string& bundlePath) {
+    return afterFirstScan([&] { return registerOnQueue(bundlePath); });
+}
+
+std::optional<Error> DiskWorkspace::unregisterPlugIn(const std::string& bundlePath) {
+    return afterFirstScan([&] { return unregisterOnQueue(bundlePath); });
+}
+
+std::optional<Error> DiskWorkspace::registerOnQueue(const std::string& bundlePath) {
+    std::optional<std::string> canonical = canonicalPath(bundlePath);
+    struct stat status;
+    if (!canonical || ::stat(canonical->c_str(), &status) != 0)
+        return Error::posix(ENOENT, bundlePath);
+    if (!S_ISDIR(status.st_mode)) return Error::posix(ENOTDIR, bundlePath);
+    if (!isUsablePath(*canonical)) return Error::posix(EILSEQ, bundlePath);
+
+    const std::string& path = *canonical;
+    const bool isNew = !scanner_.isHeld(path) && state_.registrations.insert(path).second;
+    bool wasForgotten = false;
+    forEachWithin(state_.forgotten, path, [&](auto entry) {
+        state_.forgotten.erase(entry);
+        wasForgotten = true;
+    });
+    RegistryChanges changes = scanner_.scanPath(path);
+    bool hasPlugIns = false;
+    forEachWithin(state_.plugIns, path, [&](auto) { hasPlugIns = true; });
+    if (!hasPlugIns && isNew) state_.registrations.erase(path);
+    changes.lists = changes.lists || wasForgotten || (hasPlugIns && isNew);
+    apply(changes);
+    if (hasPlugIns) return std::nullopt;
+    if (!changes.refusal.empty()) return Error{"Registry", 0, changes.refusal};
+    return Error{"Registry", 0, fmt::format("{}: no plug-ins in this application", path)};
+}
+
+/// Takes the plug-ins within a path out of the state; walks leave them out as they are now.
+bool DiskWorkspace::forgetWithin(const std::string& path, RegistryChanges& changes) {
+    reader_.beginPass();
+    forEachWithin(state_.plugIns, path, [&](auto entry) {
+        changes.uninstalled.push_back(entry->second.record);
+        BundleFolder folder(entry->first);
+        state_.forgotten[entry->first] = {reader_.refreshed(folder, entry->second.print)};
+        state_.plugIns.erase(entry);
+    });
+    return !changes.uninstalled.empty();
+}
+
+/// Drops the registrations of a path and of the plug-ins inside; answers whether there were any.
+bool DiskWorkspace::dropRegistrations(const std::string& path) {
+    return std::erase_if(state_.registrations, [&path](const std::string& registered) {
+               return isWithin(registered, path);
+           }) != 0;
+}
+
+std::optional<Error> DiskWorkspace::unregisterOnQueue(const std::string& bundlePath) {
+    RegistryChanges changes;
+    changes.lists = true;
+    // Only what a path names goes, never what merely lies below some directory.
+    const bool isKnown = state_.plugIns.contains(bundlePath) ||
+                         state_.applications.contains(bundlePath) ||
+                         state_.registrations.contains(bundlePath);
+    const bool wasRegistered = isKnown && dropRegistrations(bundlePath);
+    const bool hadPlugIns = isKnown && forgetWithin(bundlePath, changes);
+    if (!wasRegistered && !hadPlugIns)
+        return Error{"Registry", 0, fmt::format("{}: nothing is registered there", bundlePath)};
+    if (!scanner_.isHeld(bundlePath))
+        forEachWithin(state_.applications, bundlePath, [&](auto entry) {
+            changes.applications.insert(entry->first);
+            state_.applications.erase(entry);
+        });
+    apply(changes);
+    return std::nullopt;
+}
+
+}  // namespace
+
+Result<std::unique_ptr<Workspace>> openDiskWorkspace(const Directories& directories,
+                                                     SdkDictionaries& sdks, SdkMerge merge) {
+    Result<std::unique_ptr<Catalogue>> catalogue = Catalogue::open(directories.zorvanData());
+    if (!catalogue) return catalogue.error();
+    return std::unique_ptr<Workspace>(std::make_unique<DiskWorkspace>(
+        directories, sdks, std::move(merge), std::move(*catalogue)));
+}
+
+}  // namespace platform::tandry

@@ -1,0 +1,78 @@
+#include "platform/tandry/FolderEntries.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <optional>
+
+#include "platform/Files.h"
+#include "platform/Log.h"
+#include "platform/Utf8.h"
+#include "platform/Value.h"
+
+namespace platform::tandry {
+
+namespace {
+
+const Log& ops() {
+    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
+    return handle;
+}
+
+bool isDirectory(const std::string& path) {
+    struct stat status;
+    return ::stat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
+}
+
+bool isLink(int directory, const dirent& entry) {
+    if (entry.d_type != DT_UNKNOWN) return entry.d_type == DT_LNK;
+    struct stat status;
+    return ::fstatat(directory, entry.d_name, &status, AT_SYMLINK_NOFOLLOW) == 0 &&
+           S_ISLNK(status.st_mode);
+}
+
+void add(FolderEntries& found, const std::string& folder, const dirent& entry) {
+    if (entry.d_name[0] == '.' ||
+        (entry.d_type != DT_DIR && entry.d_type != DT_LNK && entry.d_type != DT_UNKNOWN))
+        return;
+    std::string path = joinPath(folder, entry.d_name);
+    std::string target;
+    if (isLink(found.directory(), entry)) {
+        std::optional<std::string> canonical = canonicalPath(path);
+        if (!canonical) {
+            EVLOG_ERROR(ops(), "skipping {}: a link that cannot be resolved", pub(path));
+            return;
+        }
+        target = *canonical;
+    }
+    const std::string& real = target.empty() ? path : target;
+    if (entry.d_type != DT_DIR && !isDirectory(real)) return;
+    if (isUsablePath(real))
+        found.entries.push_back({entry.d_name, std::move(target)});
+    else
+        EVLOG_ERROR(ops(), "skipping {}: its path is not UTF-8 text", pub(real));
+}
+
+}  // namespace
+
+bool isUsablePath(const std::string& path) {
+    return isValidUtf8(path) && isPropertyList(Value(path));
+}
+
+Result<FolderEntries> FolderEntries::read(const std::string& path) {
+    FolderEntries found;
+    found.stream.reset(::opendir(path.c_str()));
+    if (!found.stream) return Error::posix(errno, path);
+    errno = 0;
+    while (const dirent* entry = ::readdir(found.stream.get())) {
+        add(found, path, *entry);
+        errno = 0;
+    }
+    if (errno != 0) return Error::posix(errno, path);
+    std::ranges::sort(found.entries, {}, &Entry::name);
+    return found;
+}
+
+}  // namespace platform::tandry

@@ -1,0 +1,37 @@
+#pragma once
+
+#include <dirent.h>
+
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "platform/Error.h"
+
+namespace platform::tandry {
+
+/// The subdirectories of a directory, in the order of their names. Hidden ones, and those whose
+/// path is no text that a message could carry (logged), are left out.
+struct FolderEntries {
+    struct Entry {
+        std::string name;
+        std::string target;  // where a symbolic link leads, canonical; empty for a real directory
+    };
+    struct Closer {
+        void operator()(DIR* stream) const { ::closedir(stream); }
+    };
+    std::unique_ptr<DIR, Closer> stream;
+    std::vector<Entry> entries;
+
+    /// The open directory, owned here.
+    int directory() const { return ::dirfd(stream.get()); }
+
+    /// Reads the directory at a canonical path. Links that lead nowhere, or to no directory, are
+    /// left out; the first kind is logged. Error: the system's.
+    static Result<FolderEntries> read(const std::string& path);
+};
+
+/// Whether a path can stand in messages: valid UTF-8 without control characters.
+bool isUsablePath(const std::string& path);
+
+}  // namespace platform::tandry

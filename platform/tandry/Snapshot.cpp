@@ -1,0 +1,158 @@
+#include "platform/tandry/Snapshot.h"
+
+#include <algorithm>
+#include <iterator>
+
+namespace platform::tandry {
+
+namespace {
+
+bool isDigit(char c) {
+    return c >= '0' && c <= '9';
+}
+
+/// The text that a pattern compares for equality; none when it compares in another way.
+std::optional<std::string_view> equalityOperand(std::string_view pattern) {
+    if (pattern.empty()) return pattern;
+    switch (pattern.front()) {
+        case '=':
+            return pattern.substr(1);
+        case '<':
+        case '>':
+        case '?':
+            return std::nullopt;
+        default:
+            return pattern;
+    }
+}
+
+/// The keys of the values that satisfy the pattern. None when it does not narrow.
+std::optional<std::vector<std::uint64_t>> patternKeys(const Value& pattern) {
+    std::vector<std::uint64_t> keys;
+    auto add = [&keys](const std::string& text) {
+        auto operand = equalityOperand(text);
+        if (operand) keys.push_back(comparisonKey(*operand));
+        return operand.has_value();
+    };
+    if (const std::string* text = pattern.string()) {
+        if (!add(*text)) return std::nullopt;
+        return keys;
+    }
+    const Array* alternatives = pattern.array();
+    if (!alternatives) return std::nullopt;
+    // An alternative that is no string matches nothing.
+    for (const Value& alternative : *alternatives)
+        if (alternative.string() && !add(*alternative.string())) return std::nullopt;
+    return keys;
+}
+
+std::string_view pathOf(const TDPlugInProxyRef& plugIn) {
+    return *plugIn->bundlePath;
+}
+
+std::string_view pathOf(const TDApplicationProxyRef& application) {
+    return application->bundlePath;
+}
+
+template <class List>
+auto findPath(const List& list, std::string_view path) {
+    auto place = std::ranges::lower_bound(list, path, {}, [](const auto& e) { return pathOf(e); });
+    return place != list.end() && pathOf(*place) == path ? *place : nullptr;
+}
+
+}  // namespace
+
+std::uint64_t comparisonKey(std::string_view text) {
+    std::uint64_t key = 14695981039346656037u;  // FNV-1a
+    for (std::size_t i = 0; i < text.size(); ++i) {
+        bool leadingZero = text[i] == '0' && (i == 0 || !isDigit(text[i - 1]));
+        if (leadingZero)
+            while (i + 1 < text.size() && text[i] == '0' && isDigit(text[i + 1])) ++i;
+        key = (key ^ static_cast<unsigned char>(text[i])) * 1099511628211u;
+    }
+    return key;
+}
+
+Snapshot::Snapshot(const RegistryState& state) {
+    plugIns_.reserve(state.plugIns.size());
+    uuids_.reserve(state.plugIns.size());
+    for (const auto& [path, entry] : state.plugIns) {
+        auto position = static_cast<Position>(plugIns_.size());
+        const TDPlugInProxyRef& record = plugIns_.emplace_back(entry.record);
+        uuids_.emplace_back(record->plugInUuid, position);
+        for (std::string_view rest = entry.points; !rest.empty();) {
+            std::string_view point = rest.substr(0, rest.find('\0'));
+            points_.emplace_back(comparisonKey(point), position);
+            rest.remove_prefix(point.size() + 1);
+        }
+        if (record->plugInIdentifier)
+            identifiers_.emplace_back(comparisonKey(*record->plugInIdentifier), position);
+        else
+            withoutIdentifier_.push_back(position);
+    }
+    std::ranges::sort(uuids_);
+    std::ranges::sort(points_);
+    std::ranges::sort(identifiers_);
+    applications_.reserve(state.applications.size());
+    for (const auto& [path, entry] : state.applications) applications_.push_back(entry.record);
+}
+
+TDPlugInProxyRef Snapshot::plugInWithUuid(const Uuid& uuid) const {
+    auto place = std::ranges::lower_bound(uuids_, uuid, {}, &std::pair<Uuid, Position>::first);
+    return place != uuids_.end() && place->first == uuid ? plugIns_[place->second] : nullptr;
+}
+
+TDPlugInProxyRef Snapshot::plugInAtPath(std::string_view path) const {
+    return findPath(plugIns_, path);
+}
+
+TDApplicationProxyRef Snapshot::applicationAtPath(std::string_view path) const {
+    return findPath(applications_, path);
+}
+
+TDPlugInProxyList Snapshot::plugInsOfApplication(const std::string& path) const {
+    TDPlugInProxyList list;
+    const std::string inside = path + "/";
+    auto place = std::ranges::lower_bound(plugIns_, std::string_view(inside), {},
+                                          [](const auto& plugIn) { return pathOf(plugIn); });
+    for (; place != plugIns_.end() && pathOf(*place).starts_with(inside); ++place) {
+        const TDApplicationProxyRef& application = (*place)->containingApplication;
+        if (application && application->bundlePath == path) list.push_back(*place);
+    }
+    return list;
+}
+
+/// The sorted positions under the keys of a pattern; none when there is nothing to narrow by.
+std::optional<Snapshot::Positions> Snapshot::find(const Index& index, const Value* pattern) {
+    std::optional<std::vector<std::uint64_t>> keys;
+    if (pattern) keys = patternKeys(*pattern);
+    if (!keys) return std::nullopt;
+    Positions found;
+    for (std::uint64_t key : *keys)
+        for (auto place = std::ranges::lower_bound(index, key, {}, &Index::value_type::first);
+             place != index.end() && place->first == key; ++place)
+            found.push_back(place->second);
+    std::ranges::sort(found);
+    auto repeated = std::ranges::unique(found);
+    found.erase(repeated.begin(), repeated.end());
+    return found;
+}
+
+TDPlugInProxyList Snapshot::candidates(const Dictionary& query) const {
+    std::optional<Positions> byPoint = find(points_, query.find("VXExtensionPointIdentifier"));
+    std::optional<Positions> byIdentifier = find(identifiers_, query.find("VXExtensionIdentifier"));
+    if (byIdentifier) {
+        // Without an identifier a rule on it is judged by the dictionaries.
+        Positions all;
+        std::ranges::merge(*byIdentifier, withoutIdentifier_, std::back_inserter(all));
+        byIdentifier = std::move(all);
+    }
+    if (!byPoint && !byIdentifier) return plugIns_;
+    const bool pointIsBetter = byPoint && (!byIdentifier || byPoint->size() < byIdentifier->size());
+    TDPlugInProxyList list;
+    for (Position position : pointIsBetter ? *byPoint : *byIdentifier)
+        list.push_back(plugIns_[position]);
+    return list;
+}
+
+}  // namespace platform::tandry

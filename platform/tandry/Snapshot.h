@@ -1,0 +1,51 @@
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+#include "platform/tandry/RegistryState.h"
+
+namespace platform::tandry {
+
+/// A number of a text such that texts which compare equal in rules (digit runs by their numeric
+/// value, everything else byte by byte) have the same number. Others hardly ever share one.
+std::uint64_t comparisonKey(std::string_view text);
+
+/// The installed plug-ins at one moment, with indexes. Immutable; usable from any thread.
+class Snapshot {
+  public:
+    explicit Snapshot(const RegistryState& state);
+
+    /// In the order of their paths.
+    const TDPlugInProxyList& plugIns() const { return plugIns_; }
+    TDPlugInProxyRef plugInWithUuid(const Uuid& uuid) const;
+    TDPlugInProxyRef plugInAtPath(std::string_view path) const;
+    TDApplicationProxyRef applicationAtPath(std::string_view path) const;
+    TDPlugInProxyList plugInsOfApplication(const std::string& path) const;
+
+    /// The plug-ins that `query` may match, in the order of their paths: see
+    /// `Workspace::plugInsMatching`.
+    TDPlugInProxyList candidates(const Dictionary& query) const;
+
+  private:
+    using Position = std::uint32_t;  // in plugIns_
+    /// From a key to the plug-ins that have it, sorted.
+    using Index = std::vector<std::pair<std::uint64_t, Position>>;
+    using Positions = std::vector<Position>;
+
+    static std::optional<Positions> find(const Index& index, const Value* pattern);
+
+    TDPlugInProxyList plugIns_;
+    std::vector<TDApplicationProxyRef> applications_;  // in the order of their paths
+    std::vector<std::pair<Uuid, Position>> uuids_;     // sorted
+    Index points_;
+    Index identifiers_;
+    Positions withoutIdentifier_;
+};
+
+}  // namespace platform::tandry

@@ -1,0 +1,38 @@
+#include "platform/tandry/TDPlugInProxy.h"
+
+#include <fmt/format.h>
+
+namespace platform {
+
+namespace {
+
+const Dictionary* dictionaryAt(const Dictionary& dictionary, std::string_view key) {
+    const Value* value = dictionary.find(key);
+    return value ? value->dictionary() : nullptr;
+}
+
+}  // namespace
+
+const Dictionary* TDPlugInProxy::plugInDictionary() const {
+    return dictionaryAt(infoPlist.get(), "VXExtension");
+}
+
+const Dictionary* TDPlugInProxy::attributes() const {
+    const Dictionary* plugIn = plugInDictionary();
+    return plugIn ? dictionaryAt(*plugIn, "VXExtensionAttributes") : nullptr;
+}
+
+const Value* TDPlugInProxy::lookup(std::string_view key, Scope scope) const {
+    const Dictionary* dictionary = scope == Scope::Attributes         ? attributes()
+                                   : scope == Scope::PlugInDictionary ? plugInDictionary()
+                                                                      : &infoPlist.get();
+    return dictionary ? dictionary->find(key) : nullptr;
+}
+
+std::string describe(const TDPlugInProxy& proxy) {
+    return fmt::format("{} {} at {}", proxy.plugInUuid.string(),
+                       proxy.plugInIdentifier.value_or("(no identifier)"),
+                       proxy.bundlePath.value_or("(no path)"));
+}
+
+}  // namespace platform

@@ -1,0 +1,196 @@
+#include <sqlite3.h>
+
+#include <cerrno>
+#include <filesystem>
+
+#include "tests/platform/tandry/RegistryFixture.h"
+
+namespace platform::tandry {
+namespace {
+
+namespace fs = std::filesystem;
+
+class CatalogueTest : public RegistryTest {
+  protected:
+    CatalogueTest() {
+        addApplication(apps + "A.app", {{"QFBundleIdentifier", "app"}});
+        writePlist("home/zorvan/SDKs/org.point.plist", {{"FromSdk", true}});
+        for (const char* name : {"a", "b", "c"}) add(name);
+    }
+    void add(const std::string& name, const Dictionary& more = {}) {
+        addPlugIn(folder + name, name,
+                  {{"VXExtensionAttributes", Dictionary{{"key", name}}},
+                   {"VXExtensionPointIdentifier", "org.point"}},
+                  more);
+    }
+    std::map<std::string, Uuid> uuids() {
+        std::map<std::string, Uuid> result;
+        for (const auto& plugIn : workspace->installedPlugIns())
+            result[plugIn->plugInIdentifier.value_or("?")] = plugIn->plugInUuid;
+        return result;
+    }
+
+    const std::string folder = apps + "A.app/PlugIns/";
+    const std::string database = files.path("home/zorvan/Tandry.db");
+};
+
+TEST_F(CatalogueTest, ARestartReadsNothingAgain) {
+    start();
+    EXPECT_EQ(merges, 3);
+    EXPECT_THAT(recorder.take(), UnorderedElementsAre("+a", "+b", "+c"));
+    TDPlugInProxyRef before = plugIn("b");
+    start();
+    EXPECT_EQ(merges, 0);
+    EXPECT_THAT(recorder.take(), IsEmpty());
+    TDPlugInProxyRef after = plugIn("b");
+    EXPECT_EQ(after->plugInUuid, before->plugInUuid);
+    EXPECT_EQ(after->registrationDate, before->registrationDate);
+    EXPECT_EQ(after->infoPlist.get(), before->infoPlist.get());
+    EXPECT_EQ(after->originalIdentifier, before->originalIdentifier);
+    EXPECT_EQ(after->dataContainerPath, before->dataContainerPath);
+    EXPECT_EQ(after->localizedName, before->localizedName);
+    EXPECT_EQ(after->containingApplication->bundleIdentifier, "app");
+}
+
+TEST_F(CatalogueTest, WhatChangedGetsANewUuid) {
+    struct Change {
+        const char* what;
+        std::function<void()> make;
+        std::vector<std::string> names;
+    };
+    const std::vector<Change> changes{
+        {"Info.plist",
+         [&] {
+             add("a", {{"new", true}});
+         },
+         {"a"}},
+        {"entitlements",
+         [&] {
+             writePlist(folder + "b/Entitlements.plist", {{"r", 1}});
+         },
+         {"b"}},
+        {"executable named",
+         [&] {
+             add("c", {{"QFBundleExecutable", "run"}});
+         },
+         {"c"}},
+        {"executable", [&] { files.write(folder + "c/run", "#!/bin/sh\n"); }, {"c"}},
+        {"placeholder", [&] { files.write(apps + "A.app/.placeholder", ""); }, {"a", "b", "c"}},
+        {"the user's SDK dictionary",
+         [&] {
+             writePlist("home/zorvan/SDKs/org.point.plist", {{"Other", "longer"}});
+         },
+         {"a", "b", "c"}},
+    };
+    start();
+    for (const auto& [what, make, names] : changes) {
+        std::map<std::string, Uuid> before = uuids();
+        recorder.take();
+        make();
+        start();
+        std::vector<std::string> events;
+        for (const std::string& name : names) events.push_back("-" + name);
+        for (const std::string& name : names) events.push_back("+" + name);
+        EXPECT_THAT(recorder.take(), testing::ElementsAreArray(events)) << what;
+        EXPECT_EQ(merges, static_cast<int>(names.size())) << what;
+        for (const auto& [name, uuid] : uuids())
+            EXPECT_EQ(uuid != before[name], testing::Value(names, testing::Contains(name))) << what;
+    }
+    fs::remove_all(files.path(folder + "b"));
+    start();
+    EXPECT_THAT(recorder.take(), ElementsAre("-b"));
+    EXPECT_THAT(installed(), ElementsAre("a", "c"));
+}
+
+TEST_F(CatalogueTest, ADamagedCatalogueIsSetAsideAndRebuilt) {
+    auto sql = [this](const char* statement) {
+        sqlite3* handle = nullptr;
+        sqlite3_open(database.c_str(), &handle);
+        EXPECT_EQ(sqlite3_exec(handle, statement, nullptr, nullptr, nullptr), SQLITE_OK);
+        sqlite3_close(handle);
+    };
+    const std::vector<std::function<void()>> damages{
+        [&] { files.write("home/zorvan/Tandry.db", "no database at all"); },
+        [&] { fs::resize_file(database, fs::file_size(database) / 2 + 100); },
+        [&] { sql("PRAGMA user_version = 7"); },
+        [&] { sql("DROP TABLE forgotten"); },
+        [&] { sql("UPDATE plugins SET dictionaries = zeroblob(100) WHERE path LIKE '%/b'"); },
+        [&] { sql("UPDATE plugins SET identifier = 'other' WHERE path LIKE '%/b'"); },
+        [&] { sql("UPDATE applications SET identifier = 'other'"); },
+        [&] {
+            fs::remove(database);
+            fs::create_directory(database);
+        },
+    };
+    start();
+    int number = 0;
+    for (const auto& damage : damages) {
+        stop();
+        recorder.take();
+        damage();
+        ErrorLines errors;
+        start();
+        const std::string aside = "Tandry.db.damaged-" + std::to_string(++number);
+        EXPECT_THAT(errors.lines, ElementsAre(HasSubstr(aside))) << number;
+        EXPECT_TRUE(fs::exists(files.path("home/zorvan/" + aside))) << number;
+        EXPECT_THAT(installed(), ElementsAre("a", "b", "c")) << number;
+        EXPECT_EQ(recorder.take().size(), 3u) << number;
+        start();
+        EXPECT_EQ(merges, 0) << number;
+        EXPECT_THAT(recorder.take(), IsEmpty()) << number;
+    }
+}
+
+TEST_F(CatalogueTest, WorksInMemoryWhenItCannotWrite) {
+    sqlite3* other = nullptr;
+    start();
+    const std::map<std::string, Uuid> before = uuids();
+    stop();
+    // Somebody keeps it locked.
+    sqlite3_open(database.c_str(), &other);
+    sqlite3_exec(other, "PRAGMA locking_mode = EXCLUSIVE; BEGIN EXCLUSIVE", nullptr, nullptr,
+                 nullptr);
+    {
+        ErrorLines errors;
+        start();
+        EXPECT_THAT(installed(), ElementsAre("a", "b", "c"));
+        EXPECT_THAT(errors.lines, ElementsAre(HasSubstr("working without the catalogue")));
+        EXPECT_EQ(workspace->unregisterPlugIn(files.path(folder + "a")), std::nullopt);
+        EXPECT_THAT(installed(), ElementsAre("b", "c"));
+    }
+    stop();
+    sqlite3_close(other);
+    start();
+    EXPECT_EQ(uuids(), before);
+}
+
+TEST_F(CatalogueTest, HasOneOwner) {
+    start();
+    auto second = openDiskWorkspace(directories, *sdks, nullptr);
+    ASSERT_FALSE(second);
+    EXPECT_EQ(second.error().code, EADDRINUSE);
+    stop();
+    EXPECT_TRUE(openDiskWorkspace(directories, *sdks, nullptr));
+    directories.dataHome = files.write("file", "");
+    EXPECT_FALSE(openDiskWorkspace(directories, *sdks, nullptr));
+}
+
+TEST_F(CatalogueTest, LookupsEndWithTheWorkspace) {
+    auto opened = openDiskWorkspace(
+        directories, *(sdks = std::make_unique<SdkDictionaries>(directories)), nullptr);
+    ASSERT_TRUE(opened);
+    std::promise<void> asked;
+    auto waiting = std::async(std::launch::async, [&] {
+        asked.set_value();
+        return (*opened)->plugInsMatching({{"key", true}}, nullptr);
+    });
+    asked.get_future().wait();
+    // Never activated: nothing else could end the wait, whenever it begins.
+    while (waiting.wait_for(std::chrono::milliseconds(20)) == std::future_status::timeout &&
+           *opened)
+        opened->reset();
+    EXPECT_EQ(waiting.get(), std::nullopt);
+}
+
+}  // namespace
+}  // namespace platform::tandry

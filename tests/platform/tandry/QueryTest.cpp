@@ -1,0 +1,152 @@
+#include <random>
+#include <regex>
+#include <set>
+
+#include "platform/tandry/Snapshot.h"
+#include "tests/platform/tandry/RegistryFixture.h"
+
+namespace platform::tandry {
+namespace {
+
+TEST(ComparisonKey, IsTheSameForWhatComparesEqual) {
+    for (auto [a, b] : {std::pair{"a.1", "a.01"}, {"0", "000"}, {"x007y00", "x7y0"}, {"", ""}})
+        EXPECT_EQ(comparisonKey(a), comparisonKey(b)) << a << " / " << b;
+    std::set<std::uint64_t> keys;
+    for (const char* text : {"", "0", "1", "10", "100", "a", "A", "a0", "a1", "a10", "1.0", "1"})
+        keys.insert(comparisonKey(text));
+    EXPECT_EQ(keys.size(), 11u);
+}
+
+constexpr const char* kPoint = "VXExtensionPointIdentifier";
+constexpr const char* kIdentifier = "VXExtensionIdentifier";
+
+/// Values and queries from a small stock, so that they often meet.
+class Dice {
+  public:
+    int roll(int sides) { return std::uniform_int_distribution(0, sides - 1)(engine_); }
+    std::string text() {
+        static const char* const stock[] = {"a.1", "a.01", "a.10", "A.1", "b", "007", "7"};
+        return stock[roll(std::size(stock))];
+    }
+    Value value() {
+        switch (roll(6)) {
+            case 0:
+                return Array{text(), 1, text()};
+            case 1:
+                return Value(roll(3));
+            default:
+                return text();
+        }
+    }
+    std::string stringPattern() {
+        static const char* const operators[] = {"", "", "", "=", "=", "<>", ">=", "?UT-IS:"};
+        return operators[roll(std::size(operators))] + text();
+    }
+    Value pattern() {
+        switch (roll(7)) {
+            case 0:
+                return Value(roll(3));
+            case 1:
+                return Dictionary{{"items", Array()}};
+            case 2:
+                return Array();
+            case 3:
+                return Array{stringPattern(), 5, stringPattern()};
+            default:
+                return stringPattern();
+        }
+    }
+
+  private:
+    std::mt19937 engine_{7};
+};
+
+std::string normalised(const std::string& text) {
+    static const std::regex zeros("(^|[^0-9])0+(?=[0-9])");
+    return std::regex_replace(text, zeros, "$1");
+}
+
+/// What may be accepted; the kinds that never narrow count as accepting everything.
+bool accepts(const Value& pattern, const Value* value) {
+    if (const Array* alternatives = pattern.array())
+        return std::any_of(
+            alternatives->begin(), alternatives->end(),
+            [value](const Value& element) { return element.string() && accepts(element, value); });
+    const std::string* text = pattern.string();
+    if (!text || std::string("<>?").find(text->front()) != std::string::npos) return true;
+    if (!value) return false;
+    if (const Array* array = value->array())
+        return std::any_of(array->begin(), array->end(),
+                           [&](const Value& element) { return accepts(pattern, &element); });
+    const std::string operand = text->front() == '=' ? text->substr(1) : *text;
+    return value->string() && normalised(*value->string()) == normalised(operand);
+}
+
+bool accepts(const TDPlugInProxy& plugIn, const Dictionary& query) {
+    for (const auto& [key, pattern] : query) {
+        const Value* value = plugIn.lookup(key, TDPlugInProxy::Scope::Attributes);
+        if (!value) value = plugIn.lookup(key, TDPlugInProxy::Scope::InfoPlist);
+        Value identifier(plugIn.plugInIdentifier.value_or(""));
+        if (key == kIdentifier && plugIn.plugInIdentifier) value = &identifier;
+        if (!accepts(pattern, value)) return false;
+    }
+    return true;
+}
+
+TEST_F(RegistryTest, NarrowingNeverDropsAMatch) {
+    Dice dice;
+    addApplication(apps + "A.app");
+    for (int i = 0; i < 120; ++i) {
+        Dictionary extension;
+        Dictionary info;
+        Dictionary attributes;
+        if (dice.roll(3)) extension.set(kPoint, dice.value());
+        if (dice.roll(3) == 0) attributes.set(kPoint, dice.value());
+        if (dice.roll(3) == 0) info.set(kPoint, dice.value());
+        if (dice.roll(4) == 0) attributes.set(kIdentifier, dice.value());
+        if (dice.roll(4)) info.set(kIdentifier, dice.value());
+        if (dice.roll(4)) extension.set("VXExtensionAttributes", attributes);
+        info.set("VXExtension", extension);
+        writePlist(apps + "A.app/PlugIns/" + std::to_string(i) + "/Info.plist", info);
+    }
+    start();
+    const TDPlugInProxyList all = workspace->installedPlugIns();
+    ASSERT_EQ(all.size(), 120u);
+    std::size_t dropped = 0;
+    for (int i = 0; i < 400; ++i) {
+        Dictionary query;
+        if (dice.roll(3)) query.set(kPoint, dice.pattern());
+        if (dice.roll(2)) query.set(kIdentifier, dice.pattern());
+        if (dice.roll(4) == 0) query.set("other", true);
+        auto found = workspace->plugInsMatching(query, nullptr);
+        ASSERT_TRUE(found);
+        std::set<TDPlugInProxyRef> kept(found->begin(), found->end());
+        EXPECT_EQ(kept.size(), found->size()) << describe(query);
+        query.remove("other");
+        for (const auto& plugIn : all)
+            EXPECT_TRUE(kept.contains(plugIn) || !accepts(*plugIn, query))
+                << describe(query) << " " << describe(*plugIn);
+        dropped += all.size() - kept.size();
+    }
+    EXPECT_GT(dropped, 400 * all.size() / 3);
+}
+
+TEST_F(RegistryTest, TheFilterSeesIdentifierAndEntitlements) {
+    addApplication(apps + "A.app");
+    for (const char* name : {"a", "b", "c"})
+        addPlugIn(apps + "A.app/PlugIns/" + name, name,
+                  {{kPoint, "org.point"}, {"VXExtensionAttributes", Dictionary()}});
+    writePlist(apps + "A.app/PlugIns/b/Entitlements.plist", {{"right", true}});
+    start();
+    auto found = workspace->plugInsMatching(
+        {{kPoint, "org.point"}},
+        [](const std::optional<std::string>& identifier, const Dictionary& entitlements) {
+            return identifier == "a" || entitlements.contains("right");
+        });
+    ASSERT_TRUE(found);
+    EXPECT_EQ(found->size(), 2u);
+    EXPECT_TRUE(workspace->plugInsMatching({{kPoint, "org"}}, nullptr)->empty());
+}
+
+}  // namespace
+}  // namespace platform::tandry

@@ -1,0 +1,139 @@
+#pragma once
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <future>
+#include <map>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "platform/Directories.h"
+#include "platform/Log.h"
+#include "platform/PropertyList.h"
+#include "platform/SdkDictionaries.h"
+#include "platform/tandry/DiskWorkspace.h"
+#include "tests/support/TemporaryDirectory.h"
+
+namespace platform::tandry {
+
+/// Collects what an observer is told: "+identifier" and "-identifier".
+class Recorder : public WorkspaceObserver {
+  public:
+    void pluginsDidInstall(const TDPlugInProxyList& plugIns) override { add("+", plugIns); }
+    void pluginsWillUninstall(const TDPlugInProxyList& plugIns) override {
+        add("-", plugIns);
+        // Hidden before the observers hear of it.
+        for (const auto& plugIn : plugIns)
+            if (workspace->plugInWithUuid(plugIn->plugInUuid)) events.push_back("visible");
+    }
+    std::vector<std::string> take() { return std::exchange(events, {}); }
+
+    Workspace* workspace = nullptr;
+    std::vector<std::string> events;
+
+  private:
+    void add(const char* sign, const TDPlugInProxyList& plugIns) {
+        for (const auto& plugIn : plugIns)
+            events.push_back(sign + plugIn->plugInIdentifier.value_or("?"));
+    }
+};
+
+/// A registry over a directory of its own.
+class RegistryTest : public testing::Test {
+  protected:
+    RegistryTest() {
+        directories.dataHome = files.path("home");
+        directories.dataDirs = {files.path("share")};
+    }
+    ~RegistryTest() override { stop(); }
+
+    /// Opens the registry and waits for its first scan.
+    void start() {
+        stop();
+        merges = 0;
+        sdks = std::make_unique<SdkDictionaries>(directories);
+        auto opened = openDiskWorkspace(directories, *sdks,
+                                        [this](const Dictionary& sdk, const Dictionary& infoPlist) {
+                                            ++merges;
+                                            Dictionary merged = infoPlist;
+                                            for (const auto& [key, value] : sdk)
+                                                if (!merged.contains(key)) merged.set(key, value);
+                                            return merged;
+                                        });
+        ASSERT_TRUE(opened) << opened.error().text;
+        workspace = std::move(*opened);
+        recorder.workspace = workspace.get();
+        observation = workspace->addObserver(recorder);
+        workspace->activate();
+        settle();
+    }
+    /// Waits until the registry's thread has done what it was given: it is then behind the first
+    /// scan's announcements.
+    void settle() { static_cast<void>(workspace->unregisterPlugIn("/nowhere")); }
+    void stop() {
+        observation.reset();
+        workspace.reset();
+    }
+
+    void writePlist(const std::string& file, const Dictionary& dictionary) {
+        auto xml = writeXmlPropertyList(dictionary);
+        ASSERT_TRUE(xml) << xml.error().text;
+        files.write(file, *xml);
+    }
+    /// A plug-in bundle whose Info.plist holds an identifier, a VXExtension dictionary and `more`.
+    std::string addPlugIn(const std::string& path, const std::string& identifier,
+                          const Dictionary& extension = {{"VXExtensionAttributes", Dictionary()}},
+                          const Dictionary& more = {}) {
+        Dictionary info = more;
+        info.set("QFBundleIdentifier", identifier);
+        info.set("VXExtension", extension);
+        writePlist(path + "/Info.plist", info);
+        return files.path(path);
+    }
+    std::string addApplication(const std::string& path, const Dictionary& info = {}) {
+        writePlist(path + "/Info.plist", info);
+        return files.path(path);
+    }
+
+    std::vector<std::string> installed() {
+        std::vector<std::string> identifiers;
+        for (const auto& plugIn : workspace->installedPlugIns())
+            identifiers.push_back(plugIn->plugInIdentifier.value_or("?"));
+        return identifiers;
+    }
+    TDPlugInProxyRef plugIn(const std::string& identifier) {
+        for (const auto& plugIn : workspace->installedPlugIns())
+            if (plugIn->plugInIdentifier == identifier) return plugIn;
+        return nullptr;
+    }
+
+    const std::string apps = "home/zorvan/Applications/";
+    test::TemporaryDirectory files;
+    Directories directories;
+    std::unique_ptr<SdkDictionaries> sdks;
+    Recorder recorder;
+    int merges = 0;  // how many plug-ins with an SDK dictionary were read
+    std::unique_ptr<Workspace> workspace;
+    std::unique_ptr<Workspace::Observation> observation;
+};
+
+/// The error lines written while it lives.
+class ErrorLines {
+  public:
+    std::vector<std::string> lines;
+
+  private:
+    LogCapture capture_{[this](const std::string&, LogLevel level, const std::string& text) {
+        if (level == LogLevel::Error) lines.push_back(text);
+    }};
+};
+
+using testing::AllOf;
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::IsEmpty;
+using testing::UnorderedElementsAre;
+
+}  // namespace platform::tandry

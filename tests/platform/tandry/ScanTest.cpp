@@ -1,0 +1,209 @@
+#include <sys/stat.h>
+
+#include <cstdlib>
+#include <filesystem>
+
+#include "tests/platform/tandry/RegistryFixture.h"
+
+namespace platform::tandry {
+namespace {
+
+namespace fs = std::filesystem;
+using Scope = TDPlugInProxy::Scope;
+
+TEST_F(RegistryTest, FindsTheBundlesOfEveryApplicationFolder) {
+    const std::string app = addApplication(
+        apps + "Mail.app", {{"QFBundleIdentifier", "org.mail"}, {"QFBundleName", "Mail"}});
+    addPlugIn(apps + "Mail.app/PlugIns/B.appex", "org.mail.b");
+    const std::string a = addPlugIn(apps + "Mail.app/PlugIns/A.plugin", "org.mail.a");
+    addApplication("share/zorvan/Applications/Map.app");
+    addPlugIn("share/zorvan/Applications/Map.app/PlugIns/C.appex", "org.map.c");
+    files.write("share/zorvan/Applications/Map.app/.placeholder", "");
+    files.write(apps + "Mail.app/PlugIns/README", "not a bundle");
+    addPlugIn(apps + "Mail.app/PlugIns/.hidden", "org.hidden");
+    addPlugIn(apps + "Plain/PlugIns/D.appex", "org.plain");
+    ErrorLines errors;
+    start();
+
+    EXPECT_THAT(errors.lines, IsEmpty());
+    EXPECT_THAT(installed(), ElementsAre("org.mail.a", "org.mail.b", "org.map.c"));
+    EXPECT_THAT(recorder.take(), UnorderedElementsAre("+org.mail.a", "+org.mail.b", "+org.map.c"));
+    TDPlugInProxyRef found = workspace->plugInAtPath(a);
+    ASSERT_TRUE(found);
+    EXPECT_EQ(workspace->plugInWithUuid(found->plugInUuid), found);
+    EXPECT_EQ(found->containingApplication, workspace->applicationAtPath(app));
+    EXPECT_EQ(found->containingApplication->bundleIdentifier, "org.mail");
+    EXPECT_EQ(found->containingApplication->localizedName, "Mail");
+    EXPECT_FALSE(found->containingApplication->isPlaceholder);
+    EXPECT_TRUE(plugIn("org.map.c")->containingApplication->isPlaceholder);
+    EXPECT_EQ(workspace->plugInsOfApplication(app).size(), 2u);
+    EXPECT_FALSE(workspace->plugInAtPath(app));
+    EXPECT_FALSE(workspace->applicationAtPath(a));
+}
+
+TEST_F(RegistryTest, CompletesTheDictionaries) {
+    addApplication(apps + "A.app");
+    writePlist("home/zorvan/SDKs/org.point.plist", {{"FromSdk", true}});
+    const Dictionary attributes{{"VXExtensionAttributes", Dictionary{{"Size", 3}}},
+                                {"VXExtensionPointIdentifier", "org.point"},
+                                {"VXExtensionIdentifier", 7}};
+    addPlugIn(apps + "A.app/PlugIns/A.appex", "a", attributes,
+              {{"QFBundleShortVersionString", "2.5"},
+               {"VXOriginalIdentifier", "a.original"},
+               {"VXExtensionIdentifier", "a.top"}});
+    writePlist(apps + "A.app/PlugIns/A.appex/Entitlements.plist", {{"right", true}});
+    addPlugIn(apps + "A.app/PlugIns/B.appex", "b",
+              {{"VXExtensionAttributes",
+                Dictionary{{"VXExtensionVersion", 9}, {"VXExtensionPointIdentifier", "other"}}},
+               {"VXExtensionPointIdentifier", "org.unknown"}},
+              {{"QFBundleVersion", "7"}, {"QFBundleShortVersionString", "2"}});
+    addPlugIn(apps + "A.app/PlugIns/C.appex", "c", {{"VXExtensionPointIdentifier", "org.point"}});
+    addPlugIn(apps + "A.app/PlugIns/D.appex", "d");
+    start();
+
+    TDPlugInProxyRef a = plugIn("a.top");
+    ASSERT_TRUE(a);
+    EXPECT_EQ(a->bundleIdentifier, "a");
+    EXPECT_EQ(a->originalIdentifier, "a.original");
+    EXPECT_EQ(a->bundleVersion, "2.5");
+    EXPECT_EQ(*a->attributes(), (Dictionary{{"Size", 3},
+                                            {"VXExtensionVersion", "2.5"},
+                                            {"VXExtensionPointIdentifier", "org.point"}}));
+    EXPECT_EQ(*a->lookup("FromSdk", Scope::InfoPlist), Value(true));
+    EXPECT_EQ(*a->lookup("VXExtensionIdentifier", Scope::PlugInDictionary), Value(7));
+    EXPECT_FALSE(a->lookup("FromSdk", Scope::PlugInDictionary));
+    EXPECT_EQ(a->entitlements.get(), (Dictionary{{"right", true}}));
+
+    TDPlugInProxyRef b = plugIn("b");
+    EXPECT_EQ(b->bundleVersion, "7");
+    EXPECT_EQ(b->originalIdentifier, "b");
+    EXPECT_EQ(*b->lookup("VXExtensionVersion", Scope::Attributes), Value(9));
+    EXPECT_EQ(*b->lookup("VXExtensionPointIdentifier", Scope::Attributes), Value("other"));
+    EXPECT_EQ(plugIn("c")->attributes(), nullptr);
+    EXPECT_EQ(*plugIn("d")->attributes(), (Dictionary{{"VXExtensionVersion", "1"}}));
+}
+
+TEST_F(RegistryTest, NamesFollowTheUsersLanguage) {
+    ::setenv("LC_ALL", "de_AT.UTF-8", 1);
+    ::unsetenv("LANGUAGE");
+    addApplication(apps + "A.app");
+    addPlugIn(apps + "A.app/PlugIns/A.appex", "a", {},
+              {{"QFBundleDisplayName", "Long"}, {"QFBundleName", "Short"}});
+    writePlist(apps + "A.app/PlugIns/A.appex/Localized.plist",
+               {{"de_AT", Dictionary{{"QFBundleDisplayName", 5}}},
+                {"de", Dictionary{{"QFBundleDisplayName", "Lang"}}}});
+    addPlugIn(apps + "A.app/PlugIns/B.appex", "b", {}, {{"QFBundleName", "Short"}});
+    files.write(apps + "A.app/PlugIns/B.appex/Localized.plist", "broken");
+    addPlugIn(apps + "A.app/PlugIns/C.appex", "c", {}, {{"QFBundleName", true}});
+    start();
+    EXPECT_EQ(plugIn("a")->localizedName, "Lang");
+    EXPECT_EQ(plugIn("a")->localizedShortName, "Short");
+    EXPECT_EQ(plugIn("b")->localizedName, "Short");
+    EXPECT_EQ(plugIn("c")->localizedName, std::nullopt);
+    ::setenv("LC_ALL", "C", 1);
+    start();
+    EXPECT_EQ(plugIn("a")->localizedName, "Long");
+    ::unsetenv("LC_ALL");
+}
+
+TEST_F(RegistryTest, LeavesOutBadBundlesWithOneLineEach) {
+    const std::string head = "<plist version=\"1.0\"><dict><key>VXExtension</key><dict/>";
+    const std::string tail = "</dict></plist>";
+    std::string deep;
+    for (int i = 0; i < 70; ++i) deep = "<array>" + deep + "</array>";
+    auto text = [&](const char* key, const std::string& value) {
+        return head + "<key>" + key + "</key>" + value + tail;
+    };
+    auto string = [](const std::string& value) { return "<string>" + value + "</string>"; };
+    const std::map<std::string, std::string> bad{
+        {"empty", ""},
+        {"garbage", "{\"json\": 1}"},
+        {"truncated", head.substr(0, 40)},
+        {"binary", std::string("bplist00\xD1\x01\x02\0\0\0", 14)},
+        {"array", "<plist version=\"1.0\"><array/></plist>"},
+        {"no-extension", "<plist version=\"1.0\"><dict/></plist>"},
+        {"text-extension",
+         "<plist version=\"1.0\"><dict><key>VXExtension</key><string>x</string></dict></plist>"},
+        {"deep", text("Deep", deep)},
+        {"large", text("Large", string(std::string(20u << 20, 'x')))},
+        {"executable", text("QFBundleExecutable", string("../x"))},
+        {"identifier", text("VXExtensionIdentifier", string(".x"))},
+        {"bundle-identifier", text("QFBundleIdentifier", string("a/b"))},
+        {"long-identifier", text("QFBundleIdentifier", string(std::string(256, 'x')))},
+    };
+    const std::string folder = apps + "A.app/PlugIns/";
+    addApplication(apps + "A.app");
+    for (const auto& [name, bytes] : bad) files.write(folder + name + "/Info.plist", bytes);
+    files.makeDirectory(folder + "missing");
+    addPlugIn(folder + "entitlements", "x");
+    files.write(folder + "entitlements/Entitlements.plist", "broken");
+    // Wrong types that have another meaning.
+    addPlugIn(folder + "good", "good",
+              {{"VXExtensionIdentifier", Array()},
+               {"VXExtensionPointIdentifier", 4},
+               {"VXExtensionAttributes", "none"},
+               {"VXExtensionProtocol", 1}},
+              {{"QFBundleExecutable", 1}, {"QFBundleVersion", 2}, {"QFBundleName", 3}});
+    files.write(folder + "nameless/Info.plist", text("QFBundleIdentifier", "<integer>1</integer>"));
+
+    for (const char* run : {"first", "second"}) {
+        ErrorLines errors;
+        start();
+        EXPECT_THAT(installed(), ElementsAre("good", "?")) << run;
+        EXPECT_EQ(errors.lines.size(), bad.size() + 2) << run;
+        for (const auto& [name, bytes] : bad)
+            EXPECT_THAT(errors.lines,
+                        testing::Contains(HasSubstr("/" + name + "/Info.plist: ")).Times(1))
+                << run;
+    }
+    EXPECT_EQ(plugIn("?"), nullptr);
+    EXPECT_EQ(workspace->plugInAtPath(files.path(folder + "nameless"))->dataContainerPath,
+              std::nullopt);
+}
+
+TEST_F(RegistryTest, FollowsLinksAndSkipsWhatCannotBeNamed) {
+    addApplication("opt/Real.app");
+    addPlugIn("opt/Real.app/PlugIns/A.appex", "a");
+    const std::string stray = addPlugIn("opt/Stray.appex", "stray");
+    files.makeDirectory(apps);
+    fs::create_symlink(files.path("opt/Real.app"), files.path(apps + "One.app"));
+    fs::create_symlink(files.path("opt/Real.app"), files.path(apps + "Two.app"));
+    fs::create_symlink(files.path(apps + "Loop.app"), files.path(apps + "Loop.app"));
+    fs::create_symlink(files.path("opt"), files.path(apps + "Other.app"));
+    fs::create_symlink(stray, files.path("opt/Real.app/PlugIns/Link.appex"));
+    addPlugIn(apps + "Bad\xFF.app/PlugIns/A.appex", "x");
+    addPlugIn(apps + "Bell\a.app/PlugIns/A.appex", "x");
+    ErrorLines errors;
+    start();
+    EXPECT_THAT(installed(), ElementsAre("a", "stray"));
+    EXPECT_EQ(plugIn("a")->bundlePath, files.path("opt/Real.app/PlugIns/A.appex"));
+    EXPECT_EQ(plugIn("stray")->containingApplication, nullptr);
+    EXPECT_THAT(errors.lines, UnorderedElementsAre(HasSubstr("Loop.app"), HasSubstr("Other.app"),
+                                                   HasSubstr("Bad"), HasSubstr("Bell")));
+}
+
+TEST_F(RegistryTest, MakesDataContainersThatAreTheUsersOwn) {
+    addApplication(apps + "A.app");
+    const std::string folder = apps + "A.app/PlugIns/";
+    addPlugIn(folder + "A.appex", "a");
+    addPlugIn(folder + "B.appex", "b", {{"VXExtensionProtocol", "#Data"}});
+    for (const char* name : {"c", "d"}) addPlugIn(folder + name, name);
+    const std::string containers = files.makeDirectory("home/zorvan/Containers");
+    fs::create_symlink(files.makeDirectory("elsewhere"), containers + "/c");
+    files.write("home/zorvan/Containers/d", "a file");
+    start();
+    EXPECT_EQ(plugIn("a")->dataContainerPath, containers + "/a");
+    struct stat status;
+    ASSERT_EQ(::stat((containers + "/a/tmp").c_str(), &status), 0);
+    EXPECT_EQ(status.st_mode & 0777, 0700u);
+    EXPECT_FALSE(fs::exists(containers + "/b"));
+    for (const char* name : {"b", "c", "d"})
+        EXPECT_EQ(plugIn(name)->dataContainerPath, std::nullopt) << name;
+    fs::remove(containers + "/d");
+    start();
+    EXPECT_EQ(plugIn("d")->dataContainerPath, containers + "/d");
+    EXPECT_EQ(plugIn("a")->dataContainerPath, containers + "/a");
+}
+
+}  // namespace
+}  // namespace platform::tandry
