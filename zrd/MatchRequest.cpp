@@ -52,7 +52,7 @@ void Transaction::matchPlugIns() {
     for (const auto& plugIn : candidates) {
         if (firstClosedGate(*plugIn, query)) continue;
         std::optional<ZRError> error;
-        auto form = plugIn->exportForm(error);
+        auto form = plugIn->form(error);
         if (error) {
             EVLOG_ERROR(ops(), "failed to export matching plug-in {}: {}", pub(plugIn->uuid()),
                         pub(*error));

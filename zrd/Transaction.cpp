@@ -129,7 +129,10 @@ bool Transaction::processUuidList(
 }
 
 void Transaction::addAnnotationForPlugIn(const ZRDPlugIn& plugIn, Dictionary& in) const {
-    in.set(form::kAnnotations, server().annotationForPlugIn(plugIn).value_or(Dictionary()));
+    Value annotation = server().annotationForPlugIn(plugIn).value_or(Dictionary());
+    // A form that is left as it is keeps its encoded bytes.
+    const Value* present = in.find(form::kAnnotations);
+    if (!present || *present != annotation) in.set(form::kAnnotations, std::move(annotation));
 }
 
 void Transaction::done() {

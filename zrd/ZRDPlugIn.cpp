@@ -57,7 +57,8 @@ bool ZRDPlugIn::fillFromProxy() {
     if (tdproxy_->containingApplication) {
         setContainingPath(tdproxy_->containingApplication->bundlePath);
     }
-    // These three go into every form of this plug-in: encoded once, they are copied from then on.
+    // These three go into the form, also where the form itself has to be encoded anew: encoded
+    // once, they are copied from then on.
     platform::keepCborEncoded(tdproxy_->infoPlist.get());
     platform::keepCborEncoded(tdproxy_->entitlements.get());
     if (info) platform::keepCborEncoded(*info);
@@ -90,7 +91,7 @@ const Value* ZRDPlugIn::attribute(std::string_view key) const {
 
 std::optional<std::string> ZRDPlugIn::cachedName(
     std::optional<std::string>& cache, const std::optional<std::string>& registered) const {
-    std::lock_guard lock(namesMutex_);
+    std::lock_guard lock(mutex_);
     if (!cache) cache = registered;
     return cache;
 }
@@ -110,19 +111,35 @@ std::optional<std::string> ZRDPlugIn::localizedContainingName() const {
     return cachedName(localizedContainingName_, registered);
 }
 
+void ZRDPlugIn::setName(std::optional<std::string>& cache, std::optional<std::string> value) {
+    std::lock_guard lock(mutex_);
+    cache = std::move(value);
+    form_.reset();
+}
+
 void ZRDPlugIn::setLocalizedName(std::optional<std::string> value) {
-    std::lock_guard lock(namesMutex_);
-    localizedName_ = std::move(value);
+    setName(localizedName_, std::move(value));
 }
 
 void ZRDPlugIn::setLocalizedShortName(std::optional<std::string> value) {
-    std::lock_guard lock(namesMutex_);
-    localizedShortName_ = std::move(value);
+    setName(localizedShortName_, std::move(value));
 }
 
 void ZRDPlugIn::setLocalizedContainingName(std::optional<std::string> value) {
-    std::lock_guard lock(namesMutex_);
-    localizedContainingName_ = std::move(value);
+    setName(localizedContainingName_, std::move(value));
+}
+
+std::optional<Dictionary> ZRDPlugIn::form(std::optional<ZRError>& error) const {
+    {
+        std::lock_guard lock(mutex_);
+        if (form_) return form_;
+    }
+    auto made = exportForm(error);
+    if (!made) return std::nullopt;
+    platform::keepCborEncoded(*made);
+    std::lock_guard lock(mutex_);
+    form_ = made;
+    return made;
 }
 
 std::optional<ZRError> ZRDPlugIn::diagnose() const {

@@ -43,6 +43,10 @@ class ZRDPlugIn final : public ZRPlugInCore {
     /// around what is not part of the system.
     std::optional<ZRError> diagnose() const override;
 
+    /// The record's form as `exportForm` makes it, made and encoded at the first call and shared
+    /// from then on; setting a name makes it afresh. An error: there is none, as with `exportForm`.
+    std::optional<platform::Dictionary> form(std::optional<ZRError>& error) const;
+
     /// The plug-in's value for an entitlement, or null.
     const platform::Value* valueForEntitlement(std::string_view name) const;
     /// Whether that value is there and does not equal boolean false.
@@ -82,13 +86,15 @@ class ZRDPlugIn final : public ZRPlugInCore {
 
     std::optional<std::string> cachedName(std::optional<std::string>& cache,
                                           const std::optional<std::string>& registered) const;
+    void setName(std::optional<std::string>& cache, std::optional<std::string> value);
 
     const platform::TDPlugInProxyRef tdproxy_;
     const std::shared_ptr<const PlugInContext> context_;
-    mutable std::mutex namesMutex_;  // guards the three names
+    mutable std::mutex mutex_;  // guards the three names and the form
     mutable std::optional<std::string> localizedName_;
     mutable std::optional<std::string> localizedShortName_;
     mutable std::optional<std::string> localizedContainingName_;
+    mutable std::optional<platform::Dictionary> form_;
 };
 
 }  // namespace zorvan

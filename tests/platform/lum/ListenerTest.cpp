@@ -286,7 +286,10 @@ TEST_F(ListenerTest, AHalfClosedPeerStillGetsItsReplies) {
 TEST_F(ListenerTest, ADeadPeersWaitingRequestsAreDropped) {
     openAndResume();
     RawPeer peer(path());
-    peer.write(requestFrame(1) + requestFrame(2));
+    // More than are read: the hang-up is noticed all the same.
+    std::string requests;
+    for (std::uint64_t serial = 1; serial <= 80; ++serial) requests += requestFrame(serial);
+    peer.write(requests);
     ASSERT_TRUE(stepUntil([&] { return kept.size() == 1; }));
     peer.close();
     ASSERT_TRUE(stepUntil([&] { return events.size() == 2; }));
@@ -331,18 +334,6 @@ TEST_F(ListenerTest, WhoNeverReadsIsNotServedOnAndHoldsUpNobody) {
         return serials.size() == 100;
     }));
     EXPECT_TRUE(std::is_sorted(serials.begin(), serials.end()));
-}
-
-TEST_F(ListenerTest, NoticesAHangUpWhileItDoesNotRead) {
-    openAndResume();
-    RawPeer peer(path());
-    std::string requests;
-    for (std::uint64_t serial = 1; serial <= 80; ++serial) requests += requestFrame(serial);
-    peer.write(requests);
-    ASSERT_TRUE(stepUntil([&] { return kept.size() == 1; }));
-    peer.close();
-    EXPECT_TRUE(stepUntil([&] { return events.size() == 2; }));
-    EXPECT_THAT(events, ElementsAre("message 1", "invalid"));
 }
 
 TEST_F(ListenerTest, ServesBesideTwoHundredIdleClients) {
