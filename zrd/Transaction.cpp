@@ -90,7 +90,7 @@ bool Transaction::marshalPaths(
             return false;
         }
         auto resolved = platform::canonicalPath(*path, kMaxResolvedPath);
-        // Messages hold UTF-8 only: a bundle elsewhere could not even be named in a reply.
+        // A reply could not carry other paths, and the registry has no bundles there.
         if (resolved && !platform::isValidUtf8(*resolved)) resolved.reset();
         if (callback(resolved ? *resolved : *path, resolved.has_value()) == Walk::Stop)
             return false;

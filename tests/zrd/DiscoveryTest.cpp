@@ -1,0 +1,166 @@
+// The walk of the candidates: its gates, and what becomes of those that pass them.
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "Zorvan/Keys.h"
+#include "tests/Zorvan/LogLines.h"
+#include "tests/zrd/Fakes.h"
+#include "zrd/CandidateGates.h"
+#include "zrd/MatchResult.h"
+
+namespace zorvan {
+
+namespace {
+
+using testing::ElementsAre;
+using testing::IsEmpty;
+
+class GatesTest : public testing::Test {
+  protected:
+    std::string closed(const platform::TDPlugInProxyRef& proxy) {
+        query_.rules = &rules_;
+        query_.host = &host_;
+        const CandidateGate* gate = firstClosedGate(*world_.record(proxy), query_);
+        return gate ? std::string(gate->name) : "";
+    }
+
+    FakeWorld world_;
+    FakeHost host_;
+    Dictionary rules_;
+    CandidateQuery query_;
+};
+
+TEST_F(GatesTest, ACandidateMeetsThemInOrderUnlessAllAreAskedFor) {
+    // Fails at every gate; what is mended below opens one after another.
+    auto proxy = makeProxy("com.a", {}, {{"Dedicated", true}, {"VXExtensionHostEntitlement", "e"}});
+    rules_ = {{"VXExtensionIdentifier", "com.b"}};
+    query_.exclusions = {Dictionary{{"Top", "other"}}, Dictionary{{"Top", "top"}}};
+    query_.hostPlugInsPath = "/Apps/Other.app/PlugIns";
+    query_.flags = ZRDiscoverSystemOnly;
+    auto data = makeProxy("com.a", {}, {{"Dedicated", true}});
+    data->bundlePath = "/System/a.appex";
+    data->containingApplication.reset();
+    EXPECT_EQ(closed(data), "application");
+    EXPECT_EQ(closed(proxy), "system-only");
+    data->onSystemPartition = proxy->onSystemPartition = true;
+    EXPECT_EQ(closed(data), "dedicated");
+    EXPECT_EQ(closed(proxy), "dedicated");
+    proxy->onSystemPartition = false;
+    query_.flags = 0;
+    query_.hostPlugInsPath.reset();
+    EXPECT_EQ(closed(proxy), "dedicated");
+    query_.hostPlugInsPath = "/Apps/Host.app/PlugIns";
+    EXPECT_EQ(closed(proxy), "rules");
+
+    const std::string who = " 7 plugin " + proxy->plugInUuid.string();
+    rules_ = {};
+    LogLines log;
+    EXPECT_EQ(closed(proxy), "exclusions");
+    EXPECT_THAT(log.take(), ElementsAre("ops D: client" + who + " globally excluded"));
+    query_.flags = ZRDiscoverAll;
+    EXPECT_EQ(closed(proxy), "exclusions");
+    query_.exclusions.clear();
+    query_.hostPlugInsPath.reset();
+    log.take();
+    EXPECT_EQ(closed(proxy), "");
+    query_.flags = 0;
+    query_.hostPlugInsPath = "/Apps/Host.app/PlugIns";
+    EXPECT_EQ(closed(proxy), "admission");
+    EXPECT_THAT(log.take(),
+                ElementsAre("ops D: client 7 cannot use plugin " + proxy->plugInUuid.string() +
+                            ": the host does not have the \"e\" entitlement"));
+    host_.entitlements = {{"e", true}};
+    EXPECT_EQ(closed(proxy), "");
+    EXPECT_THAT(log.take(), IsEmpty());
+}
+
+class MatchResultTest : public testing::Test {
+  protected:
+    struct Candidate {
+        const char* identifier;
+        const char* version;
+        const char* name;
+        bool system = false;
+        int modified = 0;
+        std::optional<Value> replaces = std::nullopt;
+    };
+
+    static void add(MatchResult& result, const FakeWorld& world, const Candidate& candidate) {
+        auto proxy = makeProxy(candidate.identifier, {{"VXExtensionVersion", candidate.version}});
+        proxy->localizedName = candidate.name;
+        proxy->onSystemPartition = candidate.system;
+        proxy->registrationDate = {static_cast<double>(candidate.modified)};
+        if (candidate.replaces)
+            proxy->entitlements = Dictionary{{entitlement::kReplacePlugIn, *candidate.replaces}};
+        auto plugIn = world.record(proxy);
+        std::optional<ZRError> error;
+        auto form = plugIn->exportForm(error);
+        if (result.admit(*plugIn)) result.append(*plugIn, *form);
+    }
+
+    /// The names of the accepted forms, with "+" for an overrider and ">" for what is overridden.
+    static std::vector<std::string> outcome(std::uint64_t flags,
+                                            const std::vector<Candidate>& candidates) {
+        FakeWorld world;
+        MatchResult result(flags);
+        for (const Candidate& candidate : candidates) add(result, world, candidate);
+        result.linkOverrides();
+        std::vector<std::string> names;
+        const Array forms = result.forms();
+        EXPECT_EQ(forms.size(), result.size());
+        for (const Value& value : forms) {
+            const Dictionary& form = *value.dictionary();
+            const Value* overriding = form.find("overriding");
+            names.push_back(*form.find("localizedDisplayName")->string() +
+                            (form.contains("overrider") ? "+" : "") +
+                            (overriding ? ">" + *overriding->string() : ""));
+        }
+        return names;
+    }
+};
+
+TEST_F(MatchResultTest, OneAnIdentifierUnlessFlagsKeepMore) {
+    const std::vector<Candidate> candidates{{"a", "1.2", "old"},  {"b", "1", "other"},
+                                            {"a", "1.10", "new"}, {"a", "1.3", "mid"},
+                                            {"A", "1", "case"},   {"a", "1.10", "twin"}};
+    EXPECT_THAT(outcome(0, candidates), ElementsAre("other", "new", "case"));
+    EXPECT_THAT(outcome(ZRDiscoverDuplicates, candidates), ElementsAre("other", "new", "case"));
+    EXPECT_THAT(outcome(ZRDiscoverVersions, candidates),
+                ElementsAre("old", "other", "new", "mid", "case"));
+    EXPECT_THAT(outcome(ZRDiscoverVersions | ZRDiscoverDuplicates, candidates),
+                ElementsAre("old", "other", "new", "mid", "case", "twin"));
+}
+
+TEST_F(MatchResultTest, EqualVersionsAreDecidedByTheSystemVolumeThenByTheTime) {
+    const Candidate plain{"a", "1", "plain", false, 5}, twin{"a", "1", "twin", false, 5};
+    const Candidate later{"a", "1", "later", false, 6}, system{"a", "1", "system", true, 1};
+    const Candidate newSystem{"a", "1", "newSystem", true, 2};
+    for (std::uint64_t flags : {std::uint64_t{0}, std::uint64_t{ZRDiscoverVersions}}) {
+        EXPECT_THAT(outcome(flags, {plain, twin}), ElementsAre("plain"));
+        EXPECT_THAT(outcome(flags, {plain, later}), ElementsAre("later"));
+        EXPECT_THAT(outcome(flags, {later, plain}), ElementsAre("later"));
+        EXPECT_THAT(outcome(flags, {plain, system}), ElementsAre("system"));
+        EXPECT_THAT(outcome(flags, {system, plain}), ElementsAre("plain"));
+        EXPECT_THAT(outcome(flags, {system, newSystem}), ElementsAre("newSystem"));
+        EXPECT_THAT(outcome(flags, {newSystem, system}), ElementsAre("newSystem"));
+    }
+}
+
+TEST_F(MatchResultTest, ReplacersAreLinkedWithWhatTheyReplace) {
+    const Candidate a{"a", "1", "a"}, b{"b", "1", "b"};
+    EXPECT_THAT(outcome(0, {a, {"r", "1", "r", false, 0, "a"}}), ElementsAre("a+", "r>a"));
+    EXPECT_THAT(outcome(0, {{"r", "1", "r", false, 0, Array{"gone", 1, "b"}}, a, b}),
+                ElementsAre("r>b", "a", "b+"));
+    EXPECT_THAT(outcome(0, {a, {"r", "1", "r", false, 0, 7}}), ElementsAre("a", "r"));
+    // The later replacer takes the place of the earlier one in the table.
+    EXPECT_THAT(outcome(0, {{"r", "1", "r", false, 0, "a"}, {"s", "1", "s", false, 0, "a"}, a}),
+                ElementsAre("r", "s>a", "a+"));
+    // A replacer that was displaced is still named.
+    EXPECT_THAT(outcome(0, {a, {"r", "1", "r", false, 0, "a"}, {"r", "2", "r2"}}),
+                ElementsAre("a+", "r2"));
+}
+
+}  // namespace
+
+}  // namespace zorvan

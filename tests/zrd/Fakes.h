@@ -1,0 +1,210 @@
+#pragma once
+
+#include <algorithm>
+#include <map>
+#include <memory>
+#include <optional>
+#include <set>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "platform/Services.h"
+#include "platform/lum/Connection.h"
+#include "zrd/HostProcess.h"
+#include "zrd/PlugInContext.h"
+#include "zrd/ZRDPlugIn.h"
+
+namespace zorvan {
+
+using platform::Array;
+using platform::Dictionary;
+using platform::Value;
+
+struct FakeAnnotations final : AnnotationReader {
+    std::optional<Dictionary> annotationForPlugIn(const ZRDPlugIn& plugIn) override {
+        auto found = stored.find(plugIn.annotationKey());
+        return found == stored.end() ? std::nullopt : std::optional(found->second);
+    }
+    std::map<std::string, Dictionary> stored;
+};
+
+struct FakeTypes final : platform::Types {
+    bool conforms(const std::string& type, const std::string& ancestor) override {
+        return type == ancestor || parents.contains({type, ancestor});
+    }
+    std::set<std::pair<std::string, std::string>> parents{{"png", "image"}};
+};
+
+struct FakeConsent final : platform::Consent {
+    std::optional<std::vector<Dictionary>> copyConsentInformation(
+        const platform::LumBundle&) override {
+        return records;
+    }
+    std::optional<std::vector<Dictionary>> records;
+};
+
+struct FakeHost final : HostProcess {
+    pid_t pid() const override { return 7; }
+    const std::shared_ptr<ZRBundle>& bundle() const override { return bundle_; }
+    std::optional<Value> entitlementValueForKey(const std::string& name) const override {
+        const Value* value = entitlements.find(name);
+        return value ? std::optional(*value) : std::nullopt;
+    }
+    bool hasEntitlement(const std::string& name) const override {
+        auto value = entitlementValueForKey(name);
+        return value && !platform::equalsFalse(*value);
+    }
+    std::shared_ptr<ZRBundle> bundle_;
+    Dictionary entitlements;
+};
+
+inline platform::TDApplicationProxyRef makeApplication(const std::string& path,
+                                                       bool isPlaceholder = false) {
+    return std::make_shared<platform::TDApplicationProxy>(
+        platform::TDApplicationProxy{path, "com.host", "Host", isPlaceholder});
+}
+
+/// A good plug-in inside /Apps/Host.app, version 1 unless its attributes say otherwise.
+inline std::shared_ptr<platform::TDPlugInProxy> makeProxy(const std::string& identifier,
+                                                          Dictionary attributes = {},
+                                                          Dictionary plugIn = {}) {
+    if (!attributes.contains("VXExtensionVersion")) attributes.set("VXExtensionVersion", "1");
+    plugIn.set("VXExtensionAttributes", std::move(attributes));
+    auto proxy = std::make_shared<platform::TDPlugInProxy>();
+    proxy->plugInUuid = platform::Uuid::random();
+    proxy->bundlePath = "/Apps/Host.app/PlugIns/" + identifier + ".appex";
+    proxy->plugInIdentifier = proxy->originalIdentifier = identifier;
+    proxy->containingApplication = makeApplication("/Apps/Host.app");
+    proxy->dataContainerPath = "/Containers/" + identifier;
+    proxy->infoPlist = Dictionary{{"VXExtension", std::move(plugIn)}, {"Top", "top"}};
+    return proxy;
+}
+
+/// What records need of the world, and records in it.
+struct FakeWorld {
+    std::shared_ptr<ZRDPlugIn> record(platform::TDPlugInProxyRef proxy) const {
+        return ZRDPlugIn::initWithTDData(std::move(proxy), context);
+    }
+    std::shared_ptr<FakeAnnotations> annotations = std::make_shared<FakeAnnotations>();
+    std::shared_ptr<FakeConsent> consent = std::make_shared<FakeConsent>();
+    std::shared_ptr<PlugInContext> context = std::make_shared<PlugInContext>(PlugInContext{
+        .annotations = annotations, .consent = consent, .types = std::make_shared<FakeTypes>()});
+};
+
+/// A registry in memory. Its query keeps whatever the filter keeps, or fails.
+struct FakeWorkspace final : platform::Workspace {
+    using List = platform::TDPlugInProxyList;
+    using Ref = platform::TDPlugInProxyRef;
+
+    std::unique_ptr<Observation> addObserver(platform::WorkspaceObserver& added) override {
+        observer = &added;
+        return std::make_unique<Observation>();
+    }
+    void activate() override { active = true; }
+    Ref plugInWithUuid(const platform::Uuid& uuid) override {
+        return first([&](const Ref& proxy) { return proxy->plugInUuid == uuid; });
+    }
+    Ref plugInAtPath(const std::string& path) override {
+        return first([&](const Ref& proxy) { return proxy->bundlePath == path; });
+    }
+    platform::TDApplicationProxyRef applicationAtPath(const std::string&) override { return {}; }
+    List plugInsOfApplication(const std::string& path) override {
+        List found;
+        for (const auto& proxy : installed) {
+            const auto& application = proxy->containingApplication;
+            if (application && application->bundlePath == path) found.push_back(proxy);
+        }
+        return found;
+    }
+    List installedPlugIns() override { return installed; }
+    std::optional<List> plugInsMatching(const Dictionary&, const Filter& filter) override {
+        ++queries;
+        if (queryFails) return std::nullopt;
+        List found;
+        for (const auto& proxy : installed) {
+            if (filter(proxy->plugInIdentifier, proxy->entitlements.get())) found.push_back(proxy);
+        }
+        return found;
+    }
+    std::optional<platform::Error> registerPlugIn(const std::string& path) override {
+        return change("add ", path);
+    }
+    std::optional<platform::Error> unregisterPlugIn(const std::string& path) override {
+        return change("remove ", path);
+    }
+    void clearSchemaCaches() override { ++schemaClears; }
+
+    List installed;
+    std::set<std::string> refused;
+    std::vector<std::string> changes;
+    platform::WorkspaceObserver* observer = nullptr;
+    bool active = false, queryFails = false;
+    int queries = 0, schemaClears = 0;
+
+  private:
+    template <class Predicate>
+    Ref first(Predicate matches) const {
+        auto found = std::ranges::find_if(installed, matches);
+        return found == installed.end() ? nullptr : *found;
+    }
+    std::optional<platform::Error> change(const char* verb, const std::string& path) {
+        changes.push_back(verb + path);
+        if (refused.contains(path)) return platform::Error{"test", 1, "refused"};
+        return std::nullopt;
+    }
+};
+
+/// Entitlements that every process has.
+struct FakeCodeSigning final : platform::CodeSigning {
+    struct Task final : platform::CodeSigningTask {
+        explicit Task(const FakeCodeSigning& owner) : owner_(owner) {}
+        Answer entitlement(const std::string& name) override {
+            if (owner_.error) return {std::nullopt, owner_.error};
+            const Value* value = owner_.entitlements.find(name);
+            return {value ? std::optional(*value) : std::nullopt, std::nullopt};
+        }
+        const FakeCodeSigning& owner_;
+    };
+    std::unique_ptr<platform::CodeSigningTask> makeTask(const platform::AuditToken&) override {
+        return std::make_unique<Task>(*this);
+    }
+    Dictionary entitlements;
+    std::optional<platform::Error> error;
+};
+
+struct FakeSandbox final : platform::Sandbox {
+    bool isSandboxed(const platform::AuditToken&) override { return sandboxed; }
+    bool sandboxed = false;
+};
+
+struct FakeNotifications final : platform::Notifications {
+    void post(const std::string& name) override { posted.push_back(name); }
+    std::vector<std::string> posted;
+};
+
+/// A connection from this process; the test delivers its events and reads what was sent.
+struct FakeConnection final : platform::Connection {
+    pid_t pid() const override { return token.pid(); }
+    const platform::AuditToken& auditToken() const override { return token; }
+    void setContext(std::shared_ptr<void> value) override { context = std::move(value); }
+    void setEventHandler(EventHandler value) override { handler = std::move(value); }
+    void resume() override { resumed = true; }
+    void send(const platform::Message& reply) override { sent.push_back(reply); }
+    std::string description() const override { return "fake"; }
+
+    void deliver(const platform::ConnectionEvent& event) {
+        auto current = handler;
+        const auto* error = std::get_if<platform::ConnectionError>(&event);
+        if (error && error->kind == platform::ConnectionError::Kind::Invalid) handler = nullptr;
+        if (current) current(event);
+    }
+
+    platform::AuditToken token = platform::AuditToken::ofSelf().value();
+    std::shared_ptr<void> context;
+    EventHandler handler;
+    bool resumed = false;
+    std::vector<platform::Message> sent;
+};
+
+}  // namespace zorvan

@@ -1,0 +1,250 @@
+#include "zrd/Transaction.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <future>
+
+#include "Zorvan/Keys.h"
+#include "tests/Zorvan/LogLines.h"
+#include "tests/support/TemporaryDirectory.h"
+#include "tests/zrd/Fakes.h"
+#include "zrd/ZRDLumClient.h"
+#include "zrd/ZRDServer.h"
+
+namespace zorvan {
+
+namespace {
+
+using platform::ConnectionError;
+using platform::Message;
+using testing::Contains;
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::IsEmpty;
+
+/// A server over a registry in memory, with one client whose connection is the test's.
+class TransactionTest : public testing::Test {
+  protected:
+    void SetUp() override {
+        services_.directories.runtime = directory_.path("run");
+        services_.directories.stateHome = directory_.path("state");
+        services_.directories.configHome = directory_.path("config");
+        services_.mainLoop = std::make_shared<platform::RunLoop>();
+        services_.workspace = workspace_;
+        services_.codeSigning = codeSigning_;
+        services_.sandbox = sandbox_;
+        server_ = ZRDServer::initForService("zrd", std::nullopt, services_);
+        ASSERT_TRUE(server_);
+        server_->setCacheLimit(100);
+        ZRDLumClient::initWithConnection(connection_, server_);
+        ASSERT_TRUE(connection_->resumed && workspace_->active);
+    }
+    void TearDown() override {
+        deliver(ConnectionError{ConnectionError::Kind::Invalid, "closed"});
+        drain();
+    }
+
+    void deliver(const platform::ConnectionEvent& event) { connection_->deliver(event); }
+    /// Waits for everything that has been submitted.
+    void drain() {
+        std::promise<void> reached;
+        server_->submitWork([&] { reached.set_value(); });
+        reached.get_future().wait();
+    }
+    Dictionary ask(Dictionary contents) {
+        if (!contents.contains("version")) contents.set("version", 3);
+        deliver(Message(std::move(contents)));
+        drain();
+        EXPECT_EQ(connection_->sent.size(), 1u);
+        Dictionary reply = connection_->sent.back().contents();
+        connection_->sent.clear();
+        return reply;
+    }
+    static Dictionary error(int code, const std::string& text) {
+        return {{"errorcode", code}, {"error", text}};
+    }
+    ZRDLumClient& client() { return *static_cast<ZRDLumClient*>(connection_->context.get()); }
+    /// The names in the reply to "match".
+    std::vector<std::string> match(Dictionary contents) {
+        contents.set("request", "match");
+        std::vector<std::string> found;
+        const Dictionary reply = ask(std::move(contents));
+        const Value* matches = reply.find("matches");
+        if (!matches || !matches->packed()) return {"no matches"};
+        for (const Value& form : *matches->packed()->value()->array())
+            found.push_back(*form.dictionary()->find("identifier")->string());
+        return found;
+    }
+
+    ::test::TemporaryDirectory directory_;
+    std::shared_ptr<FakeWorkspace> workspace_ = std::make_shared<FakeWorkspace>();
+    std::shared_ptr<FakeCodeSigning> codeSigning_ = std::make_shared<FakeCodeSigning>();
+    std::shared_ptr<FakeSandbox> sandbox_ = std::make_shared<FakeSandbox>();
+    std::shared_ptr<FakeConnection> connection_ = std::make_shared<FakeConnection>();
+    platform::Services services_;
+    std::shared_ptr<ZRDServer> server_;
+};
+
+TEST_F(TransactionTest, VersionAndTypeAreJudgedInThisOrder) {
+    const Value none = Dictionary();
+    auto version = [](const char* text) { return error(7, text); };
+    EXPECT_EQ(ask({{"version", none}}), version("unsupported protocol version 0 (current 3)"));
+    EXPECT_EQ(ask({{"version", 4}, {"request", "x"}}),
+              version("unsupported protocol version 4 (current 3)"));
+    EXPECT_EQ(ask({{"version", -3}}), version("unsupported protocol version 0 (current 3)"));
+    EXPECT_EQ(ask({{"version", 0x1FFFFFFFFu}}),
+              version("unsupported protocol version -1 (current 3)"));
+    for (Dictionary untyped : {Dictionary(), Dictionary{{"request", 1}}})
+        EXPECT_EQ(ask(untyped), error(4, "invalid request format (missing type)"));
+    EXPECT_EQ(ask({{"request", "Add"}}), error(4, "unrecognized request"));
+    LogLines log;
+    EXPECT_EQ(ask({{"request", "bulk"}, {"version", 2}, {"flags", 0x1000000FFu}}), Dictionary());
+    EXPECT_THAT(log.take(),
+                ElementsAre(HasSubstr("requested bulk"), "ops I: bulk options 0xff not supported"));
+}
+
+TEST_F(TransactionTest, PathsAreWalkedUpToTheFirstFailure) {
+    const std::string real = directory_.makeDirectory("real"), link = directory_.path("link");
+    std::filesystem::create_directory_symlink(real, link);
+    const std::string gone = directory_.path("gone"), refused = directory_.makeDirectory("refused");
+    const std::string odd = directory_.path("odd");  // leads to a name that no reply can carry
+    std::filesystem::create_directory_symlink(directory_.makeDirectory("\xff"), odd);
+    workspace_->refused = {refused, gone};
+    struct Case {
+        const char* type;
+        Value paths;
+        Dictionary reply;
+        std::vector<std::string> changes;
+    };
+    const Dictionary format = error(4, "invalid request format");
+    const Dictionary relative = error(9, "absolute path required: a/b");
+    const Case cases[] = {
+        {"add", "/x", format, {}},
+        {"add", Array{}, {}, {}},
+        {"add", Array{link + "/./", real}, {}, {"add " + real, "add " + real}},
+        {"add", Array{link, 7, real}, format, {"add " + real}},
+        {"add", Array{link, "a/b", real}, relative, {"add " + real}},
+        {"add", Array{""}, error(9, "absolute path required: "), {}},
+        {"add", Array{real, gone}, error(9, "invalid plugin path: " + gone), {"add " + real}},
+        {"add", Array{odd}, error(9, "invalid plugin path: " + odd), {}},
+        {"add",
+         Array{real, refused, link},
+         error(2, "unable to register plug-in at " + refused),
+         {"add " + real, "add " + refused}},
+        {"remove",
+         Array{link, gone, real},
+         error(9, "no plugin at " + gone),
+         {"remove " + real, "remove " + gone}},
+        {"remove", Array{}, {}, {}},
+    };
+    codeSigning_->entitlements = {{entitlement::kManager, true}};
+    for (const auto& [type, paths, reply, changes] : cases) {
+        EXPECT_EQ(ask({{"request", type}, {"paths", paths}}), reply) << describe(paths);
+        EXPECT_EQ(std::exchange(workspace_->changes, {}), changes) << describe(paths);
+    }
+    EXPECT_EQ(ask({{"request", "add"}}), format);
+}
+
+TEST_F(TransactionTest, RemovingNeedsTheManagersEntitlement) {
+    const Dictionary request{{"request", "remove"}, {"paths", Array{"/x"}}};
+    for (Dictionary held : {Dictionary(), Dictionary{{entitlement::kManager, 0}}}) {
+        codeSigning_->entitlements = held;
+        LogLines log;
+        EXPECT_EQ(ask(request), error(11, "caller lacks entitlement for this operation"));
+        EXPECT_THAT(log.take(), Contains(HasSubstr("default -: refused request from pid=")));
+    }
+    codeSigning_->error = platform::Error{"POSIX", 5, "unreadable"};
+    LogLines log;
+    EXPECT_EQ(ask(request), error(11, "caller lacks entitlement for this operation"));
+    EXPECT_THAT(log.take(),
+                Contains(HasSubstr("ops E: error retrieving entitlements for client ")));
+    EXPECT_THAT(workspace_->changes, IsEmpty());
+}
+
+TEST_F(TransactionTest, MatchAnswersForms) {
+    workspace_->installed = {makeProxy("com.a", {{"Color", "red"}}), makeProxy("com.b")};
+    auto versionless = makeProxy("com.c");
+    versionless->infoPlist =
+        Dictionary{{"VXExtension", Dictionary{{"VXExtensionAttributes", Dictionary()}}}};
+    workspace_->installed.push_back(versionless);
+    LogLines log;
+    EXPECT_THAT(match({}), ElementsAre("com.a", "com.b"));
+    auto lines = log.take();
+    EXPECT_THAT(lines, Contains(HasSubstr("ops E: failed to export matching plug-in " +
+                                          versionless->plugInUuid.string())));
+    EXPECT_THAT(lines, Contains("ops I: match returned 2 plug-ins"));
+    EXPECT_THAT(match({{"rules", Dictionary{{"Color", "red"}}}}), ElementsAre("com.a"));
+    EXPECT_THAT(match({{"rules", Dictionary{{"Color", "blue"}}}}), IsEmpty());
+    EXPECT_EQ(ask({{"request", "match"}, {"version", 2}}), Dictionary());
+
+    server_->setAnnotation(Dictionary{{"election", 2}}, *server_->plugInForProxy(versionless));
+    server_->setAnnotation(Dictionary{{"election", 1}},
+                           *server_->plugInForProxy(workspace_->installed[0]));
+    const Value matches = *ask({{"request", "match"}}).find("matches");
+    const Array& forms = *matches.packed()->value()->array();
+    EXPECT_EQ(*forms[0].dictionary()->find("annotations"), Value(Dictionary{{"election", 1}}));
+    EXPECT_EQ(*forms[1].dictionary()->find("annotations"), Value(Dictionary()));
+    workspace_->queryFails = true;
+    EXPECT_THAT(match({{"rules", Dictionary{{"Color", "red"}}}}), IsEmpty());
+}
+
+TEST_F(TransactionTest, BadRulesAndForbiddenFlagsAreRefusedBeforeAnyQuery) {
+    for (Value rules :
+         {Value(Array{}), Value("text"), Value(Dictionary{{"k", platform::Uuid::random()}})}) {
+        EXPECT_EQ(ask({{"request", "match"}, {"rules", rules}}),
+                  error(4, "invalid request format (bad rules dictionary)"));
+    }
+    const Dictionary all{{"request", "match"}, {"flags", 0x200}};
+    const Dictionary refusal = error(11, "unauthorized discovery flag (ZRDiscoverAll)");
+    EXPECT_EQ(ask(all), refusal);
+    codeSigning_->entitlements = {{entitlement::kManager, true}};
+    EXPECT_TRUE(ask(all).contains("matches"));
+    sandbox_->sandboxed = true;
+    EXPECT_EQ(ask(all), refusal);
+    EXPECT_EQ(workspace_->queries, 0);
+}
+
+TEST_F(TransactionTest, QueuedRequestsOfADeadClientAreDropped) {
+    std::promise<void> go;
+    server_->submitWork([blocked = go.get_future().share()] { blocked.wait(); });
+    deliver(Message({{"request", "bulk"}, {"version", 3}}));
+    LogLines log;
+    deliver(ConnectionError{ConnectionError::Kind::TerminationImminent, ""});
+    EXPECT_TRUE(client().acceptWork());
+    deliver(ConnectionError{ConnectionError::Kind::Invalid, ""});
+    go.set_value();
+    drain();
+    EXPECT_THAT(connection_->sent, IsEmpty());
+    const std::string pid = std::to_string(connection_->pid());
+    EXPECT_THAT(log.take(), ElementsAre("ops D: client " + pid + " termination imminent",
+                                        "ops D: client " + pid + " is dead"));
+}
+
+TEST_F(TransactionTest, ClientsCountTheirRequestsAndReportOddEvents) {
+    EXPECT_EQ(client().pid(), getpid());
+    client().setRequestCount(998);
+    LogLines log;
+    for (int i = 0; i < 3; ++i) ask({{"request", "bulk"}});
+    auto lines = log.take();
+    EXPECT_EQ(std::ranges::count(lines, "ops D: client " + std::to_string(getpid()) +
+                                            " used 1000 requests so far"),
+              1);
+    deliver(platform::UnknownObject{"[1, 2]"});
+    deliver(ConnectionError{ConnectionError::Kind::Interrupted, "gone"});
+    EXPECT_THAT(log.take(), ElementsAre(HasSubstr("ops E: unexpected message: [1, 2] from: "),
+                                        HasSubstr("ops E: unexpected error type from lum: ")));
+
+    EXPECT_THAT(client().description(), HasSubstr(" con=fake pid="));
+    auto survivor = std::static_pointer_cast<ZRDLumClient>(connection_->context);
+    deliver(ConnectionError{ConnectionError::Kind::Invalid, ""});
+    connection_ = std::make_shared<FakeConnection>();
+    EXPECT_THAT(survivor->description(), HasSubstr(" NO CONNECTION>"));
+    EXPECT_EQ(survivor->pid(), 0);
+    EXPECT_TRUE(survivor->isSandboxed());
+}
+
+}  // namespace
+
+}  // namespace zorvan

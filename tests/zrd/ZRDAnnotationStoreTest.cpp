@@ -1,0 +1,164 @@
+#include "zrd/ZRDAnnotationStore.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <filesystem>
+
+#include "platform/Directories.h"
+#include "platform/Files.h"
+#include "platform/PropertyList.h"
+#include "tests/Zorvan/LogLines.h"
+#include "tests/support/TemporaryDirectory.h"
+#include "tests/zrd/Fakes.h"
+
+namespace zorvan {
+
+namespace {
+
+using testing::AllOf;
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::IsEmpty;
+using testing::StartsWith;
+
+/// {"version": 16, "data": {"a": {"election": 1}}}
+constexpr std::string_view kBinary(
+    "bplist00"
+    "\xd2\x01\x02\x03\x04"
+    "Tdata"
+    "Wversion"
+    "\xd1\x05\x06"
+    "\x10\x10"
+    "Qa"
+    "\xd1\x07\x08"
+    "Xelection"
+    "\x10\x01"
+    "\x08\x0d\x12\x1a\x1d\x1f\x21\x24\x2d"
+    "\0\0\0\0\0\0\x01\x01\0\0\0\0\0\0\0\x09\0\0\0\0\0\0\0\0\0\0\0\0\0\0\0\x2f",
+    88);
+
+class AnnotationStoreTest : public testing::Test {
+  protected:
+    void open() { store_ = ZRDAnnotationStore::initWithDatabase(path_, {}); }
+    std::string text() const { return *platform::readFile(path_, 1 << 20); }
+    Dictionary root() const { return *platform::readPropertyListFile(path_)->dictionary(); }
+    std::shared_ptr<ZRDPlugIn> plugIn(const char* identifier, Dictionary entitlements = {}) {
+        auto proxy = makeProxy(identifier);
+        proxy->entitlements = std::move(entitlements);
+        return world_.record(proxy);
+    }
+
+    ::test::TemporaryDirectory directory_;
+    const std::string path_ = directory_.path("Annotations");
+    FakeWorld world_;
+    std::unique_ptr<ZRDAnnotationStore> store_;
+};
+
+TEST_F(AnnotationStoreTest, WhatCannotBeLoadedIsReportedOnceAndReplacedByTheFirstChange) {
+    auto xml = [](Dictionary root) { return *platform::writeXmlPropertyList(std::move(root)); };
+    const Dictionary data{{"old", Dictionary{{"election", 1}}}};
+    const std::pair<std::string, const char*> cases[] = {
+        {"garbage", "PropertyList"},
+        {"", "PropertyList"},
+        {xml({{"version", 15}, {"data", data}}), "found database version 15 needed version 16"},
+        {xml({{"data", data}}), "found database version 0 needed version 16"},
+        {xml({{"version", "16"}, {"data", data}}), "found database version 0 needed version 16"},
+        {xml({{"version", 16}, {"data", "none"}}), "data"},
+        {xml({{"version", 16}}), "data"},
+    };
+    for (const auto& [bytes, reason] : cases) {
+        directory_.write("Annotations", bytes);
+        LogLines log;
+        open();
+        EXPECT_THAT(
+            log.take(),
+            ElementsAre(
+                AllOf(StartsWith("ops E: unable to load annotation database:" + path_ + " error:"),
+                      HasSubstr(reason), HasSubstr(" (resetting)"))));
+        EXPECT_THAT(store_->annotations(), IsEmpty());
+        EXPECT_EQ(text(), bytes);
+        store_->setAnnotation(Dictionary{{"election", 2}}, *plugIn("a"));
+        EXPECT_EQ(root(), (Dictionary{{"version", 16},
+                                      {"data", Dictionary{{"a", Dictionary{{"election", 2}}}}}}));
+        EXPECT_THAT(log.take(), IsEmpty());
+    }
+}
+
+TEST_F(AnnotationStoreTest, AMissingFileIsAnEmptyStore) {
+    LogLines log;
+    open();
+    EXPECT_THAT(store_->annotations(), IsEmpty());
+    EXPECT_THAT(log.take(), IsEmpty());
+    EXPECT_FALSE(std::filesystem::exists(path_));
+}
+
+TEST_F(AnnotationStoreTest, ReadsBinaryAndWritesXml) {
+    directory_.write("Annotations", kBinary);
+    open();
+    EXPECT_EQ(*store_->annotationForIdentifier("a"), (Dictionary{{"election", 1}}));
+    store_->setAnnotation(Dictionary(), *plugIn("b"));
+    EXPECT_THAT(text(), StartsWith("<?xml"));
+    open();
+    EXPECT_EQ(store_->annotations(),
+              (Dictionary{{"a", Dictionary{{"election", 1}}}, {"b", Dictionary()}}));
+}
+
+TEST_F(AnnotationStoreTest, ChangesMergeAndNoneRemoves) {
+    open();
+    auto own = plugIn("a"), replacer = plugIn("r", {{"com.orbel.developer.replace-plugin", "a"}});
+    const Dictionary extension{{"k", Array{1, "x"}}};
+    store_->setAnnotation(Dictionary{{"election", 1}}, *own);
+    store_->setAnnotation(Dictionary{{"extension", extension}}, *replacer);
+    store_->setAnnotation(Dictionary{{"election", 2}}, *own);
+    const Dictionary merged{{"election", 2}, {"extension", extension}};
+    open();
+    EXPECT_EQ(*store_->annotationForPlugIn(*own), merged);
+    EXPECT_EQ(*store_->annotationForPlugIn(*replacer), merged);
+    store_->setAnnotation(std::nullopt, *replacer);
+    EXPECT_FALSE(store_->annotationForPlugIn(*own));
+    EXPECT_EQ(*root().find("data"), Value(Dictionary()));
+}
+
+TEST_F(AnnotationStoreTest, AFailedSaveKeepsTheChangeForTheNextOne) {
+    directory_.makeDirectory("Annotations");  // nothing can be written in its place
+    LogLines log;
+    open();
+    log.take();
+    auto a = plugIn("a");
+    store_->setAnnotation(Dictionary{{"election", 1}}, *a);
+    EXPECT_THAT(log.take(),
+                ElementsAre(StartsWith("ops E: unable to save annotations:" + path_ + " error:")));
+    std::filesystem::remove(path_);
+    store_->setAnnotation(Dictionary(), *plugIn("b"));
+    EXPECT_TRUE(root().find("data")->dictionary()->contains("a"));
+}
+
+TEST_F(AnnotationStoreTest, TheDefaultPlaceIsMadePrivateAndItsLackStopsTheDaemon) {
+    platform::Directories directories;
+    directories.stateHome = directory_.path("deep/state");
+    const std::string url = ZRDAnnotationStore::defaultDatabaseURL(directories);
+    EXPECT_EQ(url, directories.stateHome + "/com.orbel.zorvan/Annotations");
+    struct stat status {};
+    ASSERT_EQ(
+        ::stat(platform::joinPath(directories.stateHome, "com.orbel.zorvan").c_str(), &status), 0);
+    EXPECT_EQ(status.st_mode & 07777, 0700u);
+
+    auto inconsistency = [&](std::string stateHome) -> std::string {
+        directories.stateHome = std::move(stateHome);
+        try {
+            return ZRDAnnotationStore::defaultDatabaseURL(directories);
+        } catch (const ZRInternalInconsistency& error) {
+            return error.text();
+        }
+    };
+    EXPECT_THAT(inconsistency(""), HasSubstr("unable to locate user directory: errno "));
+    EXPECT_THAT(inconsistency("/" + std::string(1100, 'x')), HasSubstr("unable to locate"));
+    EXPECT_THAT(inconsistency(directory_.write("file", "")),
+                StartsWith("unable to create plugin annotations directory:"));
+}
+
+}  // namespace
+
+}  // namespace zorvan
