@@ -144,7 +144,7 @@ class ZRPlugInCore {
                                                 const platform::Dictionary& into);
     /// Whether the SDK's value replaces the plug-in's.
     static bool sdkOverridesKey(std::string_view key);
-    /// The union of two lists of resource names.
+    /// The union of two lists of resource names: each name once, and nothing that is not text.
     static platform::Array mergeSharedResources(const platform::Array& sdk,
                                                 const platform::Array& into);
     /// Merges the SDK dictionary of the record's extension point under its Info.plist, which it
@@ -175,6 +175,8 @@ class ZRPlugInCore {
     }
 
   private:
+    std::optional<platform::Value> objectSpec(std::string_view key) const;
+
     std::string identifier_;
     std::optional<std::string> originalIdentifier_;
     std::string path_;

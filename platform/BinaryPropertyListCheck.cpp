@@ -18,9 +18,9 @@ constexpr std::size_t kSharedBytes = 64u << 20;
 
 class Walker {
   public:
-    Walker(std::string_view bytes, std::size_t maxObjects)
+    Walker(std::string_view bytes)
         : bytes_(bytes),
-          objectsLeft_(std::min(maxObjects, bytes.size() + kSharedObjects)),
+          objectsLeft_(std::min(kMaxPropertyListObjects, bytes.size() + kSharedObjects)),
           payloadLeft_(bytes.size() + kSharedBytes) {}
 
     const char* check() {
@@ -145,6 +145,8 @@ class Walker {
         if (!readPayload(at, size, payload) ||
             !fits(payload.start, payload.count, isDictionary ? 2 * refSize_ : refSize_))
             return false;
+        if (isDictionary && payload.count > kMaxPropertyListEntries)
+            return fail("too many entries in a dictionary");
         std::uint64_t references = isDictionary ? 2 * payload.count : payload.count;
         for (std::uint64_t i = 0; i < references; ++i) {
             bool isKey = isDictionary && i < payload.count;
@@ -166,8 +168,8 @@ class Walker {
 
 }  // namespace
 
-const char* problemOfBinaryPropertyList(std::string_view bytes, std::size_t maxObjects) {
-    return Walker(bytes, maxObjects).check();
+const char* problemOfBinaryPropertyList(std::string_view bytes) {
+    return Walker(bytes).check();
 }
 
 }  // namespace platform

@@ -1,6 +1,5 @@
 #pragma once
 
-#include <cstddef>
 #include <string_view>
 
 namespace platform {
@@ -8,10 +7,10 @@ namespace platform {
 /// Says why the bytes of a binary property list must not be handed to a parser, or null when they
 /// may. Every object that the parser would visit is visited: shared objects as often as they are
 /// used, so that neither their number nor the size of their contents can explode. The limits are
-/// `kMaxPropertyListFileDepth` and `maxObjects`.
+/// those of platform/PropertyList.h.
 ///
 /// Objects that a Value cannot express (null, UID, set, integers over 64 bits, strings with a NUL,
 /// keys that are no strings) are refused here as well.
-const char* problemOfBinaryPropertyList(std::string_view bytes, std::size_t maxObjects);
+const char* problemOfBinaryPropertyList(std::string_view bytes);
 
 }  // namespace platform

@@ -23,8 +23,8 @@ namespace platform {
 
 namespace {
 
-constexpr std::string_view kLevelNames[] = {"debug", "info", "default", "error"};
-/// Priorities of syslog, by level.
+constexpr std::string_view kLevelNames[] = {"debug", "info", "default", "error", "off"};
+/// Priorities of syslog, by the level of a message.
 constexpr int kPriorities[] = {7, 6, 5, 3};
 
 std::string environment(const char* name) {

@@ -14,8 +14,8 @@
 namespace platform {
 
 /// Levels of log messages, the most talkative first. A category's level is the first that it
-/// writes; unless told otherwise, `Default`.
-enum class LogLevel { Debug, Info, Default, Error };
+/// writes; unless told otherwise, `Default`. No message has the level `Off`.
+enum class LogLevel { Debug, Info, Default, Error, Off };
 
 /// Anything with a `describe` is an object of a log line: its text is written in its place.
 template <class T>
@@ -101,7 +101,7 @@ auto loggable(const T& argument) {
 /// is the journal; else to standard error with time, category and level. Strings and objects that
 /// are not wrapped in `pub` appear as "<private>" in the journal, unless the environment has
 /// ZR_LOG_PRIVATE=1. The level of a category comes from ZR_LOG: "debug" for all, or a list like
-/// "ops=debug,td=info". Both variables are read once.
+/// "ops=debug,td=info"; "off" writes nothing. Both variables are read once.
 ///
 /// Write through the macros below: they evaluate nothing while the level is off.
 class Log {

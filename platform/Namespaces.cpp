@@ -1,7 +1,6 @@
 #include "platform/Namespaces.h"
 
 #include <fcntl.h>
-#include <poll.h>
 #include <sys/stat.h>
 
 #include <array>
@@ -57,11 +56,6 @@ const std::array<std::optional<NamespaceId>, kKinds.size()>& ownIds() {
 bool sharesNamespace(const AuditToken& token, NamespaceKind kind) {
     const std::optional<NamespaceId> id = readId(token.procDirectory(), kind);
     return id && id == ownIds()[static_cast<std::size_t>(kind)];
-}
-
-bool isGone(const AuditToken& token) {
-    pollfd pidFd{token.pidFd(), POLLIN, 0};
-    return ::poll(&pidFd, 1, 0) != 0;  // readable when it has ended; a failed poll tells nothing
 }
 
 }  // namespace platform

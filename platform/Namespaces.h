@@ -11,7 +11,4 @@ enum class NamespaceKind { User, Mount, Pid };
 /// the process is gone, or guards itself against being looked at. From any thread.
 bool sharesNamespace(const AuditToken& token, NamespaceKind kind);
 
-/// Whether the process has ended.
-bool isGone(const AuditToken& token);
-
 }  // namespace platform

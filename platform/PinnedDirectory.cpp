@@ -56,7 +56,7 @@ Result<PinnedFile> PinnedDirectory::file(const std::string& name) const {
     struct stat status;
     if (!result.descriptor || ::fstat(result.descriptor.get(), &status) != 0)
         return Error::posix(errno, path);
-    if (!S_ISREG(status.st_mode)) return Error::posix(EINVAL, path);
+    if (!S_ISREG(status.st_mode)) return Error{"POSIX", EINVAL, path + ": not a regular file"};
     const FileTrust trust = trustOf(status, user_);
     result.trust = std::min(trust, trust_);
     result.weakest = trust < trust_ ? path : weakest_;

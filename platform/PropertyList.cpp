@@ -4,6 +4,7 @@
 #include <locale.h>
 #include <plist/plist.h>
 
+#include <algorithm>
 #include <bit>
 #include <cmath>
 #include <cstdlib>
@@ -216,72 +217,72 @@ class Reader {
     const char* problem_ = nullptr;
 };
 
-/// Builds libplist's nodes from a value that is a property list.
-class Writer {
-  public:
-    explicit Writer(std::size_t maxObjects) : objectsLeft_(maxObjects) {}
+/// Whether the reader's limits allow the value. Counts keys and values down from `objectsLeft`.
+bool isReadable(const Value& value, std::size_t& objectsLeft) {
+    if (objectsLeft == 0) return false;
+    --objectsLeft;
+    auto isElementReadable = [&objectsLeft](const Value& element) {
+        return isReadable(element, objectsLeft);
+    };
+    if (const Array* array = value.array()) return std::ranges::all_of(*array, isElementReadable);
+    const Dictionary* dictionary = value.dictionary();
+    if (!dictionary) return true;
+    if (dictionary->size() > std::min(kMaxPropertyListEntries, objectsLeft)) return false;
+    objectsLeft -= dictionary->size();
+    return std::ranges::all_of(*dictionary, isElementReadable, &Dictionary::Entry::second);
+}
 
-    /// Null when there are too many objects or no memory.
-    plist_t write(const Value& value) {
-        if (objectsLeft_ == 0) return nullptr;
-        --objectsLeft_;
-        switch (value.kind()) {
-            case Value::Kind::Boolean:
-                return ::plist_new_bool(*value.boolean());
-            case Value::Kind::Integer:
-                return writeInteger(value);
-            case Value::Kind::Real:
-                return ::plist_new_real(*value.real());
-            case Value::Kind::Date: {
-                double seconds = std::floor(value.date()->secondsSince1970) - kReferenceDate;
-                return nodeOfBinary(0x33, 8, std::bit_cast<std::uint64_t>(seconds));
-            }
-            case Value::Kind::Data:
-                return ::plist_new_data(value.data()->bytes().data(), value.data()->bytes().size());
-            case Value::Kind::String:
-                return ::plist_new_string(value.string()->c_str());
-            case Value::Kind::Array:
-                return writeArray(*value.array());
-            case Value::Kind::Dictionary:
-                return writeDictionary(*value.dictionary());
-            case Value::Kind::Uuid:
-            case Value::Kind::Packed:
-                break;
-        }
-        return nullptr;
+plist_t nodeOf(const Value& value);
+
+plist_t nodeOfInteger(const Value& value) {
+    if (auto small = value.signedInteger())
+        return ::plist_new_uint(static_cast<std::uint64_t>(*small));
+    return nodeOfBinary(0x14, 16, *value.unsignedInteger());
+}
+
+plist_t nodeOfDate(Date date) {
+    double seconds = std::floor(date.secondsSince1970) - kReferenceDate;
+    return nodeOfBinary(0x33, 8, std::bit_cast<std::uint64_t>(seconds));
+}
+
+plist_t nodeOfArray(const Array& array) {
+    plist_t node = ::plist_new_array();
+    for (const Value& element : array) ::plist_array_append_item(node, nodeOf(element));
+    return node;
+}
+
+plist_t nodeOfDictionary(const Dictionary& dictionary) {
+    plist_t node = ::plist_new_dict();
+    for (const auto& [key, value] : dictionary)
+        ::plist_dict_set_item(node, key.c_str(), nodeOf(value));
+    return node;
+}
+
+/// libplist's node of a value that is a property list.
+plist_t nodeOf(const Value& value) {
+    switch (value.kind()) {
+        case Value::Kind::Boolean:
+            return ::plist_new_bool(*value.boolean());
+        case Value::Kind::Integer:
+            return nodeOfInteger(value);
+        case Value::Kind::Real:
+            return ::plist_new_real(*value.real());
+        case Value::Kind::Date:
+            return nodeOfDate(*value.date());
+        case Value::Kind::Data:
+            return ::plist_new_data(value.data()->bytes().data(), value.data()->bytes().size());
+        case Value::Kind::String:
+            return ::plist_new_string(value.string()->c_str());
+        case Value::Kind::Array:
+            return nodeOfArray(*value.array());
+        case Value::Kind::Dictionary:
+            return nodeOfDictionary(*value.dictionary());
+        case Value::Kind::Uuid:
+        case Value::Kind::Packed:
+            break;
     }
-
-  private:
-    static plist_t writeInteger(const Value& value) {
-        if (auto small = value.signedInteger())
-            return ::plist_new_uint(static_cast<std::uint64_t>(*small));
-        return nodeOfBinary(0x14, 16, *value.unsignedInteger());
-    }
-
-    plist_t writeArray(const Array& array) {
-        OwnedNode node(::plist_new_array());
-        for (const Value& element : array) {
-            plist_t child = write(element);
-            if (!child) return nullptr;
-            ::plist_array_append_item(node.get(), child);
-        }
-        return node.release();
-    }
-
-    plist_t writeDictionary(const Dictionary& dictionary) {
-        OwnedNode node(::plist_new_dict());
-        for (const auto& [key, value] : dictionary) {
-            if (objectsLeft_ == 0) return nullptr;
-            --objectsLeft_;
-            plist_t child = write(value);
-            if (!child) return nullptr;
-            ::plist_dict_set_item(node.get(), key.c_str(), child);
-        }
-        return node.release();
-    }
-
-    std::size_t objectsLeft_;
-};
+    return nullptr;
+}
 
 }  // namespace
 
@@ -290,8 +291,8 @@ Result<Value> parsePropertyList(std::string_view bytes) {
     if (bytes.empty()) return failure("empty");
     if (bytes.size() > UINT32_MAX) return failure("too large");
     bool isBinary = bytes.starts_with("bplist");
-    const char* problem = isBinary ? problemOfBinaryPropertyList(bytes, kMaxPropertyListObjects)
-                                   : problemOfXmlPropertyList(bytes, kMaxPropertyListObjects);
+    const char* problem =
+        isBinary ? problemOfBinaryPropertyList(bytes) : problemOfXmlPropertyList(bytes);
     if (problem) return failure(problem);
 
     NumbersInC numbers;
@@ -319,8 +320,10 @@ Result<Value> readPropertyListFile(const std::string& path, std::size_t limit) {
 Result<std::string> writeXmlPropertyList(const Value& value) {
     if (!isPropertyList(value)) return Error{"PropertyList", 2, "not a property list"};
     // One of the reader's objects is the element around them all.
-    OwnedNode root(Writer(kMaxPropertyListObjects - 1).write(value));
-    if (!root) return Error{"PropertyList", 3, "too many objects for a property list"};
+    std::size_t objectsLeft = kMaxPropertyListObjects - 1;
+    if (!isReadable(value, objectsLeft))
+        return Error{"PropertyList", 3, "too many objects for a property list"};
+    OwnedNode root(nodeOf(value));
     NumbersInC numbers;
     char* text = nullptr;
     std::uint32_t length = 0;

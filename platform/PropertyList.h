@@ -15,6 +15,8 @@ namespace platform {
 /// binary list may share objects; each use counts).
 inline constexpr int kMaxPropertyListFileDepth = 128;
 inline constexpr std::size_t kMaxPropertyListObjects = 1u << 20;
+/// Most entries of one dictionary: libplist's work grows with the square of their number.
+inline constexpr std::size_t kMaxPropertyListEntries = 1u << 17;
 /// Largest file of `readPropertyListFile` unless the caller says otherwise.
 inline constexpr std::size_t kMaxPropertyListFile = 16u << 20;
 
@@ -27,8 +29,9 @@ Result<Value> parsePropertyList(std::string_view bytes);
 Result<Value> readPropertyListFile(const std::string& path,
                                    std::size_t limit = kMaxPropertyListFile);
 
-/// The XML form of a value. Error: the value is not a property list (`isPropertyList`). What this
-/// writes, `parsePropertyList` reads back equal (dates lose the fraction of their second).
+/// The XML form of a value. Errors: the value is not a property list (`isPropertyList`), or larger
+/// than the limits above. What this writes, `parsePropertyList` reads back equal (dates lose the
+/// fraction of their second).
 Result<std::string> writeXmlPropertyList(const Value& value);
 
 }  // namespace platform

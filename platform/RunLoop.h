@@ -43,9 +43,10 @@ class RunLoop {
 };
 
 /// Waits for events of one file descriptor, which it borrows: the owner keeps it open until the
-/// watch is gone. Each await is for one event; awaiting again replaces nothing and may be done from
-/// inside the callback. A callback may run although a following read or write would block.
-/// Destroying the watch (on the loop's thread) drops its callbacks without running them.
+/// watch is gone, and watches it only once at a time. Each await is for one event; awaiting again
+/// replaces nothing and may be done from inside the callback. A callback may run although a
+/// following read or write would block. Destroying the watch (on the loop's thread) drops its
+/// callbacks without running them.
 class RunLoop::Watch {
   public:
     Watch(RunLoop& loop, int fd);

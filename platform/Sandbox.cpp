@@ -50,13 +50,12 @@ class KernelSandbox : public Sandbox {
   public:
     bool isSandboxed(const AuditToken& token) override {
         // The namespaces come first: a process that shares ours did not build the root that the
-        // last test looks into.
+        // last test looks into. Those of a process that is gone cannot be read.
         for (NamespaceKind kind : {NamespaceKind::User, NamespaceKind::Mount, NamespaceKind::Pid})
             if (!sharesNamespace(token, kind)) return true;
         if (hasSeccompFilter(token.procDirectory()).value_or(true) && !haveSeccompFilter())
             return true;
-        if (mayHaveFlatpakInfo(token.procDirectory())) return true;
-        return isGone(token);
+        return mayHaveFlatpakInfo(token.procDirectory());
     }
 };
 

@@ -8,6 +8,7 @@
 #include "platform/Notifications.h"
 #include "platform/RunLoop.h"
 #include "platform/Sandbox.h"
+#include "platform/SdkDictionaries.h"
 #include "platform/Types.h"
 #include "platform/tandry/Workspace.h"
 
@@ -18,7 +19,8 @@ namespace platform {
 struct Services {
     Directories directories;
     std::shared_ptr<RunLoop> mainLoop;
-    std::shared_ptr<Workspace> workspace;  // null when the registry could not be opened
+    std::shared_ptr<SdkDictionaries> sdks;  // used by the registry, so it goes after it
+    std::shared_ptr<Workspace> workspace;   // null when the registry could not be opened
     std::shared_ptr<CodeSigning> codeSigning;
     std::shared_ptr<Sandbox> sandbox;
     std::shared_ptr<Consent> consent;

@@ -28,7 +28,7 @@ std::unique_ptr<Types> makeMimeTypes(const Directories& directories);
 /// {"items": [{"types": [type, ...]}, ...]}. It is accepted when it has at least one item, every
 /// item has a type that conforms to a listed type, and no listed type has more items than its
 /// count; an item counts for every listed type that one of its types conforms to. Rules and offers
-/// of other shapes are not accepted.
+/// of other shapes are not accepted, nor are negative counts and items of more than 256 types.
 bool evaluateActivationRule(const Value& rule, const Dictionary& offer, Types& types);
 
 }  // namespace platform

@@ -1,5 +1,7 @@
 #include "platform/XmlPropertyListCheck.h"
 
+#include <array>
+
 #include "platform/PropertyList.h"
 
 namespace platform {
@@ -12,8 +14,7 @@ constexpr std::string_view kSpace = " \t\r\n";
 /// parser does: a comment or a quoted ">" that only one of the two honours would hide some.
 class Scanner {
   public:
-    Scanner(std::string_view bytes, std::size_t maxObjects)
-        : rest_(bytes), objectsLeft_(maxObjects) {}
+    explicit Scanner(std::string_view bytes) : rest_(bytes) {}
 
     const char* check() {
         for (;;) {
@@ -68,11 +69,14 @@ class Scanner {
         if (end == std::string_view::npos) return "a malformed tag";
         bool isEmpty = end > 0 && rest_[end - 1] == '/';
         rest_.remove_prefix(end + 1);
+        if (name == "key" && !closes && ++keys_[depth_] > kMaxPropertyListEntries)
+            return "too many entries in a dictionary";
         if (name != "dict" && name != "array") return nullptr;
         if (closes) {
             if (depth_ > 0) --depth_;
-        } else if (!isEmpty && ++depth_ > kMaxPropertyListFileDepth) {
-            return "nested too deep";
+        } else if (!isEmpty) {
+            if (depth_ == kMaxPropertyListFileDepth) return "nested too deep";
+            keys_[++depth_] = 0;
         }
         return nullptr;
     }
@@ -89,8 +93,9 @@ class Scanner {
     }
 
     std::string_view rest_;
-    std::size_t objectsLeft_;
+    std::size_t objectsLeft_ = kMaxPropertyListObjects;
     int depth_ = 0;
+    std::array<std::size_t, kMaxPropertyListFileDepth + 1> keys_{};  // by depth
     bool inElements_ = false;
 };
 
@@ -111,12 +116,12 @@ bool isComplete(std::string_view bytes) {
 
 }  // namespace
 
-const char* problemOfXmlPropertyList(std::string_view bytes, std::size_t maxObjects) {
+const char* problemOfXmlPropertyList(std::string_view bytes) {
     std::size_t start = bytes.find_first_not_of(kSpace);
     if (start == std::string_view::npos || bytes[start] != '<') return "not a property list";
     if (bytes.find('\0') != std::string_view::npos) return "a NUL in its text";
     if (!isComplete(bytes)) return "truncated, or followed by something else";
-    return Scanner(bytes, maxObjects).check();
+    return Scanner(bytes).check();
 }
 
 }  // namespace platform

@@ -7,6 +7,7 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <climits>
 #include <cstdint>
@@ -111,8 +112,9 @@ std::optional<AuditToken> AuditToken::ofPeer(int socket) {
     UniqueFd proc = openProc(peer.pid);
     if (!pidFd || !proc || !isAlive(pidFd.get())) return std::nullopt;
     if (!pinnedByKernel) {
+        // As precisely as ticks tell: a client may well have started just now.
         const auto started = startTicks(proc.get());
-        if (!started || *started >= accepted) return std::nullopt;
+        if (!started || *started > accepted) return std::nullopt;
     }
 
     auto executable = readExecutable(proc.get());

@@ -31,6 +31,7 @@ class ClientConnection {
     /// Called for the connection's error events: no service at the name (Invalid), the daemon went
     /// away (Interrupted). Set before `resume`.
     void setEventHandler(EventHandler handler);
+    /// Connects before it returns; requests before it are answered with an error event.
     void resume();
 
     /// Sends `request` and calls `reply` once: with the reply, or with the error event when the

@@ -9,7 +9,8 @@ inline constexpr std::size_t kMaxRequestPayload = 16u << 20;
 inline constexpr std::size_t kMaxReplyPayload = 256u << 20;
 
 /// A connection's next request is not served while more than this many bytes of its own replies, or
-/// of the replies of all connections together, wait to be read by their hosts.
+/// of the replies of all connections together, wait to be read by their hosts. A reply counts with
+/// its whole length until its last byte is written: that is what its memory costs.
 inline constexpr std::size_t kMaxUnsentPerConnection = 8u << 20;
 inline constexpr std::size_t kMaxUnsentTotal = 256u << 20;
 

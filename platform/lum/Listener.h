@@ -36,6 +36,7 @@ class Listener {
     static Result<std::unique_ptr<Listener>> make(const Directories& directories,
                                                   const std::string& serviceName,
                                                   SerialQueue& queue);
+    /// On the queue, or while its loop does not run. Connections live on.
     ~Listener();
 
     /// Called for each accepted connection, which is not resumed yet. The connection keeps itself

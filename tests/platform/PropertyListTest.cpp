@@ -87,6 +87,10 @@ TEST(PropertyList, OnlyPropertyListsAreWritten) {
     EXPECT_FALSE(writeXmlPropertyList(Uuid()));
     EXPECT_FALSE(writeXmlPropertyList(Array{"\x01"}));
     EXPECT_FALSE(writeXmlPropertyList(Array(std::vector<Value>(kMaxPropertyListObjects, true))));
+    std::vector<Dictionary::Entry> entries;
+    for (std::size_t i = 0; i <= kMaxPropertyListEntries; ++i)
+        entries.emplace_back(std::to_string(i), true);
+    EXPECT_FALSE(writeXmlPropertyList(*Dictionary::fromEntries(std::move(entries))));
 }
 
 TEST(PropertyList, ReadsBinaryScalarsExactly) {
@@ -222,6 +226,9 @@ TEST(PropertyList, RefusesDeepXmlHoweverItIsHidden) {
     EXPECT_FALSE(parsePropertyList(skipped + nested(100'000, "")));
     EXPECT_FALSE(parsePropertyList(
         xml("<array>" + repeated("<true/>", kMaxPropertyListObjects) + "</array>")));
+    // The library would be busy for seconds with so many entries.
+    auto entries = repeated("<key>a</key><true/>", kMaxPropertyListEntries + 1);
+    EXPECT_FALSE(parsePropertyList(xml("<array><dict/><dict>" + entries + "</dict></array>")));
 }
 
 TEST(PropertyList, ErrorsNameTheFile) {

@@ -1,0 +1,91 @@
+#include <unordered_set>
+#include <vector>
+
+#include "Zorvan/Keys.h"
+#include "Zorvan/LogHandles.h"
+#include "Zorvan/ZRPlugInCore.h"
+#include "platform/SdkDictionaries.h"
+
+namespace zorvan {
+
+using platform::Array;
+using platform::Dictionary;
+using platform::Value;
+
+std::optional<Dictionary> ZRPlugInCore::readSDKDictionary(platform::SdkDictionaries& sdks,
+                                                          const std::string& name) {
+    auto sdk = sdks.copyExtensionSdkEntry(name);
+    if (!sdk) EVLOG_DEFAULT(ops(), "plug-in sdk \"{}\" not registered", pub(name));
+    return sdk;
+}
+
+bool ZRPlugInCore::sdkOverridesKey(std::string_view key) {
+    return key == key::kCleanTimeout;
+}
+
+namespace {
+
+/// What becomes of a key that both have: the SDK's value merged with the plug-in's. None where the
+/// plug-in's value stays, which is so wherever the two kinds of value do not merge.
+std::optional<Value> mergedValue(std::string_view key, const Value& sdk, const Value& plugIn) {
+    if (ZRPlugInCore::sdkOverridesKey(key)) return sdk;
+    if (key == key::kShared) {
+        if (!sdk.array() || !plugIn.array()) return std::nullopt;
+        return ZRPlugInCore::mergeSharedResources(*sdk.array(), *plugIn.array());
+    }
+    if (!sdk.dictionary() || !plugIn.dictionary()) return std::nullopt;
+    return ZRPlugInCore::mergeDictionary(*sdk.dictionary(), *plugIn.dictionary());
+}
+
+}  // namespace
+
+Dictionary ZRPlugInCore::mergeDictionary(const Dictionary& sdk, const Dictionary& into) {
+    Dictionary result = into;
+    for (const auto& [key, value] : sdk) {
+        const Value* own = result.find(key);
+        std::optional<Value> merged = own ? mergedValue(key, value, *own) : value;
+        if (merged) result.set(key, *std::move(merged));
+    }
+    return result;
+}
+
+Array ZRPlugInCore::mergeSharedResources(const Array& sdk, const Array& into) {
+    std::vector<Value> names;
+    std::unordered_set<std::string_view> known;
+    for (const Array* list : {&into, &sdk}) {
+        for (const Value& name : *list) {
+            if (name.string() && known.insert(*name.string()).second) names.push_back(name);
+        }
+    }
+    return Array(std::move(names));
+}
+
+void ZRPlugInCore::resolveSDK(platform::SdkDictionaries& sdks) {
+    const Dictionary* infoPlist = bundleInfoDictionary();
+    if (!infoPlist) ZR_INTERNAL_INCONSISTENCY("cannot resolve SDK without materialized Info.plist");
+    if (const Value* name = sdkSpec()) {
+        if (!name->string()) {
+            EVLOG_ERROR(ops(), "invalid SDK key:{}", pub(*name));
+            return;
+        }
+        // Where the merge leaves no plug-in dictionary the record keeps the one that it has.
+        if (auto sdk = readSDKDictionary(sdks, *name->string())) {
+            setDictionaries(mergeDictionary(*sdk, *infoPlist));
+        }
+    }
+    canonicalize();
+}
+
+void ZRPlugInCore::canonicalize() {
+    const Value* own = attributes();
+    Dictionary attributes = own && own->dictionary() ? *own->dictionary() : Dictionary();
+    if (!attributes.contains(key::kExtensionVersion)) {
+        const Value* shortVersion = infoKey(key::kShortVersion);
+        attributes.set(key::kExtensionVersion, shortVersion ? *shortVersion : Value("1"));
+    }
+    Dictionary plugIn = plugInDictionary_.value_or(Dictionary());
+    plugIn.set(key::kAttributes, std::move(attributes));
+    plugInDictionary_ = std::move(plugIn);
+}
+
+}  // namespace zorvan

@@ -1,0 +1,112 @@
+#include "bench/Child.h"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/prctl.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <fstream>
+#include <utility>
+
+#include "bench/Failure.h"
+
+namespace bench {
+
+namespace {
+
+std::vector<char*> pointers(const std::vector<std::string>& texts) {
+    std::vector<char*> result;
+    for (const std::string& text : texts) result.push_back(const_cast<char*>(text.c_str()));
+    result.push_back(nullptr);
+    return result;
+}
+
+/// Runs between fork and exec, where only plain system calls are safe.
+[[noreturn]] void execute(const char* program, char** arguments, char** environment, int log,
+                          pid_t parent) {
+    ::prctl(PR_SET_PDEATHSIG, SIGKILL);
+    // The parent may have died before the signal was asked for.
+    if (::getppid() != parent) ::_exit(127);
+    ::dup2(log, STDERR_FILENO);
+    ::dup2(log, STDOUT_FILENO);
+    ::execve(program, arguments, environment);
+    ::_exit(127);
+}
+
+}  // namespace
+
+Child::Child(const std::string& program, const std::vector<std::string>& arguments,
+             const std::vector<std::string>& environment, const std::string& log) {
+    std::vector<std::string> all{program};
+    all.insert(all.end(), arguments.begin(), arguments.end());
+    const std::vector<char*> argumentPointers = pointers(all);
+    const std::vector<char*> environmentPointers = pointers(environment);
+    platform::UniqueFd logFd(::open(log.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600));
+    if (!logFd) failErrno(log);
+
+    const pid_t parent = ::getpid();
+    pid_ = ::fork();
+    if (pid_ < 0) failErrno("fork");
+    if (pid_ == 0) {
+        execute(program.c_str(), const_cast<char**>(argumentPointers.data()),
+                const_cast<char**>(environmentPointers.data()), logFd.get(), parent);
+    }
+    pidfd_.reset(static_cast<int>(::syscall(SYS_pidfd_open, pid_, 0)));
+}
+
+Child::Child(Child&& other) noexcept
+    : pid_(std::exchange(other.pid_, -1)), pidfd_(std::move(other.pidfd_)) {}
+
+Child::~Child() {
+    stop();
+}
+
+bool Child::running() const {
+    if (pid_ < 0) return false;
+    pollfd descriptor{pidfd_.get(), POLLIN, 0};
+    return ::poll(&descriptor, 1, 0) == 0;
+}
+
+void Child::stop() {
+    if (pid_ < 0) return;
+    ::kill(pid_, SIGTERM);
+    pollfd descriptor{pidfd_.get(), POLLIN, 0};
+    if (::poll(&descriptor, 1, 2000) <= 0) ::kill(pid_, SIGKILL);
+    ::waitpid(pid_, nullptr, 0);
+    pid_ = -1;
+}
+
+double Child::residentMegabytes() const {
+    std::ifstream status(fmt::format("/proc/{}/status", pid_));
+    for (std::string word; status >> word;) {
+        double kibibytes = 0;
+        if (word == "VmRSS:" && status >> kibibytes) return kibibytes * 1024 / 1e6;
+    }
+    fail("the resident memory of process {} cannot be read", pid_);
+}
+
+cpu_set_t allowedCpus() {
+    cpu_set_t cpus;
+    if (::sched_getaffinity(0, sizeof cpus, &cpus) < 0) failErrno("sched_getaffinity");
+    return cpus;
+}
+
+void useCpus(const cpu_set_t& cpus) {
+    if (::sched_setaffinity(0, sizeof cpus, &cpus) < 0) failErrno("sched_setaffinity");
+}
+
+cpu_set_t lastCpuOf(const cpu_set_t& cpus) {
+    cpu_set_t result;
+    CPU_ZERO(&result);
+    for (int cpu = CPU_SETSIZE - 1; cpu >= 0; --cpu) {
+        if (!CPU_ISSET(cpu, &cpus)) continue;
+        CPU_SET(cpu, &result);
+        break;
+    }
+    return result;
+}
+
+}  // namespace bench

@@ -1,0 +1,28 @@
+#pragma once
+
+#include <string>
+#include <vector>
+
+#include "bench/Report.h"
+#include "bench/World.h"
+
+namespace bench {
+
+/// What is measured with, in one way of running.
+struct Run {
+    /// The worlds by size, the smallest first; all but one figure are taken in the largest.
+    const std::vector<World>& worlds;
+    std::string scratch;  // a directory for the echo servers
+    bool quick;
+    Report& report;
+
+    const World& largest() const { return worlds.back(); }
+};
+
+/// How soon a daemon answers after its start, and what it then holds. Leaves full catalogues.
+void measureStarts(const Run& run);
+
+/// How fast running daemons answer.
+void measureReplies(const Run& run);
+
+}  // namespace bench

@@ -1,0 +1,114 @@
+#include "bench/Questions.h"
+
+#include <memory>
+
+#include "Zorvan/Keys.h"
+#include "bench/Failure.h"
+#include "bench/Frames.h"
+#include "bench/World.h"
+#include "platform/Cbor.h"
+
+namespace bench {
+
+namespace {
+
+using platform::Dictionary;
+using platform::Value;
+
+/// Every request has the same serial: only one waits at a time on a connection.
+std::string requestFrame(const Dictionary& body) {
+    constexpr std::uint64_t kRequestKind = 0;
+    constexpr std::uint64_t kSerial = 1;
+    std::string payload;
+    platform::encodeCborArrayHead(3, payload);
+    platform::encodeCborUnsigned(kRequestKind, payload);
+    platform::encodeCborUnsigned(kSerial, payload);
+    platform::encodeCbor(body, payload);
+    return frameOf(payload);
+}
+
+Question question(std::string key, std::string pattern, std::size_t answers) {
+    Dictionary rules{{key, Value(pattern)}};
+    std::string frame = requestFrame({{zorvan::message::kRequest, zorvan::request::kMatch},
+                                      {zorvan::message::kVersion, zorvan::kProtocolVersion},
+                                      {zorvan::message::kRules, rules},
+                                      {zorvan::message::kFlags, 0}});
+    return {std::move(key), std::move(pattern), answers, std::move(rules), std::move(frame)};
+}
+
+Dictionary bodyOf(std::string_view frame) {
+    auto payload = std::make_shared<const std::string>(frame.substr(kFrameHead));
+    const platform::Result<Value> item = platform::decodeCbor(std::move(payload));
+    if (!item) fail("a reply cannot be decoded: {}", item.error().text);
+    const platform::Array* parts = item->array();
+    const Dictionary* body = parts && parts->size() == 3 ? (*parts)[2].dictionary() : nullptr;
+    if (!body) fail("a reply is no message");
+    if (const Value* error = body->find(zorvan::message::kError)) {
+        fail("the daemon answered with an error: {}", describe(*error));
+    }
+    return *body;
+}
+
+const Value* attributeOf(const Value& form, const std::string& key) {
+    const Dictionary* plugIn = form.dictionary();
+    for (const char* step : {zorvan::form::kInfo, zorvan::key::kAttributes}) {
+        const Value* next = plugIn ? plugIn->find(step) : nullptr;
+        plugIn = next ? next->dictionary() : nullptr;
+    }
+    return plugIn ? plugIn->find(key) : nullptr;
+}
+
+/// How many answers a reply holds, and how many of them were asked for.
+struct Count {
+    std::size_t answers = 0;
+    std::size_t right = 0;
+};
+
+Count countAnswers(const Question& question, std::string_view frame) {
+    const Dictionary body = bodyOf(frame);
+    const Value* matches = body.find(zorvan::message::kMatches);
+    if (!matches || !matches->packed()) fail("a reply has no matches");
+    const platform::Result<Value> forms = platform::unpack(*matches->packed());
+    if (!forms || !forms->array()) fail("the matches of a reply are no list");
+    Count count;
+    for (const Value& form : *forms->array()) {
+        ++count.answers;
+        const Value* attribute = attributeOf(form, question.key);
+        if (attribute && *attribute == Value(question.pattern)) ++count.right;
+    }
+    return count;
+}
+
+}  // namespace
+
+Question Question::byPoint(std::size_t answers) {
+    return question(zorvan::key::kExtensionPoint, World::pointOf(answers), answers);
+}
+
+Question Question::byRareAttribute() {
+    return question(World::kRareAttribute, World::kRareValue, 10);
+}
+
+std::string smallRequest() {
+    return requestFrame({{zorvan::message::kRequest, zorvan::request::kBulk},
+                         {zorvan::message::kVersion, zorvan::kProtocolVersion},
+                         {zorvan::message::kFlags, 0}});
+}
+
+void expectSuccess(std::string_view frame) {
+    if (!bodyOf(frame).empty()) fail("a small reply carries data");
+}
+
+bool isAnswered(const Question& question, std::string_view frame) {
+    const Count count = countAnswers(question, frame);
+    return count.answers == question.answers && count.right == question.answers;
+}
+
+void expectAnswered(const Question& question, std::string_view frame) {
+    const Count count = countAnswers(question, frame);
+    if (count.answers == question.answers && count.right == question.answers) return;
+    fail("a match of {} \"{}\" must find {} plug-ins: it found {}, {} of them right", question.key,
+         question.pattern, question.answers, count.answers, count.right);
+}
+
+}  // namespace bench

@@ -1,0 +1,35 @@
+#pragma once
+
+#include <cstddef>
+#include <string>
+#include <string_view>
+
+#include "platform/Value.h"
+
+namespace bench {
+
+/// A match that is asked for, and how many plug-ins must be in its reply.
+struct Question {
+    std::string key;  // the rule's key and pattern: every answer has this attribute
+    std::string pattern;
+    std::size_t answers;
+    platform::Dictionary rules;
+    std::string frame;  // the request
+
+    static Question byPoint(std::size_t answers);
+    static Question byRareAttribute();
+};
+
+/// The request that does nothing ("bulk"), as a frame.
+std::string smallRequest();
+
+/// Whether a reply frame is a success without data. Throws a `Failure` with its text when it is an
+/// error, or no reply.
+void expectSuccess(std::string_view frame);
+
+/// Whether a reply frame holds just the plug-ins that were asked for.
+bool isAnswered(const Question& question, std::string_view frame);
+/// Throws a `Failure` when not.
+void expectAnswered(const Question& question, std::string_view frame);
+
+}  // namespace bench

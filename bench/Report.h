@@ -1,0 +1,58 @@
+#pragma once
+
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace bench {
+
+/// What a figure has to reach.
+struct Target {
+    enum class Kind {
+        None,
+        RatioAtMost,   // times what stands beside it
+        RatioAtLeast,  // the same, for rates
+        ValueAtMost,   // in the figure's own unit
+    };
+    Kind kind = Kind::None;
+    double limit = 0;
+};
+
+/// Something that was measured, with what stands beside it from the same run.
+struct Figure {
+    std::string key;    // without its source: "small/p50"
+    std::string title;  // for people
+    double value = 0;
+    std::string unit = "µs";
+    std::string besideSource = {};  // "echo" or "baseline"
+    std::optional<double> beside = {};
+    Target now = {};   // to reach now
+    Target goal = {};  // where we are going
+
+    std::optional<double> ratio() const;
+    /// None without a target.
+    std::optional<bool> met() const;
+};
+
+/// The figures in the order in which they were measured, in sections (one per way of running).
+class Report {
+  public:
+    /// Begins a section. `suffix` is appended to the keys of its figures.
+    void begin(std::string title, std::string suffix);
+    void add(Figure figure);
+
+    /// Lines "key<TAB>value<TAB>unit".
+    std::string tsv() const;
+    /// A table for people.
+    std::string table() const;
+
+  private:
+    struct Section {
+        std::string title;
+        std::string suffix;
+        std::vector<Figure> figures;
+    };
+    std::vector<Section> sections_;
+};
+
+}  // namespace bench

@@ -1,0 +1,64 @@
+#pragma once
+
+#include <cstddef>
+#include <string>
+#include <vector>
+
+#include "bench/Child.h"
+
+namespace bench {
+
+/// A directory that goes away with the object, with all that is in it.
+class TemporaryDirectory {
+  public:
+    TemporaryDirectory();
+    TemporaryDirectory(const TemporaryDirectory&) = delete;
+    ~TemporaryDirectory();
+    const std::string& path() const { return path_; }
+
+  private:
+    std::string path_;
+};
+
+/// Generated plug-ins in the directories of a user who has nothing else, for a daemon of their own.
+///
+/// Plug-ins lie in applications of ten, each with an Info.plist of about 3 KB. Of N plug-ins, 10
+/// (and 100 and 1 000 where N is at least ten times that) belong to the extension point
+/// `pointOf(10)` and so on, spread evenly; the rest belong to other points. Ten plug-ins of any N
+/// carry the attribute `kRareAttribute`.
+class World {
+  public:
+    static constexpr const char* kRareAttribute = "ExampleSpeciality";
+    static constexpr const char* kRareValue = "rare";
+    static std::string pointOf(std::size_t matches);
+
+    /// Makes the plug-ins in a new directory under `parent`.
+    World(const std::string& parent, std::size_t plugIns);
+
+    std::size_t plugIns() const { return plugIns_; }
+    std::string runtimeDirectory() const { return root_ + "/run"; }
+    std::string socketPath() const;
+    /// Every file that a first scan reads.
+    const std::vector<std::string>& files() const { return files_; }
+
+    Child startDaemon() const;
+    /// Removes all that daemons have made here, but the plug-ins' data containers when
+    /// `keepContainers`, and waits until the file system is done with it.
+    void forget(bool keepContainers) const;
+    /// The end of what the daemons here have logged.
+    std::string logTail() const;
+
+  private:
+    void makeApplication(std::size_t number);
+    void makePlugIn(const std::string& application, std::size_t number);
+    std::string pointOfPlugIn(std::size_t number) const;
+    bool isOneOf(std::size_t matches, std::size_t offset, std::size_t number) const;
+    void writeFile(const std::string& path, const std::string& text, bool isRead);
+    std::string applications() const { return root_ + "/data/zorvan/Applications"; }
+
+    std::string root_;
+    std::size_t plugIns_;
+    std::vector<std::string> files_;
+};
+
+}  // namespace bench

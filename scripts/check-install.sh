@@ -1,0 +1,22 @@
+#!/usr/bin/env bash
+# Installs the release build into a directory of its own and compiles a host against what lies there:
+# every public header, and the library.
+set -euo pipefail
+cd "$(dirname "$0")/.."
+
+root=$(mktemp -d)
+trap 'rm -rf "$root"' EXIT
+cmake --install build/release --prefix "$root" > /dev/null
+
+for file in bin/zrd bin/zrctl bin/zrctl.entitlements; do
+    [ -e "$root/$file" ] || { echo "error: $file was not installed" >&2; exit 1; }
+done
+{
+    (cd "$root/include/zorvan" && find Zorvan platform -name '*.h' | sort | sed 's/.*/#include "&"/')
+    echo 'int main() { return zorvan::ZRErrorWithCode(0).code; }'
+} > "$root/host.cpp"
+library=$(dirname "$(find "$root" -name libzorvan.so)")
+"${CXX:-c++}" -std=c++20 -Wall -Wextra -Werror -I "$root/include/zorvan" "$root/host.cpp" \
+    -L "$library" -Wl,-rpath,"$library" -lzorvan -lfmt -o "$root/host"
+"$root/host"
+"$root/bin/zrctl" --version

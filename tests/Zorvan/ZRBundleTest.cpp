@@ -1,0 +1,65 @@
+#include "Zorvan/ZRBundle.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "platform/PropertyList.h"
+#include "tests/Zorvan/LogLines.h"
+#include "tests/support/TemporaryDirectory.h"
+
+namespace zorvan {
+namespace {
+
+using platform::Dictionary;
+
+class ZRBundleTest : public testing::Test {
+  protected:
+    void writeInfoPlist(const Dictionary& infoPlist) {
+        directory_.write("A.app/Info.plist", *platform::writeXmlPropertyList(infoPlist));
+    }
+
+    test::TemporaryDirectory directory_;
+    std::string path_ = directory_.makeDirectory("A.app");
+};
+
+TEST_F(ZRBundleTest, AnswersForABundleAndForItsExecutable) {
+    writeInfoPlist({{"QFBundleIdentifier", "com.example.a"}, {"QFBundleExecutable", "run"}});
+    std::string executable = directory_.write("A.app/run", "");
+    for (const auto& bundle :
+         {ZRBundle::initWithPath(path_), ZRBundle::initWithExecutablePath(executable)}) {
+        ASSERT_TRUE(bundle);
+        EXPECT_EQ(bundle->path(), path_);
+        EXPECT_EQ(bundle->executablePath(), executable);
+        EXPECT_EQ(bundle->supportPath(), path_);
+        EXPECT_EQ(bundle->plugInsPath(), path_ + "/PlugIns");
+        EXPECT_EQ(bundle->bundleIdentifier(), "com.example.a");
+    }
+    EXPECT_FALSE(ZRBundle::initWithPath("relative"));
+    EXPECT_TRUE(ZRBundle::initForMainBundle());
+}
+
+TEST_F(ZRBundleTest, TakesAnExecutableOutsideBundlesForABundlePath) {
+    std::string bare = directory_.write("bare", "");
+    auto bundle = ZRBundle::initWithExecutablePath(bare);
+    ASSERT_TRUE(bundle);
+    EXPECT_EQ(bundle->path(), bare);
+    EXPECT_EQ(bundle->executablePath(), bare);
+}
+
+TEST_F(ZRBundleTest, ReadsTheInfoPlistAfresh) {
+    LogLines log;
+    auto bundle = ZRBundle::initWithPath(path_);
+    EXPECT_FALSE(bundle->infoDictionary());
+    EXPECT_FALSE(bundle->bundleIdentifier());
+    auto lines = log.take();
+    for (const std::string& line :
+         {"retrieve Info.plist for " + path_ + " through ",
+          "convert Info.plist to dictionary: " + path_ + " source=(null)"})
+        EXPECT_THAT(lines, testing::Contains(testing::StartsWith("ops I: failed to " + line)));
+    writeInfoPlist({{"QFBundleIdentifier", 7}});
+    EXPECT_EQ(bundle->infoDictionary(), (Dictionary{{"QFBundleIdentifier", 7}}));
+    EXPECT_FALSE(bundle->bundleIdentifier());
+}
+
+}  // namespace
+}  // namespace zorvan

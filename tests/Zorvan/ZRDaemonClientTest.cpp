@@ -1,0 +1,185 @@
+#include "Zorvan/ZRDaemonClient.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <future>
+
+#include "Zorvan/Keys.h"
+#include "platform/Directories.h"
+#include "platform/lum/Listener.h"
+#include "tests/Zorvan/LogLines.h"
+#include "tests/support/TemporaryDirectory.h"
+
+namespace zorvan {
+namespace {
+
+using platform::Array;
+using platform::ConnectionError;
+using platform::Dictionary;
+using platform::Message;
+using platform::Uuid;
+using platform::Value;
+using Reply = ZRDaemonClient::Reply;
+
+TEST(ErrorInReply, ReadsCodeAndText) {
+    auto error = [](const Dictionary& contents) {
+        return ZRDaemonClient::errorInReply(Message(contents));
+    };
+    EXPECT_EQ(error({}), std::nullopt);
+    EXPECT_EQ(error({{"errorcode", 0}}), std::nullopt);
+    EXPECT_EQ(error({{"errorcode", "9"}, {"error", 1}}), std::nullopt);
+    EXPECT_EQ(error({{"errorcode", 9}, {"error", "no plugin"}}),
+              (ZRError{"Zorvan", 9, "no plugin"}));
+    EXPECT_EQ(error({{"errorcode", 9}}),
+              (ZRError{"Zorvan", 9, "unknown error returned by Zorvan subsystem"}));
+    EXPECT_EQ(error({{"errorcode", UINT64_MAX}})->code, INT_MAX);
+    EXPECT_THROW(error({{"error", "lost"}}), ZRInternalInconsistency);
+
+    ConnectionError broken{ConnectionError::Kind::Interrupted, "gone"};
+    EXPECT_EQ(ZRDaemonClient::errorInReply(broken), (ZRError{"Zorvan", 4, describe(broken)}));
+}
+
+/// A client, and a service that answers every request with the request itself, under "sent".
+class ClientTest : public testing::Test {
+  protected:
+    ClientTest() {
+        ::setenv("XDG_RUNTIME_DIR", runtime_.path().c_str(), 1);
+        auto listener = platform::Listener::make(platform::Directories::fromEnvironment(),
+                                                 kDefaultServiceName, queue_);
+        listener_ = std::move(*listener);
+        listener_->setEventHandler([](std::shared_ptr<platform::Connection> connection) {
+            std::weak_ptr<platform::Connection> weak = connection;
+            connection->setEventHandler([weak](const platform::ConnectionEvent& event) {
+                const auto* request = std::get_if<Message>(&event);
+                auto peer = weak.lock();
+                if (!request || !peer) return;
+                Message reply = Message::replyTo(*request);
+                reply.set("sent", request->contents());
+                peer->send(reply);
+            });
+            connection->resume();
+        });
+        listener_->resume();
+        client_ = ZRDaemonClient::initWithServiceName(nullptr);
+    }
+
+    ~ClientTest() override {
+        // The listener belongs to its queue's thread.
+        queue_.async([this] { listener_.reset(); });
+    }
+
+    /// What an operation's callback gets; `operation` takes the callback.
+    template <class Operation>
+    Reply replyOf(Operation&& operation) {
+        auto got = std::make_shared<std::promise<Reply>>();
+        auto future = got->get_future();
+        operation([got, this](const Reply& reply) {
+            client_->replyQueue().assertCurrent();
+            got->set_value(reply);
+        });
+        return future.get();
+    }
+
+    /// The request that the service saw, without the keys that all requests have.
+    template <class Operation>
+    Dictionary sent(const char* type, Operation&& operation) {
+        Reply reply = replyOf(std::forward<Operation>(operation));
+        const auto* message = std::get_if<Message>(&reply);
+        if (!message) return {{"lost", describe(std::get<ConnectionError>(reply))}};
+        Dictionary request = *message->find("sent")->dictionary();
+        EXPECT_EQ(*request.find("request"), Value(type));
+        EXPECT_EQ(*request.find("version"), Value(client_->protocolVersion()));
+        request.remove("request");
+        request.remove("version");
+        return request;
+    }
+
+    LogLines log_;
+    test::TemporaryDirectory runtime_;
+    std::unique_ptr<platform::Listener> listener_;
+    platform::SerialQueue queue_{"lum"};
+    std::shared_ptr<ZRDaemonClient> client_;
+};
+
+TEST_F(ClientTest, BuildsEachRequest) {
+    using Callback = ZRDaemonClient::ReplyCallback;
+    ZRDaemonClient& client = *client_;
+    Uuid a = Uuid::random(), b = Uuid::random();
+    Dictionary options{{"key", Array{1, "text", true}}};
+    const Value paths = Array{"/a", "/b"}, uuids = Array{b, a};
+
+    EXPECT_EQ(sent("add",
+                   [&](Callback done) {
+                       client.addPlugIns({"/a", "/b"}, done);
+                   }),
+              (Dictionary{{"paths", paths}}));
+    EXPECT_EQ(sent("remove",
+                   [&](Callback done) {
+                       client.removePlugIns({"/a", "/b"}, done);
+                   }),
+              (Dictionary{{"paths", paths}}));
+    EXPECT_EQ(sent("bulk", [&](Callback done) { client.bulkPlugins(UINT64_MAX, done); }),
+              (Dictionary{{"flags", UINT64_MAX}}));
+    EXPECT_EQ(sent("ready",
+                   [&](Callback done) {
+                       client.readyPlugIns({b, a}, 1, done);
+                   }),
+              (Dictionary{{"flags", 1}, {"uuids", uuids}}));
+    EXPECT_EQ(sent("access", [&](Callback done) { client.accessPlugIns({}, 0, done); }),
+              (Dictionary{{"flags", 0}, {"uuids", Array{}}}));
+    EXPECT_EQ(sent("match", [&](Callback done) { client.matchPlugIns(options, 5, done); }),
+              (Dictionary{{"flags", 5}, {"rules", options}}));
+    EXPECT_EQ(sent("annotate",
+                   [&](Callback done) {
+                       client.setPluginAnnotations({b, a}, options, done);
+                   }),
+              (Dictionary{{"annotations", options}, {"uuids", uuids}}));
+    EXPECT_EQ(sent("bulk-annotate",
+                   [&](Callback done) { client.bulkSetPluginAnnotations(options, done); }),
+              (Dictionary{{"annotations", options}}));
+    EXPECT_EQ(sent("lock",
+                   [&](Callback done) {
+                       client.holdPlugins({"/a", "/b"}, 2, done);
+                   }),
+              (Dictionary{{"flags", 2}, {"paths", paths}}));
+    client.setProtocolVersion(2);
+    EXPECT_EQ(sent("lock", [&](Callback done) { client.releaseHold(a, done); }),
+              (Dictionary{{"uuids", Array{a}}}));
+}
+
+TEST_F(ClientTest, UnpacksPropertyListsInTheCurrentVersionOnly) {
+    const Value list = Array{Dictionary{{"path", "/a"}}};
+    EXPECT_FALSE(ZRDaemonClient::convertToLum(list, 2));
+    Message message = client_->request("match");
+    message.set("matches", *ZRDaemonClient::convertToLum(list, 3));
+    Reply reply = replyOf([&](auto done) { client_->send(message, done); });
+    const Value received = *std::get<Message>(reply).find("sent")->dictionary()->find("matches");
+    EXPECT_EQ(client_->convertFromLum(received), list);
+    EXPECT_EQ(client_->convertFromLum(list), std::nullopt);
+    client_->setProtocolVersion(2);
+    EXPECT_EQ(client_->convertFromLum(received), std::nullopt);
+}
+
+TEST_F(ClientTest, MayBeReleasedInACallback) {
+    std::promise<void> answered;
+    client_->bulkPlugins(0, [client = client_, &answered](const Reply&) { answered.set_value(); });
+    client_.reset();
+    answered.get_future().wait();
+}
+
+TEST_F(ClientTest, AnswersEveryRequestWithAnErrorWithoutAService) {
+    client_ = ZRDaemonClient::initWithServiceName("com.example.unknown");
+    for (int i = 0; i < 2; ++i) {
+        Reply reply = replyOf([&](auto done) { client_->bulkPlugins(0, done); });
+        EXPECT_EQ(ZRDaemonClient::errorInReply(reply)->code, kZRErrorInvalidRequest);
+    }
+    auto lines = log_.take();
+    for (const char* line :
+         {"traffic D: request: ", "traffic D: reply: ", "ops E: Communications error: "})
+        EXPECT_THAT(lines, testing::Contains(testing::StartsWith(line)));
+}
+
+}  // namespace
+}  // namespace zorvan

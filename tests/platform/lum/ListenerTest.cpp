@@ -1,0 +1,378 @@
+#include "platform/lum/Listener.h"
+
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+
+#include <algorithm>
+#include <fstream>
+#include <memory>
+
+#include "tests/platform/lum/LumFixture.h"
+
+namespace platform::lum {
+namespace {
+
+using ::testing::ElementsAre;
+using Kind = ConnectionError::Kind;
+
+/// A listener whose connections write down their events and keep their requests until told to
+/// answer them.
+class ListenerTest : public LumTest {
+  protected:
+    void open() {
+        auto made = Listener::make(directories, "test", queue);
+        ASSERT_TRUE(made) << made.error().text;
+        listener = std::move(*made);
+        listener->setEventHandler([this](std::shared_ptr<Connection> connection) {
+            accepted += 1;
+            auto context = std::make_shared<int>();
+            contexts.push_back(context);
+            connection->setContext(context);
+            // Handlers may hold the context, and what they hold may not leak.
+            connection->setEventHandler(
+                [this, context, weak = std::weak_ptr(connection)](const ConnectionEvent& event) {
+                    handle(weak.lock(), event);
+                });
+            connection->resume();
+        });
+    }
+    void openAndResume() {
+        open();
+        listener->resume();
+    }
+
+    void handle(const std::shared_ptr<Connection>& connection, const ConnectionEvent& event) {
+        if (auto* message = std::get_if<Message>(&event)) {
+            events.push_back("message " + std::to_string(message->serial()));
+            if (replySize > 0) {
+                answer(connection, *message);
+            } else {
+                kept.emplace_back(connection, *message);
+            }
+        } else if (auto* error = std::get_if<ConnectionError>(&event)) {
+            events.push_back(error->kind == Kind::Invalid               ? "invalid"
+                             : error->kind == Kind::TerminationImminent ? "imminent"
+                                                                        : "interrupted");
+        } else {
+            events.push_back("unknown " + describe(std::get<UnknownObject>(event)));
+        }
+    }
+    /// On another thread, as the daemon does.
+    void answer(const std::shared_ptr<Connection>& connection, Message request) {
+        service.async([this, connection, request = std::move(request), size = replySize] {
+            Message reply = Message::replyTo(request);
+            reply.set("data", Data(std::string(size, 'x')));
+            connection->send(reply);
+            answered += 1;
+        });
+    }
+    void answerKept() {
+        for (auto& [connection, request] : kept) answer(connection, std::move(request));
+        kept.clear();
+    }
+    std::optional<Message> ask(RawPeer& peer, std::uint64_t serial) {
+        peer.write(requestFrame(serial));
+        std::optional<Message> reply;
+        stepUntil([&] { return reply || (reply = peer.read()); });
+        return reply;
+    }
+
+    std::size_t replySize = 0;  // 0: keep the requests
+    std::size_t accepted = 0;
+    std::atomic<std::size_t> answered = 0;
+    std::vector<std::string> events;
+    std::vector<std::weak_ptr<int>> contexts;
+    std::vector<std::pair<std::shared_ptr<Connection>, Message>> kept;
+    std::unique_ptr<Listener> listener;
+    SerialQueue service{"service"};
+};
+
+TEST_F(ListenerTest, OwnsItsNamePrivately) {
+    const mode_t before = umask(0);
+    open();
+    umask(before);
+    struct stat status {};
+    ASSERT_EQ(stat(path().c_str(), &status), 0);
+    EXPECT_EQ(status.st_mode & 07777, 0600u);
+    for (auto directory : {"/zorvan", "/zorvan/services"}) {
+        ASSERT_EQ(stat((directories.runtime + directory).c_str(), &status), 0);
+        EXPECT_EQ(status.st_mode & 07777, 0700u);
+    }
+    auto second = Listener::make(directories, "test", queue);
+    ASSERT_FALSE(second);
+    EXPECT_EQ(second.error().code, EADDRINUSE);
+    EXPECT_TRUE(Listener::make(directories, "other", queue));
+
+    // The first goes on undisturbed.
+    replySize = 1;
+    RawPeer early(path());
+    loop.poll();
+    EXPECT_EQ(accepted, 0u) << "nothing is accepted before resume";
+    listener->resume();
+    EXPECT_TRUE(ask(early, 1));
+
+    listener.reset();
+    EXPECT_FALSE(std::filesystem::exists(path()));
+    open();
+}
+
+TEST_F(ListenerTest, ReplacesOnlyStaleSockets) {
+    { open(); }
+    listener.reset();
+    UniqueFd stale = unixSocket(path(), ::bind);
+    ASSERT_TRUE(stale);
+    replySize = 1;
+    openAndResume();
+    RawPeer peer(path());
+    EXPECT_TRUE(ask(peer, 1));
+    listener.reset();
+
+    std::ofstream(path()) << "somebody's file";
+    EXPECT_FALSE(Listener::make(directories, "test", queue));
+    EXPECT_TRUE(std::filesystem::exists(path()));
+
+    std::filesystem::rename(directories.runtime + "/zorvan/services", directories.runtime + "/x");
+    std::filesystem::create_directory_symlink("../x", directories.runtime + "/zorvan/services");
+    EXPECT_FALSE(Listener::make(directories, "other", queue));
+}
+
+TEST_F(ListenerTest, RefusesNamesThatAreNoSocketNames) {
+    for (const std::string& name : {std::string(), std::string("a/b"), std::string(".hidden"),
+                                    std::string("a\0b", 3), std::string(108, 'n')})
+        EXPECT_FALSE(Listener::make(directories, name, queue)) << name;
+}
+
+using PassedSocketTest = LumTest;  // without another thread, for the fork
+
+TEST_F(PassedSocketTest, IsTakenOver) {
+    UniqueFd byName = unixSocket(directories.runtime + "/by-name", ::bind);
+    ASSERT_EQ(listen(byName.get(), 5), 0);
+    // In a process of its own: passed descriptors have fixed numbers.
+    EXPECT_EXIT(
+        {
+            dup2(byName.get(), 3);
+            setenv("LISTEN_PID", std::to_string(getpid()).c_str(), 1);
+            setenv("LISTEN_FDS", "1", 1);
+            setenv("LISTEN_FDNAMES", "test", 1);
+            RunLoop ownLoop;
+            SerialQueue ownQueue("lum", ownLoop);
+            int clients = 0;
+            auto taken = Listener::make(directories, "test", ownQueue);
+            if (!taken || Listener::make(directories, "test", ownQueue)) _exit(1);
+            (*taken)->setEventHandler([&](std::shared_ptr<Connection>) { clients += 1; });
+            (*taken)->resume();
+            RawPeer peer(directories.runtime + "/by-name");
+            while (clients == 0) ownLoop.runOnce(std::chrono::milliseconds(100));
+            _exit(getenv("LISTEN_FDS") || std::filesystem::exists(path()) ? 2 : 0);
+        },
+        ::testing::ExitedWithCode(0), "");
+}
+
+TEST_F(ListenerTest, LetsNoOtherUserIn) {
+    if (geteuid() != 0) GTEST_SKIP() << "only root can be somebody else";
+    openAndResume();
+    std::filesystem::permissions(directories.runtime, std::filesystem::perms::all);
+    std::filesystem::permissions(directories.zorvanRuntime(), std::filesystem::perms::all);
+    std::filesystem::permissions(directories.zorvanRuntime() + "/services",
+                                 std::filesystem::perms::all);
+    std::filesystem::permissions(path(), std::filesystem::perms::all);
+    const pid_t child = fork();
+    if (child == 0) {
+        char byte;
+        if (setuid(65534) != 0) _exit(1);
+        RawPeer peer(path());
+        _exit(peer.fd() >= 0 && ::recv(peer.fd(), &byte, 1, 0) == 0 ? 0 : 2);
+    }
+    int status = -1;
+    EXPECT_TRUE(stepUntil([&] { return waitpid(child, &status, WNOHANG) == child; }));
+    EXPECT_EQ(status, 0);
+    EXPECT_EQ(accepted, 0u);
+    EXPECT_EQ(errorLines("is not let in"), 1u);
+}
+
+TEST_F(ListenerTest, AMalformedFrameEndsItsConnectionAlone) {
+    replySize = 1;
+    openAndResume();
+    RawPeer bystander(path());
+    ASSERT_TRUE(ask(bystander, 1));
+    const std::string head("\x00\x00\x00", 3);
+    struct Case {
+        std::string bytes;
+        const char* reason;
+        bool closes;
+    };
+    const std::string deep(130, '\x81');
+    for (const auto& [bytes, reason, closes] : {
+             Case{std::string("\x01\x00\x00\x01", 4), "over the limit", false},
+             Case{"GET / HTTP/1.0\r\n\r\n", "over the limit", false},
+             Case{head + std::string("\x00", 1), "", false},
+             Case{head + "\x04" + std::string("\x83\x00\x01\xf6", 4), "", false},
+             Case{head + "\x0a" + std::string("\x83\x00\x01\xa2\x61k\x01\x61k\x02", 10), "", false},
+             Case{head + "\x07" + std::string("\x83\x00\x01\xa1\x61\xff\x01", 7), "", false},
+             Case{head + "\x84\x83" + std::string("\0\1", 2) + deep.substr(1) + "\xa0", "", false},
+             Case{requestFrame(1).substr(0, 6), "middle of a frame", true},
+             Case{head, "middle of a frame", true},
+         }) {
+        const std::size_t lines = errorLines();
+        events.clear();
+        RawPeer peer(path());
+        peer.write(bytes);
+        if (closes) peer.close();
+        EXPECT_TRUE(stepUntil([&] { return events.size() == 1; })) << reason;
+        EXPECT_THAT(events, ElementsAre("invalid"));
+        EXPECT_EQ(errorLines(), lines + 1);
+        EXPECT_GE(errorLines(reason), 1u) << reason;
+        EXPECT_TRUE(closes || peer.hasEnded());
+    }
+    EXPECT_TRUE(ask(bystander, 2));
+}
+
+TEST_F(ListenerTest, UnknownObjectsAreEventsAndNothingMore) {
+    replySize = 1;
+    openAndResume();
+    RawPeer peer(path());
+    peer.write(*encodeFrame(FrameKind::Reply, Message(), 100));
+    EXPECT_TRUE(ask(peer, 7));
+    ASSERT_EQ(events.size(), 2u);
+    EXPECT_TRUE(events[0].starts_with("unknown ")) << events[0];
+    EXPECT_EQ(events[1], "message 7");
+    EXPECT_EQ(errorLines(), 0u);
+}
+
+TEST_F(ListenerTest, DeliversOneRequestAtATimeAndAnswersInOrder) {
+    openAndResume();
+    RawPeer peer(path());
+    std::string requests;
+    constexpr std::uint64_t kCount = 3000;  // more than wait cut, in less than one read
+    for (std::uint64_t serial = 1; serial <= kCount; ++serial) requests += requestFrame(serial);
+    ASSERT_EQ(peer.write(requests), requests.size());
+    ASSERT_TRUE(stepUntil([&] { return !events.empty(); }));
+    loop.poll();
+    EXPECT_THAT(events, ElementsAre("message 1"));
+
+    replySize = 1;
+    answerKept();
+    std::vector<std::uint64_t> serials;
+    EXPECT_TRUE(stepUntil([&] {
+        while (auto reply = peer.read()) serials.push_back(reply->serial());
+        return serials.size() == kCount;
+    }));
+    EXPECT_TRUE(std::is_sorted(serials.begin(), serials.end()));
+    EXPECT_EQ(events.size(), kCount);
+}
+
+TEST_F(ListenerTest, AHalfClosedPeerStillGetsItsReplies) {
+    openAndResume();
+    RawPeer peer(path());
+    peer.write(requestFrame(1) + requestFrame(2));
+    peer.halfClose();
+    ASSERT_TRUE(stepUntil([&] { return kept.size() == 1; }));
+    loop.poll();
+    EXPECT_THAT(events, ElementsAre("message 1")) << "the end never overtakes a message";
+    replySize = 1;
+    answerKept();
+    std::size_t replies = 0;
+    EXPECT_TRUE(stepUntil([&] { return (replies += peer.read() ? 1 : 0) == 2; }));
+    EXPECT_TRUE(stepUntil([&] { return events.size() == 3; }));
+    peer.close();
+    EXPECT_TRUE(stepUntil([&] { return events.size() == 4; }));
+    EXPECT_THAT(events, ElementsAre("message 1", "message 2", "imminent", "invalid"));
+    EXPECT_TRUE(stepUntil([&] { return contexts[0].expired(); }));
+}
+
+TEST_F(ListenerTest, ADeadPeersWaitingRequestsAreDropped) {
+    openAndResume();
+    RawPeer peer(path());
+    // More than are read: the hang-up is noticed all the same.
+    std::string requests;
+    for (std::uint64_t serial = 1; serial <= 80; ++serial) requests += requestFrame(serial);
+    peer.write(requests);
+    ASSERT_TRUE(stepUntil([&] { return kept.size() == 1; }));
+    peer.close();
+    ASSERT_TRUE(stepUntil([&] { return events.size() == 2; }));
+    EXPECT_FALSE(contexts[0].expired()) << "somebody still has the connection";
+    replySize = 1;
+    answerKept();
+    EXPECT_TRUE(stepUntil([&] { return contexts[0].expired(); }));
+    EXPECT_THAT(events, ElementsAre("message 1", "invalid"));
+    EXPECT_EQ(errorLines(), 0u);
+}
+
+TEST_F(ListenerTest, WhoNeverReadsIsNotServedOnAndHoldsUpNobody) {
+    replySize = 1 << 20;
+    openAndResume();
+    RawPeer greedy(path());
+    std::size_t written = 0;
+    std::string requests;
+    for (std::uint64_t serial = 1; serial <= 100; ++serial)
+        requests += requestFrame(serial, {{"ballast", std::string(500'000, 'b')}});
+    // Until its requests wait in the connection and, behind that, in the socket.
+    std::size_t idle = 0;
+    EXPECT_TRUE(stepUntil([&] {
+        const std::size_t count = greedy.write(std::string_view(requests).substr(written));
+        written += count;
+        idle = count == 0 && loop.poll() == 0 && answered == events.size() ? idle + 1 : 0;
+        return idle > 10;
+    }));
+    EXPECT_LT(written, requests.size() * 3 / 4);
+    EXPECT_GE(events.size(), 8u);
+    EXPECT_LE(events.size(), 11u);
+
+    const std::size_t before = events.size();
+    RawPeer other(path());
+    for (std::uint64_t serial = 1; serial <= 20; ++serial) EXPECT_TRUE(ask(other, serial));
+    EXPECT_EQ(events.size(), before + 20);
+
+    // Once it reads, everything goes on, in order.
+    std::vector<std::uint64_t> serials;
+    EXPECT_TRUE(stepUntil([&] {
+        while (auto reply = greedy.read()) serials.push_back(reply->serial());
+        written += greedy.write(std::string_view(requests).substr(written));
+        return serials.size() == 100;
+    }));
+    EXPECT_TRUE(std::is_sorted(serials.begin(), serials.end()));
+}
+
+TEST_F(ListenerTest, ServesBesideTwoHundredIdleClients) {
+    replySize = 1;
+    openAndResume();
+    std::vector<UniqueFd> idle;
+    for (int i = 0; i < 200; ++i) idle.push_back(unixSocket(path(), ::connect));
+    RawPeer peer(path());
+    EXPECT_TRUE(ask(peer, 1));
+    EXPECT_EQ(accepted, 201u);
+    idle.clear();
+    EXPECT_TRUE(stepUntil([&] { return events.size() == 201; }));
+}
+
+TEST_F(ListenerTest, WaitsForDescriptors) {
+    replySize = 1;
+    openAndResume();
+    loop.poll();
+    std::vector<std::unique_ptr<RawPeer>> peers;
+    for (int i = 0; i < 3; ++i) peers.push_back(std::make_unique<RawPeer>(path()));
+    // Room for one more descriptor, then for one client and a half.
+    rlimit before{};
+    getrlimit(RLIMIT_NOFILE, &before);
+    UniqueFd next(::open("/dev/null", O_RDONLY | O_CLOEXEC));
+    const auto lowest = static_cast<rlim_t>(next.get());
+    next.reset();
+    for (rlim_t room : {1, 5}) {
+        rlimit low{lowest + room, before.rlim_max};
+        setrlimit(RLIMIT_NOFILE, &low);
+        loop.runOnce(std::chrono::milliseconds(1000));
+        loop.runOnce(std::chrono::milliseconds(1000));
+    }
+    EXPECT_LT(accepted, 3u);
+    setrlimit(RLIMIT_NOFILE, &before);
+    for (auto& peer : peers) EXPECT_TRUE(ask(*peer, 1));
+    EXPECT_EQ(accepted, 3u);
+    EXPECT_GE(errorLines("cannot accept"), 1u);
+    EXPECT_LE(errorLines(), 2u);
+}
+
+}  // namespace
+}  // namespace platform::lum

@@ -1,0 +1,48 @@
+#include "tools/zrctl/RegistrationCommands.h"
+
+#include <fmt/core.h>
+
+#include <filesystem>
+#include <vector>
+
+#include "platform/Files.h"
+#include "platform/Utf8.h"
+#include "tools/zrctl/Session.h"
+
+using platform::Error;
+using platform::Result;
+
+namespace zrctl {
+
+Result<std::string> absolutePath(const std::string& path, std::string_view directory) {
+    std::string absolute = path.starts_with('/') ? path : platform::joinPath(directory, path);
+    if (path.empty()) return Error{"zrctl", 0, "a path is empty"};
+    if (!platform::isValidUtf8(absolute))
+        return Error{"zrctl", 0, fmt::format("{}: the path is not UTF-8 text", absolute)};
+    return absolute;
+}
+
+Outcome runRegistration(const Options& options) {
+    std::error_code noDirectory;
+    const std::string directory = std::filesystem::current_path(noDirectory).string();
+    if (noDirectory)
+        return Outcome::failure(
+            fmt::format("cannot tell the current directory: {}", noDirectory.message()));
+    std::vector<std::string> paths;
+    for (const std::string& path : options.paths) {
+        const Result<std::string> absolute = absolutePath(path, directory);
+        if (!absolute) return Outcome::usage(absolute.error().text);
+        paths.push_back(*absolute);
+    }
+
+    Session session(options.service);
+    const auto reply = session.ask([&](auto& client, const auto& callback) {
+        if (options.command == Options::Command::Add)
+            client.addPlugIns(paths, callback);
+        else
+            client.removePlugIns(paths, callback);
+    });
+    return reply ? Outcome{} : Outcome::failure(reply.error().text);
+}
+
+}  // namespace zrctl

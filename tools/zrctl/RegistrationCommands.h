@@ -1,0 +1,20 @@
+#pragma once
+
+#include <string>
+#include <string_view>
+
+#include "platform/Error.h"
+#include "tools/zrctl/Options.h"
+#include "tools/zrctl/Outcome.h"
+
+namespace zrctl {
+
+/// `zrctl add` and `zrctl remove`: registers or unregisters bundles by path, in order, up to the
+/// first that the daemon refuses; those before it stay done.
+Outcome runRegistration(const Options& options);
+
+/// A path from the command line as the daemon takes it: absolute, a relative one within
+/// `directory`; nothing is resolved. Error: it could not be sent (it is empty, or no UTF-8).
+platform::Result<std::string> absolutePath(const std::string& path, std::string_view directory);
+
+}  // namespace zrctl

@@ -1,0 +1,39 @@
+#include "tools/zrctl/Session.h"
+
+#include <future>
+
+using platform::ConnectionError;
+using platform::Error;
+using zorvan::ZRDaemonClient;
+
+namespace zrctl {
+
+namespace {
+
+Error whyNoAnswer(const ConnectionError& error) {
+    if (error.kind == ConnectionError::Kind::Interrupted)
+        return {"zrctl", 0, "zrd ended the connection: " + error.text};
+    // The text names the socket, or says what is wrong with the service's name or the request.
+    const bool noService = error.text.starts_with("no service at ");
+    return {"zrctl", 0, noService ? "zrd is not running: " + error.text : error.text};
+}
+
+}  // namespace
+
+Session::Session(const std::string& service)
+    : client_(ZRDaemonClient::initWithServiceName(service.c_str())) {}
+
+platform::Result<platform::Message> Session::ask(const Question& question) {
+    // Shared with the callback: the reply queue may still be leaving it when this returns.
+    auto promise = std::make_shared<std::promise<ZRDaemonClient::Reply>>();
+    question(*client_,
+             [promise](const ZRDaemonClient::Reply& reply) { promise->set_value(reply); });
+    const ZRDaemonClient::Reply reply = promise->get_future().get();
+
+    if (const auto* broken = std::get_if<ConnectionError>(&reply)) return whyNoAnswer(*broken);
+    if (const auto refused = ZRDaemonClient::errorInReply(reply))
+        return Error{refused->domain, refused->code, describe(*refused)};
+    return std::get<platform::Message>(reply);
+}
+
+}  // namespace zrctl

@@ -1,0 +1,74 @@
+// The request "match".
+
+#include "Zorvan/Keys.h"
+#include "Zorvan/LogHandles.h"
+#include "Zorvan/ZRDaemonClient.h"
+#include "zrd/CandidateGates.h"
+#include "zrd/MatchResult.h"
+#include "zrd/Probes.h"
+#include "zrd/Transaction.h"
+#include "zrd/ZRDLumClient.h"
+#include "zrd/ZRDPlugIn.h"
+#include "zrd/ZRDServer.h"
+
+namespace zorvan {
+
+using platform::Dictionary;
+using platform::Value;
+
+namespace {
+
+/// The dictionaries of a stored exclusions value; anything else in it excludes nothing.
+std::vector<Dictionary> exclusionRules(const std::optional<Value>& stored) {
+    std::vector<Dictionary> rules;
+    if (!stored || !stored->array()) return rules;
+    for (const Value& element : *stored->array()) {
+        if (element.dictionary()) rules.push_back(*element.dictionary());
+    }
+    return rules;
+}
+
+}  // namespace
+
+void Transaction::matchPlugIns() {
+    const Value* rules = request_.find(message::kRules);
+    if (rules && (!rules->dictionary() || !platform::isPropertyList(*rules))) {
+        return fail(kZRErrorInvalidRequest, "invalid request format (bad rules dictionary)");
+    }
+    CandidateQuery query;
+    query.rules = rules ? rules->dictionary() : nullptr;
+    query.flags = unsignedUnder(message::kFlags);
+    if ((query.flags & ZRDiscoverAll) &&
+        (!client_->hasEntitlement(entitlement::kManager) || client_->isSandboxed())) {
+        return fail(kZRErrorDenied, "unauthorized discovery flag (ZRDiscoverAll)");
+    }
+    query.exclusions = exclusionRules(server().userPrefs().exclusions());
+    query.host = client_.get();
+    if (client_->bundle()) query.hostPlugInsPath = client_->bundle()->plugInsPath();
+
+    auto candidates = server().findPlugIns(query.rules).value_or(ZRDPlugInList());
+    probes::discoverRaw(static_cast<unsigned int>(candidates.size()));
+    MatchResult result(query.flags);
+    for (const auto& plugIn : candidates) {
+        if (firstClosedGate(*plugIn, query)) continue;
+        std::optional<ZRError> error;
+        auto form = plugIn->form(error);
+        if (error) {
+            EVLOG_ERROR(ops(), "failed to export matching plug-in {}: {}", pub(plugIn->uuid()),
+                        pub(*error));
+        }
+        if (!form || !result.admit(*plugIn)) continue;
+        addAnnotationForPlugIn(*plugIn, *form);
+        result.append(*plugIn, *std::move(form));
+    }
+    result.linkOverrides();
+    EVLOG_INFO(ops(), "match returned {} plug-ins", result.size());
+    if (auto matches =
+            ZRDaemonClient::convertToLum(result.forms(), static_cast<std::int64_t>(version()))) {
+        reply_.set(message::kMatches, *std::move(matches));
+    }
+    EVLOG_DEBUG(ops(), "reply marshalled");
+    done();
+}
+
+}  // namespace zorvan

@@ -1,0 +1,154 @@
+#include "zrd/Transaction.h"
+
+#include <fmt/format.h>
+
+#include "Zorvan/Keys.h"
+#include "Zorvan/LogHandles.h"
+#include "platform/Files.h"
+#include "platform/Value.h"
+#include "zrd/Probes.h"
+#include "zrd/ZRDLumClient.h"
+#include "zrd/ZRDPlugIn.h"
+#include "zrd/ZRDServer.h"
+
+namespace zorvan {
+
+using platform::Array;
+using platform::Dictionary;
+using platform::Value;
+
+namespace {
+
+/// A resolved path of this many bytes or more counts as not resolved.
+constexpr std::size_t kMaxResolvedPath = 1024;
+
+}  // namespace
+
+Transaction::Transaction(platform::Message request, std::shared_ptr<ZRDLumClient> client)
+    : client_(std::move(client)),
+      request_(std::move(request)),
+      reply_(platform::Message::replyTo(request_)) {}
+
+ZRDServer& Transaction::server() const {
+    return *client_->server();
+}
+
+std::uint64_t Transaction::unsignedUnder(const char* key) const {
+    const Value* value = request_.find(key);
+    return value ? value->unsignedInteger().value_or(0) : 0;
+}
+
+void Transaction::dispatch() {
+    struct Entry {
+        const char* type;
+        void (Transaction::*handler)();
+    };
+    static constexpr Entry kHandlers[] = {
+        {request::kAdd, &Transaction::addPlugIns},
+        {request::kRemove, &Transaction::removePlugIns},
+        {request::kBulk, &Transaction::bulkPlugIns},
+        {request::kMatch, &Transaction::matchPlugIns},
+    };
+    server().mainQueue().assertCurrent();
+
+    const Value* typeValue = request_.find(message::kRequest);
+    const std::string* type = typeValue ? typeValue->string() : nullptr;
+    version_ = unsignedUnder(message::kVersion);
+    if (version_ != kProtocolVersion && version_ != kProtocolVersionWithoutForms) {
+        return fail(kZRErrorVersion,
+                    fmt::format("unsupported protocol version {} (current {})",
+                                static_cast<std::int32_t>(version_.load()), kProtocolVersion));
+    }
+    if (!client_->acceptWork()) return;
+
+    const char* typeText = type ? type->c_str() : nullptr;
+    EVLOG_DEBUG(ops(), "client {} requested {}", client_->pid(), pub(typeText));
+    probes::request(client_->pid(), typeText);
+    if (!type) return fail(kZRErrorInvalidRequest, "invalid request format (missing type)");
+    for (const auto& [name, handler] : kHandlers) {
+        if (*type == name) return (this->*handler)();
+    }
+    fail(kZRErrorInvalidRequest, "unrecognized request");
+}
+
+bool Transaction::marshalPaths(
+    const std::function<Walk(const std::string& path, bool resolved)>& callback) {
+    const Value* paths = request_.find(message::kPaths);
+    if (!paths || !paths->array()) {
+        fail(kZRErrorInvalidRequest, "invalid request format");
+        return false;
+    }
+    for (const Value& element : *paths->array()) {
+        const std::string* path = element.string();
+        if (!path) {
+            fail(kZRErrorInvalidRequest, "invalid request format");
+            return false;
+        }
+        if (!path->starts_with('/')) {
+            fail(kZRErrorPath, fmt::format("absolute path required: {}", *path));
+            return false;
+        }
+        auto resolved = platform::canonicalPath(*path, kMaxResolvedPath);
+        if (callback(resolved ? *resolved : *path, resolved.has_value()) == Walk::Stop)
+            return false;
+    }
+    return true;
+}
+
+bool Transaction::processPaths(
+    const std::function<Walk(const std::string& path, bool resolved)>& callback) {
+    bool completed = marshalPaths(callback);
+    if (completed) done();
+    return completed;
+}
+
+bool Transaction::processUuidList(
+    const std::function<Walk(const std::shared_ptr<ZRDPlugIn>&)>& callback) {
+    const Value* uuids = request_.find(message::kUuids);
+    if (!uuids || !uuids->array()) {
+        fail(kZRErrorInvalidRequest, "invalid request format (uuid)");
+        return false;
+    }
+    for (const Value& element : *uuids->array()) {
+        auto uuid = element.uuid();
+        if (!uuid) {
+            fail(kZRErrorInvalidRequest, "invalid request (bad uuid array)");
+            return false;
+        }
+        auto plugIn = server().findPlugIn(*uuid);
+        if (!plugIn) {
+            fail(kZRErrorInvalidRequest, "no such plugin (uuid not found)");
+            return false;
+        }
+        if (callback(plugIn) == Walk::Stop) return false;
+    }
+    return true;
+}
+
+void Transaction::addAnnotationForPlugIn(const ZRDPlugIn& plugIn, Dictionary& in) const {
+    Value annotation = server().annotationForPlugIn(plugIn).value_or(Dictionary());
+    // A form that is left as it is keeps its encoded bytes.
+    const Value* present = in.find(form::kAnnotations);
+    if (!present || *present != annotation) in.set(form::kAnnotations, std::move(annotation));
+}
+
+void Transaction::done() {
+    if (probes::requestOutputEnabled()) {
+        probes::requestOutput(client_->pid(), describe(reply_).c_str());
+    }
+    if (auto connection = client_->connection()) connection->send(reply_);
+}
+
+void Transaction::fail(std::int32_t code, const std::string& message) {
+    reply_.set(message::kErrorCode, code);
+    reply_.set(message::kError, message);
+    done();
+}
+
+void Transaction::fail(std::int32_t code, const ZRError& error) {
+    reply_.set(message::kErrorCode, error.domain == kZRErrorDomain ? error.code : code);
+    if (error.description) reply_.set(message::kError, *error.description);
+    done();
+}
+
+}  // namespace zorvan

@@ -1,0 +1,70 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <string>
+
+#include "Zorvan/ZRError.h"
+#include "platform/lum/Message.h"
+
+namespace zorvan {
+
+class ZRDLumClient;
+class ZRDPlugIn;
+class ZRDServer;
+
+/// One request being served: the message, the reply being built for it, and who sent it. Made when
+/// the message arrives; everything else runs on the service queue, one transaction at a time. Every
+/// request gets exactly one reply: `done`, or one of the two `fail`, directly or through a walker
+/// that failed.
+class Transaction {
+  public:
+    Transaction(platform::Message request, std::shared_ptr<ZRDLumClient> client);
+
+    /// Serves the request: checks its version and its client, then runs the handler of its type.
+    void dispatch();
+
+    const std::shared_ptr<ZRDLumClient>& client() const { return client_; }
+    const platform::Message& request() const { return request_; }
+    std::uint64_t version() const { return version_; }
+
+  private:
+    /// Whether a walk goes on. A callback that answers `Stop` has sent the reply.
+    enum class Walk { Continue, Stop };
+
+    // Handlers, one a request type.
+    void addPlugIns();
+    void removePlugIns();
+    void bulkPlugIns();
+    void matchPlugIns();
+
+    /// Visits "paths" in order: each element resolved to its canonical path (`resolved`), or as it
+    /// was sent when it cannot be. True when every element was visited and none answered `Stop`;
+    /// otherwise the failure has been sent.
+    bool marshalPaths(const std::function<Walk(const std::string& path, bool resolved)>& callback);
+    /// The same, and sends the reply when every element was visited.
+    bool processPaths(const std::function<Walk(const std::string& path, bool resolved)>& callback);
+    /// Visits the plug-ins that "uuids" names, in order; answers as `marshalPaths`.
+    bool processUuidList(const std::function<Walk(const std::shared_ptr<ZRDPlugIn>&)>& callback);
+    /// Stores the plug-in's annotation, or an empty one, under "annotations".
+    void addAnnotationForPlugIn(const ZRDPlugIn& plugIn, platform::Dictionary& in) const;
+
+    /// The request's unsigned integer under a key; 0 when it is absent or of another kind.
+    std::uint64_t unsignedUnder(const char* key) const;
+
+    void done();
+    void fail(std::int32_t code, const std::string& message);
+    /// With the error's own code when it is one of ours, else with `code`.
+    void fail(std::int32_t code, const ZRError& error);
+
+    ZRDServer& server() const;
+
+    const std::shared_ptr<ZRDLumClient> client_;
+    const platform::Message request_;
+    platform::Message reply_;
+    std::atomic<std::uint64_t> version_{0};
+};
+
+}  // namespace zorvan

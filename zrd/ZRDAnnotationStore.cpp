@@ -1,0 +1,130 @@
+#include "zrd/ZRDAnnotationStore.h"
+
+#include <fmt/format.h>
+
+#include <cerrno>
+
+#include "Zorvan/Helpers.h"
+#include "Zorvan/LogHandles.h"
+#include "platform/Directories.h"
+#include "platform/Files.h"
+#include "platform/PropertyList.h"
+#include "zrd/Probes.h"
+#include "zrd/ZRDPlugIn.h"
+
+namespace zorvan {
+
+using platform::Dictionary;
+using platform::Value;
+
+namespace {
+
+constexpr std::int64_t kVersion = 16;
+constexpr const char* kVersionKey = "version";
+constexpr const char* kDataKey = "data";
+constexpr std::size_t kMaxFileSize = 256u << 20;
+
+ZRError zrError(const platform::Error& error) {
+    return {error.domain, error.code, error.text};
+}
+
+bool isMissingFile(const ZRError& error) {
+    return error.domain == "POSIX" && error.code == ENOENT;
+}
+
+/// The "data" of an annotation file's root, or what is wrong with it.
+std::optional<ZRError> readRoot(const Value& root, Dictionary& data) {
+    const Dictionary* dictionary = root.dictionary();
+    const Value* version = dictionary ? dictionary->find(kVersionKey) : nullptr;
+    std::int64_t found = version ? version->numberAsInteger().value_or(0) : 0;
+    if (found != kVersion) {
+        return ZRErrorWithFormat(kZRErrorVersion, "found database version {} needed version {}",
+                                 found, kVersion);
+    }
+    const Value* stored = dictionary->find(kDataKey);
+    if (!stored || !stored->dictionary()) {
+        return ZRErrorWithCode(kZRErrorVersion, "found no data in database");
+    }
+    data = *stored->dictionary();
+    return std::nullopt;
+}
+
+}  // namespace
+
+std::unique_ptr<ZRDAnnotationStore> ZRDAnnotationStore::initWithDatabase(
+    const std::optional<std::string>& path, const platform::Directories& directories) {
+    std::unique_ptr<ZRDAnnotationStore> store(
+        new ZRDAnnotationStore(path ? *path : defaultDatabaseURL(directories)));
+    if (auto error = store->loadDb()) {
+        if (!isMissingFile(*error)) {
+            EVLOG_ERROR(ops(), "unable to load annotation database:{} error:{} (resetting)",
+                        pub(store->annotationsURL_), pub(*error));
+        }
+        store->annotations_ = Dictionary();
+    }
+    return store;
+}
+
+std::string ZRDAnnotationStore::defaultDatabaseURL(const platform::Directories& directories) {
+    char userDirectory[1024];
+    std::size_t size = platform::userConfstr(directories, platform::kUserDirectory, userDirectory,
+                                             sizeof userDirectory);
+    if (size == 0 || size >= sizeof userDirectory) {
+        ZR_INTERNAL_INCONSISTENCY(fmt::format("unable to locate user directory: errno {}", errno));
+    }
+    std::string directory = platform::joinPath(userDirectory, "com.orbel.zorvan") + "/";
+    if (auto error = platform::makeDirectories(directory, 0700)) {
+        ZR_INTERNAL_INCONSISTENCY(
+            fmt::format("unable to create plugin annotations directory:{} error:{}", directory,
+                        describe(*error)));
+    }
+    return directory + "Annotations";
+}
+
+std::optional<ZRError> ZRDAnnotationStore::loadDb() {
+    std::optional<ZRError> error;
+    auto root = platform::readPropertyListFile(annotationsURL_, kMaxFileSize);
+    if (!root) {
+        error = zrError(root.error());
+    } else {
+        error = readRoot(*root, annotations_);
+    }
+    if (error) probes::dbLoad(error->domain.c_str(), static_cast<std::uint64_t>(error->code));
+    return error;
+}
+
+std::optional<ZRError> ZRDAnnotationStore::saveDb() const {
+    auto bytes = platform::writeXmlPropertyList(
+        Dictionary{{kVersionKey, kVersion}, {kDataKey, annotations_}});
+    if (!bytes) return zrError(bytes.error());
+    if (auto error = platform::writeFileAtomically(annotationsURL_, *bytes)) return zrError(*error);
+    return std::nullopt;
+}
+
+const Dictionary* ZRDAnnotationStore::annotationForIdentifier(std::string_view key) const {
+    const Value* annotation = annotations_.find(key);
+    return annotation ? annotation->dictionary() : nullptr;
+}
+
+const Dictionary* ZRDAnnotationStore::annotationForPlugIn(const ZRDPlugIn& plugIn) const {
+    return annotationForIdentifier(plugIn.annotationKey());
+}
+
+void ZRDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,
+                                       const ZRDPlugIn& plugIn) {
+    const std::string& key = plugIn.annotationKey();
+    if (annotation) {
+        const Dictionary* current = annotationForIdentifier(key);
+        Dictionary merged = current ? *current : Dictionary();
+        for (const auto& [name, value] : *annotation) merged.set(name, value);
+        annotations_.set(key, std::move(merged));
+    } else {
+        annotations_.remove(key);
+    }
+    if (auto error = saveDb()) {
+        EVLOG_ERROR(ops(), "unable to save annotations:{} error:{}", pub(annotationsURL_),
+                    pub(*error));
+    }
+}
+
+}  // namespace zorvan

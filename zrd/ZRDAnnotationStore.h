@@ -1,0 +1,62 @@
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "Zorvan/ZRError.h"
+#include "platform/Value.h"
+
+namespace platform {
+struct Directories;
+}
+
+namespace zorvan {
+
+class ZRDPlugIn;
+
+/// The user's choices about plug-ins ("annotations"), kept over restarts: one small dictionary an
+/// annotation key, in memory and in one property-list file that is rewritten after every change.
+///
+/// The file's root is {"version": 16, "data": {annotation key: annotation}}; it is read in any
+/// property-list form and written as XML. Changes that others make to it while the daemon runs are
+/// lost.
+///
+/// Owned by the database; used on its queue only, once it is built.
+class ZRDAnnotationStore {
+  public:
+    /// The store, loaded. The file is at `path` as given, or at the default place. A file that
+    /// cannot be loaded leaves the store empty, which is logged unless there is just no file; it is
+    /// replaced by the first change.
+    static std::unique_ptr<ZRDAnnotationStore> initWithDatabase(
+        const std::optional<std::string>& path, const platform::Directories& directories);
+
+    /// The annotation under a key, or null. Good until the next change.
+    const platform::Dictionary* annotationForIdentifier(std::string_view key) const;
+    const platform::Dictionary* annotationForPlugIn(const ZRDPlugIn& plugIn) const;
+
+    /// Merges the entries of `annotation` into the plug-in's annotation, or removes that when there
+    /// are none, then saves. A failed save is logged; the change stays and reaches the file with
+    /// the next successful one.
+    void setAnnotation(const std::optional<platform::Dictionary>& annotation,
+                       const ZRDPlugIn& plugIn);
+
+    /// Each answers what went wrong, or none.
+    std::optional<ZRError> loadDb();
+    std::optional<ZRError> saveDb() const;
+
+    /// <user directory>/com.orbel.zorvan/Annotations. Makes the directory (0700). Without one the
+    /// daemon cannot do its work: an internal inconsistency.
+    static std::string defaultDatabaseURL(const platform::Directories& directories);
+
+    const std::string& annotationsURL() const { return annotationsURL_; }
+    const platform::Dictionary& annotations() const { return annotations_; }
+
+  private:
+    explicit ZRDAnnotationStore(std::string path) : annotationsURL_(std::move(path)) {}
+
+    std::string annotationsURL_;
+    platform::Dictionary annotations_;
+};
+
+}  // namespace zorvan

@@ -1,0 +1,73 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "platform/CodeSigning.h"
+#include "platform/lum/Connection.h"
+#include "zrd/HostProcess.h"
+
+namespace zorvan {
+
+class ZRDServer;
+
+/// One connected host. Turns each message of its connection into a `Transaction` on the service
+/// queue, tells handlers who asks, and stops work when the connection dies.
+///
+/// Owned by its connection and, while they live, by its transactions; it refers to the connection
+/// weakly.
+class ZRDLumClient final : public HostProcess, public std::enable_shared_from_this<ZRDLumClient> {
+  public:
+    /// Makes the record of an accepted connection and resumes the connection. On the queue "lum".
+    static std::shared_ptr<ZRDLumClient> initWithConnection(
+        const std::shared_ptr<platform::Connection>& connection, std::shared_ptr<ZRDServer> server);
+
+    pid_t pid() const override;
+    const std::shared_ptr<ZRBundle>& bundle() const override { return bundle_; }
+    std::optional<platform::Value> entitlementValueForKey(const std::string& name) const override;
+    bool hasEntitlement(const std::string& name) const override;
+
+    /// Whether the process runs in a sandbox. A process whose connection is gone counts as
+    /// sandboxed.
+    bool isSandboxed() const;
+
+    /// False once the connection has died: requests still queued are dropped. From any thread.
+    bool acceptWork() const { return acceptWork_; }
+    void setAcceptWork(bool accept) { acceptWork_ = accept; }
+    /// Null when the connection is gone.
+    std::shared_ptr<platform::Connection> connection() const { return connection_.lock(); }
+    const std::shared_ptr<ZRDServer>& server() const { return server_; }
+    /// The executable; empty when it cannot be told.
+    const std::string& path() const { return path_; }
+    platform::CodeSigningTask& task() const { return *task_; }
+    /// Requests received so far. On the service queue only.
+    std::uint32_t requestCount() const { return requestCount_; }
+    void setRequestCount(std::uint32_t count) { requestCount_ = count; }
+
+    std::string description() const;
+
+  private:
+    ZRDLumClient(const std::shared_ptr<platform::Connection>& connection,
+                 std::shared_ptr<ZRDServer> server);
+
+    // On the connection's event delivery.
+    void handleEvent(const platform::ConnectionEvent& event);
+    void receive(const platform::Message& message);
+    void dying();
+    void dead();
+    // On the service queue.
+    void countRequest();
+
+    std::atomic<bool> acceptWork_{true};
+    const std::weak_ptr<platform::Connection> connection_;
+    const std::shared_ptr<ZRDServer> server_;
+    std::string path_;
+    std::shared_ptr<ZRBundle> bundle_;
+    std::unique_ptr<platform::CodeSigningTask> task_;
+    std::uint32_t requestCount_ = 0;
+};
+
+}  // namespace zorvan

@@ -1,0 +1,180 @@
+#include "zrd/ZRDPlugIn.h"
+
+#include <algorithm>
+#include <cmath>
+
+#include "Zorvan/Keys.h"
+#include "Zorvan/LogHandles.h"
+#include "platform/Cbor.h"
+#include "zrd/PlugInContext.h"
+
+namespace zorvan {
+
+using platform::Dictionary;
+using platform::TDPlugInProxy;
+using platform::Value;
+
+namespace {
+
+/// Seconds since 1970 without their fraction, or the nearest end of what 32 bits hold.
+std::int32_t wholeSeconds(platform::Date date) {
+    double seconds = std::trunc(date.secondsSince1970);
+    if (!(seconds > INT32_MIN)) return std::isnan(seconds) ? 0 : INT32_MIN;
+    if (seconds >= INT32_MAX) return INT32_MAX;
+    return static_cast<std::int32_t>(seconds);
+}
+
+}  // namespace
+
+ZRDPlugIn::ZRDPlugIn(platform::TDPlugInProxyRef proxy, std::shared_ptr<const PlugInContext> context)
+    : tdproxy_(std::move(proxy)), context_(std::move(context)) {}
+
+std::shared_ptr<ZRDPlugIn> ZRDPlugIn::initWithTDData(platform::TDPlugInProxyRef proxy,
+                                                     std::shared_ptr<const PlugInContext> context) {
+    if (!proxy->bundlePath) return nullptr;
+    std::shared_ptr<ZRDPlugIn> plugIn(new ZRDPlugIn(std::move(proxy), std::move(context)));
+    if (!plugIn->fillFromProxy()) return nullptr;
+    if (auto fault = plugIn->diagnose()) {
+        EVLOG_INFO(ops(), "ignoring mis-configured plug-in at {}: {}", plugIn->path(), pub(*fault));
+        return nullptr;
+    }
+    return plugIn;
+}
+
+bool ZRDPlugIn::fillFromProxy() {
+    const Dictionary* info = tdproxy_->plugInDictionary();
+    std::optional<Dictionary> plugInDictionary;
+    if (info) plugInDictionary = *info;
+    if (!initialize(tdproxy_->plugInIdentifier, tdproxy_->bundlePath, std::nullopt,
+                    plugInDictionary, tdproxy_->plugInUuid)) {
+        return false;
+    }
+    setEntitlements(tdproxy_->entitlements.get());
+    setOriginalIdentifier(tdproxy_->originalIdentifier);
+    setLastModified(wholeSeconds(tdproxy_->registrationDate));
+    setOnSystemVolume(tdproxy_->onSystemPartition);
+    setHubProtocolVersion(declaredHubProtocolVersion());
+    if (tdproxy_->containingApplication) {
+        setContainingPath(tdproxy_->containingApplication->bundlePath);
+    }
+    // These three go into the form, also where the form itself has to be encoded anew: encoded
+    // once, they are copied from then on.
+    platform::keepCborEncoded(tdproxy_->infoPlist.get());
+    platform::keepCborEncoded(tdproxy_->entitlements.get());
+    if (info) platform::keepCborEncoded(*info);
+    return true;
+}
+
+std::uint32_t ZRDPlugIn::declaredHubProtocolVersion() const {
+    if (const Value* declared = pluginKey(key::kHubProtocolVersion)) {
+        auto version = declared->unsignedInteger();
+        if (version && *version <= UINT32_MAX) return static_cast<std::uint32_t>(*version);
+    }
+    return infoKey(key::kOldStylePlugIn) ? 1 : 2;
+}
+
+const Dictionary* ZRDPlugIn::bundleInfoDictionary() const {
+    return &tdproxy_->infoPlist.get();
+}
+
+const Value* ZRDPlugIn::infoKey(std::string_view key) const {
+    return tdproxy_->lookup(key, TDPlugInProxy::Scope::InfoPlist);
+}
+
+const Value* ZRDPlugIn::pluginKey(std::string_view key) const {
+    return tdproxy_->lookup(key, TDPlugInProxy::Scope::PlugInDictionary);
+}
+
+const Value* ZRDPlugIn::attribute(std::string_view key) const {
+    return tdproxy_->lookup(key, TDPlugInProxy::Scope::Attributes);
+}
+
+std::optional<std::string> ZRDPlugIn::cachedName(
+    std::optional<std::string>& cache, const std::optional<std::string>& registered) const {
+    std::lock_guard lock(mutex_);
+    if (!cache) cache = registered;
+    return cache;
+}
+
+std::optional<std::string> ZRDPlugIn::localizedName() const {
+    return cachedName(localizedName_, tdproxy_->localizedName);
+}
+
+std::optional<std::string> ZRDPlugIn::localizedShortName() const {
+    return cachedName(localizedShortName_, tdproxy_->localizedShortName);
+}
+
+std::optional<std::string> ZRDPlugIn::localizedContainingName() const {
+    const auto& application = tdproxy_->containingApplication;
+    std::optional<std::string> registered;
+    if (application && !application->localizedName.empty()) registered = application->localizedName;
+    return cachedName(localizedContainingName_, registered);
+}
+
+void ZRDPlugIn::setName(std::optional<std::string>& cache, std::optional<std::string> value) {
+    std::lock_guard lock(mutex_);
+    cache = std::move(value);
+    form_.reset();
+}
+
+void ZRDPlugIn::setLocalizedName(std::optional<std::string> value) {
+    setName(localizedName_, std::move(value));
+}
+
+void ZRDPlugIn::setLocalizedShortName(std::optional<std::string> value) {
+    setName(localizedShortName_, std::move(value));
+}
+
+void ZRDPlugIn::setLocalizedContainingName(std::optional<std::string> value) {
+    setName(localizedContainingName_, std::move(value));
+}
+
+std::optional<Dictionary> ZRDPlugIn::form(std::optional<ZRError>& error) const {
+    {
+        std::lock_guard lock(mutex_);
+        if (form_) return form_;
+    }
+    auto made = exportForm(error);
+    if (!made) return std::nullopt;
+    platform::keepCborEncoded(*made);
+    std::lock_guard lock(mutex_);
+    form_ = made;
+    return made;
+}
+
+std::optional<ZRError> ZRDPlugIn::diagnose() const {
+    if (auto fault = ZRPlugInCore::diagnose()) return fault;
+    if (!isData() && !tdproxy_->dataContainerPath) {
+        return ZRErrorWithCode(kZRErrorPlugIn, "this plug-in has no sandbox data container");
+    }
+    if (!containingPath() && !path().starts_with("/System/")) {
+        return ZRErrorWithCode(kZRErrorPlugIn,
+                               "plug-ins outside containing apps must be in /System");
+    }
+    return std::nullopt;
+}
+
+const Value* ZRDPlugIn::valueForEntitlement(std::string_view name) const {
+    return entitlements() ? entitlements()->find(name) : nullptr;
+}
+
+bool ZRDPlugIn::hasEntitlement(std::string_view name) const {
+    const Value* value = valueForEntitlement(name);
+    return value && !platform::equalsFalse(*value);
+}
+
+const std::string& ZRDPlugIn::annotationKey() const {
+    const Value* replaced = valueForEntitlement(entitlement::kReplacePlugIn);
+    if (replaced && replaced->string()) return *replaced->string();
+    return identifier();
+}
+
+Dictionary ZRDPlugIn::prunedInfoDictionaryFor(const Dictionary& dictionary) {
+    Dictionary pruned;
+    for (const auto& [key, value] : dictionary) {
+        if (!key.starts_with("DT")) pruned.set(key, value);
+    }
+    return pruned;
+}
+
+}  // namespace zorvan

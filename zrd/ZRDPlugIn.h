@@ -1,0 +1,100 @@
+#pragma once
+
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <set>
+#include <string>
+
+#include "Zorvan/ZRPlugInCore.h"
+#include "platform/tandry/TDPlugInProxy.h"
+
+namespace zorvan {
+
+class HostProcess;
+struct PlugInContext;
+
+/// The daemon's record of one installed plug-in, tied to the registry's record of it, which answers
+/// the dictionary lookups and the names. Made by the database on its queue, then shared: everything
+/// but the cached names is immutable, so every operation may be called from any thread, except
+/// those that reach the annotations or the host (see each).
+class ZRDPlugIn final : public ZRPlugInCore {
+  public:
+    /// Null when the registry's record has no bundle path, the core refuses it, or it fails its
+    /// self-check, which is logged.
+    static std::shared_ptr<ZRDPlugIn> initWithTDData(platform::TDPlugInProxyRef proxy,
+                                                     std::shared_ptr<const PlugInContext> context);
+
+    const platform::TDPlugInProxyRef& tdproxy() const { return tdproxy_; }
+
+    // The registry's view of the bundle.
+    const platform::Dictionary* bundleInfoDictionary() const override;
+    const platform::Value* infoKey(std::string_view key) const override;
+    const platform::Value* pluginKey(std::string_view key) const override;
+    const platform::Value* attribute(std::string_view key) const override;
+    std::optional<std::string> localizedName() const override;
+    void setLocalizedName(std::optional<std::string> value) override;
+    std::optional<std::string> localizedShortName() const override;
+    void setLocalizedShortName(std::optional<std::string> value) override;
+    std::optional<std::string> localizedContainingName() const override;
+    void setLocalizedContainingName(std::optional<std::string> value) override;
+
+    /// The core's self-check, then the daemon's: a data container for what runs, and an application
+    /// around what is not part of the system.
+    std::optional<ZRError> diagnose() const override;
+
+    /// The record's form as `exportForm` makes it, made and encoded at the first call and shared
+    /// from then on; setting a name makes it afresh. An error: there is none, as with `exportForm`.
+    std::optional<platform::Dictionary> form(std::optional<ZRError>& error) const;
+
+    /// The plug-in's value for an entitlement, or null.
+    const platform::Value* valueForEntitlement(std::string_view name) const;
+    /// Whether that value is there and does not equal boolean false.
+    bool hasEntitlement(std::string_view name) const;
+    /// The key of the user's choices about this plug-in: the identifier that it replaces, else its
+    /// own.
+    const std::string& annotationKey() const;
+
+    /// `dictionary` without the entries whose keys begin with "DT".
+    static platform::Dictionary prunedInfoDictionaryFor(const platform::Dictionary& dictionary);
+
+    // Matching. Reads annotations: not from inside the database's queue.
+    /// Whether every rule holds; no rules hold always.
+    bool match(const platform::Dictionary* rules) const;
+    /// Whether one rule holds.
+    bool matchKey(const std::string& key, const platform::Value& pattern) const;
+
+    // Admission.
+    /// Why the host may not use this plug-in; none: it may.
+    std::optional<std::string> allowForClient(const HostProcess& host) const;
+    /// The consent services that the user has granted to the containing application.
+    std::set<std::string> allowedVSKServices() const;
+
+  private:
+    ZRDPlugIn(platform::TDPlugInProxyRef proxy, std::shared_ptr<const PlugInContext> context);
+    bool fillFromProxy();
+    std::uint32_t declaredHubProtocolVersion() const;
+
+    /// The value that a rule's key stands for: borrowed from the registry's record, or made for the
+    /// rule.
+    struct RuleValue;
+    RuleValue valueForRule(const std::string& key) const;
+    std::string userElection() const;
+    bool matchValue(const platform::Value& value, const platform::Value& patterns) const;
+    bool matchText(const std::string& value, const std::string& pattern) const;
+    bool matchDictionary(const platform::Value& value, const platform::Dictionary& pattern) const;
+
+    std::optional<std::string> cachedName(std::optional<std::string>& cache,
+                                          const std::optional<std::string>& registered) const;
+    void setName(std::optional<std::string>& cache, std::optional<std::string> value);
+
+    const platform::TDPlugInProxyRef tdproxy_;
+    const std::shared_ptr<const PlugInContext> context_;
+    mutable std::mutex mutex_;  // guards the three names and the form
+    mutable std::optional<std::string> localizedName_;
+    mutable std::optional<std::string> localizedShortName_;
+    mutable std::optional<std::string> localizedContainingName_;
+    mutable std::optional<platform::Dictionary> form_;
+};
+
+}  // namespace zorvan

@@ -1,0 +1,68 @@
+#include "zrd/ZRDServer.h"
+
+#include <mutex>
+
+#include "Zorvan/LogHandles.h"
+#include "platform/RunLoop.h"
+#include "zrd/ZRDLumClient.h"
+
+namespace zorvan {
+
+namespace {
+
+std::mutex serverMutex;  // guards theServer
+
+std::shared_ptr<ZRDServer>& theServer() {
+    static std::shared_ptr<ZRDServer> server;
+    return server;
+}
+
+}  // namespace
+
+ZRDServer::ZRDServer(platform::Services services)
+    : ZRDatabase(services), lumQueue_("lum", *services.mainLoop), mainQueue_("service") {}
+
+ZRDServer::~ZRDServer() = default;
+
+std::shared_ptr<ZRDServer> ZRDServer::initForService(const std::string& serviceName,
+                                                     const std::optional<std::string>& databasePath,
+                                                     platform::Services services) {
+    std::shared_ptr<ZRDServer> server(new ZRDServer(std::move(services)));
+    if (!server->initWithDatabase(databasePath, server)) return nullptr;
+    if (!server->listen(serviceName)) return nullptr;
+    {
+        std::lock_guard lock(serverMutex);
+        theServer() = server;
+    }
+    server->service_->setEventHandler(
+        [weak = std::weak_ptr(server)](std::shared_ptr<platform::Connection> connection) {
+            if (auto self = weak.lock()) ZRDLumClient::initWithConnection(connection, self);
+        });
+    server->userPrefs_ = std::make_unique<ZRDUserPrefs>(server->services().directories);
+    // From here on what the scan announces finds a complete server.
+    server->workspace().activate();
+    return server;
+}
+
+bool ZRDServer::listen(const std::string& serviceName) {
+    auto listener = platform::Listener::make(services().directories, serviceName, lumQueue_);
+    if (!listener) {
+        EVLOG_ERROR(ops(), "cannot listen on service {}: {}", pub(serviceName),
+                    pub(listener.error()));
+        return false;
+    }
+    service_ = std::move(*listener);
+    return true;
+}
+
+std::shared_ptr<ZRDServer> ZRDServer::server() {
+    std::lock_guard lock(serverMutex);
+    return theServer();
+}
+
+void ZRDServer::run() {
+    service_->resume();
+    services().mainLoop->run();
+}
+
+}  // namespace zorvan

@@ -1,0 +1,60 @@
+#pragma once
+
+#include <atomic>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "platform/SerialQueue.h"
+#include "platform/lum/Listener.h"
+#include "zrd/ZRDUserPrefs.h"
+#include "zrd/ZRDatabase.h"
+
+namespace zorvan {
+
+/// The daemon's one long-lived object: the plug-in database, the listener on the named service, the
+/// queues and the user's preferences. Every connection becomes a `ZRDLumClient`; every request runs
+/// on the queue "service", one after another.
+///
+/// Made on the main thread, whose run loop it uses, and shared with its clients.
+class ZRDServer final : public ZRDatabase {
+  public:
+    /// The server of a service, listening but not yet accepting. `databasePath` is the annotation
+    /// file's, or none for the default place. Null when there is no registry or the service's name
+    /// cannot be had, which is logged.
+    static std::shared_ptr<ZRDServer> initForService(const std::string& serviceName,
+                                                     const std::optional<std::string>& databasePath,
+                                                     platform::Services services);
+    ~ZRDServer() override;
+
+    /// The process's server; null before there is one.
+    static std::shared_ptr<ZRDServer> server();
+
+    /// Begins to accept and runs the main run loop; returns when the loop is stopped.
+    void run();
+
+    /// Runs `work` on the service queue, after all work submitted before. From any thread.
+    void submitWork(std::function<void()> work) { mainQueue_.async(std::move(work)); }
+
+    std::uint32_t verbose() const { return verbose_; }
+    void setVerbose(std::uint32_t count) { verbose_ = count; }
+    platform::SerialQueue& lumQueue() { return lumQueue_; }
+    platform::SerialQueue& mainQueue() { return mainQueue_; }
+    platform::Listener& service() { return *service_; }
+    ZRDUserPrefs& userPrefs() { return *userPrefs_; }
+
+    using ZRDatabase::services;
+
+  private:
+    explicit ZRDServer(platform::Services services);
+    bool listen(const std::string& serviceName);
+
+    std::atomic<std::uint32_t> verbose_{0};
+    platform::SerialQueue lumQueue_;
+    platform::SerialQueue mainQueue_;
+    std::unique_ptr<platform::Listener> service_;
+    std::unique_ptr<ZRDUserPrefs> userPrefs_;
+};
+
+}  // namespace zorvan

@@ -1,0 +1,101 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <unordered_map>
+#include <vector>
+
+#include "Zorvan/ZRError.h"
+#include "platform/Services.h"
+#include "platform/SyncQueue.h"
+#include "platform/tandry/Workspace.h"
+#include "zrd/PlugInContext.h"
+
+namespace zorvan {
+
+class ZRDAnnotationStore;
+class ZRDPlugIn;
+
+using ZRDPlugInRef = std::shared_ptr<ZRDPlugIn>;
+using ZRDPlugInList = std::vector<ZRDPlugInRef>;
+
+/// The daemon's view of the installed plug-ins: the registry is the source of truth, this keeps
+/// records that were built from it, and the user's annotations. One a process; `ZRDServer` derives
+/// from it.
+///
+/// Every operation may be called from any thread unless it says otherwise; the cache and the store
+/// are only touched on the queue "ZRDatabase", which operations enter synchronously, so none may be
+/// called from inside it.
+class ZRDatabase : public AnnotationReader, public platform::WorkspaceObserver {
+  public:
+    virtual ~ZRDatabase();
+
+    /// The most records that the cache may hold before it is emptied. 0 until set.
+    std::uint32_t cacheLimit() const { return cacheLimit_; }
+    void setCacheLimit(std::uint32_t limit) { cacheLimit_ = limit; }
+
+    /// The record of a plug-in, from the cache or built now. Null when none can be built.
+    ZRDPlugInRef plugInForProxy(const platform::TDPlugInProxyRef& proxy);
+    /// The record with a UUID. Null for an unknown one, which is logged, and when none can be
+    /// built.
+    ZRDPlugInRef findPlugIn(const platform::Uuid& uuid);
+    /// The record of the plug-in bundle at a path; null, which is logged, when none is registered
+    /// there.
+    ZRDPlugInRef findPlugInAtPath(const std::string& bundlePath);
+    /// The records of an application's plug-ins, in the registry's order. None for an application
+    /// without plug-ins and for what is no application.
+    std::optional<ZRDPlugInList> plugInsWithinApplication(const std::string& bundlePath);
+    /// The records that a query (a rules dictionary, or null) may match, each once: what the
+    /// registry selects and the user's election admits. None when the registry's query fails.
+    std::optional<ZRDPlugInList> findPlugIns(const platform::Dictionary* query);
+
+    /// Registers, or unregisters, the bundle at a path with the registry. None on success.
+    std::optional<ZRError> addPlugIn(const std::string& bundlePath);
+    std::optional<ZRError> removePlugIn(const std::string& bundlePath);
+
+    std::optional<platform::Dictionary> annotationForPlugIn(const ZRDPlugIn& plugIn) override;
+    /// Merges `annotation` into the plug-in's, or removes that, and saves. Always answers none: a
+    /// failed save is logged, and the change kept.
+    std::optional<ZRError> setAnnotation(const std::optional<platform::Dictionary>& annotation,
+                                         const ZRDPlugIn& plugIn);
+    /// Tells whoever listens that annotations, and with them match results, have changed.
+    void notifyAnnotationChange();
+
+    void pluginsDidInstall(const platform::TDPlugInProxyList& plugIns) override;
+    void pluginsWillUninstall(const platform::TDPlugInProxyList& plugIns) override;
+
+  protected:
+    explicit ZRDatabase(platform::Services services);
+
+    /// Completes the construction; `self` is this very object. False when there is no registry.
+    bool initWithDatabase(const std::optional<std::string>& path,
+                          const std::shared_ptr<ZRDatabase>& self);
+
+    const platform::Services& services() const { return services_; }
+    platform::Workspace& workspace() { return *services_.workspace; }
+
+  private:
+    // On sync_ only.
+    ZRDPlugInRef createPlugInForProxy(const platform::TDPlugInProxyRef& proxy);
+    void purgeCachesToLimit(std::uint32_t limit);
+    void autoElect(const ZRDPlugIn& plugIn);
+
+    std::optional<platform::TDPlugInProxyList> candidates(const platform::Dictionary* query);
+    bool electionAdmits(const std::vector<std::string>& patterns,
+                        const std::optional<std::string>& identifier,
+                        const platform::Dictionary& entitlements);
+
+    const platform::Services services_;
+    std::atomic<std::uint32_t> cacheLimit_{0};
+    platform::SyncQueue sync_{"ZRDatabase"};
+    std::shared_ptr<PlugInContext> context_;
+    std::unique_ptr<ZRDAnnotationStore> annotations_;         // guarded by sync_
+    std::unordered_map<platform::Uuid, ZRDPlugInRef> cache_;  // guarded by sync_
+    std::atomic<std::size_t> cacheCount_{0};                  // size of cache_, for log lines
+    std::unique_ptr<platform::Workspace::Observation> observation_;  // the first to go
+};
+
+}  // namespace zorvan

@@ -1,0 +1,52 @@
+#include "Zorvan/LogHandles.h"
+#include "Zorvan/ZRPlugInCore.h"
+#include "platform/Process.h"
+#include "platform/Services.h"
+#include "platform/tandry/DiskWorkspace.h"
+#include "zrd/CommandLine.h"
+#include "zrd/ZRDServer.h"
+
+namespace {
+
+/// The services of this machine. Without a registry the server cannot be constructed.
+platform::Services diskServices() {
+    platform::Services services;
+    services.directories = platform::Directories::fromEnvironment();
+    services.mainLoop = std::make_shared<platform::RunLoop>();
+    services.codeSigning = platform::makeFileCodeSigning();
+    services.sandbox = platform::makeKernelSandbox();
+    services.consent = platform::makeFileConsent(services.directories);
+    services.notifications = platform::makeFileNotifications(services.directories);
+    services.types = platform::makeMimeTypes(services.directories);
+    services.sdks = std::make_shared<platform::SdkDictionaries>(services.directories);
+    auto workspace = platform::tandry::openDiskWorkspace(services.directories, *services.sdks,
+                                                         &zorvan::ZRPlugInCore::mergeDictionary);
+    if (workspace) {
+        services.workspace = std::move(*workspace);
+    } else {
+        EVLOG_ERROR(zorvan::ops(), "cannot open the application registry: {}",
+                    platform::pub(workspace.error()));
+    }
+    return services;
+}
+
+}  // namespace
+
+int main(int argc, char* argv[]) {
+    EVLOG_INFO(zorvan::ops(), "zrd is launching");
+    auto options = zorvan::CommandLine::parse(argc, argv);
+    if (!options) return 2;
+    platform::prepareDaemonProcess();
+    platform::Services services = diskServices();
+    auto server =
+        zorvan::ZRDServer::initForService(options->serviceName, options->databasePath, services);
+    if (!server) {
+        EVLOG_ERROR(zorvan::ops(), "unable to construct server");
+        return 1;
+    }
+    server->setVerbose(options->verbose);
+    server->setCacheLimit(options->cacheLimit);
+    services.mainLoop->post(platform::notifyServiceManagerReady);
+    server->run();
+    return 0;
+}
