@@ -214,7 +214,7 @@ void ApplicationScanner::visitPlugIn(const BundleFolder& folder,
             reader_.isUnchanged(folder, entry.print)) {
             if (entry.pass == 0 && entry.needsContainer)
                 entry.record->dataContainerPath =
-                    containers_.prepare(*entry.record->plugInIdentifier);
+                    containers_.locate(*entry.record->plugInIdentifier);
             entry.pass = pass_;
             return;
         }
@@ -244,7 +244,7 @@ void ApplicationScanner::install(const BundleFolder& folder, PlugInEntry entry,
     record.registrationDate = now();
     record.containingApplication = application;
     if (entry.needsContainer)
-        record.dataContainerPath = containers_.prepare(*record.plugInIdentifier);
+        record.dataContainerPath = containers_.locate(*record.plugInIdentifier);
     entry.pass = pass_;
     changes_.installed.push_back(entry.record);
     auto [place, isNew] = state_.plugIns.try_emplace(folder.path);

@@ -67,6 +67,7 @@ class DiskWorkspace final : public Workspace {
     std::optional<Error> afterFirstScan(const std::function<std::optional<Error>()>& work);
 
     void firstScan();
+    void publish();
     std::optional<Error> registerOnQueue(const std::string& bundlePath);
     std::optional<Error> unregisterOnQueue(const std::string& bundlePath);
     void dropApplications(const std::string& path, RegistryChanges& changes);
@@ -145,15 +146,20 @@ void DiskWorkspace::firstScan() {
     const RegistryChanges changes = scanner_.scanAll();
     EVLOG_INFO(ops(), "{} plug-ins in {} applications, {} new, {} gone", state_.plugIns.size(),
                state_.applications.size(), changes.installed.size(), changes.uninstalled.size());
-    if (!changes.records()) current_.publish(std::make_shared<const Snapshot>(state_));
+    if (!changes.records()) publish();
     apply(changes);
+}
+
+void DiskWorkspace::publish() {
+    current_.publish(std::make_shared<const Snapshot>(state_));
+    containers_.makeMissing();
 }
 
 /// The record that goes is hidden before its observers hear of it, so that what they drop is not
 /// built again; the catalogue changes after them.
 void DiskWorkspace::apply(const RegistryChanges& changes) {
     if (!changes.records() && !changes.lists) return;
-    if (changes.records()) current_.publish(std::make_shared<const Snapshot>(state_));
+    if (changes.records()) publish();
     if (!changes.uninstalled.empty())
         for (WorkspaceObserver* observer : observers_)
             observer->pluginsWillUninstall(changes.uninstalled);
