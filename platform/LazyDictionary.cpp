@@ -16,14 +16,16 @@ const Log& ops() {
 
 LazyDictionary::LazyDictionary(Dictionary dictionary) : state_(std::make_shared<State>()) {
     state_->dictionary = std::move(dictionary);
-    std::call_once(state_->decoded, [] {});
 }
 
 LazyDictionary::LazyDictionary(EncodedBytes bytes) : state_(std::make_shared<State>()) {
+    state_->isEncoded = true;
     state_->bytes = std::move(bytes);
 }
 
 const Dictionary& LazyDictionary::get() const {
+    // A finished flag costs a system call to set, which records without bytes need not pay.
+    if (!state_->isEncoded) return state_->dictionary;
     std::call_once(state_->decoded, [&state = *state_] {
         auto value = decodeCbor(state.bytes, CborOptions::KeepEncoded);
         if (!value) {

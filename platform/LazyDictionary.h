@@ -23,6 +23,7 @@ class LazyDictionary {
 
   private:
     struct State {
+        bool isEncoded = false;  // made from bytes
         EncodedBytes bytes;
         std::once_flag decoded;
         Dictionary dictionary;

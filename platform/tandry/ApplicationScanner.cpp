@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <chrono>
+#include <filesystem>
 
 #include "platform/Files.h"
 #include "platform/Log.h"
@@ -25,12 +26,14 @@ Date now() {
     return {Seconds(std::chrono::system_clock::now().time_since_epoch()).count()};
 }
 
-std::optional<FolderEntries> entriesOf(const std::string& path) {
-    Result<FolderEntries> entries = FolderEntries::read(path);
-    if (entries) return std::move(*entries);
-    if (entries.error().code != ENOENT)
-        EVLOG_ERROR(ops(), "cannot look for plug-ins: {}", pub(entries.error().text));
-    return std::nullopt;
+bool isMissing(const Error& error) {
+    return error.code == ENOENT;
+}
+
+/// Whether a failure says nothing about the disk's content: nothing may be dropped for it.
+bool isPassing(const Error& error) {
+    return error.domain == "POSIX" && (error.code == EMFILE || error.code == ENFILE ||
+                                       error.code == ENOMEM || error.code == EIO);
 }
 
 }  // namespace
@@ -100,8 +103,12 @@ void ApplicationScanner::visitAll() {
 }
 
 void ApplicationScanner::visitFolder(const std::string& folder) {
-    std::optional<FolderEntries> found = entriesOf(folder);
-    if (!found) return;
+    Result<FolderEntries> found = FolderEntries::read(folder);
+    if (!found) {
+        EVLOG_ERROR(ops(), "cannot look for applications: {}", pub(found.error().text));
+        if (isPassing(found.error())) keep(folder);
+        return;
+    }
     for (const auto& [name, target] : found->entries) {
         if (!isApplication(name)) continue;
         std::string path = target.empty() ? joinPath(folder, name) : target;
@@ -121,17 +128,34 @@ void ApplicationScanner::visitPath(const std::string& path) {
 }
 
 void ApplicationScanner::visitApplication(const std::string& path) {
-    TDApplicationProxyRef application = applicationAt(path);
     // Two links may lead to one application.
-    if (std::exchange(state_.applications[path].plugInsPass, pass_) == pass_) return;
-    const std::string folder = joinPath(path, kPlugIns);
-    std::optional<FolderEntries> found = entriesOf(folder);
+    auto known = state_.applications.find(path);
+    if (known != state_.applications.end() && known->second.plugInsPass == pass_) return;
+    std::string folder = joinPath(path, kPlugIns);
+    std::error_code ignored;
+    if (std::filesystem::is_symlink(folder, ignored))
+        folder = canonicalPath(folder).value_or(folder);
+    visitPlugIns(path, folder);
+}
+
+/// An application that cannot be looked into is not known.
+void ApplicationScanner::visitPlugIns(const std::string& application, const std::string& folder) {
+    Result<FolderEntries> found = FolderEntries::read(folder);
+    if (!found && !isMissing(found.error())) {
+        EVLOG_ERROR(ops(), "cannot look for plug-ins: {}", pub(found.error().text));
+        if (isPassing(found.error())) keep(application);
+        return;
+    }
+    TDApplicationProxyRef record = applicationAt(application);
+    state_.applications[application].plugInsPass = pass_;
     if (!found) return;
+    const bool isInside = isWithin(folder, application);
     for (const auto& [name, target] : found->entries)
-        if (target.empty())
-            visitPlugIn(BundleFolder(found->directory(), folder, name), application);
-        else
+        if (!target.empty())
             visitPlugIn(BundleFolder(target), applicationOf(target));
+        else
+            visitPlugIn(BundleFolder(found->directory(), folder, name),
+                        isInside ? record : applicationOf(joinPath(folder, name)));
 }
 
 TDApplicationProxyRef ApplicationScanner::applicationAt(const std::string& path) {
@@ -190,7 +214,7 @@ void ApplicationScanner::visitPlugIn(const BundleFolder& folder,
             reader_.isUnchanged(folder, entry.print)) {
             if (entry.pass == 0 && entry.needsContainer)
                 entry.record->dataContainerPath =
-                    containers_.prepare(*entry.record->plugInIdentifier);
+                    containers_.locate(*entry.record->plugInIdentifier);
             entry.pass = pass_;
             return;
         }
@@ -204,11 +228,12 @@ void ApplicationScanner::visitPlugIn(const BundleFolder& folder,
 }
 
 void ApplicationScanner::refuse(const BundleFolder& folder, BundleReader::Reading reading) {
-    EVLOG_ERROR(ops(), "leaving out a plug-in: {}", pub(*reading.refusal));
-    if (changes_.refusal.empty()) changes_.refusal = *reading.refusal;
-    if (!reading.lasting) return;
-    state_.refusals[folder.path] = {std::move(reading.entry.print), std::move(*reading.refusal),
-                                    pass_};
+    const Error& error = *reading.refusal;
+    EVLOG_ERROR(ops(), "leaving out a plug-in: {}", pub(error.text));
+    if (changes_.refusal.empty()) changes_.refusal = error.text;
+    if (isPassing(error)) keep(folder.path);
+    if (error.domain == "POSIX") return;
+    state_.refusals[folder.path] = {std::move(reading.entry.print), error.text, pass_};
     changes_.lists = true;
 }
 
@@ -219,12 +244,23 @@ void ApplicationScanner::install(const BundleFolder& folder, PlugInEntry entry,
     record.registrationDate = now();
     record.containingApplication = application;
     if (entry.needsContainer)
-        record.dataContainerPath = containers_.prepare(*record.plugInIdentifier);
+        record.dataContainerPath = containers_.locate(*record.plugInIdentifier);
     entry.pass = pass_;
     changes_.installed.push_back(entry.record);
     auto [place, isNew] = state_.plugIns.try_emplace(folder.path);
     if (!isNew) changes_.uninstalled.push_back(place->second.record);
     place->second = std::move(entry);
+}
+
+/// Counts as met what is known within `scope`.
+void ApplicationScanner::keep(const std::string& scope) {
+    auto meet = [&](auto& list) {
+        forEachWithin(list, scope, [this](auto entry) { entry->second.pass = pass_; });
+    };
+    meet(state_.applications);
+    meet(state_.plugIns);
+    meet(state_.forgotten);
+    meet(state_.refusals);
 }
 
 /// Drops what lies within `scope` and was not met by this walk.

@@ -36,6 +36,7 @@ class ApplicationScanner {
     void visitFolder(const std::string& folder);
     void visitPath(const std::string& path);
     void visitApplication(const std::string& path);
+    void visitPlugIns(const std::string& application, const std::string& folder);
     void visitPlugIn(const BundleFolder& folder, const TDApplicationProxyRef& application);
     void refuse(const BundleFolder& folder, BundleReader::Reading reading);
     void install(const BundleFolder& folder, PlugInEntry entry,
@@ -44,6 +45,7 @@ class ApplicationScanner {
     TDApplicationProxyRef applicationOf(const std::string& plugInPath);
     bool isForgotten(const BundleFolder& folder);
     bool isRefused(const BundleFolder& folder);
+    void keep(const std::string& scope);
     RegistryChanges finish(const std::string& scope);
 
     RegistryState& state_;

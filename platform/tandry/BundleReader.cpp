@@ -22,6 +22,8 @@ constexpr int kReplyLevels = 8;
 /// Most bytes that a record's encoded dictionaries may have.
 constexpr std::size_t kMaxRecordSize = 2 * kMaxBundleFile;
 
+constexpr std::size_t kMaxShownName = 80;
+
 constexpr const char* kInfoPlist = "Info.plist";
 constexpr const char* kEntitlements = "Entitlements.plist";
 constexpr const char* kLocalized = "Localized.plist";
@@ -90,7 +92,8 @@ const std::string* identifierAt(const Dictionary& plugIn, const Dictionary& info
 std::optional<Error> unsafeName(const std::string& file, std::string_view key,
                                 const std::string* name) {
     if (!name || isSafeName(*name)) return std::nullopt;
-    return malformed(file, fmt::format("{} \"{}\" cannot be a file name", key, *name));
+    return malformed(
+        file, fmt::format("{} \"{}\" cannot be a file name", key, name->substr(0, kMaxShownName)));
 }
 
 void appendPoint(const Value& value, std::string& points) {
@@ -179,10 +182,7 @@ BundleReader::Reading BundleReader::readPlugIn(const BundleFolder& folder) {
     reading.entry.record = std::make_shared<TDPlugInProxy>();
     // Stamps are older than what is read, so a change in between is seen by the next walk.
     appendFixedStamps(folder, reading.entry.print.stamps);
-    if (std::optional<Error> error = fill(folder, reading.entry)) {
-        reading.refusal = error->text;
-        reading.lasting = error->domain != "POSIX";
-    }
+    reading.refusal = fill(folder, reading.entry);
     return reading;
 }
 

@@ -33,10 +33,9 @@ class BundleReader {
     struct Reading {
         /// When not refused, complete but for UUID, registration date, application and container.
         PlugInEntry entry;
-        /// Why the bundle is refused, naming the file; none when it is good.
-        std::optional<std::string> refusal;
-        /// Whether reading again would give the same as long as the fingerprint is the same.
-        bool lasting = true;
+        /// Why the bundle is refused, naming the file; none when it is good. In the domain "POSIX"
+        /// when a file could not be read; any other reason lasts as long as the fingerprint does.
+        std::optional<Error> refusal;
     };
 
     BundleReader(SdkDictionaries& sdks, SdkMerge merge, std::vector<std::string> languages);

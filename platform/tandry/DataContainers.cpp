@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <utility>
 
 #include "platform/Error.h"
 #include "platform/Files.h"
@@ -36,7 +37,7 @@ bool DataContainers::openRoot() {
     return bool(folder_);
 }
 
-std::optional<std::string> DataContainers::prepare(const std::string& identifier) {
+std::optional<std::string> DataContainers::locate(const std::string& identifier) {
     if (!openRoot()) return std::nullopt;
     std::string path = joinPath(root_, identifier);
     struct stat status;
@@ -45,12 +46,23 @@ std::optional<std::string> DataContainers::prepare(const std::string& identifier
         EVLOG_ERROR(ops(), "{} is not a directory of this user, so no data container", pub(path));
         return std::nullopt;
     }
-    if (::mkdirat(folder_.get(), identifier.c_str(), kPrivate) != 0 ||
-        ::mkdirat(folder_.get(), (identifier + "/tmp").c_str(), kPrivate) != 0) {
-        EVLOG_ERROR(ops(), "cannot make a data container: {}", pub(Error::posix(errno, path)));
+    if (errno != ENOENT) {
+        EVLOG_ERROR(ops(), "no data container: {}", pub(Error::posix(errno, path)));
         return std::nullopt;
     }
+    missing_.push_back(identifier);
     return path;
+}
+
+void DataContainers::makeMissing() {
+    for (const std::string& identifier : std::exchange(missing_, {})) {
+        const bool isMade = ::mkdirat(folder_.get(), identifier.c_str(), kPrivate) == 0;
+        // Versions of one plug-in share their container.
+        if (!isMade && errno == EEXIST) continue;
+        if (!isMade || ::mkdirat(folder_.get(), (identifier + "/tmp").c_str(), kPrivate) != 0)
+            EVLOG_ERROR(ops(), "cannot make a data container: {}",
+                        pub(Error::posix(errno, joinPath(root_, identifier))));
+    }
 }
 
 }  // namespace platform::tandry

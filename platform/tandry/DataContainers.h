@@ -2,6 +2,7 @@
 
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "platform/UniqueFd.h"
 
@@ -14,15 +15,20 @@ class DataContainers {
     /// `root` is made at the first need.
     explicit DataContainers(std::string root);
 
-    /// The path of the container of an identifier (a safe file name), made if it is missing. None,
-    /// and an error line, when it cannot be made or is not a directory of this user's own.
-    std::optional<std::string> prepare(const std::string& identifier);
+    /// The path of the container of an identifier (a safe file name). None, and an error line, when
+    /// what is there is not a directory of this user's own, or containers cannot be made at all.
+    std::optional<std::string> locate(const std::string& identifier);
+
+    /// Makes the containers that `locate` has missed, which costs more than anything else in a
+    /// first scan and so is left until lookups have their answers. Failures are logged.
+    void makeMissing();
 
   private:
     bool openRoot();
 
     std::string root_;
     UniqueFd folder_;
+    std::vector<std::string> missing_;
 };
 
 }  // namespace platform::tandry

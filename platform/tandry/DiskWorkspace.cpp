@@ -67,8 +67,10 @@ class DiskWorkspace final : public Workspace {
     std::optional<Error> afterFirstScan(const std::function<std::optional<Error>()>& work);
 
     void firstScan();
+    void publish();
     std::optional<Error> registerOnQueue(const std::string& bundlePath);
     std::optional<Error> unregisterOnQueue(const std::string& bundlePath);
+    void dropApplications(const std::string& path, RegistryChanges& changes);
     bool dropRegistrations(const std::string& path);
     bool forgetWithin(const std::string& path, RegistryChanges& changes);
     void apply(const RegistryChanges& changes);
@@ -81,6 +83,7 @@ class DiskWorkspace final : public Workspace {
     std::unique_ptr<Catalogue> catalogue_;
     BundleReader reader_;
     DataContainers containers_;
+    bool isScanned_ = false;
     RegistryState state_;
     ApplicationScanner scanner_;
     std::vector<WorkspaceObserver*> observers_;
@@ -137,21 +140,26 @@ void DiskWorkspace::activate() {
 
 void DiskWorkspace::firstScan() {
     queue_.assertCurrent();
-    if (closing_) return;
+    if (closing_ || std::exchange(isScanned_, true)) return;
     // Filled in place: the scanner refers to the state.
     state_ = catalogue_->load();
     const RegistryChanges changes = scanner_.scanAll();
     EVLOG_INFO(ops(), "{} plug-ins in {} applications, {} new, {} gone", state_.plugIns.size(),
                state_.applications.size(), changes.installed.size(), changes.uninstalled.size());
-    if (!changes.records()) current_.publish(std::make_shared<const Snapshot>(state_));
+    if (!changes.records()) publish();
     apply(changes);
+}
+
+void DiskWorkspace::publish() {
+    current_.publish(std::make_shared<const Snapshot>(state_));
+    containers_.makeMissing();
 }
 
 /// The record that goes is hidden before its observers hear of it, so that what they drop is not
 /// built again; the catalogue changes after them.
 void DiskWorkspace::apply(const RegistryChanges& changes) {
     if (!changes.records() && !changes.lists) return;
-    if (changes.records()) current_.publish(std::make_shared<const Snapshot>(state_));
+    if (changes.records()) publish();
     if (!changes.uninstalled.empty())
         for (WorkspaceObserver* observer : observers_)
             observer->pluginsWillUninstall(changes.uninstalled);
@@ -230,7 +238,10 @@ std::optional<Error> DiskWorkspace::registerOnQueue(const std::string& bundlePat
     RegistryChanges changes = scanner_.scanPath(path);
     bool hasPlugIns = false;
     forEachWithin(state_.plugIns, path, [&](auto) { hasPlugIns = true; });
-    if (!hasPlugIns && isNew) state_.registrations.erase(path);
+    if (!hasPlugIns && isNew) {
+        state_.registrations.erase(path);
+        dropApplications(path, changes);
+    }
     changes.lists = changes.lists || wasForgotten || (hasPlugIns && isNew);
     apply(changes);
     if (hasPlugIns) return std::nullopt;
@@ -248,6 +259,15 @@ bool DiskWorkspace::forgetWithin(const std::string& path, RegistryChanges& chang
         state_.plugIns.erase(entry);
     });
     return !changes.uninstalled.empty();
+}
+
+/// Drops an application that no walk would find.
+void DiskWorkspace::dropApplications(const std::string& path, RegistryChanges& changes) {
+    if (scanner_.isHeld(path)) return;
+    forEachWithin(state_.applications, path, [&](auto entry) {
+        changes.applications.insert(entry->first);
+        state_.applications.erase(entry);
+    });
 }
 
 /// Drops the registrations of a path and of the plug-ins inside; answers whether there were any.
@@ -268,11 +288,7 @@ std::optional<Error> DiskWorkspace::unregisterOnQueue(const std::string& bundleP
     const bool hadPlugIns = isKnown && forgetWithin(bundlePath, changes);
     if (!wasRegistered && !hadPlugIns)
         return Error{"Registry", 0, fmt::format("{}: nothing is registered there", bundlePath)};
-    if (!scanner_.isHeld(bundlePath))
-        forEachWithin(state_.applications, bundlePath, [&](auto entry) {
-            changes.applications.insert(entry->first);
-            state_.applications.erase(entry);
-        });
+    dropApplications(bundlePath, changes);
     apply(changes);
     return std::nullopt;
 }

@@ -46,7 +46,7 @@ class Workspace {
     /// Adds an observer, which must outlive the handle.
     virtual std::unique_ptr<Observation> addObserver(WorkspaceObserver& observer) = 0;
 
-    /// Begins the first scan. Nothing is scanned and no observer called before.
+    /// Begins the first scan, once. Nothing is scanned and no observer called before.
     virtual void activate() = 0;
 
     virtual TDPlugInProxyRef plugInWithUuid(const Uuid& uuid) = 0;

@@ -175,22 +175,5 @@ TEST_F(CatalogueTest, HasOneOwner) {
     EXPECT_FALSE(openDiskWorkspace(directories, *sdks, nullptr));
 }
 
-TEST_F(CatalogueTest, LookupsEndWithTheWorkspace) {
-    auto opened = openDiskWorkspace(
-        directories, *(sdks = std::make_unique<SdkDictionaries>(directories)), nullptr);
-    ASSERT_TRUE(opened);
-    std::promise<void> asked;
-    auto waiting = std::async(std::launch::async, [&] {
-        asked.set_value();
-        return (*opened)->plugInsMatching({{"key", true}}, nullptr);
-    });
-    asked.get_future().wait();
-    // Never activated: nothing else could end the wait, whenever it begins.
-    while (waiting.wait_for(std::chrono::milliseconds(20)) == std::future_status::timeout &&
-           *opened)
-        opened->reset();
-    EXPECT_EQ(waiting.get(), std::nullopt);
-}
-
 }  // namespace
 }  // namespace platform::tandry

@@ -2,7 +2,7 @@
 #include <regex>
 #include <set>
 
-#include "platform/tandry/Snapshot.h"
+#include "platform/tandry/CurrentSnapshot.h"
 #include "tests/platform/tandry/RegistryFixture.h"
 
 namespace platform::tandry {
@@ -15,6 +15,13 @@ TEST(ComparisonKey, IsTheSameForWhatComparesEqual) {
     for (const char* text : {"", "0", "1", "10", "100", "a", "A", "a0", "a1", "a10", "1.0", "1"})
         keys.insert(comparisonKey(text));
     EXPECT_EQ(keys.size(), 11u);
+}
+
+TEST(CurrentSnapshot, EndsTheWaitForAFirstScanThatNeverComes) {
+    CurrentSnapshot current;
+    auto waiting = std::async(std::launch::async, [&current] { return current.get(); });
+    current.close();
+    EXPECT_EQ(waiting.get(), nullptr);
 }
 
 constexpr const char* kPoint = "VXExtensionPointIdentifier";

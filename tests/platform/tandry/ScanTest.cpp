@@ -171,15 +171,21 @@ TEST_F(RegistryTest, FollowsLinksAndSkipsWhatCannotBeNamed) {
     fs::create_symlink(files.path(apps + "Loop.app"), files.path(apps + "Loop.app"));
     fs::create_symlink(files.path("opt"), files.path(apps + "Other.app"));
     fs::create_symlink(stray, files.path("opt/Real.app/PlugIns/Link.appex"));
+    addApplication(apps + "Shared.app");
+    addPlugIn("opt/Shelf/S.appex", "shelved");
+    fs::create_symlink(files.path("opt/Shelf"), files.path(apps + "Shared.app/PlugIns"));
+    files.write(apps + "File.app/PlugIns", "not a directory");
     addPlugIn(apps + "Bad\xFF.app/PlugIns/A.appex", "x");
     addPlugIn(apps + "Bell\a.app/PlugIns/A.appex", "x");
     ErrorLines errors;
     start();
-    EXPECT_THAT(installed(), ElementsAre("a", "stray"));
+    EXPECT_THAT(installed(), ElementsAre("a", "shelved", "stray"));
+    EXPECT_EQ(plugIn("shelved")->bundlePath, files.path("opt/Shelf/S.appex"));
     EXPECT_EQ(plugIn("a")->bundlePath, files.path("opt/Real.app/PlugIns/A.appex"));
     EXPECT_EQ(plugIn("stray")->containingApplication, nullptr);
-    EXPECT_THAT(errors.lines, UnorderedElementsAre(HasSubstr("Loop.app"), HasSubstr("Other.app"),
-                                                   HasSubstr("Bad"), HasSubstr("Bell")));
+    EXPECT_THAT(errors.lines,
+                UnorderedElementsAre(HasSubstr("Loop.app"), HasSubstr("Other.app"),
+                                     HasSubstr("Bad"), HasSubstr("Bell"), HasSubstr("File.app")));
 }
 
 TEST_F(RegistryTest, MakesDataContainersThatAreTheUsersOwn) {
