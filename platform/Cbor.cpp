@@ -7,6 +7,7 @@
 #include <cstring>
 #include <vector>
 
+#include "platform/SliceList.h"
 #include "platform/Utf8.h"
 
 namespace platform {
@@ -20,107 +21,145 @@ constexpr std::uint64_t kUuidTag = 37;
 /// claim many must not multiply.
 constexpr std::size_t kMaxReserved = 256;
 
-template <class Encode, class Argument>
-void appendHead(Encode encode, Argument argument, std::string& out) {
-    unsigned char head[9];
-    std::size_t size = encode(argument, head, sizeof head);
-    out.append(reinterpret_cast<const char*>(head), size);
-}
+/// Writes into a string: everything is copied.
+class StringOutput {
+  public:
+    explicit StringOutput(std::string& bytes) : bytes_(bytes) {}
 
-void encodeText(std::string_view text, std::string& out) {
-    appendHead(cbor_encode_string_start, text.size(), out);
-    out += text;
-}
-
-void encodeBytes(std::string_view bytes, std::string& out) {
-    appendHead(cbor_encode_bytestring_start, bytes.size(), out);
-    out += bytes;
-}
-
-void encodeInteger(const Value& value, std::string& out) {
-    auto small = value.signedInteger();
-    if (small && *small < 0) {
-        appendHead(cbor_encode_negint, static_cast<std::uint64_t>(-1 - *small), out);
-    } else {
-        encodeCborUnsigned(*value.unsignedInteger(), out);
+    void append(std::string_view bytes) { bytes_ += bytes; }
+    void appendShared(const EncodedBytes& bytes) { bytes_ += bytes.bytes; }
+    std::size_t appendGap(std::size_t size) {
+        bytes_.append(size, '\0');
+        return bytes_.size() - size;
     }
-}
+    void fill(std::size_t gap, std::string_view bytes) { bytes_.replace(gap, bytes.size(), bytes); }
+    std::size_t size() const { return bytes_.size(); }
 
-/// The length takes four bytes always: it is known only after the value has been written in place.
-void encodePacked(const Packed& packed, std::string& out) {
-    appendHead(cbor_encode_tag, kPackedTag, out);
-    out += '\x5A';
-    std::size_t start = out.size() + 4;
-    out.append(4, '\0');
-    if (packed.value()) {
-        encodeCbor(*packed.value(), out);
-    } else {
-        out += packed.bytes().bytes;
+  private:
+    std::string& bytes_;
+};
+
+template <class Output>
+class Encoder {
+  public:
+    explicit Encoder(Output& out) : out_(out) {}
+
+    template <class Encode, class Argument>
+    void head(Encode encode, Argument argument) {
+        unsigned char bytes[9];
+        std::size_t size = encode(argument, bytes, sizeof bytes);
+        out_.append({reinterpret_cast<const char*>(bytes), size});
     }
-    std::size_t length = out.size() - start;
-    for (std::size_t i = 1; i <= 4; ++i, length >>= 8) out[start - i] = static_cast<char>(length);
-}
+
+    void dictionary(const Dictionary& value) {
+        if (const EncodedBytes* encoded = value.encoded()) return out_.appendShared(*encoded);
+        head(cbor_encode_map_start, value.size());
+        for (const auto& [key, element] : value) {
+            text(key);
+            this->value(element);
+        }
+    }
+
+    void value(const Value& value) {
+        switch (value.kind()) {
+            case Value::Kind::Boolean:
+                return head(cbor_encode_bool, *value.boolean());
+            case Value::Kind::Integer:
+                return integer(value);
+            case Value::Kind::Real:
+                return head(cbor_encode_double, *value.real());
+            case Value::Kind::Date:
+                head(cbor_encode_tag, kDateTag);
+                return head(cbor_encode_double, value.date()->secondsSince1970);
+            case Value::Kind::Data:
+                return bytes(value.data()->bytes());
+            case Value::Kind::String:
+                return text(*value.string());
+            case Value::Kind::Uuid:
+                return uuid(*value.uuid());
+            case Value::Kind::Array:
+                head(cbor_encode_array_start, value.array()->size());
+                for (const Value& element : *value.array()) this->value(element);
+                return;
+            case Value::Kind::Dictionary:
+                return dictionary(*value.dictionary());
+            case Value::Kind::Packed:
+                return packed(*value.packed());
+        }
+    }
+
+  private:
+    void text(std::string_view text) {
+        head(cbor_encode_string_start, text.size());
+        out_.append(text);
+    }
+
+    void bytes(std::string_view bytes) {
+        head(cbor_encode_bytestring_start, bytes.size());
+        out_.append(bytes);
+    }
+
+    void integer(const Value& value) {
+        auto small = value.signedInteger();
+        if (small && *small < 0) {
+            head(cbor_encode_negint, static_cast<std::uint64_t>(-1 - *small));
+        } else {
+            head(cbor_encode_uint, *value.unsignedInteger());
+        }
+    }
+
+    void uuid(const Uuid& uuid) {
+        head(cbor_encode_tag, kUuidTag);
+        bytes({reinterpret_cast<const char*>(uuid.bytes.data()), uuid.bytes.size()});
+    }
+
+    /// The length takes four bytes always: it is known only after the value has been written.
+    void packed(const Packed& packed) {
+        head(cbor_encode_tag, kPackedTag);
+        out_.append("\x5A");
+        auto gap = out_.appendGap(4);
+        std::size_t start = out_.size();
+        if (packed.value()) {
+            value(*packed.value());
+        } else {
+            out_.appendShared(packed.bytes());
+        }
+        out_.fill(gap, bigEndian32(out_.size() - start));
+    }
+
+    Output& out_;
+};
 
 }  // namespace
 
+std::string bigEndian32(std::size_t number) {
+    std::string bytes(4, '\0');
+    for (std::size_t i = 4; i-- > 0; number >>= 8) bytes[i] = static_cast<char>(number);
+    return bytes;
+}
+
 void encodeCborArrayHead(std::size_t count, std::string& out) {
-    appendHead(cbor_encode_array_start, count, out);
+    StringOutput output(out);
+    Encoder(output).head(cbor_encode_array_start, count);
 }
 
 void encodeCborUnsigned(std::uint64_t value, std::string& out) {
-    appendHead(cbor_encode_uint, value, out);
+    StringOutput output(out);
+    Encoder(output).head(cbor_encode_uint, value);
 }
 
 void encodeCbor(const Dictionary& value, std::string& out) {
-    if (const EncodedBytes* encoded = value.encoded()) {
-        out += encoded->bytes;
-        return;
-    }
-    appendHead(cbor_encode_map_start, value.size(), out);
-    for (const auto& [key, element] : value) {
-        encodeText(key, out);
-        encodeCbor(element, out);
-    }
+    StringOutput output(out);
+    Encoder(output).dictionary(value);
 }
 
 void encodeCbor(const Value& value, std::string& out) {
-    switch (value.kind()) {
-        case Value::Kind::Boolean:
-            appendHead(cbor_encode_bool, *value.boolean(), out);
-            break;
-        case Value::Kind::Integer:
-            encodeInteger(value, out);
-            break;
-        case Value::Kind::Real:
-            appendHead(cbor_encode_double, *value.real(), out);
-            break;
-        case Value::Kind::Date:
-            appendHead(cbor_encode_tag, kDateTag, out);
-            appendHead(cbor_encode_double, value.date()->secondsSince1970, out);
-            break;
-        case Value::Kind::Data:
-            encodeBytes(value.data()->bytes(), out);
-            break;
-        case Value::Kind::String:
-            encodeText(*value.string(), out);
-            break;
-        case Value::Kind::Uuid: {
-            auto uuid = *value.uuid();
-            appendHead(cbor_encode_tag, kUuidTag, out);
-            encodeBytes({reinterpret_cast<const char*>(uuid.bytes.data()), uuid.bytes.size()}, out);
-            break;
-        }
-        case Value::Kind::Array:
-            encodeCborArrayHead(value.array()->size(), out);
-            for (const Value& element : *value.array()) encodeCbor(element, out);
-            break;
-        case Value::Kind::Dictionary:
-            encodeCbor(*value.dictionary(), out);
-            break;
-        case Value::Kind::Packed:
-            encodePacked(*value.packed(), out);
-            break;
-    }
+    StringOutput output(out);
+    Encoder(output).value(value);
+}
+
+void encodeCbor(const Dictionary& value, SliceList& out) {
+    Encoder(out).dictionary(value);
 }
 
 void keepCborEncoded(const Dictionary& dictionary) {

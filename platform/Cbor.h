@@ -9,6 +9,8 @@
 
 namespace platform {
 
+class SliceList;
+
 /// The encoding of values in messages and in the catalogue: CBOR (RFC 8949), a subset of it.
 ///
 /// | value | item |
@@ -39,10 +41,14 @@ inline constexpr std::size_t kMaxCborValues = 1u << 20;
 /// not walked. Never fails.
 void encodeCbor(const Value& value, std::string& out);
 void encodeCbor(const Dictionary& value, std::string& out);
+/// The same into slices: what carries its encoded bytes is shared, not copied.
+void encodeCbor(const Dictionary& value, SliceList& out);
 /// Appends the heads of an array or map, an unsigned integer and a text string, for callers that
 /// write the parts of an item one by one.
 void encodeCborArrayHead(std::size_t count, std::string& out);
 void encodeCborUnsigned(std::uint64_t value, std::string& out);
+/// A number as four bytes, the highest first.
+std::string bigEndian32(std::size_t number);
 
 /// Gives a dictionary its encoded bytes, unless it carries them already. Safe on shared
 /// dictionaries.

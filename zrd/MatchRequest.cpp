@@ -48,7 +48,7 @@ void Transaction::matchPlugIns() {
 
     auto candidates = server().findPlugIns(query.rules).value_or(ZRDPlugInList());
     probes::discoverRaw(static_cast<unsigned int>(candidates.size()));
-    MatchResult result(query.flags);
+    MatchResult result(query.flags, candidates.size());
     for (const auto& plugIn : candidates) {
         if (firstClosedGate(*plugIn, query)) continue;
         std::optional<ZRError> error;
@@ -59,7 +59,7 @@ void Transaction::matchPlugIns() {
         }
         if (!form || !result.admit(*plugIn)) continue;
         addAnnotationForPlugIn(*plugIn, *form);
-        result.append(*plugIn, *std::move(form));
+        result.append(plugIn, *std::move(form));
     }
     result.linkOverrides();
     EVLOG_INFO(ops(), "match returned {} plug-ins", result.size());

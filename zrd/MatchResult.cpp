@@ -24,6 +24,11 @@ int compareVersions(const Value* candidate, const Value* accepted) {
 
 }  // namespace
 
+MatchResult::MatchResult(std::uint64_t flags, std::size_t expected) : flags_(flags) {
+    accepted_.reserve(expected);
+    byIdentifier_.reserve(expected);
+}
+
 bool MatchResult::wins(const ZRDPlugIn& plugIn, const Dictionary& accepted,
                        int versionOrder) const {
     if (versionOrder != 0) return versionOrder > 0;
@@ -34,58 +39,63 @@ bool MatchResult::wins(const ZRDPlugIn& plugIn, const Dictionary& accepted,
 }
 
 bool MatchResult::admit(const ZRDPlugIn& plugIn) {
-    auto found = byIdentifier_.find(plugIn.identifier());
-    if (found == byIdentifier_.end()) return true;
-    auto& rivals = found->second;
-    for (auto index = rivals.begin(); index != rivals.end(); ++index) {
-        const Dictionary& rival = *accepted_[*index];
-        int order = compareVersions(plugIn.version(), rival.find(form::kVersion));
-        if ((flags_ & ZRDiscoverVersions) && (order != 0 || (flags_ & ZRDiscoverDuplicates)))
-            continue;
-        if (!wins(plugIn, rival, order)) return false;
-        accepted_[*index] = nullptr;
-        rivals.erase(index);
-        return true;
+    auto rivals = byIdentifier_.find(plugIn.identifier());
+    if (rivals == byIdentifier_.end()) return true;
+    std::size_t next = kNone;
+    for (std::size_t i = rivals->second.first; i != kNone; i = next) {
+        Accepted& rival = accepted_[i];
+        next = rival.nextOfIdentifier;
+        if (rival.displaced) continue;
+        int order = compareVersions(plugIn.version(), rival.form.find(form::kVersion));
+        bool keepsBoth =
+            (flags_ & ZRDiscoverVersions) && (order != 0 || (flags_ & ZRDiscoverDuplicates));
+        if (keepsBoth) continue;
+        rival.displaced = wins(plugIn, rival.form, order);
+        return rival.displaced;
     }
     return true;
 }
 
-void MatchResult::append(const ZRDPlugIn& plugIn, Dictionary form) {
-    auto shared = std::make_shared<Dictionary>(std::move(form));
-    byIdentifier_[plugIn.identifier()].push_back(accepted_.size());
-    accepted_.push_back(shared);
-    const Value* replaced = plugIn.valueForEntitlement(entitlement::kReplacePlugIn);
+void MatchResult::append(std::shared_ptr<ZRDPlugIn> plugIn, Dictionary form) {
+    std::size_t index = accepted_.size();
+    auto [rivals, isFirst] = byIdentifier_.try_emplace(plugIn->identifier(), index, index);
+    if (!isFirst) {
+        accepted_[rivals->second.last].nextOfIdentifier = index;
+        rivals->second.last = index;
+    }
+    const Value* replaced = plugIn->valueForEntitlement(entitlement::kReplacePlugIn);
+    accepted_.push_back({std::move(plugIn), std::move(form)});
     if (!replaced) return;
-    if (replaced->string()) replacers_[*replaced->string()] = shared;
+    if (replaced->string()) replacers_[*replaced->string()] = index;
     if (!replaced->array()) return;
     for (const Value& element : *replaced->array()) {
-        if (element.string()) replacers_[*element.string()] = shared;
+        if (element.string()) replacers_[*element.string()] = index;
     }
 }
 
 void MatchResult::linkOverrides() {
     if (replacers_.empty()) return;
-    for (const FormRef& form : accepted_) {
-        if (!form) continue;
-        const Value identifier = *form->find(form::kIdentifier);
-        auto replacer = replacers_.find(*identifier.string());
+    for (Accepted& accepted : accepted_) {
+        if (accepted.displaced) continue;
+        auto replacer = replacers_.find(accepted.plugIn->identifier());
         if (replacer == replacers_.end()) continue;
-        const Value uuid = *replacer->second->find(form::kUuid);
-        form->set(form::kOverrider, uuid);
-        replacer->second->set(form::kOverriding, identifier);
-        EVLOG_INFO(ops(), "plug-in {} overrides {}", pub(uuid), pub(*form->find(form::kUuid)));
+        Accepted& overrider = accepted_[replacer->second];
+        const std::string uuid = overrider.plugIn->uuid().string();
+        accepted.form.set(form::kOverrider, uuid);
+        overrider.form.set(form::kOverriding, accepted.plugIn->identifier());
+        EVLOG_INFO(ops(), "plug-in {} overrides {}", pub(uuid), pub(accepted.plugIn->uuid()));
     }
 }
 
 std::size_t MatchResult::size() const {
-    return accepted_.size() - std::ranges::count(accepted_, nullptr);
+    return std::ranges::count(accepted_, false, &Accepted::displaced);
 }
 
 platform::Array MatchResult::forms() const {
     std::vector<Value> forms;
     forms.reserve(accepted_.size());
-    for (const FormRef& form : accepted_) {
-        if (form) forms.emplace_back(*form);
+    for (const Accepted& accepted : accepted_) {
+        if (!accepted.displaced) forms.emplace_back(accepted.form);
     }
     return platform::Array(std::move(forms));
 }

@@ -1,8 +1,10 @@
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
 #include <memory>
 #include <string>
+#include <string_view>
 #include <unordered_map>
 #include <vector>
 
@@ -17,14 +19,15 @@ class ZRDPlugIn;
 /// its request, on the service queue.
 class MatchResult {
   public:
-    /// `flags` are the request's ZRDiscover… bits.
-    explicit MatchResult(std::uint64_t flags) : flags_(flags) {}
+    /// `flags` are the request's ZRDiscover… bits; `expected` plug-ins at the most will be
+    /// accepted.
+    MatchResult(std::uint64_t flags, std::size_t expected);
 
     /// Whether the plug-in wins against the accepted forms of its identifier; the form that it
     /// beats is taken out.
     bool admit(const ZRDPlugIn& plugIn);
     /// Accepts the form of a plug-in that was admitted.
-    void append(const ZRDPlugIn& plugIn, platform::Dictionary form);
+    void append(std::shared_ptr<ZRDPlugIn> plugIn, platform::Dictionary form);
     /// Sets "overrider" on the form of each replaced plug-in and "overriding" on its replacer's.
     void linkOverrides();
 
@@ -33,17 +36,29 @@ class MatchResult {
     platform::Array forms() const;
 
   private:
-    using FormRef = std::shared_ptr<platform::Dictionary>;
+    static constexpr std::size_t kNone = SIZE_MAX;
+
+    /// Stays where it is, so that its index stays good, also when it is displaced.
+    struct Accepted {
+        std::shared_ptr<ZRDPlugIn> plugIn;
+        platform::Dictionary form;
+        std::size_t nextOfIdentifier = kNone;
+        bool displaced = false;
+    };
+    struct SameIdentifier {
+        std::size_t first;
+        std::size_t last;
+    };
 
     bool wins(const ZRDPlugIn& plugIn, const platform::Dictionary& accepted,
               int versionOrder) const;
 
     std::uint64_t flags_;
-    std::vector<FormRef> accepted_;  // null: displaced since
-    std::unordered_map<std::string, std::vector<std::size_t>>
-        byIdentifier_;  // indexes of accepted_
-    /// The form of the plug-in that replaces an identifier. It stays here when it is displaced.
-    std::unordered_map<std::string, FormRef> replacers_;
+    std::vector<Accepted> accepted_;
+    std::unordered_map<std::string_view, SameIdentifier>
+        byIdentifier_;  // keys of accepted plug-ins
+    /// Who replaces an identifier. It stays so when it is displaced itself.
+    std::unordered_map<std::string, std::size_t> replacers_;
 };
 
 }  // namespace zorvan

@@ -11,7 +11,6 @@
 namespace zorvan {
 
 using platform::Dictionary;
-using platform::TDPlugInProxy;
 using platform::Value;
 
 namespace {
@@ -27,7 +26,11 @@ std::int32_t wholeSeconds(platform::Date date) {
 }  // namespace
 
 ZRDPlugIn::ZRDPlugIn(platform::TDPlugInProxyRef proxy, std::shared_ptr<const PlugInContext> context)
-    : tdproxy_(std::move(proxy)), context_(std::move(context)) {}
+    : tdproxy_(std::move(proxy)),
+      registeredInfo_(tdproxy_->infoPlist.get()),
+      registeredPlugIn_(tdproxy_->plugInDictionary()),
+      registeredAttributes_(tdproxy_->attributes()),
+      context_(std::move(context)) {}
 
 std::shared_ptr<ZRDPlugIn> ZRDPlugIn::initWithTDData(platform::TDPlugInProxyRef proxy,
                                                      std::shared_ptr<const PlugInContext> context) {
@@ -42,9 +45,8 @@ std::shared_ptr<ZRDPlugIn> ZRDPlugIn::initWithTDData(platform::TDPlugInProxyRef 
 }
 
 bool ZRDPlugIn::fillFromProxy() {
-    const Dictionary* info = tdproxy_->plugInDictionary();
     std::optional<Dictionary> plugInDictionary;
-    if (info) plugInDictionary = *info;
+    if (registeredPlugIn_) plugInDictionary = *registeredPlugIn_;
     if (!initialize(tdproxy_->plugInIdentifier, tdproxy_->bundlePath, std::nullopt,
                     plugInDictionary, tdproxy_->plugInUuid)) {
         return false;
@@ -59,9 +61,9 @@ bool ZRDPlugIn::fillFromProxy() {
     }
     // These three go into the form, also where the form itself has to be encoded anew: encoded
     // once, they are copied from then on.
-    platform::keepCborEncoded(tdproxy_->infoPlist.get());
+    platform::keepCborEncoded(registeredInfo_);
     platform::keepCborEncoded(tdproxy_->entitlements.get());
-    if (info) platform::keepCborEncoded(*info);
+    if (registeredPlugIn_) platform::keepCborEncoded(*registeredPlugIn_);
     return true;
 }
 
@@ -74,19 +76,19 @@ std::uint32_t ZRDPlugIn::declaredHubProtocolVersion() const {
 }
 
 const Dictionary* ZRDPlugIn::bundleInfoDictionary() const {
-    return &tdproxy_->infoPlist.get();
+    return &registeredInfo_;
 }
 
 const Value* ZRDPlugIn::infoKey(std::string_view key) const {
-    return tdproxy_->lookup(key, TDPlugInProxy::Scope::InfoPlist);
+    return registeredInfo_.find(key);
 }
 
 const Value* ZRDPlugIn::pluginKey(std::string_view key) const {
-    return tdproxy_->lookup(key, TDPlugInProxy::Scope::PlugInDictionary);
+    return registeredPlugIn_ ? registeredPlugIn_->find(key) : nullptr;
 }
 
 const Value* ZRDPlugIn::attribute(std::string_view key) const {
-    return tdproxy_->lookup(key, TDPlugInProxy::Scope::Attributes);
+    return registeredAttributes_ ? registeredAttributes_->find(key) : nullptr;
 }
 
 std::optional<std::string> ZRDPlugIn::cachedName(

@@ -89,6 +89,10 @@ class ZRDPlugIn final : public ZRPlugInCore {
     void setName(std::optional<std::string>& cache, std::optional<std::string> value);
 
     const platform::TDPlugInProxyRef tdproxy_;
+    // The registry record's dictionaries, so that a lookup searches one of them and not three.
+    const platform::Dictionary& registeredInfo_;
+    const platform::Dictionary* const registeredPlugIn_;
+    const platform::Dictionary* const registeredAttributes_;
     const std::shared_ptr<const PlugInContext> context_;
     mutable std::mutex mutex_;  // guards the three names and the form
     mutable std::optional<std::string> localizedName_;

@@ -28,19 +28,21 @@ std::optional<Message> asMessage(const Value& item, FrameKind expected) {
 
 }  // namespace
 
-Result<std::string> encodeFrame(FrameKind kind, const Message& message, std::size_t limit) {
-    std::string frame(kFrameHeaderSize, '\0');
-    encodeCborArrayHead(3, frame);
-    encodeCborUnsigned(static_cast<std::uint64_t>(kind), frame);
-    encodeCborUnsigned(message.serial(), frame);
-    encodeCbor(message.contents(), frame);
+Result<SliceList> encodeFrame(FrameKind kind, const Message& message, std::size_t limit) {
+    std::string start;
+    encodeCborArrayHead(3, start);
+    encodeCborUnsigned(static_cast<std::uint64_t>(kind), start);
+    encodeCborUnsigned(message.serial(), start);
 
+    SliceList frame;
+    const auto length = frame.appendGap(kFrameHeaderSize);
+    frame.append(start);
+    encodeCbor(message.contents(), frame);
     const std::size_t size = frame.size() - kFrameHeaderSize;
     if (size > limit)
         return Error{kDomain, 0,
                      fmt::format("a message of {} bytes is over the limit of {}", size, limit)};
-    for (std::size_t i = 0; i < kFrameHeaderSize; ++i)
-        frame[i] = static_cast<char>(size >> (8 * (kFrameHeaderSize - 1 - i)));
+    frame.fill(length, bigEndian32(size));
     return frame;
 }
 

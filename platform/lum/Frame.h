@@ -9,6 +9,7 @@
 #include <variant>
 
 #include "platform/Error.h"
+#include "platform/SliceList.h"
 #include "platform/lum/Connection.h"
 #include "platform/lum/Message.h"
 
@@ -21,7 +22,7 @@ enum class FrameKind : std::uint64_t { Request = 0, Reply = 1 };
 inline constexpr std::size_t kFrameHeaderSize = 4;
 
 /// A whole frame. Error (domain "Lum"): the payload would be over `limit` bytes.
-Result<std::string> encodeFrame(FrameKind kind, const Message& message, std::size_t limit);
+Result<SliceList> encodeFrame(FrameKind kind, const Message& message, std::size_t limit);
 
 /// What a payload is to a receiver of frames of the kind `expected`: a message; a well-formed item
 /// that is no such message; or, for anything else, an error that says what is wrong with it.

@@ -9,13 +9,16 @@
 
 namespace platform::lum {
 
-bool FrameSocket::write(const std::string& frame, std::size_t& offset, std::size_t most) {
-    const std::size_t end = std::min(frame.size() - offset, most) + offset;
-    while (offset < end) {
-        const ssize_t count =
-            ::send(socket_.get(), frame.data() + offset, end - offset, MSG_NOSIGNAL | MSG_DONTWAIT);
+bool FrameSocket::write(SliceList& frame, std::size_t most) {
+    const std::size_t left = frame.remaining() - std::min(frame.remaining(), most);
+    while (frame.remaining() > left) {
+        iovec vectors[64];
+        msghdr message{};
+        message.msg_iov = vectors;
+        message.msg_iovlen = frame.gather(vectors);
+        const ssize_t count = ::sendmsg(socket_.get(), &message, MSG_NOSIGNAL | MSG_DONTWAIT);
         if (count >= 0) {
-            offset += static_cast<std::size_t>(count);
+            frame.consume(static_cast<std::size_t>(count));
         } else if (errno != EINTR) {
             broken_ = errno != EAGAIN && errno != ENOBUFS && errno != ENOMEM;
             return false;
@@ -24,14 +27,13 @@ bool FrameSocket::write(const std::string& frame, std::size_t& offset, std::size
     return true;
 }
 
-FrameSocket::Sent FrameSocket::send(std::string frame) {
+FrameSocket::Sent FrameSocket::send(SliceList frame) {
     std::lock_guard lock(mutex_);
     if (!socket_ || broken_) return {};
-    std::size_t offset = 0;
     const bool first = unsent_.empty();
-    if (first && (write(frame, offset, frame.size()) || broken_)) return {};
+    if (first && (write(frame, frame.size()) || broken_)) return {};
     const std::size_t size = frame.size();
-    unsent_.push_back({std::move(frame), offset});
+    unsent_.push_back(std::move(frame));
     held_ += size;
     return {size, first};
 }
@@ -43,12 +45,12 @@ FrameSocket::Flushed FrameSocket::flush() {
     std::size_t freed = 0;
     std::size_t most = kMostAtOnce;
     while (!unsent_.empty() && most > 0) {
-        Unsent& next = unsent_.front();
-        const std::size_t before = next.offset;
-        const bool goesOn = write(next.frame, next.offset, most);
-        most -= next.offset - before;
-        if (next.offset == next.frame.size()) {
-            freed += next.frame.size();
+        SliceList& next = unsent_.front();
+        const std::size_t before = next.remaining();
+        const bool goesOn = write(next, most);
+        most -= std::min(most, before - next.remaining());
+        if (next.remaining() == 0) {
+            freed += next.size();
             unsent_.pop_front();
         }
         if (!goesOn) break;

@@ -5,8 +5,8 @@
 #include <deque>
 #include <mutex>
 #include <optional>
-#include <string>
 
+#include "platform/SliceList.h"
 #include "platform/UniqueFd.h"
 
 namespace platform::lum {
@@ -26,7 +26,7 @@ class FrameSocket {
     };
     /// Writes what the socket takes at once and keeps the frame while a rest of it is unsent. On a
     /// closed or broken socket the frame vanishes.
-    Sent send(std::string frame);
+    Sent send(SliceList frame);
 
     struct Flushed {
         std::size_t freed = 0;       // bytes of frames that are held no more
@@ -49,21 +49,16 @@ class FrameSocket {
     std::size_t close();
 
   private:
-    /// Sends at most `most` bytes of `frame` from `offset` on, and moves it; false when the socket
-    /// takes no more for now.
-    bool write(const std::string& frame, std::size_t& offset, std::size_t most);
+    /// Sends `most` bytes of `frame` (or somewhat more, or all it has) and consumes them; false
+    /// when the socket takes no more for now.
+    bool write(SliceList& frame, std::size_t most);
     std::size_t dropUnsent();
-
-    struct Unsent {
-        std::string frame;
-        std::size_t offset;
-    };
 
     mutable std::mutex mutex_;
     // Written under the mutex, so that nobody sends on a descriptor number that has been closed.
     UniqueFd socket_;
-    std::deque<Unsent> unsent_;  // guarded by mutex_
-    bool broken_ = false;        // guarded by mutex_: the peer reads no more
+    std::deque<SliceList> unsent_;  // guarded by mutex_
+    bool broken_ = false;           // guarded by mutex_: the peer reads no more
     std::atomic<std::size_t> held_ = 0;
 };
 

@@ -206,7 +206,7 @@ void PeerConnection::endTurn() {
 }
 
 void PeerConnection::send(const Message& reply) {
-    Result<std::string> frame = encodeFrame(FrameKind::Reply, reply, kMaxReplyPayload);
+    Result<SliceList> frame = encodeFrame(FrameKind::Reply, reply, kMaxReplyPayload);
     if (!frame) {
         loop_.post([weak = weak_from_this(), reason = frame.error().text] {
             if (auto self = weak.lock()) self->breakOff(reason);

@@ -42,7 +42,7 @@ class ClientConnectionTest : public LumTest {
     void reply(const Message& request, Dictionary body = {}) {
         Message message(std::move(body));
         message.setSerial(request.serial());
-        unwritten += *encodeFrame(FrameKind::Reply, message, kMaxReplyPayload);
+        unwritten += encodeFrame(FrameKind::Reply, message, kMaxReplyPayload)->string();
         write();
     }
     void write() { written += server->write(std::string_view(unwritten).substr(written)); }

@@ -234,7 +234,7 @@ TEST_F(ListenerTest, UnknownObjectsAreEventsAndNothingMore) {
     replySize = 1;
     openAndResume();
     RawPeer peer(path());
-    peer.write(*encodeFrame(FrameKind::Reply, Message(), 100));
+    peer.write(encodeFrame(FrameKind::Reply, Message(), 100)->string());
     EXPECT_TRUE(ask(peer, 7));
     ASSERT_EQ(events.size(), 2u);
     EXPECT_TRUE(events[0].starts_with("unknown ")) << events[0];

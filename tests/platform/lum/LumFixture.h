@@ -83,7 +83,7 @@ inline UniqueFd unixSocket(const std::string& path, int (*use)(int, const sockad
 inline std::string requestFrame(std::uint64_t serial, Dictionary body = {}) {
     Message message(std::move(body));
     message.setSerial(serial);
-    return *encodeFrame(FrameKind::Request, message, kMaxRequestPayload);
+    return encodeFrame(FrameKind::Request, message, kMaxRequestPayload)->string();
 }
 
 /// A peer that writes bytes as it likes; reads never block.
