@@ -6,12 +6,16 @@
 #include <sys/prctl.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <fstream>
+#include <limits>
+#include <string>
 #include <utility>
 
 #include "bench/Failure.h"
+#include "bench/Interrupt.h"
 
 namespace bench {
 
@@ -77,6 +81,32 @@ void Child::stop() {
     if (::poll(&descriptor, 1, 2000) <= 0) ::kill(pid_, SIGKILL);
     ::waitpid(pid_, nullptr, 0);
     pid_ = -1;
+}
+
+void Child::waitUntilIdle() const {
+    constexpr timespec kPause{0, 50'000'000};
+    constexpr int kQuietPauses = 8;
+    constexpr int kMostPauses = 1200;
+    long before = -1;
+    for (int i = 0, quiet = 0; i < kMostPauses && quiet < kQuietPauses; ++i) {
+        checkInterrupted();
+        const long ticks = cpuTicks();
+        quiet = ticks == before ? quiet + 1 : 0;
+        before = ticks;
+        ::nanosleep(&kPause, nullptr);
+    }
+}
+
+long Child::cpuTicks() const {
+    std::ifstream stat(fmt::format("/proc/{}/stat", pid_));
+    // The second field, the name in parentheses, may hold anything; user and system time are the
+    // 12th and 13th after it.
+    stat.ignore(std::numeric_limits<std::streamsize>::max(), ')');
+    std::string skipped;
+    for (int i = 0; i < 11; ++i) stat >> skipped;
+    long user = 0, system = 0;
+    if (!(stat >> user >> system)) fail("process {} is gone", pid_);
+    return user + system;
 }
 
 double Child::residentMegabytes() const {

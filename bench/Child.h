@@ -26,10 +26,15 @@ class Child {
     bool running() const;
     /// Ends the process and waits until it is gone.
     void stop();
+    /// Waits until the process has used no CPU for a while: until it is done with what it does
+    /// after its first replies, such as filling its catalogue. A minute at most.
+    void waitUntilIdle() const;
     /// VmRSS of the process, in MB (10^6 bytes).
     double residentMegabytes() const;
 
   private:
+    long cpuTicks() const;
+
     pid_t pid_ = -1;
     platform::UniqueFd pidfd_;
 };

@@ -14,6 +14,7 @@ struct Run {
     const std::vector<World>& worlds;
     std::string scratch;  // a directory for the echo servers
     bool quick;
+    int freshScans;  // rounds of the one figure that is slow to prepare: files have to go
     Report& report;
 
     const World& largest() const { return worlds.back(); }

@@ -225,6 +225,7 @@ void measureReplies(const Run& run) {
     for (const World& world : run.worlds) {
         daemons.push_back(world.startDaemon());
         waitForSocket(world.socketPath(), daemons.back());
+        daemons.back().waitUntilIdle();
     }
     struct Size {
         std::size_t matches;
