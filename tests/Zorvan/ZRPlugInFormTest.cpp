@@ -91,11 +91,11 @@ TEST(PlugInForm, NeedsEveryFactThatItAlwaysCarries) {
     EXPECT_EQ(missing(*record), "plug-in com.example.a at /a.appex has no original identifier");
     auto bare = ZRPlugInCore::initWithName("a", "/a", {}, {}, {});
     bare->setOriginalIdentifier("a");
-    EXPECT_EQ(missing(*bare), "plug-in a at /a has no version attribute");
+    EXPECT_EQ(missing(*bare), "plug-in a has no version attribute");
     const Dictionary& plugInDictionary = *kInfoPlist.find("VXExtension")->dictionary();
     auto unread = ZRPlugInCore::initWithName("a", "/a", {}, plugInDictionary, {});
     unread->setOriginalIdentifier("a");
-    EXPECT_EQ(missing(*unread), "plug-in a at /a has no Info.plist");
+    EXPECT_EQ(missing(*unread), "plug-in a has no Info.plist");
 }
 
 TEST(PlugInForm, IsReadWithDefaultsForWhatIsMissingOrOfTheWrongType) {

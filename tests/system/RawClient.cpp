@@ -47,8 +47,9 @@ std::string RawClient::frame(std::string_view payload) {
 std::string RawClient::request(const platform::Dictionary& contents) {
     platform::Message message(contents);
     message.setSerial(1);
-    return *platform::lum::encodeFrame(platform::lum::FrameKind::Request, message,
-                                       platform::lum::kMaxRequestPayload);
+    return platform::lum::encodeFrame(platform::lum::FrameKind::Request, message,
+                                      platform::lum::kMaxRequestPayload)
+        ->string();
 }
 
 }  // namespace test

@@ -96,14 +96,14 @@ class MatchResultTest : public testing::Test {
         auto plugIn = world.record(proxy);
         std::optional<ZRError> error;
         auto form = plugIn->exportForm(error);
-        if (result.admit(*plugIn)) result.append(*plugIn, *form);
+        if (result.admit(*plugIn)) result.append(plugIn, *form);
     }
 
     /// The names of the accepted forms, with "+" for an overrider and ">" for what is overridden.
     static std::vector<std::string> outcome(std::uint64_t flags,
                                             const std::vector<Candidate>& candidates) {
         FakeWorld world;
-        MatchResult result(flags);
+        MatchResult result(flags, 0);
         for (const Candidate& candidate : candidates) add(result, world, candidate);
         result.linkOverrides();
         std::vector<std::string> names;

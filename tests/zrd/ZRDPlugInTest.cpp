@@ -59,7 +59,8 @@ TEST_F(ZRDPlugInTest, HubProtocolVersionIsDeclaredOrTellsTheOldStyle) {
     EXPECT_EQ(version({}, true), 1u);
     EXPECT_EQ(version({}, false), 2u);
     EXPECT_EQ(version({{"HubProtocolVersion", "3"}}, false), 2u);
-    EXPECT_EQ(version({{"HubProtocolVersion", std::uint64_t{1} << 32}}, false), 2u);
+    EXPECT_EQ(version({{"HubProtocolVersion", std::uint64_t{1} << 32}}, false), UINT32_MAX);
+    EXPECT_EQ(version({{"HubProtocolVersion", -1}}, false), 0u);
 }
 
 TEST_F(ZRDPlugInTest, RefusesWhatIsMisconfiguredAndSaysWhy) {
