@@ -88,7 +88,7 @@ TEST(PlugInForm, NeedsEveryFactThatItAlwaysCarries) {
     };
     auto record = completePlugIn();
     record->setOriginalIdentifier(std::nullopt);
-    EXPECT_EQ(missing(*record), "plug-in com.example.a at /a.appex has no original identifier");
+    EXPECT_EQ(missing(*record), "plug-in com.example.a has no original identifier");
     auto bare = ZRPlugInCore::initWithName("a", "/a", {}, {}, {});
     bare->setOriginalIdentifier("a");
     EXPECT_EQ(missing(*bare), "plug-in a has no version attribute");
