@@ -116,7 +116,7 @@ class ZRPlugInCore {
     bool isMultiplexed() const { return false; }
     bool isHybrid() const;
     /// Available only inside the application that contains it.
-    bool isDedicated() const;
+    virtual bool isDedicated() const;
     /// Without code: nothing is ever started.
     bool isData() const;
     platform::Date timestamp() const { return {static_cast<double>(lastModified_)}; }

@@ -129,10 +129,14 @@ bool Transaction::processUuidList(
 }
 
 void Transaction::addAnnotationForPlugIn(const ZRDPlugIn& plugIn, Dictionary& in) const {
-    Value annotation = server().annotationForPlugIn(plugIn).value_or(Dictionary());
-    // A form that is left as it is keeps its encoded bytes.
-    const Value* present = in.find(form::kAnnotations);
-    if (!present || *present != annotation) in.set(form::kAnnotations, std::move(annotation));
+    auto annotation = server().annotationForPlugIn(plugIn);
+    if (annotation) {
+        in.set(form::kAnnotations, *std::move(annotation));
+    } else if (!in.encoded()) {
+        // A form that comes straight from its record has an empty annotation and its encoded bytes:
+        // it is left as it is, and so keeps them.
+        in.set(form::kAnnotations, Dictionary());
+    }
 }
 
 void Transaction::done() {

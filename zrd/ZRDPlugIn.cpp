@@ -30,6 +30,9 @@ ZRDPlugIn::ZRDPlugIn(platform::TDPlugInProxyRef proxy, std::shared_ptr<const Plu
       registeredInfo_(tdproxy_->infoPlist.get()),
       registeredPlugIn_(tdproxy_->plugInDictionary()),
       registeredAttributes_(tdproxy_->attributes()),
+      isDedicated_(ZRPlugInCore::isDedicated()),
+      hostEntitlement_(pluginKey(key::kHostEntitlement)),
+      extensionPoint_(attributeOrInfoKey(key::kExtensionPoint)),
       context_(std::move(context)) {}
 
 std::shared_ptr<ZRDPlugIn> ZRDPlugIn::initWithTDData(platform::TDPlugInProxyRef proxy,

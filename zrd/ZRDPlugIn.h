@@ -33,6 +33,7 @@ class ZRDPlugIn final : public ZRPlugInCore {
     const platform::Value* infoKey(std::string_view key) const override;
     const platform::Value* pluginKey(std::string_view key) const override;
     const platform::Value* attribute(std::string_view key) const override;
+    bool isDedicated() const override { return isDedicated_; }
     std::optional<std::string> localizedName() const override;
     void setLocalizedName(std::optional<std::string> value) override;
     std::optional<std::string> localizedShortName() const override;
@@ -80,6 +81,7 @@ class ZRDPlugIn final : public ZRPlugInCore {
     /// rule.
     struct RuleValue;
     RuleValue valueForRule(const std::string& key) const;
+    const platform::Value* attributeOrInfoKey(std::string_view key) const;
     std::string userElection() const;
     bool matchValue(const platform::Value& value, const platform::Value& patterns) const;
     bool matchText(const std::string& value, const std::string& pattern) const;
@@ -94,6 +96,10 @@ class ZRDPlugIn final : public ZRPlugInCore {
     const platform::Dictionary& registeredInfo_;
     const platform::Dictionary* const registeredPlugIn_;
     const platform::Dictionary* const registeredAttributes_;
+    // What every discovery asks of every candidate.
+    const bool isDedicated_;
+    const platform::Value* const hostEntitlement_;
+    const platform::Value* const extensionPoint_;
     const std::shared_ptr<const PlugInContext> context_;
     mutable std::mutex mutex_;  // guards what follows
     mutable std::optional<std::string> localizedName_;

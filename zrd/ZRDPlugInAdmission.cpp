@@ -21,11 +21,11 @@ std::optional<std::string> ZRDPlugIn::allowForClient(const HostProcess& host) co
             return "the host's plug-in entitlement does not allow this plug-in";
         }
     }
-    const Value* demanded = pluginKey(key::kHostEntitlement);
-    if (!demanded) return std::nullopt;
+    if (!hostEntitlement_) return std::nullopt;
     // A demand that names no entitlement cannot be met by anybody.
-    if (!demanded->string() || !host.hasEntitlement(*demanded->string())) {
-        return fmt::format("the host does not have the \"{}\" entitlement", describe(*demanded));
+    if (!hostEntitlement_->string() || !host.hasEntitlement(*hostEntitlement_->string())) {
+        return fmt::format("the host does not have the \"{}\" entitlement",
+                           describe(*hostEntitlement_));
     }
     return std::nullopt;
 }

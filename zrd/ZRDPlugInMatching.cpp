@@ -73,6 +73,11 @@ ZRDPlugIn::RuleValue ZRDPlugIn::valueForRule(const std::string& key) const {
         if (!containingPath()) return RuleValue::neverMatching();
         return *containingPath();
     }
+    if (key == key::kExtensionPoint) return extensionPoint_;
+    return attributeOrInfoKey(key);
+}
+
+const Value* ZRDPlugIn::attributeOrInfoKey(std::string_view key) const {
     if (const Value* value = attribute(key)) return value;
     return infoKey(key);
 }
