@@ -2,8 +2,6 @@
 
 #include <uuid/uuid.h>
 
-#include <cstring>
-
 namespace platform {
 
 Uuid Uuid::random() {
@@ -32,10 +30,3 @@ std::string describe(const Uuid& uuid) {
 }
 
 }  // namespace platform
-
-std::size_t std::hash<platform::Uuid>::operator()(const platform::Uuid& uuid) const noexcept {
-    // Identifiers are random already: any eight bytes of them are a good hash.
-    std::size_t hash = 0;
-    std::memcpy(&hash, uuid.bytes.data(), sizeof hash);
-    return hash;
-}

@@ -3,6 +3,7 @@
 #include <array>
 #include <compare>
 #include <cstdint>
+#include <cstring>
 #include <functional>
 #include <optional>
 #include <string>
@@ -32,5 +33,10 @@ std::string describe(const Uuid& uuid);
 
 template <>
 struct std::hash<platform::Uuid> {
-    std::size_t operator()(const platform::Uuid& uuid) const noexcept;
+    // Identifiers are random already: any eight bytes of them are a good hash.
+    std::size_t operator()(const platform::Uuid& uuid) const noexcept {
+        std::size_t hash = 0;
+        std::memcpy(&hash, uuid.bytes.data(), sizeof hash);
+        return hash;
+    }
 };

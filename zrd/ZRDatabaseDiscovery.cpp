@@ -1,10 +1,11 @@
 // The candidates of a discovery query. The rules themselves are judged later, by matching.
 
 #include <algorithm>
+#include <bit>
 #include <cctype>
 #include <cwctype>
 #include <string>
-#include <unordered_set>
+#include <vector>
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
@@ -33,6 +34,27 @@ std::string describe(const ProxyList& list) {
     }
     return text + ")";
 }
+
+/// A set of at most `most` UUIDs in one piece of memory: thousands pass through here at a request.
+class SeenUuids {
+  public:
+    explicit SeenUuids(std::size_t most) : slots_(std::bit_ceil(2 * most + 1)) {}
+
+    /// Whether the UUID is new.
+    bool insert(const platform::Uuid& uuid) {
+        std::size_t slot = std::hash<platform::Uuid>()(uuid);
+        for (;; ++slot) {
+            auto& held = slots_[slot & (slots_.size() - 1)];
+            if (held == uuid) return false;
+            if (held) continue;
+            held = uuid;
+            return true;
+        }
+    }
+
+  private:
+    std::vector<std::optional<platform::Uuid>> slots_;
+};
 
 /// The first character of valid UTF-8 text that is not empty.
 char32_t firstCharacter(std::string_view text) {
@@ -119,8 +141,7 @@ std::optional<ZRDPlugInList> ZRDatabase::findPlugIns(const Dictionary* query) {
     if (!proxies) return std::nullopt;
     ZRDPlugInList plugIns;
     plugIns.reserve(proxies->size());
-    std::unordered_set<platform::Uuid> seen;
-    seen.reserve(proxies->size());
+    SeenUuids seen(proxies->size());
     for (const auto& proxy : *proxies) {
         if (!proxy->bundlePath) {
             EVLOG_INFO(ops(), "skipping td proxy {} with nil bundleURL", *proxy);
@@ -131,7 +152,7 @@ std::optional<ZRDPlugInList> ZRDatabase::findPlugIns(const Dictionary* query) {
             continue;
         }
         auto plugIn = plugInForProxy(proxy);
-        if (plugIn && seen.insert(plugIn->uuid()).second) plugIns.push_back(std::move(plugIn));
+        if (plugIn && seen.insert(plugIn->uuid())) plugIns.push_back(std::move(plugIn));
     }
     EVLOG_DEBUG(ops(), "TD reported {} plug-ins (cache {}/{})", plugIns.size(), cachedBefore,
                 cacheCount_.load());
