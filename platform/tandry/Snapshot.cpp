@@ -133,8 +133,7 @@ std::optional<Snapshot::Positions> Snapshot::find(const Index& index, const Valu
              place != index.end() && place->first == key; ++place)
             found.push_back(place->second);
     std::ranges::sort(found);
-    auto repeated = std::ranges::unique(found);
-    found.erase(repeated.begin(), repeated.end());
+    found.erase(std::unique(found.begin(), found.end()), found.end());
     return found;
 }
 
