@@ -8,8 +8,8 @@ namespace platform::lum {
 inline constexpr std::size_t kMaxRequestPayload = 16u << 20;
 inline constexpr std::size_t kMaxReplyPayload = 256u << 20;
 
-/// Most values in a request, those inside others included. In memory a value is larger than the byte
-/// that is enough to encode it.
+/// Most values in a request, those inside others included. In memory a value is larger than the
+/// byte that is enough to encode it.
 inline constexpr std::size_t kMaxRequestValues = 1u << 18;
 
 /// A connection's next request is not served while more than this many bytes of its own replies, or

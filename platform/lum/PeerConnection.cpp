@@ -82,6 +82,8 @@ void PeerConnection::readable() {
 }
 
 void PeerConnection::hungUp() {
+    // What wakes us is a hang-up or out-of-band data, which a receive in between may have dropped.
+    if (socket_.hasOutOfBandData() || !socket_.isHungUp()) return breakOff("out-of-band data");
     // What the peer sent last may still be worth an error line.
     while (mayReadOn() && receiveSome()) proceed();
     becomeInvalid("the peer closed the connection");

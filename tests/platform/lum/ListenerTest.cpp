@@ -227,6 +227,11 @@ TEST_F(ListenerTest, AMalformedFrameEndsItsConnectionAlone) {
         EXPECT_GE(errorLines(reason), 1u) << reason;
         EXPECT_TRUE(closes || peer.hasEnded());
     }
+    events.clear();
+    RawPeer peer(path());
+    ASSERT_EQ(::send(peer.fd(), "!", 1, MSG_OOB), 1);
+    EXPECT_TRUE(stepUntil([&] { return events.size() == 1; }));
+    EXPECT_EQ(errorLines("out-of-band data"), 1u);
     EXPECT_TRUE(ask(bystander, 2));
 }
 
