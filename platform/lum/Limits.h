@@ -23,4 +23,8 @@ inline constexpr std::size_t kMaxUnsentTotal = 256u << 20;
 inline constexpr std::size_t kMaxWaitingRequests = 64;
 inline constexpr std::size_t kMaxWaitingBytes = 16u << 20;
 
+/// No connection is accepted while fewer than this many file descriptors are left to the process:
+/// what clients cannot use up is there for the work itself.
+inline constexpr int kReservedDescriptors = 64;
+
 }  // namespace platform::lum

@@ -1,9 +1,13 @@
 #include "platform/lum/Listener.h"
 
+#include <fcntl.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
+#include <climits>
 #include <optional>
 #include <system_error>
 #include <utility>
@@ -11,6 +15,7 @@
 #include "platform/Log.h"
 #include "platform/RunLoop.h"
 #include "platform/UniqueFd.h"
+#include "platform/lum/Limits.h"
 #include "platform/lum/PeerConnection.h"
 #include "platform/lum/ReplyBudget.h"
 #include "platform/lum/ServiceSocket.h"
@@ -32,6 +37,16 @@ bool isExhaustion(int errnum) {
     return errnum == EMFILE || errnum == ENFILE || errnum == ENOBUFS || errnum == ENOMEM;
 }
 
+/// Whether the process could open that many descriptors more. They are counted from the top, where
+/// the free ones are: usually the first that are looked at suffice.
+bool hasFreeDescriptors(int count) {
+    rlimit limit{};
+    if (getrlimit(RLIMIT_NOFILE, &limit) != 0) return true;
+    auto fd = static_cast<int>(std::min<rlim_t>(limit.rlim_cur, INT_MAX));
+    while (count > 0 && fd > 0) count -= fcntl(--fd, F_GETFD) < 0 ? 1 : 0;
+    return count == 0;
+}
+
 }  // namespace
 
 struct Listener::State : std::enable_shared_from_this<Listener::State> {
@@ -41,7 +56,7 @@ struct Listener::State : std::enable_shared_from_this<Listener::State> {
     EventHandler handler;
     std::optional<RunLoop::Watch> watch;  // since `resume`
     RunLoop::Timer pause;
-    bool exhausted = false;  // no descriptors were left at the last try
+    bool exhausted = false;  // descriptors have run short, and hosts have waited since then
     UniqueFd undecided;      // accepted when no descriptors were left to look at its peer
 
     State(SerialQueue& eventQueue, lum::ServiceSocket serviceSocket)
@@ -63,13 +78,13 @@ void Listener::State::acceptSome() {
     queue.assertCurrent();
     auto self = shared_from_this();
     for (int i = 0; i < kMostAcceptedAtOnce && watch; ++i) {
+        if (!hasFreeDescriptors(lum::kReservedDescriptors)) return acceptFailed(EMFILE);
         UniqueFd connected = std::move(undecided);
         if (!connected)
             connected.reset(accept4(socket.fd(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
         if (connected) {
             admit(std::move(connected));
             if (undecided) return acceptFailed(EMFILE);
-            exhausted = false;
         } else if (errno != ECONNABORTED && errno != EINTR) {
             return acceptFailed(errno);
         }
@@ -78,7 +93,10 @@ void Listener::State::acceptSome() {
 }
 
 void Listener::State::acceptFailed(int errnum) {
-    if (errnum == EAGAIN) return awaitConnections();
+    if (errnum == EAGAIN) {
+        exhausted = false;
+        return awaitConnections();
+    }
     const bool first = !std::exchange(exhausted, true);
     if (first || !isExhaustion(errnum)) {
         EVLOG_ERROR(ops(), "cannot accept connections for now: {}",
