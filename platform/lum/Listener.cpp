@@ -11,6 +11,7 @@
 #include <optional>
 #include <system_error>
 #include <utility>
+#include <vector>
 
 #include "platform/Log.h"
 #include "platform/RunLoop.h"
@@ -55,9 +56,12 @@ struct Listener::State : std::enable_shared_from_this<Listener::State> {
     std::shared_ptr<lum::ReplyBudget> budget;
     EventHandler handler;
     std::optional<RunLoop::Watch> watch;  // since `resume`
+    // To be closed at the end. Those that are gone are dropped when the list is full.
+    std::vector<std::weak_ptr<lum::PeerConnection>> connections;
     RunLoop::Timer pause;
     bool exhausted = false;  // descriptors have run short, and hosts have waited since then
-    UniqueFd undecided;      // accepted when no descriptors were left to look at its peer
+    bool closed = false;
+    UniqueFd undecided;  // accepted when no descriptors were left to look at its peer
 
     State(SerialQueue& eventQueue, lum::ServiceSocket serviceSocket)
         : queue(eventQueue),
@@ -72,6 +76,8 @@ struct Listener::State : std::enable_shared_from_this<Listener::State> {
     void acceptSome();
     void acceptFailed(int errnum);
     void admit(UniqueFd connected);
+    void remember(const std::shared_ptr<lum::PeerConnection>& connection);
+    void close();
 };
 
 void Listener::State::acceptSome() {
@@ -123,8 +129,29 @@ void Listener::State::admit(UniqueFd connected) {
         EVLOG_ERROR(ops(), "client {} is not let in: it cannot be told who it is", peer.pid);
         return;
     }
-    handler(std::make_shared<lum::PeerConnection>(std::move(connected), std::move(*token), queue,
-                                                  budget));
+    auto connection = std::make_shared<lum::PeerConnection>(std::move(connected), std::move(*token),
+                                                            queue, budget);
+    remember(connection);
+    handler(std::move(connection));
+}
+
+void Listener::State::remember(const std::shared_ptr<lum::PeerConnection>& connection) {
+    if (connections.size() == connections.capacity()) {
+        std::erase_if(connections, [](const auto& weak) { return weak.expired(); });
+        connections.reserve(std::max<std::size_t>(2 * connections.size(), 16));
+    }
+    connections.push_back(connection);
+}
+
+void Listener::State::close() {
+    // What the connections let go of may be what keeps this alive.
+    auto self = shared_from_this();
+    pause.cancel();
+    watch.reset();
+    undecided.reset();
+    closed = true;
+    for (const auto& weak : std::exchange(connections, {}))
+        if (auto connection = weak.lock()) connection->abandon();
 }
 
 Result<std::unique_ptr<Listener>> Listener::make(const Directories& directories,
@@ -139,8 +166,11 @@ Result<std::unique_ptr<Listener>> Listener::make(const Directories& directories,
 Listener::Listener(std::shared_ptr<State> state) : state_(std::move(state)) {}
 
 Listener::~Listener() {
-    state_->pause.cancel();
-    state_->watch.reset();
+    close();
+}
+
+void Listener::close() {
+    state_->close();
 }
 
 void Listener::setEventHandler(EventHandler handler) {
@@ -150,7 +180,7 @@ void Listener::setEventHandler(EventHandler handler) {
 void Listener::resume() {
     state_->queue.async([weak = std::weak_ptr(state_)] {
         auto state = weak.lock();
-        if (!state || state->watch) return;
+        if (!state || state->watch || state->closed) return;
         state->watch.emplace(state->queue.runLoop(), state->socket.fd());
         state->acceptSome();
     });

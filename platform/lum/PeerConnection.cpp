@@ -244,6 +244,13 @@ void PeerConnection::becomeInvalid(const std::string& reason) {
     if (handler) handler(ConnectionError{ConnectionError::Kind::Invalid, reason});
 }
 
+void PeerConnection::abandon() {
+    auto self = shared_from_this();
+    if (!queue_.isCurrent()) handler_ = nullptr;
+    becomeInvalid("the service has ended");
+    context_.reset();
+}
+
 std::string PeerConnection::description() const {
     return fmt::format("<Connection {} pid={}>", fmt::ptr(this), pid());
 }

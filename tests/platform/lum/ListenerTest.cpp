@@ -353,6 +353,28 @@ TEST_F(ListenerTest, ServesBesideTwoHundredIdleClients) {
     EXPECT_TRUE(stepUntil([&] { return events.size() == 201; }));
 }
 
+TEST_F(ListenerTest, ClosesItsConnectionsWhereverItEnds) {
+    for (const bool onQueue : {true, false}) {
+        contexts.clear();
+        events.clear();
+        openAndResume();
+        RawPeer busy(path()), idle(path());
+        busy.write(requestFrame(1));
+        ASSERT_TRUE(stepUntil([&] { return contexts.size() == 2 && !events.empty(); }));
+        kept.clear();
+        if (onQueue) {
+            queue.async([&] { listener.reset(); });
+            loop.poll();
+            EXPECT_THAT(events, ElementsAre("message 1", "invalid", "invalid"));
+        } else {
+            listener.reset();
+            EXPECT_THAT(events, ElementsAre("message 1")) << "nobody is on the queue";
+        }
+        for (const auto& context : contexts) EXPECT_TRUE(context.expired());
+        EXPECT_TRUE(busy.hasEnded() && idle.hasEnded());
+    }
+}
+
 TEST_F(ListenerTest, WaitsForDescriptors) {
     replySize = 1;
     openAndResume();
