@@ -223,10 +223,10 @@ cbor_callbacks makeCallbacks() {
 /// Reads one item by recursive descent. Each step answers nothing after it has noted what is wrong.
 class Decoder {
   public:
-    Decoder(const EncodedBytes& bytes, CborOptions options)
+    Decoder(const EncodedBytes& bytes, CborOptions options, std::optional<std::size_t> maxValues)
         : source_(bytes),
           keepEncoded_(options == CborOptions::KeepEncoded),
-          valuesLeft_(kMaxCborValues + bytes.bytes.size() / 8) {}
+          valuesLeft_(maxValues.value_or(kMaxCborValues + bytes.bytes.size() / 8)) {}
 
     Result<Value> decode() {
         auto value = readValue(1);
@@ -368,17 +368,21 @@ class Decoder {
 
 }  // namespace
 
-Result<Value> decodeCbor(std::shared_ptr<const std::string> bytes, CborOptions options) {
+Result<Value> decodeCbor(std::shared_ptr<const std::string> bytes, CborOptions options,
+                         std::optional<std::size_t> maxValues) {
     std::string_view all = *bytes;
-    return decodeCbor(EncodedBytes{std::move(bytes), all}, options);
+    return decodeCbor(EncodedBytes{std::move(bytes), all}, options, maxValues);
 }
 
-Result<Value> decodeCbor(const EncodedBytes& bytes, CborOptions options) {
-    return Decoder(bytes, options).decode();
+Result<Value> decodeCbor(const EncodedBytes& bytes, CborOptions options,
+                         std::optional<std::size_t> maxValues) {
+    return Decoder(bytes, options, maxValues).decode();
 }
 
 Result<Value> unpack(const Packed& packed) {
-    auto value = packed.value() ? Result<Value>(*packed.value()) : decodeCbor(packed.bytes());
+    auto value = packed.value()
+                     ? Result<Value>(*packed.value())
+                     : decodeCbor(packed.bytes(), CborOptions::Plain, kUnlimitedCborValues);
     if (value && !isPropertyList(*value, kMaxCborDepth))
         return Error{"Cbor", 2, "not a property list"};
     return value;

@@ -1,6 +1,9 @@
 #pragma once
 
+#include <cstddef>
+#include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -33,9 +36,13 @@ class SliceList;
 /// Deepest nesting of arrays and maps that is read: what stands at the top has depth 1.
 inline constexpr int kMaxCborDepth = 128;
 
-/// Most values that are read from one item: this many, and one more for every eight of its bytes.
-/// A value in memory is larger than the byte that is enough to encode it.
+/// Most values that are read from one item unless the caller says otherwise: this many, and one
+/// more for every eight of its bytes. A value in memory is larger than the byte that is enough to
+/// encode it.
 inline constexpr std::size_t kMaxCborValues = 1u << 20;
+/// No such limit, for whoever has to read everything that `encodeCbor` can write: since each value
+/// takes a byte at least, the length of the bytes is one.
+inline constexpr std::size_t kUnlimitedCborValues = SIZE_MAX;
 
 /// Appends the encoding of `value` to `out`. A dictionary that carries its encoded bytes is copied,
 /// not walked. Never fails.
@@ -62,11 +69,14 @@ enum class CborOptions {
 };
 
 /// Reads the one item that `bytes` holds. Checks counts and lengths against what is left of the
-/// bytes before it allocates, the depth, UTF-8 and duplicate keys; nothing may follow the item. The
-/// error says what is wrong and at which offset (domain "Cbor").
+/// bytes before it allocates, the depth, the number of values (`maxValues`; none means
+/// `kMaxCborValues`), UTF-8 and duplicate keys; nothing may follow the item. The error says what is
+/// wrong and at which offset (domain "Cbor").
 Result<Value> decodeCbor(std::shared_ptr<const std::string> bytes,
-                         CborOptions options = CborOptions::Plain);
-Result<Value> decodeCbor(const EncodedBytes& bytes, CborOptions options = CborOptions::Plain);
+                         CborOptions options = CborOptions::Plain,
+                         std::optional<std::size_t> maxValues = std::nullopt);
+Result<Value> decodeCbor(const EncodedBytes& bytes, CborOptions options = CborOptions::Plain,
+                         std::optional<std::size_t> maxValues = std::nullopt);
 
 /// The value of a packed property list: the one it was made from, or its bytes decoded. Errors: as
 /// `decodeCbor`; a value that is no property list.

@@ -6,8 +6,9 @@
 
 namespace platform {
 
-void programmingError(const std::string& text) {
-    EVLOG_ERROR(Log::make("com.orbel.Zorvan", "ops"), "programming error: {}", pub(text));
+void programmingError(const std::string& text, CodePlace place) {
+    EVLOG_ERROR(Log::make("com.orbel.Zorvan", "ops"), "programming error in {} ({}:{}): {}",
+                pub(place.method), pub(place.file), place.line, pub(text));
     std::abort();
 }
 

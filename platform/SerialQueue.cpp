@@ -5,7 +5,6 @@
 #include <thread>
 #include <utility>
 
-#include "platform/ProgrammingError.h"
 #include "platform/RunLoop.h"
 
 namespace platform {
@@ -51,8 +50,8 @@ bool SerialQueue::isCurrent() const {
     return state_->loop.isCurrent();
 }
 
-void SerialQueue::assertCurrent() const {
-    if (!isCurrent()) programmingError("not on queue \"" + state_->label + "\"");
+void SerialQueue::assertCurrent(CodePlace place) const {
+    if (!isCurrent()) programmingError("not on queue \"" + state_->label + "\"", place);
 }
 
 const std::string& SerialQueue::label() const {

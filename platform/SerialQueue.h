@@ -4,6 +4,8 @@
 #include <memory>
 #include <string>
 
+#include "platform/ProgrammingError.h"
+
 namespace platform {
 
 class RunLoop;
@@ -27,7 +29,7 @@ class SerialQueue {
     void async(std::function<void()> work);
 
     /// Stops the process when the caller does not run on this queue: a programming error.
-    void assertCurrent() const;
+    void assertCurrent(CodePlace place = CodePlace::here()) const;
     bool isCurrent() const;
 
     const std::string& label() const;

@@ -5,6 +5,8 @@
 #include <string>
 #include <thread>
 
+#include "platform/ProgrammingError.h"
+
 namespace platform {
 
 /// A lock that knows its owner: `sync` runs work on the calling thread, one at a time. Entering it
@@ -16,20 +18,20 @@ class SyncQueue {
 
     /// Runs `work`, alone, before it returns, and answers what the work answers.
     template <class Work>
-    decltype(auto) sync(Work&& work) {
-        Entry entry(*this);
+    decltype(auto) sync(Work&& work, CodePlace place = CodePlace::here()) {
+        Entry entry(*this, place);
         return std::forward<Work>(work)();
     }
 
     /// Stops the process when the caller is not inside `sync` of this queue.
-    void assertCurrent() const;
+    void assertCurrent(CodePlace place = CodePlace::here()) const;
 
     const std::string& label() const { return label_; }
 
   private:
     class Entry {
       public:
-        explicit Entry(SyncQueue& queue);
+        Entry(SyncQueue& queue, CodePlace place);
         ~Entry();
 
       private:

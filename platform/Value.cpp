@@ -322,12 +322,12 @@ bool equalsFalse(const Value& value) {
 
 namespace {
 
+/// Writes until the text is full: what lies behind that is not even walked.
 class Describer {
   public:
     std::string text;
 
     void add(const Value& value, bool quoted) {
-        if (text.size() > kMaxDescription) return;
         switch (value.kind()) {
             case Value::Kind::Boolean:
                 text += *value.boolean() ? "true" : "false";
@@ -357,10 +357,7 @@ class Describer {
                 add(*value.dictionary());
                 break;
             case Value::Kind::String:
-                if (quoted)
-                    append("\"{}\"", *value.string());
-                else
-                    text += *value.string();
+                addString(*value.string(), quoted ? "\"" : "");
                 break;
         }
     }
@@ -369,6 +366,7 @@ class Describer {
         text += '[';
         const char* separator = "";
         for (const Value& element : array) {
+            if (isFull()) return;
             text += std::exchange(separator, ", ");
             add(element, true);
         }
@@ -379,14 +377,15 @@ class Describer {
         text += '{';
         const char* separator = "";
         for (const auto& [key, value] : dictionary) {
-            append("{}{}: ", std::exchange(separator, ", "), key);
+            if (isFull()) return;
+            append("{}{}: ", std::exchange(separator, ", "), upToLimit(key));
             add(value, true);
         }
         text += '}';
     }
 
     std::string take() {
-        if (text.size() > kMaxDescription) {
+        if (isFull()) {
             text.resize(kMaxDescription);
             text += "...";
         }
@@ -394,9 +393,19 @@ class Describer {
     }
 
   private:
+    bool isFull() const { return text.size() > kMaxDescription; }
+
+    static std::string_view upToLimit(std::string_view string) {
+        return string.substr(0, kMaxDescription + 1);
+    }
+
     template <class... Arguments>
     void append(fmt::format_string<Arguments...> format, Arguments&&... arguments) {
         fmt::format_to(std::back_inserter(text), format, std::forward<Arguments>(arguments)...);
+    }
+
+    void addString(std::string_view string, const char* quote) {
+        append("{}{}{}", quote, upToLimit(string), quote);
     }
 
     void addInteger(const Value& value) {

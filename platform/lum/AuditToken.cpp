@@ -68,18 +68,30 @@ std::uint64_t ticksSinceBoot() {
            static_cast<std::uint64_t>(now.tv_nsec) * perSecond / 1'000'000'000;
 }
 
+struct FileId {
+    std::uint32_t major, minor;
+    std::uint64_t inode;
+    bool operator==(const FileId&) const = default;
+};
+
+/// Which file a path leads to, as the kernel knows it already: the file may lie in a file system
+/// that the peer serves itself, and nothing is asked of that.
+std::optional<FileId> fileAt(int directory, const char* path) {
+    struct statx status {};
+    if (statx(directory, path, AT_STATX_DONT_SYNC, STATX_TYPE | STATX_INO, &status) != 0)
+        return std::nullopt;
+    return FileId{status.stx_dev_major, status.stx_dev_minor, status.stx_ino};
+}
+
 std::optional<std::string> readExecutable(int procDirectory) {
-    struct stat running {};
-    struct stat named {};
     char path[PATH_MAX];
-    if (fstatat(procDirectory, "exe", &running, 0) != 0) return std::nullopt;
+    const auto running = fileAt(procDirectory, "exe");
+    if (!running) return std::nullopt;
     const ssize_t length = readlinkat(procDirectory, "exe", path, sizeof path);
     if (length <= 0 || length == sizeof path || path[0] != '/') return std::nullopt;
     std::string result(path, static_cast<std::size_t>(length));
     // Also no match: the path of another mount namespace, and "/x (deleted)".
-    if (stat(result.c_str(), &named) != 0 || named.st_dev != running.st_dev ||
-        named.st_ino != running.st_ino)
-        return std::nullopt;
+    if (fileAt(AT_FDCWD, result.c_str()) != running) return std::nullopt;
     return result;
 }
 

@@ -49,7 +49,7 @@ class Connection {
     virtual pid_t pid() const = 0;
     virtual const AuditToken& auditToken() const = 0;
 
-    /// Keeps `context` alive until the connection is destroyed, and releases it then.
+    /// Keeps `context` alive until the connection is destroyed, or its listener closed.
     virtual void setContext(std::shared_ptr<void> context) = 0;
     /// Set before `resume`. Released when the connection has become invalid.
     virtual void setEventHandler(EventHandler handler) = 0;

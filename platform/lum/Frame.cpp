@@ -6,6 +6,7 @@
 #include <utility>
 
 #include "platform/Cbor.h"
+#include "platform/lum/Limits.h"
 
 namespace platform::lum {
 
@@ -47,7 +48,10 @@ Result<SliceList> encodeFrame(FrameKind kind, const Message& message, std::size_
 }
 
 DecodedPayload decodePayload(std::shared_ptr<const std::string> payload, FrameKind expected) {
-    Result<Value> item = decodeCbor(std::move(payload));
+    // Requests are a stranger's; of the daemon's replies, whatever it could write is read.
+    const std::size_t maxValues =
+        expected == FrameKind::Request ? kMaxRequestValues : kUnlimitedCborValues;
+    Result<Value> item = decodeCbor(std::move(payload), CborOptions::Plain, maxValues);
     if (!item) return item.error();
     if (auto message = asMessage(*item, expected)) return std::move(*message);
     return UnknownObject{describe(*item)};

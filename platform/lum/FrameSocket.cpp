@@ -74,9 +74,17 @@ std::optional<std::size_t> FrameSocket::receive(char* buffer, std::size_t size) 
     }
 }
 
+bool FrameSocket::polls(short events) const {
+    pollfd state{socket_.get(), events, 0};
+    return ::poll(&state, 1, 0) > 0 && (state.revents & events);
+}
+
 bool FrameSocket::isHungUp() const {
-    pollfd state{socket_.get(), POLLPRI, 0};
-    return ::poll(&state, 1, 0) > 0 && (state.revents & (POLLHUP | POLLERR | POLLNVAL | POLLPRI));
+    return polls(POLLHUP | POLLERR | POLLNVAL);
+}
+
+bool FrameSocket::hasOutOfBandData() const {
+    return polls(POLLPRI);
 }
 
 std::size_t FrameSocket::close() {

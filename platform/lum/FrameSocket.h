@@ -45,6 +45,9 @@ class FrameSocket {
     /// Whether both ends are closed, or the socket cannot be used on for another reason.
     bool isHungUp() const;
 
+    /// Whether out-of-band data is to be had, which frames never are.
+    bool hasOutOfBandData() const;
+
     /// Closes and drops what is unsent; answers how many bytes were held.
     std::size_t close();
 
@@ -53,6 +56,7 @@ class FrameSocket {
     /// when the socket takes no more for now.
     bool write(SliceList& frame, std::size_t most);
     std::size_t dropUnsent();
+    bool polls(short events) const;
 
     mutable std::mutex mutex_;
     // Written under the mutex, so that nobody sends on a descriptor number that has been closed.

@@ -8,6 +8,10 @@ namespace platform::lum {
 inline constexpr std::size_t kMaxRequestPayload = 16u << 20;
 inline constexpr std::size_t kMaxReplyPayload = 256u << 20;
 
+/// Most values in a request, those inside others included. In memory a value is larger than the
+/// byte that is enough to encode it.
+inline constexpr std::size_t kMaxRequestValues = 1u << 18;
+
 /// A connection's next request is not served while more than this many bytes of its own replies, or
 /// of the replies of all connections together, wait to be read by their hosts. A reply counts with
 /// its whole length until its last byte is written: that is what its memory costs.
@@ -18,5 +22,9 @@ inline constexpr std::size_t kMaxUnsentTotal = 256u << 20;
 /// it.
 inline constexpr std::size_t kMaxWaitingRequests = 64;
 inline constexpr std::size_t kMaxWaitingBytes = 16u << 20;
+
+/// No connection is accepted while fewer than this many file descriptors are left to the process:
+/// what clients cannot use up is there for the work itself.
+inline constexpr int kReservedDescriptors = 64;
 
 }  // namespace platform::lum

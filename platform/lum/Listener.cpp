@@ -1,16 +1,22 @@
 #include "platform/lum/Listener.h"
 
+#include <fcntl.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
+#include <climits>
 #include <optional>
 #include <system_error>
 #include <utility>
+#include <vector>
 
 #include "platform/Log.h"
 #include "platform/RunLoop.h"
 #include "platform/UniqueFd.h"
+#include "platform/lum/Limits.h"
 #include "platform/lum/PeerConnection.h"
 #include "platform/lum/ReplyBudget.h"
 #include "platform/lum/ServiceSocket.h"
@@ -32,6 +38,16 @@ bool isExhaustion(int errnum) {
     return errnum == EMFILE || errnum == ENFILE || errnum == ENOBUFS || errnum == ENOMEM;
 }
 
+/// Whether the process could open that many descriptors more. They are counted from the top, where
+/// the free ones are: usually the first that are looked at suffice.
+bool hasFreeDescriptors(int count) {
+    rlimit limit{};
+    if (getrlimit(RLIMIT_NOFILE, &limit) != 0) return true;
+    auto fd = static_cast<int>(std::min<rlim_t>(limit.rlim_cur, INT_MAX));
+    while (count > 0 && fd > 0) count -= fcntl(--fd, F_GETFD) < 0 ? 1 : 0;
+    return count == 0;
+}
+
 }  // namespace
 
 struct Listener::State : std::enable_shared_from_this<Listener::State> {
@@ -40,9 +56,12 @@ struct Listener::State : std::enable_shared_from_this<Listener::State> {
     std::shared_ptr<lum::ReplyBudget> budget;
     EventHandler handler;
     std::optional<RunLoop::Watch> watch;  // since `resume`
+    // To be closed at the end. Those that are gone are dropped when the list is full.
+    std::vector<std::weak_ptr<lum::PeerConnection>> connections;
     RunLoop::Timer pause;
-    bool exhausted = false;  // no descriptors were left at the last try
-    UniqueFd undecided;      // accepted when no descriptors were left to look at its peer
+    bool exhausted = false;  // descriptors have run short, and hosts have waited since then
+    bool closed = false;
+    UniqueFd undecided;  // accepted when no descriptors were left to look at its peer
 
     State(SerialQueue& eventQueue, lum::ServiceSocket serviceSocket)
         : queue(eventQueue),
@@ -57,19 +76,21 @@ struct Listener::State : std::enable_shared_from_this<Listener::State> {
     void acceptSome();
     void acceptFailed(int errnum);
     void admit(UniqueFd connected);
+    void remember(const std::shared_ptr<lum::PeerConnection>& connection);
+    void close();
 };
 
 void Listener::State::acceptSome() {
     queue.assertCurrent();
     auto self = shared_from_this();
     for (int i = 0; i < kMostAcceptedAtOnce && watch; ++i) {
+        if (!hasFreeDescriptors(lum::kReservedDescriptors)) return acceptFailed(EMFILE);
         UniqueFd connected = std::move(undecided);
         if (!connected)
             connected.reset(accept4(socket.fd(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
         if (connected) {
             admit(std::move(connected));
             if (undecided) return acceptFailed(EMFILE);
-            exhausted = false;
         } else if (errno != ECONNABORTED && errno != EINTR) {
             return acceptFailed(errno);
         }
@@ -78,7 +99,10 @@ void Listener::State::acceptSome() {
 }
 
 void Listener::State::acceptFailed(int errnum) {
-    if (errnum == EAGAIN) return awaitConnections();
+    if (errnum == EAGAIN) {
+        exhausted = false;
+        return awaitConnections();
+    }
     const bool first = !std::exchange(exhausted, true);
     if (first || !isExhaustion(errnum)) {
         EVLOG_ERROR(ops(), "cannot accept connections for now: {}",
@@ -105,8 +129,29 @@ void Listener::State::admit(UniqueFd connected) {
         EVLOG_ERROR(ops(), "client {} is not let in: it cannot be told who it is", peer.pid);
         return;
     }
-    handler(std::make_shared<lum::PeerConnection>(std::move(connected), std::move(*token), queue,
-                                                  budget));
+    auto connection = std::make_shared<lum::PeerConnection>(std::move(connected), std::move(*token),
+                                                            queue, budget);
+    remember(connection);
+    handler(std::move(connection));
+}
+
+void Listener::State::remember(const std::shared_ptr<lum::PeerConnection>& connection) {
+    if (connections.size() == connections.capacity()) {
+        std::erase_if(connections, [](const auto& weak) { return weak.expired(); });
+        connections.reserve(std::max<std::size_t>(2 * connections.size(), 16));
+    }
+    connections.push_back(connection);
+}
+
+void Listener::State::close() {
+    // What the connections let go of may be what keeps this alive.
+    auto self = shared_from_this();
+    pause.cancel();
+    watch.reset();
+    undecided.reset();
+    closed = true;
+    for (const auto& weak : std::exchange(connections, {}))
+        if (auto connection = weak.lock()) connection->abandon();
 }
 
 Result<std::unique_ptr<Listener>> Listener::make(const Directories& directories,
@@ -121,8 +166,11 @@ Result<std::unique_ptr<Listener>> Listener::make(const Directories& directories,
 Listener::Listener(std::shared_ptr<State> state) : state_(std::move(state)) {}
 
 Listener::~Listener() {
-    state_->pause.cancel();
-    state_->watch.reset();
+    close();
+}
+
+void Listener::close() {
+    state_->close();
 }
 
 void Listener::setEventHandler(EventHandler handler) {
@@ -132,7 +180,7 @@ void Listener::setEventHandler(EventHandler handler) {
 void Listener::resume() {
     state_->queue.async([weak = std::weak_ptr(state_)] {
         auto state = weak.lock();
-        if (!state || state->watch) return;
+        if (!state || state->watch || state->closed) return;
         state->watch.emplace(state->queue.runLoop(), state->socket.fd());
         state->acceptSome();
     });

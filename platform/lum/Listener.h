@@ -36,7 +36,7 @@ class Listener {
     static Result<std::unique_ptr<Listener>> make(const Directories& directories,
                                                   const std::string& serviceName,
                                                   SerialQueue& queue);
-    /// On the queue, or while its loop does not run. Connections live on.
+    /// As `close`.
     ~Listener();
 
     /// Called for each accepted connection, which is not resumed yet. The connection keeps itself
@@ -44,6 +44,12 @@ class Listener {
     void setEventHandler(EventHandler handler);
     /// Begins to accept. Hosts that connected earlier have waited in the socket's backlog.
     void resume();
+
+    /// Accepts no more, for good, and closes the connections that are still open: they let go of
+    /// their handlers and contexts. On the queue they get their invalid event before that; there is
+    /// no event where the loop does not run. On the queue (but not from a connection's handler), or
+    /// while its loop does not run.
+    void close();
 
   private:
     struct State;

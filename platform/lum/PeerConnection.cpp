@@ -82,6 +82,8 @@ void PeerConnection::readable() {
 }
 
 void PeerConnection::hungUp() {
+    // What wakes us is a hang-up or out-of-band data, which a receive in between may have dropped.
+    if (socket_.hasOutOfBandData() || !socket_.isHungUp()) return breakOff("out-of-band data");
     // What the peer sent last may still be worth an error line.
     while (mayReadOn() && receiveSome()) proceed();
     becomeInvalid("the peer closed the connection");
@@ -240,6 +242,13 @@ void PeerConnection::becomeInvalid(const std::string& reason) {
     // Its closures may hold the context, which may hold anything: let go of it after the event.
     auto handler = std::exchange(handler_, nullptr);
     if (handler) handler(ConnectionError{ConnectionError::Kind::Invalid, reason});
+}
+
+void PeerConnection::abandon() {
+    auto self = shared_from_this();
+    if (!queue_.isCurrent()) handler_ = nullptr;
+    becomeInvalid("the service has ended");
+    context_.reset();
 }
 
 std::string PeerConnection::description() const {

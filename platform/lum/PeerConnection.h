@@ -38,6 +38,10 @@ class PeerConnection final : public Connection,
     void send(const Message& reply) override;
     std::string description() const override;
 
+    /// Becomes invalid because the service ends, and lets go of the handler and the context. The
+    /// event is for the queue alone: off the queue, where the loop may not run, there is none.
+    void abandon();
+
   private:
     class Turn;
     enum TurnState { Free, Taken, Awaited };

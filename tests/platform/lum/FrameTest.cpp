@@ -6,7 +6,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/Value.h"
+#include "platform/Cbor.h"
+#include "platform/lum/Limits.h"
 
 namespace platform::lum {
 namespace {
@@ -40,8 +41,9 @@ TEST(Frame, IsWhatTheDescriptionShows) {
     Message reply = Message::replyTo(request);
     reply.set("error", "invalid request format (bad rules dictionary)");
     reply.set("errorcode", 4);
-    EXPECT_EQ(documentedFrames(), (std::vector{encodeFrame(FrameKind::Request, request, 1000)->string(),
-                                               encodeFrame(FrameKind::Reply, reply, 1000)->string()}));
+    EXPECT_EQ(documentedFrames(),
+              (std::vector{encodeFrame(FrameKind::Request, request, 1000)->string(),
+                           encodeFrame(FrameKind::Reply, reply, 1000)->string()}));
 }
 
 TEST(Frame, OverTheLimitIsNotEncoded) {
@@ -69,6 +71,19 @@ TEST(Frame, TellsMessagesFromOtherItemsAndFromGarbage) {
 
     for (auto garbage : {""sv, "\x83\x00\x01"sv, "\x83\x00\x01\xa0\x00"sv, "\x83\x00\x01\xf6"sv})
         EXPECT_TRUE(std::holds_alternative<Error>(decode(garbage)));
+}
+
+TEST(Frame, LimitsTheValuesOfRequestsButNotOfReplies) {
+    const auto decodeBody = [](std::size_t values, FrameKind kind) {
+        const std::vector<Value> list(values - 5, Value(0));  // in [kind, serial, {"k": list}]
+        Message message(Dictionary{{"k", Array(list)}});
+        std::string bytes = encodeFrame(kind, message, kMaxReplyPayload)->string();
+        return decode(std::string_view(bytes).substr(kFrameHeaderSize), kind);
+    };
+    EXPECT_TRUE(std::holds_alternative<Message>(decodeBody(kMaxRequestValues, FrameKind::Request)));
+    EXPECT_TRUE(
+        std::holds_alternative<Error>(decodeBody(kMaxRequestValues + 1, FrameKind::Request)));
+    EXPECT_TRUE(std::holds_alternative<Message>(decodeBody(2 * kMaxCborValues, FrameKind::Reply)));
 }
 
 TEST(FrameReader, PutsPiecesTogetherAndCutsRuns) {
