@@ -14,7 +14,9 @@ using platform::Value;
 
 std::optional<Dictionary> ZRPlugInCore::readSDKDictionary(platform::SdkDictionaries& sdks,
                                                           const std::string& name) {
-    auto sdk = sdks.copyExtensionSdkEntry(name);
+    const auto entry = sdks.copyExtensionSdkEntry(name);
+    // Why a file could not be read just now has been logged.
+    std::optional<Dictionary> sdk = entry ? *entry : std::nullopt;
     if (!sdk) EVLOG_DEFAULT(ops(), "plug-in sdk \"{}\" not registered", pub(name));
     return sdk;
 }

@@ -5,6 +5,7 @@
 
 #include "platform/Consent.h"
 #include "platform/Directories.h"
+#include "platform/FileStamp.h"
 #include "platform/Files.h"
 #include "platform/Log.h"
 #include "platform/Notifications.h"
@@ -12,6 +13,7 @@
 #include "platform/PropertyList.h"
 #include "platform/SdkDictionaries.h"
 #include "platform/lum/LumBundle.h"
+#include "tests/support/NoDescriptors.h"
 #include "tests/support/TemporaryDirectory.h"
 
 namespace platform {
@@ -81,19 +83,28 @@ TEST_F(SettingsFiles, BundleAroundAnExecutable) {
 
 TEST_F(SettingsFiles, SdkDictionaryOfTheUserComesFirstAndIsReadAgainWhenItChanges) {
     SdkDictionaries sdks(directories_);
-    EXPECT_EQ(sdks.copyExtensionSdkEntry("point"), std::nullopt);
+    EXPECT_EQ(*sdks.copyExtensionSdkEntry("point"), std::nullopt);
     write("system/zorvan/SDKs/point.plist", Dictionary{{"from", "system"}});
-    EXPECT_EQ(sdks.copyExtensionSdkEntry("point"), (Dictionary{{"from", "system"}}));
+    EXPECT_EQ(*sdks.copyExtensionSdkEntry("point"), (Dictionary{{"from", "system"}}));
     const std::string mine = write("data/zorvan/SDKs/point.plist", Dictionary{{"from", "user"}});
-    EXPECT_EQ(sdks.copyExtensionSdkEntry("point"), (Dictionary{{"from", "user"}}));
+    EXPECT_EQ(*sdks.copyExtensionSdkEntry("point"), (Dictionary{{"from", "user"}}));
     EXPECT_EQ(sdks.candidateFiles("point").at(0), mine);
 
+    write("data/zorvan/SDKs/point.plist", Dictionary{{"from", "anew"}});
+    {
+        const test::NoDescriptors none;
+        EXPECT_EQ(sdks.copyExtensionSdkEntry("point").error().code, EMFILE);
+        EXPECT_EQ(*sdks.copyExtensionSdkEntry("unheard-of"), std::nullopt);
+    }
+    EXPECT_EQ(*sdks.copyExtensionSdkEntry("point"), (Dictionary{{"from", "anew"}}));
+    EXPECT_EQ(std::exchange(errors_, 0), 1);
+
     write("data/zorvan/SDKs/point.plist", Array{"no dictionary"});
-    EXPECT_EQ(sdks.copyExtensionSdkEntry("point"), std::nullopt);
-    EXPECT_EQ(sdks.copyExtensionSdkEntry("point"), std::nullopt);
+    EXPECT_EQ(*sdks.copyExtensionSdkEntry("point"), std::nullopt);
+    EXPECT_EQ(*sdks.copyExtensionSdkEntry("point"), std::nullopt);
     EXPECT_EQ(errors_, 1);
     std::filesystem::remove(mine);
-    EXPECT_EQ(sdks.copyExtensionSdkEntry("point"), (Dictionary{{"from", "system"}}));
+    EXPECT_EQ(*sdks.copyExtensionSdkEntry("point"), (Dictionary{{"from", "system"}}));
 
     for (const std::string& name :
          {std::string("../SDKs/point"), std::string(), std::string(".p"), std::string(250, 'x')})
@@ -116,6 +127,15 @@ TEST_F(SettingsFiles, PreferencesSeeWhatOthersWrite) {
     EXPECT_EQ(value(), Value(Array{"second"}));
     EXPECT_EQ(errors_, 0);
 
+    write(file, Dictionary{{"key", Array{"third!"}}});
+    {
+        const test::NoDescriptors none;
+        EXPECT_EQ(value(), Value(Array{"second"})) << "what cannot be read now takes nothing away";
+        EXPECT_EQ(value(), Value(Array{"second"}));
+        EXPECT_EQ(std::exchange(errors_, 0), 1);
+    }
+    EXPECT_EQ(value(), Value(Array{"third!"}));
+
     for (const char* bytes : {"garbage", "<plist><array/></plist>", ""}) {
         files_.write(file, bytes);
         EXPECT_EQ(value(), std::nullopt);
@@ -125,6 +145,16 @@ TEST_F(SettingsFiles, PreferencesSeeWhatOthersWrite) {
     std::filesystem::remove(files_.path(file));
     EXPECT_EQ(value(), std::nullopt);
     EXPECT_EQ(errors_, 3);
+}
+
+TEST_F(SettingsFiles, StampsSettleAfterAChange) {
+    const std::string file = files_.path("file");
+    do {
+        files_.write("file", "x");
+    } while (fileStamp(file).settled);
+    while (!fileStamp(file).settled) std::this_thread::yield();
+    EXPECT_EQ(fileStamp(files_.path("none")).text, "");
+    EXPECT_TRUE(fileStamp(files_.path("none")).settled);
 }
 
 TEST_F(SettingsFiles, ConsentIsRecordedByApplication) {
