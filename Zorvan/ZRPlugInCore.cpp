@@ -1,5 +1,8 @@
 #include "Zorvan/ZRPlugInCore.h"
 
+#include <algorithm>
+#include <string_view>
+
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
 
@@ -146,9 +149,25 @@ bool ZRPlugInCore::isHybrid() const {
     return pluginKey(key::kEmbeddedCode) != nullptr;
 }
 
+namespace {
+
+/// Whether a text says yes, as authors write it where a boolean belongs.
+bool isAffirmative(std::string_view text) {
+    const auto sameLetter = [](char a, char lower) {
+        return (a >= 'A' && a <= 'Z' ? a - 'A' + 'a' : a) == lower;
+    };
+    for (const std::string_view word : {"yes", "true", "1"})
+        if (std::ranges::equal(text, word, sameLetter)) return true;
+    return false;
+}
+
+}  // namespace
+
 bool ZRPlugInCore::isDedicated() const {
     const Value* dedicated = pluginKey(key::kDedicated);
-    return dedicated && dedicated->isNumber() && !equalsFalse(*dedicated);
+    if (!dedicated) return false;
+    if (const std::string* text = dedicated->string()) return isAffirmative(*text);
+    return dedicated->isNumber() && !equalsFalse(*dedicated);
 }
 
 bool ZRPlugInCore::isData() const {

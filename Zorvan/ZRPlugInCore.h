@@ -115,7 +115,8 @@ class ZRPlugInCore {
     bool isAppExtension() const;
     bool isMultiplexed() const { return false; }
     bool isHybrid() const;
-    /// Available only inside the application that contains it.
+    /// Available only inside the application that contains it: "Dedicated" is a number other than
+    /// 0, or a text that says yes.
     virtual bool isDedicated() const;
     /// Without code: nothing is ever started.
     bool isData() const;

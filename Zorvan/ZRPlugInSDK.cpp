@@ -14,7 +14,9 @@ using platform::Value;
 
 std::optional<Dictionary> ZRPlugInCore::readSDKDictionary(platform::SdkDictionaries& sdks,
                                                           const std::string& name) {
-    auto sdk = sdks.copyExtensionSdkEntry(name);
+    const auto entry = sdks.copyExtensionSdkEntry(name);
+    // Why a file could not be read just now has been logged.
+    std::optional<Dictionary> sdk = entry ? *entry : std::nullopt;
     if (!sdk) EVLOG_DEFAULT(ops(), "plug-in sdk \"{}\" not registered", pub(name));
     return sdk;
 }
@@ -41,12 +43,19 @@ std::optional<Value> mergedValue(std::string_view key, const Value& sdk, const V
 
 Dictionary ZRPlugInCore::mergeDictionary(const Dictionary& sdk, const Dictionary& into) {
     Dictionary result = into;
+    // Added all at once: each addition would move the entries behind it.
+    std::vector<Dictionary::Entry> added;
     for (const auto& [key, value] : sdk) {
-        const Value* own = result.find(key);
-        std::optional<Value> merged = own ? mergedValue(key, value, *own) : value;
-        if (merged) result.set(key, *std::move(merged));
+        const Value* own = into.find(key);
+        if (!own) {
+            added.emplace_back(key, value);
+        } else if (std::optional<Value> merged = mergedValue(key, value, *own)) {
+            result.set(key, *std::move(merged));
+        }
     }
-    return result;
+    if (added.empty()) return result;
+    added.insert(added.end(), result.begin(), result.end());
+    return *Dictionary::fromEntries(std::move(added));
 }
 
 Array ZRPlugInCore::mergeSharedResources(const Array& sdk, const Array& into) {

@@ -8,8 +8,12 @@ namespace platform {
 
 namespace {
 
-/// An item with more types than this is not an offer that anybody means.
+// Nobody means a rule or an offer beyond these. Each type of the offer is compared with each one of
+// the rule at most once, so that an evaluation costs at most their product in questions.
+constexpr std::size_t kMaxTypesOfRule = 256;
+constexpr std::size_t kMaxItems = 4096;
 constexpr std::size_t kMaxTypesOfItem = 256;
+constexpr std::size_t kMaxTypesOfOffer = 16384;
 
 struct Limit {
     const std::string& type;
@@ -17,8 +21,9 @@ struct Limit {
     std::int64_t items = 0;
 };
 
-/// None when the rule has another shape.
+/// None when the rule has another shape, or lists too many types.
 std::optional<std::vector<Limit>> limitsOf(const Dictionary& rule) {
+    if (rule.size() > kMaxTypesOfRule) return std::nullopt;
     std::vector<Limit> limits;
     limits.reserve(rule.size());
     for (const auto& [type, most] : rule) {
@@ -29,7 +34,7 @@ std::optional<std::vector<Limit>> limitsOf(const Dictionary& rule) {
     return limits;
 }
 
-/// The types of an offered item; null when it has another shape.
+/// The types of an offered item; null when it has another shape, or too many of them.
 const Array* typesOf(const Value& item) {
     const Dictionary* dictionary = item.dictionary();
     const Value* value = dictionary ? dictionary->find("types") : nullptr;
@@ -41,8 +46,7 @@ const Array* typesOf(const Value& item) {
 }
 
 /// Counts an item for every limit that one of its types falls under. False when there is none, or
-/// when a limit is exceeded: the count of the items looked at is bounded by the rule's, whatever
-/// the size of the offer.
+/// when a limit is exceeded.
 bool countItem(const Array& itemTypes, std::vector<Limit>& limits, Types& types) {
     bool counted = false;
     for (Limit& limit : limits) {
@@ -65,10 +69,12 @@ bool evaluateActivationRule(const Value& rule, const Dictionary& offer, Types& t
     std::optional<std::vector<Limit>> limits = limitsOf(*dictionary);
     const Value* list = offer.find("items");
     const Array* items = list ? list->array() : nullptr;
-    if (!limits || !items || items->empty()) return false;
+    if (!limits || !items || items->empty() || items->size() > kMaxItems) return false;
+    std::size_t offered = 0;
     for (const Value& item : *items) {
         const Array* itemTypes = typesOf(item);
-        if (!itemTypes || !countItem(*itemTypes, *limits, types)) return false;
+        if (!itemTypes || (offered += itemTypes->size()) > kMaxTypesOfOffer) return false;
+        if (!countItem(*itemTypes, *limits, types)) return false;
     }
     return true;
 }

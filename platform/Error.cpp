@@ -2,6 +2,7 @@
 
 #include <fmt/format.h>
 
+#include <cerrno>
 #include <cstring>
 
 namespace platform {
@@ -14,6 +15,11 @@ Error Error::posix(int errnum, std::string_view what) {
 
 std::string describe(const Error& error) {
     return fmt::format("{} ({} {})", error.text, error.domain, error.code);
+}
+
+bool isTransient(const Error& error) {
+    return error.domain == "POSIX" && (error.code == EMFILE || error.code == ENFILE ||
+                                       error.code == ENOMEM || error.code == EIO);
 }
 
 }  // namespace platform

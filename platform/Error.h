@@ -22,6 +22,10 @@ struct Error {
 
 std::string describe(const Error& error);
 
+/// Whether the same may succeed later with nothing changed on disk: out of descriptors or memory,
+/// or the device failed.
+bool isTransient(const Error& error);
+
 /// A value, or the error that kept it from being made.
 template <class T>
 class [[nodiscard]] Result {

@@ -23,6 +23,9 @@ namespace platform {
 
 namespace {
 
+/// As many bytes of one text as a line shows.
+constexpr std::size_t kMaxText = 64 * 1024;
+
 constexpr std::string_view kLevelNames[] = {"debug", "info", "default", "error", "off"};
 /// Priorities of syslog, by the level of a message.
 constexpr int kPriorities[] = {7, 6, 5, 3};
@@ -116,6 +119,7 @@ void writeToStandardError(const std::string& category, LogLevel level, const std
 namespace detail {
 
 std::string escaped(std::string_view text) {
+    if (text.size() > kMaxText) return escaped(text.substr(0, kMaxText)) + "...";
     std::string result;
     result.reserve(text.size());
     std::size_t valid = validUtf8Prefix(text);

@@ -36,7 +36,7 @@ Public<T> pub(const T& argument) {
 namespace detail {
 
 /// The text of a string argument for the log: control characters and bytes that are not UTF-8
-/// escaped ("\n", else "\xNN"); "(null)" for a null pointer.
+/// escaped ("\n", else "\xNN"), cut after 64 KiB with "..."; "(null)" for a null pointer.
 std::string escaped(std::string_view text);
 inline std::string escaped(const char* text) {
     return escaped(text ? std::string_view(text) : std::string_view("(null)"));

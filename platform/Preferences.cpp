@@ -1,20 +1,12 @@
 #include "platform/Preferences.h"
 
-#include <algorithm>
-
 #include "platform/Directories.h"
 #include "platform/FileStamp.h"
-#include "platform/Log.h"
-#include "platform/PropertyList.h"
+#include "platform/Files.h"
 
 namespace platform {
 
 namespace {
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 /// The name of this host in the names of its preference files.
 std::string machineId() {
@@ -27,20 +19,6 @@ std::string machineId() {
     return usable ? id : "local";
 }
 
-Dictionary readValues(const std::string& path) {
-    const Result<Value> value = readPropertyListFile(path);
-    if (!value) {
-        EVLOG_ERROR(ops(), "cannot read preferences: {}", pub(value.error()));
-        return {};
-    }
-    const Dictionary* dictionary = value->dictionary();
-    if (!dictionary) {
-        EVLOG_ERROR(ops(), "preference file {} is not a dictionary", pub(path));
-        return {};
-    }
-    return *dictionary;
-}
-
 }  // namespace
 
 Preferences::Preferences(const Directories& directories)
@@ -51,18 +29,16 @@ std::string Preferences::path(const std::string& domain) const {
 }
 
 void Preferences::synchronize(const std::string& domain) {
-    Domain& known = domains_[domain];
-    const std::string file = path(domain);
-    // The stamp is older than what is read, so a change in between is seen the next time.
-    std::string stamp = fileStamp(file);
-    if (stamp == known.stamp) return;
-    known.values = stamp.empty() ? Dictionary() : readValues(file);
-    known.stamp = std::move(stamp);
+    const auto known = domains_.try_emplace(domain, path(domain), "preferences").first;
+    DictionaryFile& file = known->second;
+    // What was known stays in force while the file cannot be read.
+    static_cast<void>(file.update(fileStamp(file.path())));
 }
 
 std::optional<Value> Preferences::value(const std::string& domain, const std::string& key) const {
     const auto known = domains_.find(domain);
-    const Value* value = known != domains_.end() ? known->second.values.find(key) : nullptr;
+    if (known == domains_.end() || !known->second.dictionary()) return std::nullopt;
+    const Value* value = known->second.dictionary()->find(key);
     return value ? std::optional(*value) : std::nullopt;
 }
 

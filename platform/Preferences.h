@@ -4,7 +4,7 @@
 #include <optional>
 #include <string>
 
-#include "platform/Files.h"
+#include "platform/DictionaryFile.h"
 #include "platform/Value.h"
 
 namespace platform {
@@ -19,8 +19,9 @@ class Preferences {
     explicit Preferences(const Directories& directories);
 
     /// Makes values that other processes have written since visible: re-reads the domain's file
-    /// when its stamp has changed. A file that cannot be read, or is no dictionary, counts as
-    /// empty, with one error line each time it changes.
+    /// when its stamp has changed. While the file cannot be read the values stay as they were; a
+    /// missing file, or one that is no dictionary, counts as empty. Each fault gives one error line
+    /// until it or the file changes.
     void synchronize(const std::string& domain);
     /// The value of a key as of the last `synchronize`; none when it is absent.
     std::optional<Value> value(const std::string& domain, const std::string& key) const;
@@ -29,13 +30,9 @@ class Preferences {
     std::string path(const std::string& domain) const;
 
   private:
-    struct Domain {
-        std::string stamp;
-        Dictionary values;
-    };
     std::string folder_;
     std::string host_;
-    std::map<std::string, Domain> domains_;
+    std::map<std::string, DictionaryFile> domains_;
 };
 
 }  // namespace platform

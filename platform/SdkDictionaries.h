@@ -1,12 +1,13 @@
 #pragma once
 
 #include <map>
-#include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "platform/DictionaryFile.h"
+#include "platform/Error.h"
 #include "platform/Value.h"
 
 namespace platform {
@@ -21,18 +22,18 @@ class SdkDictionaries {
     explicit SdkDictionaries(const Directories& directories);
 
     /// The dictionary registered for a name. None when there is none, the name could not be a
-    /// file's name, or the file is no dictionary (which is logged).
-    std::optional<Dictionary> copyExtensionSdkEntry(const std::string& name);
+    /// file's name, or the file may not be read or is no dictionary (which is logged). Errors: the
+    /// system's, also logged, when a file cannot be read just now, so that nobody knows.
+    Result<std::optional<Dictionary>> copyExtensionSdkEntry(const std::string& name);
     /// The files that `copyExtensionSdkEntry` would look at for a name, first the one that counts
     /// when it exists; empty for a name that could not be a file's.
     std::vector<std::string> candidateFiles(const std::string& name) const;
     void clear();
 
   private:
-    struct Entry;
     std::vector<std::string> folders_;
-    std::mutex mutex_;  // guards entries_
-    std::map<std::string, std::shared_ptr<const Entry>> entries_;
+    std::mutex mutex_;                               // guards entries_
+    std::map<std::string, DictionaryFile> entries_;  // the file that counts, by name
 };
 
 }  // namespace platform

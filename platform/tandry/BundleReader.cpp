@@ -186,14 +186,16 @@ BundleReader::Reading BundleReader::readPlugIn(const BundleFolder& folder) {
     return reading;
 }
 
-void BundleReader::complete(Dictionary& info, const std::string& sdk) {
-    if (!sdk.empty())
-        if (std::optional<Dictionary> defaults = sdks_.copyExtensionSdkEntry(sdk))
-            info = merge_(*defaults, info);
+std::optional<Error> BundleReader::complete(Dictionary& info, const std::string& sdk) {
+    if (!sdk.empty()) {
+        const Result<std::optional<Dictionary>> defaults = sdks_.copyExtensionSdkEntry(sdk);
+        if (!defaults) return defaults.error();
+        if (*defaults) info = merge_(**defaults, info);
+    }
     const Dictionary* foundPlugIn = dictionaryAt(info, kExtension);
     const Dictionary* foundAttributes =
         foundPlugIn ? dictionaryAt(*foundPlugIn, kAttributes) : nullptr;
-    if (!foundAttributes) return;
+    if (!foundAttributes) return std::nullopt;
 
     Dictionary plugIn = *foundPlugIn;
     Dictionary attributes = *foundAttributes;
@@ -205,6 +207,7 @@ void BundleReader::complete(Dictionary& info, const std::string& sdk) {
     if (point && !attributes.contains(kPointIdentifier)) attributes.set(kPointIdentifier, *point);
     plugIn.set(kAttributes, std::move(attributes));
     info.set(kExtension, std::move(plugIn));
+    return std::nullopt;
 }
 
 Dictionary BundleReader::localizations(const BundleFolder& folder) {
@@ -231,7 +234,8 @@ std::optional<Error> BundleReader::fill(const BundleFolder& folder, PlugInEntry&
     if (sdk && isSafeName(*sdk)) entry.print.sdk = *sdk;
     appendNamedStamps(folder, entry.print, entry.print.stamps);
 
-    complete(info, entry.print.sdk);
+    if (std::optional<Error> error = complete(info, entry.print.sdk))
+        return Error{error->domain, error->code, fmt::format("{}: {}", file, error->text)};
     if (!fitsReplies(info)) return malformed(file, "nested too deeply with its SDK dictionary");
     auto dictionaries = std::make_shared<std::string>();
     encodeCbor(info, *dictionaries);

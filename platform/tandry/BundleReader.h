@@ -67,7 +67,7 @@ class BundleReader {
     std::optional<Error> fill(const BundleFolder& folder, PlugInEntry& entry);
     std::optional<Error> describePlugIn(const BundleFolder& folder, const Dictionary& info,
                                         PlugInEntry& entry);
-    void complete(Dictionary& info, const std::string& sdk);
+    std::optional<Error> complete(Dictionary& info, const std::string& sdk);
     Dictionary localizations(const BundleFolder& folder);
 
     SdkDictionaries& sdks_;

@@ -104,9 +104,16 @@ TEST(ZRPlugInCore, DerivesEverythingThroughItsLookups) {
     EXPECT_EQ(*record.sdkSpec(), Value("com.example.point"));
     EXPECT_EQ(record.embeddedProtocolSpec(), Value("#Data"));
     EXPECT_EQ(record.principalSpec(), std::nullopt);
-    record.elsewhere = {{"Dedicated", "true"}, {"VXExtensionAttributes", "text"}};
-    EXPECT_FALSE(record.isDedicated());
+    record.elsewhere = {{"VXExtensionAttributes", "text"}};
     EXPECT_EQ(record.version(), nullptr);
+    for (const Value& yes : {Value("YES"), Value("True"), Value("1"), Value(2)}) {
+        record.elsewhere.set("Dedicated", yes);
+        EXPECT_TRUE(record.isDedicated()) << describe(yes);
+    }
+    for (const Value& no : {Value("no"), Value("2"), Value("yes "), Value(""), Value(0.0)}) {
+        record.elsewhere.set("Dedicated", no);
+        EXPECT_FALSE(record.isDedicated()) << describe(no);
+    }
 }
 
 template <class Work>

@@ -76,6 +76,9 @@ TEST(Log, ArgumentsCannotForgeLinesOrDriveTheTerminal) {
               "\\xC2\\x9Ba\xC2\xA0");
     EXPECT_EQ(detail::escaped("\xC3(\xED\xA0\x80\xF4\x90\x80\x80\xE2\x82"),
               "\\xC3(\\xED\\xA0\\x80\\xF4\\x90\\x80\\x80\\xE2\\x82");
+    const std::string longest(64 * 1024, 'x');
+    EXPECT_EQ(detail::escaped(longest), longest);
+    EXPECT_EQ(detail::escaped(longest + "y"), longest + "...");
 }
 
 TEST(Log, LinesGoToStandardErrorWholeAndAboveTheLevelOnly) {

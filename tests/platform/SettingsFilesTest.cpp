@@ -4,7 +4,9 @@
 #include <thread>
 
 #include "platform/Consent.h"
+#include "platform/DictionaryFile.h"
 #include "platform/Directories.h"
+#include "platform/FileStamp.h"
 #include "platform/Files.h"
 #include "platform/Log.h"
 #include "platform/Notifications.h"
@@ -29,6 +31,11 @@ class SettingsFiles : public testing::Test {
 
     std::string write(std::string_view relative, const Value& value) const {
         return files_.write(relative, *writeXmlPropertyList(value));
+    }
+    /// Puts a file there that fails with EIO when it is read.
+    void breakFile(std::string_view relative) const {
+        std::filesystem::remove(files_.path(relative));
+        std::filesystem::create_symlink("/proc/self/mem", files_.path(relative));
     }
 
     test::TemporaryDirectory files_;
@@ -81,23 +88,49 @@ TEST_F(SettingsFiles, BundleAroundAnExecutable) {
 
 TEST_F(SettingsFiles, SdkDictionaryOfTheUserComesFirstAndIsReadAgainWhenItChanges) {
     SdkDictionaries sdks(directories_);
-    EXPECT_EQ(sdks.copyExtensionSdkEntry("point"), std::nullopt);
+    EXPECT_EQ(*sdks.copyExtensionSdkEntry("point"), std::nullopt);
     write("system/zorvan/SDKs/point.plist", Dictionary{{"from", "system"}});
-    EXPECT_EQ(sdks.copyExtensionSdkEntry("point"), (Dictionary{{"from", "system"}}));
+    EXPECT_EQ(*sdks.copyExtensionSdkEntry("point"), (Dictionary{{"from", "system"}}));
     const std::string mine = write("data/zorvan/SDKs/point.plist", Dictionary{{"from", "user"}});
-    EXPECT_EQ(sdks.copyExtensionSdkEntry("point"), (Dictionary{{"from", "user"}}));
+    EXPECT_EQ(*sdks.copyExtensionSdkEntry("point"), (Dictionary{{"from", "user"}}));
     EXPECT_EQ(sdks.candidateFiles("point").at(0), mine);
 
+    breakFile("data/zorvan/SDKs/point.plist");
+    EXPECT_EQ(sdks.copyExtensionSdkEntry("point").error().code, EIO);
+    std::filesystem::remove(mine);
+    EXPECT_EQ(std::exchange(errors_, 0), 1);
+
     write("data/zorvan/SDKs/point.plist", Array{"no dictionary"});
-    EXPECT_EQ(sdks.copyExtensionSdkEntry("point"), std::nullopt);
-    EXPECT_EQ(sdks.copyExtensionSdkEntry("point"), std::nullopt);
+    EXPECT_EQ(*sdks.copyExtensionSdkEntry("point"), std::nullopt);
+    EXPECT_EQ(*sdks.copyExtensionSdkEntry("point"), std::nullopt);
     EXPECT_EQ(errors_, 1);
     std::filesystem::remove(mine);
-    EXPECT_EQ(sdks.copyExtensionSdkEntry("point"), (Dictionary{{"from", "system"}}));
+    EXPECT_EQ(*sdks.copyExtensionSdkEntry("point"), (Dictionary{{"from", "system"}}));
 
     for (const std::string& name :
          {std::string("../SDKs/point"), std::string(), std::string(".p"), std::string(250, 'x')})
         EXPECT_TRUE(sdks.candidateFiles(name).empty()) << name;
+}
+
+TEST_F(SettingsFiles, DictionaryStaysUntilItsFileCanBeReadAgain) {
+    const auto content = [](const char* text) { return std::optional(Dictionary{{"key", text}}); };
+    DictionaryFile file(write("file", *content("first")), "test file");
+    EXPECT_FALSE(file.update({"1"}));
+    breakFile("file");
+    for (int i = 0; i < 2; ++i) EXPECT_EQ(file.update({"2"})->code, EIO);
+    EXPECT_EQ(file.dictionary(), content("first"));
+    EXPECT_EQ(errors_, 1);
+    std::filesystem::remove(file.path());
+    write("file", *content("second"));
+    EXPECT_FALSE(file.update({"2"})) << "the stamp was not remembered";
+    EXPECT_EQ(file.dictionary(), content("second"));
+
+    EXPECT_FALSE(file.update({"3", false}));
+    write("file", *content("third"));
+    EXPECT_FALSE(file.update({"3"}));
+    write("file", *content("fourth"));
+    EXPECT_FALSE(file.update({"3"}));
+    EXPECT_EQ(file.dictionary(), content("third")) << "kept once the stamp had settled";
 }
 
 TEST_F(SettingsFiles, PreferencesSeeWhatOthersWrite) {
@@ -125,6 +158,16 @@ TEST_F(SettingsFiles, PreferencesSeeWhatOthersWrite) {
     std::filesystem::remove(files_.path(file));
     EXPECT_EQ(value(), std::nullopt);
     EXPECT_EQ(errors_, 3);
+}
+
+TEST_F(SettingsFiles, StampsSettleAfterAChange) {
+    const std::string file = files_.path("file");
+    do {
+        files_.write("file", "x");
+    } while (fileStamp(file).settled);
+    while (!fileStamp(file).settled) std::this_thread::yield();
+    EXPECT_EQ(fileStamp(files_.path("none")).text, "");
+    EXPECT_TRUE(fileStamp(files_.path("none")).settled);
 }
 
 TEST_F(SettingsFiles, ConsentIsRecordedByApplication) {

@@ -52,6 +52,19 @@ TEST(MimeTypes, FollowAliasesAndSubclassesOfAllDirectories) {
                                {"", "a/top", false}});
 }
 
+TEST(MimeTypes, AreReadAgainAfterAPassingFailure) {
+    const test::TemporaryDirectory files;
+    const std::string broken = files.makeDirectory("mime") + "/subclasses";
+    std::filesystem::create_symlink("/proc/self/mem", broken);
+    const auto types = makeMimeTypes(dataDirectories(files.path(), {}));
+    expectConformance(*types, {{"a/below", "a/above", false}, {"a/b", "A/B", true}});
+    std::filesystem::remove(broken);
+    files.write("mime/subclasses", "a/below a/above\n");
+    expectConformance(*types, {{"a/below", "a/above", true}});
+    files.write("mime/subclasses", "");
+    expectConformance(*types, {{"a/below", "a/above", true}});
+}
+
 TEST(MimeTypes, ReadTheSharedDatabase) {
     if (!std::filesystem::exists("/usr/share/mime/subclasses")) GTEST_SKIP();
     const auto types = makeMimeTypes(dataDirectories("/nowhere", {"/usr/share"}));
@@ -109,6 +122,26 @@ TEST(ActivationRule, CountsConformingItemsOfWellFormedOffers) {
     for (const Case& c : cases)
         EXPECT_EQ(evaluateActivationRule(c.rule, c.offer, *types), c.accepted)
             << describe(c.rule) << " " << describe(c.offer);
+}
+
+TEST(ActivationRule, RefusesWhatWouldTakeTooLong) {
+    class : public Types {
+      public:
+        bool conforms(const std::string&, const std::string&) override { return true; }
+    } types;
+    const auto accepts = [&types](std::size_t listed, std::size_t items, std::size_t typesOfItem) {
+        Dictionary rule;
+        for (std::size_t i = 0; i < listed; ++i) rule.set(std::to_string(i), 10000);
+        const Value item =
+            Dictionary{{"types", Array(std::vector<Value>(typesOfItem, Value("a/b")))}};
+        const Array all(std::vector<Value>(items, item));
+        return evaluateActivationRule(rule, {{"items", all}}, types);
+    };
+    EXPECT_TRUE(accepts(256, 4096, 4));
+    EXPECT_FALSE(accepts(256, 4096, 5));
+    EXPECT_FALSE(accepts(257, 1, 1));
+    EXPECT_FALSE(accepts(1, 4097, 1));
+    EXPECT_FALSE(accepts(1, 1, 257));
 }
 
 }  // namespace

@@ -59,8 +59,12 @@ TEST_F(RegistryTest, CompletesTheDictionaries) {
               {{"QFBundleVersion", "7"}, {"QFBundleShortVersionString", "2"}});
     addPlugIn(apps + "A.app/PlugIns/C.appex", "c", {{"VXExtensionPointIdentifier", "org.point"}});
     addPlugIn(apps + "A.app/PlugIns/D.appex", "d");
+    // Reading this file fails with EIO.
+    std::filesystem::create_symlink("/proc/self/mem", files.path("home/zorvan/SDKs/org.bad.plist"));
+    addPlugIn(apps + "A.app/PlugIns/E.appex", "e", {{"VXExtensionPointIdentifier", "org.bad"}});
     start();
 
+    EXPECT_FALSE(plugIn("e")) << "not without its SDK dictionary";
     TDPlugInProxyRef a = plugIn("a.top");
     ASSERT_TRUE(a);
     EXPECT_EQ(a->bundleIdentifier, "a");

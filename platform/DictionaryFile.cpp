@@ -1,0 +1,62 @@
+#include "platform/DictionaryFile.h"
+
+#include <fmt/format.h>
+
+#include <cerrno>
+
+#include "platform/Log.h"
+#include "platform/PropertyList.h"
+
+namespace platform {
+
+namespace {
+
+const Log& ops() {
+    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
+    return handle;
+}
+
+/// Removed since its stamp was taken.
+bool isMissing(const Error& error) {
+    return error.domain == "POSIX" && error.code == ENOENT;
+}
+
+Result<Dictionary> readDictionary(const std::string& path) {
+    const Result<Value> value = readPropertyListFile(path);
+    if (!value) return value.error();
+    if (const Dictionary* dictionary = value->dictionary()) return *dictionary;
+    return Error{"PropertyList", 0, fmt::format("{}: not a dictionary", path)};
+}
+
+}  // namespace
+
+DictionaryFile::DictionaryFile(std::string path, std::string kind)
+    : path_(std::move(path)), kind_(std::move(kind)) {}
+
+std::optional<Error> DictionaryFile::update(const FileStamp& stamp) {
+    if (stamp_ == stamp.text) return std::nullopt;
+    std::optional<Dictionary> read;
+    if (!stamp.text.empty()) {
+        Result<Dictionary> dictionary = readDictionary(path_);
+        if (dictionary) {
+            read = std::move(*dictionary);
+            reported_.clear();
+        } else if (const Error& error = dictionary.error(); !isMissing(error)) {
+            report(stamp, error);
+            if (error.domain == "POSIX") return error;
+        }
+    }
+    dictionary_ = std::move(read);
+    // The stamp is older than what was read, so a change in between is seen the next time.
+    stamp_ = stamp.settled ? std::optional(stamp.text) : std::nullopt;
+    return std::nullopt;
+}
+
+void DictionaryFile::report(const FileStamp& stamp, const Error& fault) {
+    std::string report = stamp.text + " " + fault.text;
+    if (report == reported_) return;
+    reported_ = std::move(report);
+    EVLOG_ERROR(ops(), "cannot read {}: {}", pub(kind_), pub(fault));
+}
+
+}  // namespace platform
