@@ -190,7 +190,7 @@ TEST_F(RegistryTest, FollowsLinksAndSkipsWhatCannotBeNamed) {
     fs::create_symlink(files.path("opt/Shelf"), files.path(apps + "Shared.app/PlugIns"));
     files.write(apps + "File.app/PlugIns", "not a directory");
     addPlugIn(apps + "Bad\xFF.app/PlugIns/A.appex", "x");
-    addPlugIn(apps + "Bell\a.app/PlugIns/A.appex", "x");
+    addPlugIn(apps + "Line\n.app/PlugIns/A.appex", "x");
     ErrorLines errors;
     start();
     EXPECT_THAT(installed(), ElementsAre("a", "shelved", "stray"));
@@ -199,7 +199,7 @@ TEST_F(RegistryTest, FollowsLinksAndSkipsWhatCannotBeNamed) {
     EXPECT_EQ(plugIn("stray")->containingApplication, nullptr);
     EXPECT_THAT(errors.lines,
                 UnorderedElementsAre(HasSubstr("Loop.app"), HasSubstr("Other.app"),
-                                     HasSubstr("Bad"), HasSubstr("Bell"), HasSubstr("File.app")));
+                                     HasSubstr("Bad"), HasSubstr("Line"), HasSubstr("File.app")));
 }
 
 TEST_F(RegistryTest, MakesDataContainersThatAreTheUsersOwn) {
