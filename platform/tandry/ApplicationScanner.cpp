@@ -183,7 +183,7 @@ bool ApplicationScanner::isForgotten(const BundleFolder& folder) {
         return true;
     }
     state_.forgotten.erase(found);
-    changes_.lists = true;
+    changes_.forgotten.insert(folder.path);
     return false;
 }
 
@@ -194,7 +194,7 @@ bool ApplicationScanner::isRefused(const BundleFolder& folder) {
     if (refusal.pass == pass_) return true;
     if (!reader_.isUnchanged(folder, refusal.print)) {
         state_.refusals.erase(found);
-        changes_.lists = true;
+        changes_.refusals.insert(folder.path);
         return false;
     }
     // Remembered from an earlier run: its author has to be told in this one as well.
@@ -234,7 +234,7 @@ void ApplicationScanner::refuse(const BundleFolder& folder, BundleReader::Readin
     if (isPassing(error)) keep(folder.path);
     if (error.domain == "POSIX") return;
     state_.refusals[folder.path] = {std::move(reading.entry.print), error.text, pass_};
-    changes_.lists = true;
+    changes_.refusals.insert(folder.path);
 }
 
 void ApplicationScanner::install(const BundleFolder& folder, PlugInEntry entry,
@@ -275,15 +275,15 @@ RegistryChanges ApplicationScanner::finish(const std::string& scope) {
         changes_.applications.insert(entry->first);
         state_.applications.erase(entry);
     });
-    auto dropUnmet = [&](auto& list) {
+    auto dropUnmet = [&](auto& list, std::set<std::string>& paths) {
         forEachWithin(list, scope, [&](auto entry) {
             if (entry->second.pass == pass_) return;
+            paths.insert(entry->first);
             list.erase(entry);
-            changes_.lists = true;
         });
     };
-    dropUnmet(state_.forgotten);
-    dropUnmet(state_.refusals);
+    dropUnmet(state_.forgotten, changes_.forgotten);
+    dropUnmet(state_.refusals, changes_.refusals);
     return std::exchange(changes_, {});
 }
 
