@@ -231,20 +231,19 @@ std::optional<Error> DiskWorkspace::registerOnQueue(const std::string& bundlePat
 
     const std::string& path = *canonical;
     const bool isNew = !scanner_.isHeld(path) && state_.registrations.insert(path).second;
-    std::set<std::string> remembered;
-    forEachWithin(state_.forgotten, path, [&](auto entry) {
-        remembered.insert(entry->first);
-        state_.forgotten.erase(entry);
-    });
-    RegistryChanges changes = scanner_.scanPath(path);
-    changes.forgotten.merge(remembered);
+    std::map<std::string, Forgotten> forgotten;
+    forEachWithin(state_.forgotten, path,
+                  [&](auto entry) { forgotten.insert(state_.forgotten.extract(entry)); });
     bool hasPlugIns = false;
-    forEachWithin(state_.plugIns, path, [&](auto) { hasPlugIns = true; });
-    if (!hasPlugIns && isNew) {
-        state_.registrations.erase(path);
-        dropApplications(path, changes);
+    RegistryChanges changes = scanner_.scanPath(path, hasPlugIns);
+    if (hasPlugIns) {
+        for (const auto& [inside, entry] : forgotten) changes.forgotten.insert(inside);
+        if (isNew) changes.registrations.insert(path);
+    } else {
+        state_.forgotten.merge(forgotten);
+        if (isNew) state_.registrations.erase(path);
+        if (isNew) dropApplications(path, changes);
     }
-    if (hasPlugIns && isNew) changes.registrations.insert(path);
     std::optional<Error> error = apply(changes);
     if (hasPlugIns) return error;
     if (!changes.refusal.empty()) return Error{"Registry", 0, changes.refusal};
@@ -264,10 +263,13 @@ bool DiskWorkspace::forgetWithin(const std::string& path, RegistryChanges& chang
     return !changes.uninstalled.empty();
 }
 
-/// Drops an application that no walk would find.
+/// Drops the applications that no walk would find.
 void DiskWorkspace::dropApplications(const std::string& path, RegistryChanges& changes) {
     if (scanner_.isHeld(path)) return;
     forEachWithin(state_.applications, path, [&](auto entry) {
+        bool hasPlugIns = false;
+        forEachWithin(state_.plugIns, entry->first, [&](auto) { hasPlugIns = true; });
+        if (hasPlugIns) return;
         changes.applications.insert(entry->first);
         state_.applications.erase(entry);
     });
@@ -292,6 +294,12 @@ std::optional<Error> DiskWorkspace::unregisterOnQueue(const std::string& bundleP
     const bool hadPlugIns = isKnown && forgetWithin(bundlePath, changes);
     if (!wasRegistered && !hadPlugIns)
         return Error{"Registry", 0, fmt::format("{}: nothing is registered there", bundlePath)};
+    if (!hadPlugIns) {
+        // Links may have led from there to plug-ins elsewhere.
+        RegistryChanges walk = scanner_.scanAll();
+        walk.registrations.merge(changes.registrations);
+        changes = std::move(walk);
+    }
     dropApplications(bundlePath, changes);
     return apply(changes);
 }

@@ -77,7 +77,7 @@ struct RegistryChanges {
     std::set<std::string> registrations;
     std::set<std::string> forgotten;
     std::set<std::string> refusals;
-    std::string refusal;  // why the first refused bundle was, if any was
+    std::string refusal;  // why the first bundle that was refused or not read was, if any was
 
     bool records() const {
         return !installed.empty() || !uninstalled.empty() || !applications.empty();
