@@ -71,6 +71,9 @@ bool ApplicationScanner::isHeld(const std::string& path) const {
 
 void ApplicationScanner::begin() {
     ++pass_;
+    metPlugIns_ = 0;
+    isIncomplete_ = false;
+    unreachable_.clear();
     reader_.beginPass();
 }
 
@@ -80,33 +83,43 @@ RegistryChanges ApplicationScanner::scanAll() {
     return finish({});
 }
 
-RegistryChanges ApplicationScanner::scanPath(const std::string& path) {
+RegistryChanges ApplicationScanner::scanPath(const std::string& path, bool& hasPlugIns) {
     begin();
     bool isKnown = state_.applications.contains(applicationAbove(path));
     visitPath(path);
-    // An application that changed is part of its other plug-ins' records too.
-    if (isKnown && !isApplication(path) && !changes_.applications.empty()) {
-        visitAll();
-        return finish({});
-    }
-    return finish(path);
+    hasPlugIns = metPlugIns_ != 0;
+    // An application that changed is part of its other plug-ins' records too. What was not met may
+    // be there by another road: a registration of its own, or a link.
+    const bool hasChanged = isKnown && !isApplication(path) && !changes_.applications.empty();
+    if (!hasChanged && isAllMet(path)) return finish(path);
+    std::string refusal = changes_.refusal;
+    visitAll();
+    changes_.refusal = std::move(refusal);
+    return finish({});
 }
 
 void ApplicationScanner::visitAll() {
     for (const std::string& folder : folders_)
-        if (std::optional<std::string> canonical = canonicalPath(folder)) visitFolder(*canonical);
-    for (const std::string& path : state_.registrations)
-        if (canonicalPath(path) == path)
-            visitPath(path);
+        if (std::optional<std::string> canonical = canonicalPath(folder))
+            visitFolder(*canonical);
         else
+            unreachable_.push_back(folder);
+    for (const std::string& path : state_.registrations)
+        if (canonicalPath(path) == path) {
+            visitPath(path);
+        } else {
             EVLOG_INFO(ops(), "nothing at registered path {}", path);
+            unreachable_.push_back(path);
+        }
 }
 
 void ApplicationScanner::visitFolder(const std::string& folder) {
     Result<FolderEntries> found = FolderEntries::read(folder);
     if (!found) {
         EVLOG_ERROR(ops(), "cannot look for applications: {}", pub(found.error().text));
-        if (isPassing(found.error())) keep(folder);
+        unreachable_.push_back(folder);
+        // Its links may lead anywhere.
+        if (isPassing(found.error())) isIncomplete_ = true;
         return;
     }
     for (const auto& [name, target] : found->entries) {
@@ -143,7 +156,9 @@ void ApplicationScanner::visitPlugIns(const std::string& application, const std:
     Result<FolderEntries> found = FolderEntries::read(folder);
     if (!found && !isMissing(found.error())) {
         EVLOG_ERROR(ops(), "cannot look for plug-ins: {}", pub(found.error().text));
-        if (isPassing(found.error())) keep(application);
+        if (changes_.refusal.empty()) changes_.refusal = found.error().text;
+        unreachable_.push_back(application);
+        if (isPassing(found.error())) isIncomplete_ = true;
         return;
     }
     TDApplicationProxyRef record = applicationAt(application);
@@ -177,14 +192,10 @@ TDApplicationProxyRef ApplicationScanner::applicationOf(const std::string& plugI
 
 bool ApplicationScanner::isForgotten(const BundleFolder& folder) {
     auto found = state_.forgotten.find(folder.path);
-    if (found == state_.forgotten.end()) return false;
-    if (reader_.isUnchanged(folder, found->second.print)) {
-        found->second.pass = pass_;
-        return true;
-    }
-    state_.forgotten.erase(found);
-    changes_.lists = true;
-    return false;
+    if (found == state_.forgotten.end() || !reader_.isUnchanged(folder, found->second.print))
+        return false;
+    found->second.pass = pass_;
+    return true;
 }
 
 bool ApplicationScanner::isRefused(const BundleFolder& folder) {
@@ -194,7 +205,7 @@ bool ApplicationScanner::isRefused(const BundleFolder& folder) {
     if (refusal.pass == pass_) return true;
     if (!reader_.isUnchanged(folder, refusal.print)) {
         state_.refusals.erase(found);
-        changes_.lists = true;
+        changes_.refusals.insert(folder.path);
         return false;
     }
     // Remembered from an earlier run: its author has to be told in this one as well.
@@ -209,18 +220,27 @@ void ApplicationScanner::visitPlugIn(const BundleFolder& folder,
     auto found = state_.plugIns.find(folder.path);
     if (found != state_.plugIns.end()) {
         PlugInEntry& entry = found->second;
-        if (entry.pass == pass_) return;
+        if (entry.pass == pass_) {
+            ++metPlugIns_;
+            return;
+        }
         if (entry.record->containingApplication == application &&
             reader_.isUnchanged(folder, entry.print)) {
             if (entry.pass == 0 && entry.needsContainer)
                 entry.record->dataContainerPath =
                     containers_.locate(*entry.record->plugInIdentifier);
             entry.pass = pass_;
+            ++metPlugIns_;
             return;
         }
     }
     if (isForgotten(folder) || isRefused(folder)) return;
     BundleReader::Reading reading = reader_.readPlugIn(folder);
+    // One that cannot be read is not known to have changed.
+    if (reading.refusal && reading.refusal->domain == "POSIX")
+        unreachable_.push_back(folder.path);
+    else if (state_.forgotten.erase(folder.path))
+        changes_.forgotten.insert(folder.path);
     if (reading.refusal)
         refuse(folder, std::move(reading));
     else
@@ -231,10 +251,13 @@ void ApplicationScanner::refuse(const BundleFolder& folder, BundleReader::Readin
     const Error& error = *reading.refusal;
     EVLOG_ERROR(ops(), "leaving out a plug-in: {}", pub(error.text));
     if (changes_.refusal.empty()) changes_.refusal = error.text;
-    if (isPassing(error)) keep(folder.path);
-    if (error.domain == "POSIX") return;
+    if (error.domain == "POSIX") {
+        auto known = state_.plugIns.find(folder.path);
+        if (isPassing(error) && known != state_.plugIns.end()) known->second.pass = pass_;
+        return;
+    }
     state_.refusals[folder.path] = {std::move(reading.entry.print), error.text, pass_};
-    changes_.lists = true;
+    changes_.refusals.insert(folder.path);
 }
 
 void ApplicationScanner::install(const BundleFolder& folder, PlugInEntry entry,
@@ -246,44 +269,47 @@ void ApplicationScanner::install(const BundleFolder& folder, PlugInEntry entry,
     if (entry.needsContainer)
         record.dataContainerPath = containers_.locate(*record.plugInIdentifier);
     entry.pass = pass_;
+    ++metPlugIns_;
     changes_.installed.push_back(entry.record);
     auto [place, isNew] = state_.plugIns.try_emplace(folder.path);
     if (!isNew) changes_.uninstalled.push_back(place->second.record);
     place->second = std::move(entry);
 }
 
-/// Counts as met what is known within `scope`.
-void ApplicationScanner::keep(const std::string& scope) {
-    auto meet = [&](auto& list) {
-        forEachWithin(list, scope, [this](auto entry) { entry->second.pass = pass_; });
-    };
-    meet(state_.applications);
-    meet(state_.plugIns);
-    meet(state_.forgotten);
-    meet(state_.refusals);
+bool ApplicationScanner::isAllMet(const std::string& scope) {
+    bool result = true;
+    auto look = [&](auto entry) { result = result && entry->second.pass == pass_; };
+    forEachWithin(state_.applications, scope, look);
+    forEachWithin(state_.plugIns, scope, look);
+    return result;
+}
+
+/// What was forgotten stays so while it cannot be looked at, be it unreadable or on a volume that
+/// is not mounted.
+bool ApplicationScanner::isUnreachable(const std::string& path) const {
+    return std::ranges::any_of(unreachable_,
+                               [&path](const auto& scope) { return isWithin(path, scope); });
 }
 
 /// Drops what lies within `scope` and was not met by this walk.
 RegistryChanges ApplicationScanner::finish(const std::string& scope) {
-    forEachWithin(state_.plugIns, scope, [&](auto entry) {
-        if (entry->second.pass == pass_) return;
-        changes_.uninstalled.push_back(entry->second.record);
-        state_.plugIns.erase(entry);
-    });
-    forEachWithin(state_.applications, scope, [&](auto entry) {
-        if (entry->second.pass == pass_) return;
-        changes_.applications.insert(entry->first);
-        state_.applications.erase(entry);
-    });
-    auto dropUnmet = [&](auto& list) {
-        forEachWithin(list, scope, [&](auto entry) {
+    if (isIncomplete_) return std::exchange(changes_, {});
+    auto dropUnmet = [&](auto& map, auto note) {
+        forEachWithin(map, scope, [&](auto entry) {
             if (entry->second.pass == pass_) return;
-            list.erase(entry);
-            changes_.lists = true;
+            note(*entry);
+            map.erase(entry);
         });
     };
-    dropUnmet(state_.forgotten);
-    dropUnmet(state_.refusals);
+    dropUnmet(state_.plugIns,
+              [&](auto& entry) { changes_.uninstalled.push_back(entry.second.record); });
+    dropUnmet(state_.applications, [&](auto& entry) { changes_.applications.insert(entry.first); });
+    dropUnmet(state_.refusals, [&](auto& entry) { changes_.refusals.insert(entry.first); });
+    forEachWithin(state_.forgotten, scope, [&](auto entry) {
+        if (entry->second.pass == pass_ || isUnreachable(entry->first)) return;
+        changes_.forgotten.insert(entry->first);
+        state_.forgotten.erase(entry);
+    });
     return std::exchange(changes_, {});
 }
 

@@ -20,7 +20,8 @@ class ApplicationScanner {
     /// Walks every application folder and everything that was registered by path.
     RegistryChanges scanAll();
     /// The same for one canonical path alone: that of a plug-in or of an application.
-    RegistryChanges scanPath(const std::string& path);
+    /// `hasPlugIns` says whether good plug-ins were met there.
+    RegistryChanges scanPath(const std::string& path, bool& hasPlugIns);
 
     /// Whether an application folder holds the plug-in or application at a path, so that a walk
     /// would find it by itself.
@@ -45,15 +46,20 @@ class ApplicationScanner {
     TDApplicationProxyRef applicationOf(const std::string& plugInPath);
     bool isForgotten(const BundleFolder& folder);
     bool isRefused(const BundleFolder& folder);
-    void keep(const std::string& scope);
+    bool isAllMet(const std::string& scope);
+    bool isUnreachable(const std::string& path) const;
     RegistryChanges finish(const std::string& scope);
 
     RegistryState& state_;
     BundleReader& reader_;
     DataContainers& containers_;
     std::vector<std::string> folders_;
+    // Of the walk under way:
     Pass pass_ = 0;
     RegistryChanges changes_;
+    std::size_t metPlugIns_ = 0;            // good ones that were looked at
+    bool isIncomplete_ = false;             // something failed that says nothing about the disk
+    std::vector<std::string> unreachable_;  // paths that could not be looked into
 };
 
 }  // namespace platform::tandry

@@ -19,9 +19,6 @@ namespace {
 /// Levels of containers that stand around a bundle's dictionary in a reply, generously.
 constexpr int kReplyLevels = 8;
 
-/// Most bytes that a record's encoded dictionaries may have.
-constexpr std::size_t kMaxRecordSize = 2 * kMaxBundleFile;
-
 constexpr std::size_t kMaxShownName = 80;
 
 constexpr const char* kInfoPlist = "Info.plist";
@@ -33,6 +30,9 @@ constexpr const char* kExtension = "VXExtension";
 constexpr const char* kAttributes = "VXExtensionAttributes";
 constexpr const char* kPointIdentifier = "VXExtensionPointIdentifier";
 constexpr const char* kShortVersion = "QFBundleShortVersionString";
+constexpr const char* kExecutable = "QFBundleExecutable";
+constexpr const char* kIdentifier = "VXExtensionIdentifier";
+constexpr const char* kOriginalIdentifier = "VXOriginalIdentifier";
 
 const Log& ops() {
     static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
@@ -50,6 +50,15 @@ Error malformed(const std::string& file, std::string_view reason) {
     return {"PropertyList", 0, fmt::format("{}: {}", file, reason)};
 }
 
+/// Why a dictionary of a bundle's file cannot be kept: hosts pay for each of its values.
+std::optional<Error> excess(const std::string& file, const Dictionary& dictionary) {
+    if (countValues(dictionary, kMaxBundleValues) > kMaxBundleValues)
+        return malformed(file, "too many values");
+    if (!fitsReplies(dictionary))
+        return malformed(file, "nested too deeply, or control characters");
+    return std::nullopt;
+}
+
 /// The dictionary in a bundle's file. Error ENOENT when there is none.
 Result<Dictionary> readDictionary(const BundleFolder& folder, const char* name) {
     std::string file = joinPath(folder.path, name);
@@ -63,7 +72,7 @@ Result<Dictionary> readDictionary(const BundleFolder& folder, const char* name) 
     if (!value) return malformed(file, value.error().text);
     const Dictionary* dictionary = value->dictionary();
     if (!dictionary) return malformed(file, "not a dictionary");
-    if (!fitsReplies(*value)) return malformed(file, "nested too deeply, or control characters");
+    if (auto error = excess(file, *dictionary)) return *error;
     return *dictionary;
 }
 
@@ -86,6 +95,25 @@ const std::string* identifierAt(const Dictionary& plugIn, const Dictionary& info
                                 std::string_view key) {
     const std::string* text = stringAt(plugIn, key);
     return text ? text : stringAt(info, key);
+}
+
+std::optional<Error> wrongType(const std::string& file, const Dictionary& dictionary,
+                               std::initializer_list<const char*> keysOfStrings) {
+    for (const char* key : keysOfStrings)
+        if (dictionary.contains(key) && !stringAt(dictionary, key))
+            return malformed(file, fmt::format("{} is not a string", key));
+    return std::nullopt;
+}
+
+/// Whether the keys that hosts rely on have values of their types. Readers would refuse each form
+/// made of such a plug-in; its author learns it once, here.
+std::optional<Error> wrongType(const std::string& file, const Dictionary& info,
+                               const Dictionary& plugIn) {
+    if (plugIn.contains(kAttributes) && !dictionaryAt(plugIn, kAttributes))
+        return malformed(file, fmt::format("{} is not a dictionary", kAttributes));
+    if (auto error = wrongType(file, plugIn, {kIdentifier, kOriginalIdentifier})) return error;
+    return wrongType(file, info,
+                     {kIdentifier, kOriginalIdentifier, kBundleIdentifier, kExecutable});
 }
 
 /// Names from files become parts of paths.
@@ -227,8 +255,8 @@ std::optional<Error> BundleReader::fill(const BundleFolder& folder, PlugInEntry&
     const Dictionary* extension = dictionaryAt(info, kExtension);
     if (!extension) return malformed(file, "no \"VXExtension\" dictionary, so not a plug-in");
 
-    const std::string* executable = stringAt(info, "QFBundleExecutable");
-    if (auto error = unsafeName(file, "QFBundleExecutable", executable)) return error;
+    const std::string* executable = stringAt(info, kExecutable);
+    if (auto error = unsafeName(file, kExecutable, executable)) return error;
     if (executable) entry.print.executable = *executable;
     const std::string* sdk = stringAt(*extension, kPointIdentifier);
     if (sdk && isSafeName(*sdk)) entry.print.sdk = *sdk;
@@ -236,18 +264,29 @@ std::optional<Error> BundleReader::fill(const BundleFolder& folder, PlugInEntry&
 
     if (std::optional<Error> error = complete(info, entry.print.sdk))
         return Error{error->domain, error->code, fmt::format("{}: {}", file, error->text)};
-    if (!fitsReplies(info)) return malformed(file, "nested too deeply with its SDK dictionary");
-    auto dictionaries = std::make_shared<std::string>();
-    encodeCbor(info, *dictionaries);
-    entry.infoPlistSize = dictionaries->size();
+    if (auto error = excess(file, info)) return error;
+    if (auto error = encode(folder, info, entry)) return error;
+    return describePlugIn(folder, info, entry);
+}
+
+std::optional<Error> BundleReader::encode(const BundleFolder& folder, const Dictionary& info,
+                                          PlugInEntry& entry) {
     Result<Dictionary> entitlements = readDictionary(folder, kEntitlements);
     if (!entitlements && !isMissing(entitlements.error())) return entitlements.error();
-    encodeCbor(entitlements ? *entitlements : Dictionary(), *dictionaries);
-    // A small binary list may have expanded to something large.
-    if (dictionaries->size() > kMaxRecordSize) return malformed(file, "too large when expanded");
+    auto dictionaries = std::make_shared<std::string>();
+    auto append = [&](const char* name, const Dictionary& dictionary) -> std::optional<Error> {
+        encodeCbor(dictionary, *dictionaries);
+        // A small binary list may have expanded to something large.
+        if (dictionaries->size() <= kMaxRecordSize) return std::nullopt;
+        return malformed(joinPath(folder.path, name), "too large when expanded");
+    };
+    if (auto error = append(kInfoPlist, info)) return error;
+    entry.infoPlistSize = dictionaries->size();
+    if (auto error = append(kEntitlements, entitlements ? *entitlements : Dictionary()))
+        return error;
     entry.dictionaries = std::move(dictionaries);
     entry.attachDictionaries();
-    return describePlugIn(folder, info, entry);
+    return std::nullopt;
 }
 
 std::optional<Error> BundleReader::describePlugIn(const BundleFolder& folder,
@@ -256,19 +295,22 @@ std::optional<Error> BundleReader::describePlugIn(const BundleFolder& folder,
     const Dictionary* extension = dictionaryAt(info, kExtension);
     if (!extension) return malformed(file, "the merge lost the \"VXExtension\" dictionary");
     const Dictionary& plugIn = *extension;
+    if (auto error = wrongType(file, info, plugIn)) return error;
     const std::string* bundle = stringAt(info, kBundleIdentifier);
-    const std::string* identifier = identifierAt(plugIn, info, "VXExtensionIdentifier");
+    const std::string* identifier = identifierAt(plugIn, info, kIdentifier);
     if (!identifier) identifier = bundle;
-    const std::string* original = identifierAt(plugIn, info, "VXOriginalIdentifier");
+    if (!identifier)
+        return malformed(file, fmt::format("neither {} nor {}", kIdentifier, kBundleIdentifier));
+    const std::string* original = identifierAt(plugIn, info, kOriginalIdentifier);
     if (!original) original = identifier;
     if (auto error = unsafeName(file, kBundleIdentifier, bundle)) return error;
-    if (auto error = unsafeName(file, "VXExtensionIdentifier", identifier)) return error;
+    if (auto error = unsafeName(file, kIdentifier, identifier)) return error;
 
     TDPlugInProxy& record = *entry.record;
     record.bundlePath = folder.path;
     if (bundle) record.bundleIdentifier = *bundle;
-    if (identifier) record.plugInIdentifier = *identifier;
-    if (original) record.originalIdentifier = *original;
+    record.plugInIdentifier = *identifier;
+    record.originalIdentifier = *original;
     const std::string* version = stringAt(info, "QFBundleVersion");
     if (!version) version = stringAt(info, kShortVersion);
     if (version) record.bundleVersion = *version;
@@ -280,7 +322,7 @@ std::optional<Error> BundleReader::describePlugIn(const BundleFolder& folder,
     entry.points = pointsOf(info, dictionaryAt(plugIn, kAttributes));
     const Value* protocol = plugIn.find("VXExtensionProtocol");
     bool isData = protocol && *protocol == Value("#Data");
-    entry.needsContainer = identifier && !isData;
+    entry.needsContainer = !isData;
     return std::nullopt;
 }
 

@@ -14,6 +14,10 @@ namespace platform::tandry {
 /// Largest property list that is read from a bundle. Real ones have a few KiB; each of them travels
 /// in replies.
 inline constexpr std::size_t kMaxBundleFile = 1u << 20;
+/// Most values in one property list of a bundle, also with its SDK dictionary merged.
+inline constexpr std::size_t kMaxBundleValues = 16384;
+/// Most bytes of a plug-in's encoded dictionaries: Info.plist and entitlements.
+inline constexpr std::size_t kMaxRecordSize = 256u << 10;
 
 /// Where a bundle lies: its canonical path, and how its files are reached with few look-ups.
 struct BundleFolder {
@@ -48,7 +52,7 @@ class BundleReader {
     /// `print` with the stamps that the bundle's files have now.
     Fingerprint refreshed(const BundleFolder& folder, Fingerprint print);
 
-    /// Reads a plug-in bundle: an Info.plist with a "VXExtension" dictionary.
+    /// Reads a plug-in bundle: an Info.plist with a "VXExtension" dictionary and an identifier.
     Reading readPlugIn(const BundleFolder& folder);
 
     /// The stamps of the files that go into an application's record.
@@ -65,6 +69,8 @@ class BundleReader {
                            std::string& stamps);
     const std::string& sdkStamps(const std::string& sdk);
     std::optional<Error> fill(const BundleFolder& folder, PlugInEntry& entry);
+    std::optional<Error> encode(const BundleFolder& folder, const Dictionary& info,
+                                PlugInEntry& entry);
     std::optional<Error> describePlugIn(const BundleFolder& folder, const Dictionary& info,
                                         PlugInEntry& entry);
     std::optional<Error> complete(Dictionary& info, const std::string& sdk);

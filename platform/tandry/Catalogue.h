@@ -14,39 +14,40 @@ namespace platform::tandry {
 /// The registry's state on disk: a cache of what the bundles say, and the home of the UUIDs and of
 /// what was registered or forgotten by path. Belongs to the registry's thread once made.
 ///
-/// Failures never reach the caller: they are logged, and the registry goes on in memory.
+/// Without a usable file the registry goes on in memory, and each save tries again. Every failure
+/// is logged here.
 class Catalogue {
   public:
-    /// The catalogue `Tandry.db` in a directory, which is made when missing. Takes a lock beside it
-    /// that is held for life; nothing is read yet. Error: the directory cannot be used, or another
-    /// process holds the lock (EADDRINUSE).
-    static Result<std::unique_ptr<Catalogue>> open(const std::string& directory);
+    /// The catalogue `Tandry.db` in a directory. Takes a lock beside it that is held for life;
+    /// nothing is read yet. Error: another process holds the lock (EADDRINUSE).
+    static Result<std::unique_ptr<Catalogue>> open(std::string directory);
 
-    /// What is stored. A catalogue that is damaged, cannot be read or has another version is set
-    /// aside under another name, with an error line, and an empty one takes its place.
+    /// What is stored. A catalogue that is damaged or has another version is set aside under
+    /// another name, with an error line, and an empty one takes its place. One that cannot be read
+    /// for any other reason stays as it is, and nothing counts as stored.
     RegistryState load();
 
-    /// Stores, in one transaction, what `changes` says has changed of `state`.
-    void save(const RegistryState& state, const RegistryChanges& changes);
+    /// Stores, in one transaction that outlives a power failure, what `changes` says has changed of
+    /// `state`, and whatever an earlier save failed to store. The error says why nothing was.
+    std::optional<Error> save(const RegistryState& state, const RegistryChanges& changes);
 
   private:
-    Catalogue(std::string path, UniqueFd lock);
+    explicit Catalogue(std::string directory);
 
+    std::optional<Error> takeLock();
     std::optional<Error> openDatabase();
-    std::optional<Error> read(RegistryState& state);
-    std::optional<Error> readApplications(RegistryState& state);
-    std::optional<Error> readPlugIns(RegistryState& state);
-    std::optional<Error> readLists(RegistryState& state);
-    std::optional<Error> write(const RegistryState& state, const RegistryChanges& changes);
-    std::optional<Error> writeApplications(const RegistryState& state,
-                                           const RegistryChanges& changes);
-    std::optional<Error> writePlugIns(const RegistryState& state, const RegistryChanges& changes);
-    std::optional<Error> writeLists(const RegistryState& state);
+    std::optional<Error> prepareDatabase();
+    std::optional<Error> store(const RegistryState& state, const RegistryChanges& changes);
+    std::optional<Error> writeAll(const RegistryState& state);
+    bool isDamage(const Error& error) const;
     bool setAside(const Error& reason);
 
+    std::string directory_;
     std::string path_;
-    UniqueFd lock_;
-    SqliteDatabase database_;  // none while the registry works in memory alone
+    UniqueFd lock_;                // none when it could not be made
+    SqliteDatabase database_;      // none while the registry works in memory alone
+    bool isStale_ = false;         // the file differs from the state by more than the next changes
+    bool hasUnreadLists_ = false;  // the file may hold registrations that the state lacks
 };
 
 }  // namespace platform::tandry

@@ -71,9 +71,9 @@ class DiskWorkspace final : public Workspace {
     std::optional<Error> registerOnQueue(const std::string& bundlePath);
     std::optional<Error> unregisterOnQueue(const std::string& bundlePath);
     void dropApplications(const std::string& path, RegistryChanges& changes);
-    bool dropRegistrations(const std::string& path);
+    bool dropRegistrations(const std::string& path, RegistryChanges& changes);
     bool forgetWithin(const std::string& path, RegistryChanges& changes);
-    void apply(const RegistryChanges& changes);
+    std::optional<Error> apply(const RegistryChanges& changes);
 
     SdkDictionaries& sdks_;
     CurrentSnapshot current_;
@@ -147,7 +147,8 @@ void DiskWorkspace::firstScan() {
     EVLOG_INFO(ops(), "{} plug-ins in {} applications, {} new, {} gone", state_.plugIns.size(),
                state_.applications.size(), changes.installed.size(), changes.uninstalled.size());
     if (!changes.records()) publish();
-    apply(changes);
+    // The catalogue has told of a failure, and nobody waits for an answer.
+    static_cast<void>(apply(changes));
 }
 
 void DiskWorkspace::publish() {
@@ -156,17 +157,17 @@ void DiskWorkspace::publish() {
 }
 
 /// The record that goes is hidden before its observers hear of it, so that what they drop is not
-/// built again; the catalogue changes after them.
-void DiskWorkspace::apply(const RegistryChanges& changes) {
-    if (!changes.records() && !changes.lists) return;
+/// built again; the catalogue changes after them. The error says why it did not.
+std::optional<Error> DiskWorkspace::apply(const RegistryChanges& changes) {
     if (changes.records()) publish();
     if (!changes.uninstalled.empty())
         for (WorkspaceObserver* observer : observers_)
             observer->pluginsWillUninstall(changes.uninstalled);
-    catalogue_->save(state_, changes);
+    std::optional<Error> error = catalogue_->save(state_, changes);
     if (!changes.installed.empty())
         for (WorkspaceObserver* observer : observers_)
             observer->pluginsDidInstall(changes.installed);
+    return error;
 }
 
 TDPlugInProxyRef DiskWorkspace::plugInWithUuid(const Uuid& uuid) {
@@ -230,21 +231,21 @@ std::optional<Error> DiskWorkspace::registerOnQueue(const std::string& bundlePat
 
     const std::string& path = *canonical;
     const bool isNew = !scanner_.isHeld(path) && state_.registrations.insert(path).second;
-    bool wasForgotten = false;
-    forEachWithin(state_.forgotten, path, [&](auto entry) {
-        state_.forgotten.erase(entry);
-        wasForgotten = true;
-    });
-    RegistryChanges changes = scanner_.scanPath(path);
+    std::map<std::string, Forgotten> forgotten;
+    forEachWithin(state_.forgotten, path,
+                  [&](auto entry) { forgotten.insert(state_.forgotten.extract(entry)); });
     bool hasPlugIns = false;
-    forEachWithin(state_.plugIns, path, [&](auto) { hasPlugIns = true; });
-    if (!hasPlugIns && isNew) {
-        state_.registrations.erase(path);
-        dropApplications(path, changes);
+    RegistryChanges changes = scanner_.scanPath(path, hasPlugIns);
+    if (hasPlugIns) {
+        for (const auto& [inside, entry] : forgotten) changes.forgotten.insert(inside);
+        if (isNew) changes.registrations.insert(path);
+    } else {
+        state_.forgotten.merge(forgotten);
+        if (isNew) state_.registrations.erase(path);
+        if (isNew) dropApplications(path, changes);
     }
-    changes.lists = changes.lists || wasForgotten || (hasPlugIns && isNew);
-    apply(changes);
-    if (hasPlugIns) return std::nullopt;
+    std::optional<Error> error = apply(changes);
+    if (hasPlugIns) return error;
     if (!changes.refusal.empty()) return Error{"Registry", 0, changes.refusal};
     return Error{"Registry", 0, fmt::format("{}: no plug-ins in this application", path)};
 }
@@ -256,41 +257,51 @@ bool DiskWorkspace::forgetWithin(const std::string& path, RegistryChanges& chang
         changes.uninstalled.push_back(entry->second.record);
         BundleFolder folder(entry->first);
         state_.forgotten[entry->first] = {reader_.refreshed(folder, entry->second.print)};
+        changes.forgotten.insert(entry->first);
         state_.plugIns.erase(entry);
     });
     return !changes.uninstalled.empty();
 }
 
-/// Drops an application that no walk would find.
+/// Drops the applications that no walk would find.
 void DiskWorkspace::dropApplications(const std::string& path, RegistryChanges& changes) {
     if (scanner_.isHeld(path)) return;
     forEachWithin(state_.applications, path, [&](auto entry) {
+        bool hasPlugIns = false;
+        forEachWithin(state_.plugIns, entry->first, [&](auto) { hasPlugIns = true; });
+        if (hasPlugIns) return;
         changes.applications.insert(entry->first);
         state_.applications.erase(entry);
     });
 }
 
 /// Drops the registrations of a path and of the plug-ins inside; answers whether there were any.
-bool DiskWorkspace::dropRegistrations(const std::string& path) {
-    return std::erase_if(state_.registrations, [&path](const std::string& registered) {
-               return isWithin(registered, path);
+bool DiskWorkspace::dropRegistrations(const std::string& path, RegistryChanges& changes) {
+    return std::erase_if(state_.registrations, [&](const std::string& registered) {
+               if (!isWithin(registered, path)) return false;
+               changes.registrations.insert(registered);
+               return true;
            }) != 0;
 }
 
 std::optional<Error> DiskWorkspace::unregisterOnQueue(const std::string& bundlePath) {
     RegistryChanges changes;
-    changes.lists = true;
     // Only what a path names goes, never what merely lies below some directory.
     const bool isKnown = state_.plugIns.contains(bundlePath) ||
                          state_.applications.contains(bundlePath) ||
                          state_.registrations.contains(bundlePath);
-    const bool wasRegistered = isKnown && dropRegistrations(bundlePath);
+    const bool wasRegistered = isKnown && dropRegistrations(bundlePath, changes);
     const bool hadPlugIns = isKnown && forgetWithin(bundlePath, changes);
     if (!wasRegistered && !hadPlugIns)
         return Error{"Registry", 0, fmt::format("{}: nothing is registered there", bundlePath)};
+    if (!hadPlugIns) {
+        // Links may have led from there to plug-ins elsewhere.
+        RegistryChanges walk = scanner_.scanAll();
+        walk.registrations.merge(changes.registrations);
+        changes = std::move(walk);
+    }
     dropApplications(bundlePath, changes);
-    apply(changes);
-    return std::nullopt;
+    return apply(changes);
 }
 
 }  // namespace

@@ -17,8 +17,8 @@ using SdkMerge = std::function<Dictionary(const Dictionary& sdk, const Dictionar
 namespace tandry {
 
 /// The registry over this user's disk, with a catalogue at <data>/zorvan/Tandry.db. `sdks` must
-/// outlive it. Error: the catalogue's directory cannot be used, or another process owns it
-/// (EADDRINUSE).
+/// outlive it. A catalogue that cannot be used is told of in an error line, and the registry works
+/// in memory. Error: another process owns the catalogue (EADDRINUSE).
 Result<std::unique_ptr<Workspace>> openDiskWorkspace(const Directories& directories,
                                                      SdkDictionaries& sdks, SdkMerge merge);
 

@@ -52,13 +52,16 @@ void add(FolderEntries& found, const std::string& folder, const dirent& entry) {
     if (isUsablePath(real))
         found.entries.push_back({entry.d_name, std::move(target)});
     else
-        EVLOG_ERROR(ops(), "skipping {}: its path is not UTF-8 text", pub(real));
+        EVLOG_ERROR(ops(), "skipping {}: its path is not UTF-8 text, or has control characters",
+                    pub(real));
 }
 
 }  // namespace
 
 bool isUsablePath(const std::string& path) {
-    return isValidUtf8(path) && isPropertyList(Value(path));
+    auto isControl = [](unsigned char c) { return c < 0x20 || c == 0x7F; };
+    return isValidUtf8(path) && std::ranges::none_of(path, isControl) &&
+           isPropertyList(Value(path));
 }
 
 Result<FolderEntries> FolderEntries::read(const std::string& path) {

@@ -31,7 +31,7 @@ struct FolderEntries {
     static Result<FolderEntries> read(const std::string& path);
 };
 
-/// Whether a path can stand in messages: valid UTF-8 without control characters.
+/// Whether a path can stand in messages: valid UTF-8 without ASCII control characters.
 bool isUsablePath(const std::string& path);
 
 }  // namespace platform::tandry

@@ -73,13 +73,16 @@ struct RegistryState {
 struct RegistryChanges {
     TDPlugInProxyList installed;
     TDPlugInProxyList uninstalled;
-    std::set<std::string> applications;  // came, changed or went
-    bool lists = false;                  // registrations, forgotten or refusals changed
-    std::string refusal;                 // why the first refused bundle was, if any was
+    std::set<std::string> applications;  // paths of what came, changed or went, as below
+    std::set<std::string> registrations;
+    std::set<std::string> forgotten;
+    std::set<std::string> refusals;
+    std::string refusal;  // why the first bundle that was refused or not read was, if any was
 
     bool records() const {
         return !installed.empty() || !uninstalled.empty() || !applications.empty();
     }
+    bool lists() const { return !registrations.empty() || !forgotten.empty() || !refusals.empty(); }
 };
 
 inline bool isOnSystemPartition(std::string_view path) {

@@ -1,7 +1,6 @@
 #include "platform/tandry/Snapshot.h"
 
 #include <algorithm>
-#include <iterator>
 
 namespace platform::tandry {
 
@@ -46,6 +45,13 @@ std::optional<std::vector<std::uint64_t>> patternKeys(const Value& pattern) {
     return keys;
 }
 
+template <class List>
+void sortUnique(List& list) {
+    std::ranges::sort(list);
+    auto repeated = std::ranges::unique(list);
+    list.erase(repeated.begin(), repeated.end());
+}
+
 std::string_view pathOf(const TDPlugInProxyRef& plugIn) {
     return *plugIn->bundlePath;
 }
@@ -87,12 +93,10 @@ Snapshot::Snapshot(const RegistryState& state) {
         }
         if (record->plugInIdentifier)
             identifiers_.emplace_back(comparisonKey(*record->plugInIdentifier), position);
-        else
-            withoutIdentifier_.push_back(position);
     }
     std::ranges::sort(uuids_);
-    std::ranges::sort(points_);
-    std::ranges::sort(identifiers_);
+    sortUnique(points_);
+    sortUnique(identifiers_);
     applications_.reserve(state.applications.size());
     for (const auto& [path, entry] : state.applications) applications_.push_back(entry.record);
 }
@@ -123,29 +127,26 @@ TDPlugInProxyList Snapshot::plugInsOfApplication(const std::string& path) const 
 }
 
 /// The sorted positions under the keys of a pattern; none when there is nothing to narrow by.
-std::optional<Snapshot::Positions> Snapshot::find(const Index& index, const Value* pattern) {
+std::optional<Snapshot::Positions> Snapshot::find(const Index& index, const Value* pattern) const {
     std::optional<std::vector<std::uint64_t>> keys;
     if (pattern) keys = patternKeys(*pattern);
     if (!keys) return std::nullopt;
+    sortUnique(*keys);
     Positions found;
-    for (std::uint64_t key : *keys)
+    for (std::uint64_t key : *keys) {
+        // One plug-in may have many keys: then looking at each plug-in once costs less.
+        if (found.size() > plugIns_.size()) return std::nullopt;
         for (auto place = std::ranges::lower_bound(index, key, {}, &Index::value_type::first);
              place != index.end() && place->first == key; ++place)
             found.push_back(place->second);
-    std::ranges::sort(found);
-    found.erase(std::unique(found.begin(), found.end()), found.end());
+    }
+    sortUnique(found);
     return found;
 }
 
 TDPlugInProxyList Snapshot::candidates(const Dictionary& query) const {
     std::optional<Positions> byPoint = find(points_, query.find("VXExtensionPointIdentifier"));
     std::optional<Positions> byIdentifier = find(identifiers_, query.find("VXExtensionIdentifier"));
-    if (byIdentifier) {
-        // Without an identifier a rule on it is judged by the dictionaries.
-        Positions all;
-        std::ranges::merge(*byIdentifier, withoutIdentifier_, std::back_inserter(all));
-        byIdentifier = std::move(all);
-    }
     if (!byPoint && !byIdentifier) return plugIns_;
     const bool pointIsBetter = byPoint && (!byIdentifier || byPoint->size() < byIdentifier->size());
     TDPlugInProxyList list;

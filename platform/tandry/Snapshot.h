@@ -38,14 +38,13 @@ class Snapshot {
     using Index = std::vector<std::pair<std::uint64_t, Position>>;
     using Positions = std::vector<Position>;
 
-    static std::optional<Positions> find(const Index& index, const Value* pattern);
+    std::optional<Positions> find(const Index& index, const Value* pattern) const;
 
     TDPlugInProxyList plugIns_;
     std::vector<TDApplicationProxyRef> applications_;  // in the order of their paths
     std::vector<std::pair<Uuid, Position>> uuids_;     // sorted
     Index points_;
     Index identifiers_;
-    Positions withoutIdentifier_;
 };
 
 }  // namespace platform::tandry

@@ -118,7 +118,9 @@ void SqliteStatement::Finalizer::operator()(sqlite3_stmt* handle) const {
 
 SqliteStatement::SqliteStatement(SqliteDatabase& database, const char* sql) : database_(&database) {
     sqlite3_stmt* handle = nullptr;
-    check(sqlite3_prepare_v2(database.handle_.get(), sql, -1, &handle, nullptr));
+    const int code = sqlite3_prepare_v2(database.handle_.get(), sql, -1, &handle, nullptr);
+    check(code);
+    if (code == SQLITE_ERROR) error_->code = SQLITE_SCHEMA;
     handle_.reset(handle);
 }
 

@@ -40,7 +40,8 @@ class SqliteDatabase {
     std::unique_ptr<sqlite3, Closer> handle_;
 };
 
-/// A prepared statement, which must not outlive its database. After a failure every operation does
+/// A prepared statement, which must not outlive its database. One that does not fit the database's
+/// tables has the error SQLITE_SCHEMA. After a failure every operation does
 /// nothing more, and `error` tells of the first.
 class SqliteStatement {
   public:

@@ -66,11 +66,13 @@ class Workspace {
                                                              const Filter& filter) = 0;
 
     /// Registers the plug-in bundle at a path, or the application there with all its plug-ins.
-    /// Returns when the catalogue has changed. The error says why the bundle was refused.
+    /// Returns when the catalogue has changed. The error says why the bundle was refused, or why
+    /// nothing was stored: the registration then holds until the registry is closed, and is stored
+    /// with the next change that can be. Registering once more tries that at once.
     virtual std::optional<Error> registerPlugIn(const std::string& bundlePath) = 0;
     /// Forgets what is registered at a path: a plug-in, or an application's plug-ins. A bundle that
     /// an application directory holds stays forgotten until it is registered again or changes.
-    /// Error: nothing is registered there.
+    /// Error: nothing is registered there, or nothing was stored (as above).
     virtual std::optional<Error> unregisterPlugIn(const std::string& bundlePath) = 0;
 
     /// Drops what the registry caches of SDK dictionaries.

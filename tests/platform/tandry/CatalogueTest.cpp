@@ -30,6 +30,13 @@ class CatalogueTest : public RegistryTest {
         return result;
     }
 
+    void sql(const char* statement) {
+        sqlite3* handle = nullptr;
+        sqlite3_open(database.c_str(), &handle);
+        EXPECT_EQ(sqlite3_exec(handle, statement, nullptr, nullptr, nullptr), SQLITE_OK);
+        sqlite3_close(handle);
+    }
+
     const std::string folder = apps + "A.app/PlugIns/";
     const std::string database = files.path("home/zorvan/Tandry.db");
 };
@@ -103,12 +110,6 @@ TEST_F(CatalogueTest, WhatChangedGetsANewUuid) {
 }
 
 TEST_F(CatalogueTest, ADamagedCatalogueIsSetAsideAndRebuilt) {
-    auto sql = [this](const char* statement) {
-        sqlite3* handle = nullptr;
-        sqlite3_open(database.c_str(), &handle);
-        EXPECT_EQ(sqlite3_exec(handle, statement, nullptr, nullptr, nullptr), SQLITE_OK);
-        sqlite3_close(handle);
-    };
     const std::vector<std::function<void()>> damages{
         [&] { files.write("home/zorvan/Tandry.db", "no database at all"); },
         [&] { fs::resize_file(database, fs::file_size(database) / 2 + 100); },
@@ -141,27 +142,69 @@ TEST_F(CatalogueTest, ADamagedCatalogueIsSetAsideAndRebuilt) {
     }
 }
 
-TEST_F(CatalogueTest, WorksInMemoryWhenItCannotWrite) {
-    sqlite3* other = nullptr;
+TEST_F(CatalogueTest, RowsThatDoNotFitTheOthersAreReadAgain) {
+    start();
+    stop();
+    sql("DELETE FROM applications");
+    ErrorLines errors;
+    start();
+    EXPECT_THAT(errors.lines, IsEmpty());
+    EXPECT_EQ(merges, 3);
+    start();
+    EXPECT_EQ(merges, 0);
+    EXPECT_THAT(installed(), ElementsAre("a", "b", "c"));
+}
+
+TEST_F(CatalogueTest, WorksInMemoryAndKeepsTheFileWhenItCannotBeOpened) {
     start();
     const std::map<std::string, Uuid> before = uuids();
-    stop();
-    // Somebody keeps it locked.
-    sqlite3_open(database.c_str(), &other);
-    sqlite3_exec(other, "PRAGMA locking_mode = EXCLUSIVE; BEGIN EXCLUSIVE", nullptr, nullptr,
-                 nullptr);
-    {
+    for (const char* suffix : {"-wal", ".lock"}) {
+        stop();
+        fs::remove(database + suffix);
+        fs::create_directory(database + suffix);
         ErrorLines errors;
         start();
+        EXPECT_THAT(errors.lines, ElementsAre(HasSubstr("working without the catalogue"),
+                                              HasSubstr("cannot write the catalogue")));
         EXPECT_THAT(installed(), ElementsAre("a", "b", "c"));
-        EXPECT_THAT(errors.lines, ElementsAre(HasSubstr("working without the catalogue")));
-        EXPECT_EQ(workspace->unregisterPlugIn(files.path(folder + "a")), std::nullopt);
+        EXPECT_TRUE(workspace->unregisterPlugIn(files.path(folder + "a")));
         EXPECT_THAT(installed(), ElementsAre("b", "c"));
+        stop();
+        fs::remove(database + suffix);
+        start();
+        EXPECT_EQ(uuids(), before) << suffix;
     }
-    stop();
-    sqlite3_close(other);
+}
+
+TEST_F(CatalogueTest, StoresLaterWhatCouldNotBeStored) {
+    const std::string loose = addPlugIn("opt/Loose.appex", "loose");
     start();
+    EXPECT_EQ(workspace->registerPlugIn(loose), std::nullopt);
+    EXPECT_EQ(workspace->unregisterPlugIn(files.path(folder + "a")), std::nullopt);
+    sqlite3* other = nullptr;
+    sqlite3_open(database.c_str(), &other);
+    auto lock = [&](const char* how) { sqlite3_exec(other, how, nullptr, nullptr, nullptr); };
+    lock("BEGIN IMMEDIATE");
+    add("d");
+    const std::string d = files.path(folder + "d");
+    EXPECT_THAT(workspace->registerPlugIn(d)->text, HasSubstr("locked"));
+    EXPECT_THAT(installed(), ElementsAre("b", "c", "d", "loose"));
+    lock("COMMIT");
+    EXPECT_EQ(workspace->registerPlugIn(d), std::nullopt);
+    const std::map<std::string, Uuid> before = uuids();
+    start();
+    EXPECT_EQ(merges, 0);
     EXPECT_EQ(uuids(), before);
+
+    // Locked from the start: what was registered and removed before counts again afterwards.
+    stop();
+    lock("PRAGMA locking_mode = EXCLUSIVE; BEGIN EXCLUSIVE");
+    start();
+    EXPECT_THAT(installed(), ElementsAre("a", "b", "c", "d"));
+    sqlite3_close(other);
+    EXPECT_EQ(workspace->unregisterPlugIn(files.path(folder + "b")), std::nullopt);
+    start();
+    EXPECT_THAT(installed(), ElementsAre("c", "d", "loose"));
 }
 
 TEST_F(CatalogueTest, HasOneOwner) {
@@ -172,7 +215,7 @@ TEST_F(CatalogueTest, HasOneOwner) {
     stop();
     EXPECT_TRUE(openDiskWorkspace(directories, *sdks, nullptr));
     directories.dataHome = files.write("file", "");
-    EXPECT_FALSE(openDiskWorkspace(directories, *sdks, nullptr));
+    EXPECT_TRUE(openDiskWorkspace(directories, *sdks, nullptr));
 }
 
 }  // namespace

@@ -58,7 +58,7 @@ class Dice {
             case 2:
                 return Array();
             case 3:
-                return Array{stringPattern(), 5, stringPattern()};
+                return Array{stringPattern(), 5, stringPattern(), stringPattern()};
             default:
                 return stringPattern();
         }
@@ -94,7 +94,7 @@ bool accepts(const TDPlugInProxy& plugIn, const Dictionary& query) {
         const Value* value = plugIn.lookup(key, TDPlugInProxy::Scope::Attributes);
         if (!value) value = plugIn.lookup(key, TDPlugInProxy::Scope::InfoPlist);
         Value identifier(plugIn.plugInIdentifier.value_or(""));
-        if (key == kIdentifier && plugIn.plugInIdentifier) value = &identifier;
+        if (key == kIdentifier) value = &identifier;
         if (!accepts(pattern, value)) return false;
     }
     return true;
@@ -111,7 +111,8 @@ TEST_F(RegistryTest, NarrowingNeverDropsAMatch) {
         if (dice.roll(3) == 0) attributes.set(kPoint, dice.value());
         if (dice.roll(3) == 0) info.set(kPoint, dice.value());
         if (dice.roll(4) == 0) attributes.set(kIdentifier, dice.value());
-        if (dice.roll(4)) info.set(kIdentifier, dice.value());
+        info.set("QFBundleIdentifier", dice.text());
+        if (dice.roll(4)) info.set(kIdentifier, dice.text());
         if (dice.roll(4)) extension.set("VXExtensionAttributes", attributes);
         info.set("VXExtension", extension);
         writePlist(apps + "A.app/PlugIns/" + std::to_string(i) + "/Info.plist", info);

@@ -1,3 +1,6 @@
+#include <sys/resource.h>
+#include <unistd.h>
+
 #include <filesystem>
 
 #include "tests/platform/tandry/RegistryFixture.h"
@@ -90,6 +93,60 @@ TEST_F(RegistryTest, AnUnregisteredBundleStaysForgottenUntilItChanges) {
     EXPECT_THAT(installed(), ElementsAre("a"));
     EXPECT_EQ(workspace->registerPlugIn(app), std::nullopt);
     EXPECT_THAT(installed(), ElementsAre("a", "b"));
+}
+
+TEST_F(RegistryTest, RegisteringAnApplicationKeepsWhatOtherRoadsLeadTo) {
+    const std::string app = addApplication("opt/A.app");
+    addPlugIn("opt/A.app/PlugIns/A.appex", "a");
+    const std::string extra = addPlugIn("opt/A.app/Extras/E.appex", "extra");
+    addApplication("opt/A.app/Inner.app");
+    addPlugIn("opt/A.app/Inner.app/PlugIns/I.appex", "inner");
+    files.makeDirectory(apps);
+    fs::create_symlink(files.path("opt/A.app/Inner.app"), files.path(apps + "Inner.app"));
+    start();
+    EXPECT_EQ(workspace->registerPlugIn(extra), std::nullopt);
+    EXPECT_EQ(workspace->registerPlugIn(app), std::nullopt);
+    EXPECT_THAT(recorder.take(), ElementsAre("+inner", "+extra", "+a"));
+    EXPECT_THAT(installed(), UnorderedElementsAre("a", "extra", "inner"));
+}
+
+/// Leaves the process no file descriptors while it lives.
+class NoDescriptors {
+  public:
+    NoDescriptors() {
+        ::getrlimit(RLIMIT_NOFILE, &before_);
+        rlimit none = before_;
+        const int lowest = ::dup(STDIN_FILENO);
+        ::close(lowest);
+        none.rlim_cur = static_cast<rlim_t>(lowest);
+        ::setrlimit(RLIMIT_NOFILE, &none);
+    }
+    ~NoDescriptors() { ::setrlimit(RLIMIT_NOFILE, &before_); }
+
+  private:
+    rlimit before_;
+};
+
+TEST_F(RegistryTest, WhatIsForgottenStaysSoWhileItCannotBeRead) {
+    const std::string app = addApplication("opt/A.app");
+    const std::string a = addPlugIn("opt/A.app/PlugIns/A.appex", "a");
+    addPlugIn("opt/A.app/PlugIns/B.appex", "b");
+    start();
+    EXPECT_EQ(workspace->registerPlugIn(app), std::nullopt);
+    EXPECT_EQ(workspace->unregisterPlugIn(a), std::nullopt);
+    {
+        const NoDescriptors limit;
+        for (const std::string& path : {a, app})
+            EXPECT_THAT(workspace->registerPlugIn(path)->text, HasSubstr("Too many open files"));
+    }
+    EXPECT_THAT(installed(), ElementsAre("b"));
+    // As a volume that is not mounted.
+    fs::rename(files.path("opt"), files.path("away"));
+    start();
+    EXPECT_THAT(installed(), IsEmpty());
+    fs::rename(files.path("away"), files.path("opt"));
+    start();
+    EXPECT_THAT(installed(), ElementsAre("b"));
 }
 
 }  // namespace

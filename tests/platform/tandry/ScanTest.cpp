@@ -3,6 +3,7 @@
 #include <cstdlib>
 #include <filesystem>
 
+#include "platform/tandry/BundleReader.h"
 #include "tests/platform/tandry/RegistryFixture.h"
 
 namespace platform::tandry {
@@ -46,7 +47,7 @@ TEST_F(RegistryTest, CompletesTheDictionaries) {
     writePlist("home/zorvan/SDKs/org.point.plist", {{"FromSdk", true}});
     const Dictionary attributes{{"VXExtensionAttributes", Dictionary{{"Size", 3}}},
                                 {"VXExtensionPointIdentifier", "org.point"},
-                                {"VXExtensionIdentifier", 7}};
+                                {"CleanTimeout", 7}};
     addPlugIn(apps + "A.app/PlugIns/A.appex", "a", attributes,
               {{"QFBundleShortVersionString", "2.5"},
                {"VXOriginalIdentifier", "a.original"},
@@ -74,7 +75,7 @@ TEST_F(RegistryTest, CompletesTheDictionaries) {
                                             {"VXExtensionVersion", "2.5"},
                                             {"VXExtensionPointIdentifier", "org.point"}}));
     EXPECT_EQ(*a->lookup("FromSdk", Scope::InfoPlist), Value(true));
-    EXPECT_EQ(*a->lookup("VXExtensionIdentifier", Scope::PlugInDictionary), Value(7));
+    EXPECT_EQ(*a->lookup("CleanTimeout", Scope::PlugInDictionary), Value(7));
     EXPECT_FALSE(a->lookup("FromSdk", Scope::PlugInDictionary));
     EXPECT_EQ(a->entitlements.get(), (Dictionary{{"right", true}}));
 
@@ -119,6 +120,14 @@ TEST_F(RegistryTest, LeavesOutBadBundlesWithOneLineEach) {
         return head + "<key>" + key + "</key>" + value + tail;
     };
     auto string = [](const std::string& value) { return "<string>" + value + "</string>"; };
+    std::string many;
+    for (std::size_t i = 0; i < kMaxBundleValues; ++i) many += "<true/>";
+    many = "<array>" + many + "</array>";
+    auto own = [&](const char* key, const std::string& value) {
+        std::string whole = text("QFBundleIdentifier", string("x"));
+        return whole.replace(whole.find("<dict/>"), 7,
+                             std::string("<dict><key>") + key + "</key>" + value + "</dict>");
+    };
     const std::map<std::string, std::string> bad{
         {"empty", ""},
         {"garbage", "{\"json\": 1}"},
@@ -134,6 +143,14 @@ TEST_F(RegistryTest, LeavesOutBadBundlesWithOneLineEach) {
         {"identifier", text("VXExtensionIdentifier", string(".x"))},
         {"bundle-identifier", text("QFBundleIdentifier", string("a/b"))},
         {"long-identifier", text("QFBundleIdentifier", string(std::string(256, 'x')))},
+        {"nameless", text("QFBundleName", string("x"))},
+        {"executable-type", text("QFBundleExecutable", "<integer>1</integer>")},
+        {"bundle-identifier-type", text("QFBundleIdentifier", "<integer>1</integer>")},
+        {"identifier-type", own("VXExtensionIdentifier", "<array/>")},
+        {"original-type", own("VXOriginalIdentifier", "<true/>")},
+        {"attributes-type", own("VXExtensionAttributes", string("none"))},
+        {"many", own("Many", many)},
+        {"bulky", own("Bulky", string(std::string(kMaxRecordSize, 'x')))},
     };
     const std::string folder = apps + "A.app/PlugIns/";
     addApplication(apps + "A.app");
@@ -141,28 +158,25 @@ TEST_F(RegistryTest, LeavesOutBadBundlesWithOneLineEach) {
     files.makeDirectory(folder + "missing");
     addPlugIn(folder + "entitlements", "x");
     files.write(folder + "entitlements/Entitlements.plist", "broken");
+    addPlugIn(folder + "entitled", "x");
+    files.write(folder + "entitled/Entitlements.plist",
+                "<plist version=\"1.0\"><dict><key>Many</key>" + many + tail);
     // Wrong types that have another meaning.
     addPlugIn(folder + "good", "good",
-              {{"VXExtensionIdentifier", Array()},
-               {"VXExtensionPointIdentifier", 4},
-               {"VXExtensionAttributes", "none"},
-               {"VXExtensionProtocol", 1}},
-              {{"QFBundleExecutable", 1}, {"QFBundleVersion", 2}, {"QFBundleName", 3}});
-    files.write(folder + "nameless/Info.plist", text("QFBundleIdentifier", "<integer>1</integer>"));
+              {{"VXExtensionPointIdentifier", 4}, {"VXExtensionProtocol", 1}},
+              {{"QFBundleVersion", 2}, {"QFBundleName", 3}});
 
     for (const char* run : {"first", "second"}) {
         ErrorLines errors;
         start();
-        EXPECT_THAT(installed(), ElementsAre("good", "?")) << run;
-        EXPECT_EQ(errors.lines.size(), bad.size() + 2) << run;
+        EXPECT_THAT(installed(), ElementsAre("good")) << run;
+        EXPECT_EQ(errors.lines.size(), bad.size() + 3) << run;
+        EXPECT_THAT(errors.lines, testing::Contains(HasSubstr("plist: too many values")).Times(2));
         for (const auto& [name, bytes] : bad)
             EXPECT_THAT(errors.lines,
                         testing::Contains(HasSubstr("/" + name + "/Info.plist: ")).Times(1))
                 << run;
     }
-    EXPECT_EQ(plugIn("?"), nullptr);
-    EXPECT_EQ(workspace->plugInAtPath(files.path(folder + "nameless"))->dataContainerPath,
-              std::nullopt);
 }
 
 TEST_F(RegistryTest, FollowsLinksAndSkipsWhatCannotBeNamed) {
@@ -180,7 +194,7 @@ TEST_F(RegistryTest, FollowsLinksAndSkipsWhatCannotBeNamed) {
     fs::create_symlink(files.path("opt/Shelf"), files.path(apps + "Shared.app/PlugIns"));
     files.write(apps + "File.app/PlugIns", "not a directory");
     addPlugIn(apps + "Bad\xFF.app/PlugIns/A.appex", "x");
-    addPlugIn(apps + "Bell\a.app/PlugIns/A.appex", "x");
+    addPlugIn(apps + "Line\n.app/PlugIns/A.appex", "x");
     ErrorLines errors;
     start();
     EXPECT_THAT(installed(), ElementsAre("a", "shelved", "stray"));
@@ -189,7 +203,7 @@ TEST_F(RegistryTest, FollowsLinksAndSkipsWhatCannotBeNamed) {
     EXPECT_EQ(plugIn("stray")->containingApplication, nullptr);
     EXPECT_THAT(errors.lines,
                 UnorderedElementsAre(HasSubstr("Loop.app"), HasSubstr("Other.app"),
-                                     HasSubstr("Bad"), HasSubstr("Bell"), HasSubstr("File.app")));
+                                     HasSubstr("Bad"), HasSubstr("Line"), HasSubstr("File.app")));
 }
 
 TEST_F(RegistryTest, MakesDataContainersThatAreTheUsersOwn) {
