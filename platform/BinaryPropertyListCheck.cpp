@@ -1,6 +1,7 @@
 #include "platform/BinaryPropertyListCheck.h"
 
 #include <algorithm>
+#include <bit>
 #include <cstdint>
 
 #include "platform/PropertyList.h"
@@ -23,23 +24,27 @@ class Walker {
           objectsLeft_(std::min(kMaxPropertyListObjects, bytes.size() + kSharedObjects)),
           payloadLeft_(bytes.size() + kSharedBytes) {}
 
-    const char* check() {
-        if (bytes_.size() < kHeaderSize + kTrailerSize) return "truncated";
+    PropertyListCheck check() {
+        visitRoot();
+        return std::move(found_);
+    }
+
+  private:
+    bool visitRoot() {
+        if (bytes_.size() < kHeaderSize + kTrailerSize) return fail("truncated");
         std::size_t trailer = bytes_.size() - kTrailerSize;
         offsetSize_ = byte(trailer + 6);
         refSize_ = byte(trailer + 7);
         objectCount_ = number(trailer + 8, 8);
         std::uint64_t root = number(trailer + 16, 8);
         std::uint64_t table = number(trailer + 24, 8);
-        if (!isWordSize(offsetSize_) || !isWordSize(refSize_)) return "bad trailer";
-        if (table < kHeaderSize || table > trailer) return "bad trailer";
-        if (objectCount_ > (trailer - table) / offsetSize_) return "bad trailer";
+        if (!isWordSize(offsetSize_) || !isWordSize(refSize_)) return fail("bad trailer");
+        if (table < kHeaderSize || table > trailer) return fail("bad trailer");
+        if (objectCount_ > (trailer - table) / offsetSize_) return fail("bad trailer");
         table_ = table;
-        visit(root, 1, false);
-        return problem_;
+        return visit(root, 1, false);
     }
 
-  private:
     /// An object's payload: `count` units from `start` on.
     struct Payload {
         std::uint64_t count;
@@ -56,7 +61,7 @@ class Walker {
     }
 
     bool fail(const char* problem) {
-        problem_ = problem;
+        found_.problem = problem;
         return false;
     }
 
@@ -82,7 +87,7 @@ class Walker {
             case 0x2:
                 return size == 2 || size == 3 ? fits(at + 1, 1u << size, 1) : fail("bad real");
             case 0x3:
-                return size == 3 ? fits(at + 1, 8, 1) : fail("bad date");
+                return size == 3 ? visitDate(at + 1) : fail("bad date");
             case 0x4:
             case 0x5:
             case 0x6:
@@ -99,6 +104,13 @@ class Walker {
         if (size > 4) return fail("bad integer");
         if (!fits(start, 1u << size, 1)) return false;
         if (size == 4 && number(start, 8) != 0) return fail("integer over 64 bits");
+        return true;
+    }
+
+    bool visitDate(std::size_t start) {
+        if (!fits(start, 8, 1)) return false;
+        double seconds = std::bit_cast<double>(number(start, 8));
+        found_.dates.push_back({seconds + kPropertyListReferenceDate});
         return true;
     }
 
@@ -145,8 +157,7 @@ class Walker {
         if (!readPayload(at, size, payload) ||
             !fits(payload.start, payload.count, isDictionary ? 2 * refSize_ : refSize_))
             return false;
-        if (isDictionary && payload.count > kMaxPropertyListEntries)
-            return fail("too many entries in a dictionary");
+        if (isDictionary) found_.entries += payload.count;
         std::uint64_t references = isDictionary ? 2 * payload.count : payload.count;
         for (std::uint64_t i = 0; i < references; ++i) {
             bool isKey = isDictionary && i < payload.count;
@@ -163,12 +174,12 @@ class Walker {
     std::size_t refSize_ = 0;
     std::uint64_t objectCount_ = 0;
     std::size_t table_ = 0;
-    const char* problem_ = nullptr;
+    PropertyListCheck found_;
 };
 
 }  // namespace
 
-const char* problemOfBinaryPropertyList(std::string_view bytes) {
+PropertyListCheck checkBinaryPropertyList(std::string_view bytes) {
     return Walker(bytes).check();
 }
 

@@ -29,6 +29,9 @@ constexpr std::string_view kPrivatePrefix = "com.orbel.private.";
 /// Stands for a restriction that could not be read: no dictionary, and so nothing that admits.
 constexpr const char* kUnreadableRestriction = "unreadable";
 
+/// Largest entitlement file that is read, on accepting a peer.
+constexpr std::size_t kMaxEntitlements = 64u << 10;
+
 /// What an entitlement file holds, and who may have written it.
 struct Entitlements {
     Dictionary values;
@@ -58,7 +61,7 @@ Result<Entitlements> readEntitlements(const std::string& executable) {
     if (!file) return orMissing(file.error());
 
     const std::string path = joinPath(parentPath(executable), name);
-    const Result<std::string> bytes = file->read(kMaxPropertyListFile);
+    const Result<std::string> bytes = file->read(kMaxEntitlements);
     if (!bytes) return Error::posix(bytes.error().code, path);
     const Result<Value> value = parsePropertyList(*bytes);
     if (!value)

@@ -8,21 +8,18 @@
 #include <bit>
 #include <cmath>
 #include <cstdlib>
-#include <cstring>
 #include <memory>
 #include <vector>
 
 #include "platform/BinaryPropertyListCheck.h"
 #include "platform/Files.h"
+#include "platform/PropertyListWork.h"
 #include "platform/Utf8.h"
 #include "platform/XmlPropertyListCheck.h"
 
 namespace platform {
 
 namespace {
-
-/// 2001-01-01 00:00 UTC, from which property lists count, in seconds since 1970.
-constexpr double kReferenceDate = 978307200;
 
 struct PlistFree {
     void operator()(plist_t node) const { ::plist_free(node); }
@@ -53,38 +50,14 @@ class NumbersInC {
     locale_t before_;
 };
 
-// Scalars that libplist's accessors cut to fewer bits travel as one-object binary lists.
-
-constexpr std::size_t kScalarAt = 8;
-
-/// The marker and the payload of a scalar, in the bytes of its own binary list.
-struct BinaryScalar {
-    unsigned char marker = 0;
-    std::uint64_t payload = 0;
-};
-
-std::optional<BinaryScalar> binaryOf(plist_t node, std::size_t payloadAt) {
-    char* raw = nullptr;  // must be null, or nothing is written
-    std::uint32_t length = 0;
-    ::plist_to_bin(node, &raw, &length);
-    Allocated<char> bytes(raw);
-    if (!raw || length < kScalarAt + payloadAt + 8) return std::nullopt;
-    BinaryScalar scalar;
-    scalar.marker = static_cast<unsigned char>(raw[kScalarAt]);
-    for (std::size_t i = 0; i < 8; ++i) {
-        scalar.payload =
-            scalar.payload << 8 | static_cast<unsigned char>(raw[kScalarAt + payloadAt + i]);
-    }
-    return scalar;
-}
-
+/// A scalar for which libplist has no maker that keeps all its bits.
 plist_t nodeOfBinary(unsigned char marker, std::size_t payloadSize, std::uint64_t payload) {
     std::string bytes = "bplist00";
     bytes += static_cast<char>(marker);
     bytes.append(payloadSize - 8, '\0');
     for (int shift = 56; shift >= 0; shift -= 8) bytes += static_cast<char>(payload >> shift);
     std::size_t table = bytes.size();
-    bytes += static_cast<char>(kScalarAt);
+    bytes += static_cast<char>(8);  // where the scalar is
     bytes.append(32, '\0');
     std::size_t trailer = bytes.size() - 32;
     bytes[trailer + 6] = 1;   // size of an offset
@@ -100,6 +73,17 @@ plist_t nodeOfBinary(unsigned char marker, std::size_t payloadSize, std::uint64_
 /// wrong.
 class Reader {
   public:
+    explicit Reader(const PropertyListCheck& check) : check_(check) {}
+
+    std::optional<Value> readRoot(plist_t root) {
+        auto value = read(root, 1);
+        if (value && entries_ != check_.entries) return fail("a key twice in a dictionary");
+        return value;
+    }
+
+    const char* problem() const { return problem_; }
+
+  private:
     std::optional<Value> read(plist_t node, int depth) {
         switch (::plist_get_node_type(node)) {
             case PLIST_BOOLEAN: {
@@ -115,7 +99,7 @@ class Reader {
                 return Value(real);
             }
             case PLIST_DATE:
-                return readDate(node);
+                return readDate();
             case PLIST_STRING: {
                 std::uint64_t length = 0;
                 const char* text = ::plist_get_string_ptr(node, &length);
@@ -135,9 +119,6 @@ class Reader {
         }
     }
 
-    const char* problem() const { return problem_; }
-
-  private:
     std::nullopt_t fail(const char* problem) {
         problem_ = problem;
         return std::nullopt;
@@ -147,17 +128,16 @@ class Reader {
         std::uint64_t number = 0;
         ::plist_get_uint_val(node, &number);
         if (number <= INT64_MAX) return Value(number);
-        // Negative, or too large to be: only the binary form tells.
-        auto scalar = binaryOf(node, 1);
-        if (!scalar) return fail("an unreadable integer");
-        if (scalar->marker == 0x13) return Value(static_cast<std::int64_t>(number));
+        // Negative, or too large to be: no accessor tells, but the two are not the same.
+        OwnedNode negative(::plist_new_uint(number));
+        if (::plist_compare_node_value(node, negative.get()))
+            return Value(static_cast<std::int64_t>(number));
         return Value(number);
     }
 
-    std::optional<Value> readDate(plist_t node) {
-        auto scalar = binaryOf(node, 1);
-        if (!scalar) return fail("an unreadable date");
-        Value date(Date{std::bit_cast<double>(scalar->payload) + kReferenceDate});
+    std::optional<Value> readDate() {
+        if (nextDate_ == check_.dates.size()) return fail("an unreadable date");
+        Value date(check_.dates[nextDate_++]);
         if (!isPropertyList(date)) return fail("a date out of range");
         return date;
     }
@@ -209,28 +189,70 @@ class Reader {
             if (!value) return std::nullopt;
             entries.emplace_back(rawKey, std::move(*value));
         }
+        entries_ += entries.size();
         auto dictionary = Dictionary::fromEntries(std::move(entries));
         if (!dictionary) return fail("a dictionary with the same key twice");
         return Value(std::move(*dictionary));
     }
 
+    const PropertyListCheck& check_;
+    std::size_t nextDate_ = 0;
+    std::size_t entries_ = 0;
     const char* problem_ = nullptr;
 };
 
-/// Whether the reader's limits allow the value. Counts keys and values down from `objectsLeft`.
-bool isReadable(const Value& value, std::size_t& objectsLeft) {
-    if (objectsLeft == 0) return false;
-    --objectsLeft;
-    auto isElementReadable = [&objectsLeft](const Value& element) {
-        return isReadable(element, objectsLeft);
-    };
-    if (const Array* array = value.array()) return std::ranges::all_of(*array, isElementReadable);
-    const Dictionary* dictionary = value.dictionary();
-    if (!dictionary) return true;
-    if (dictionary->size() > std::min(kMaxPropertyListEntries, objectsLeft)) return false;
-    objectsLeft -= dictionary->size();
-    return std::ranges::all_of(*dictionary, isElementReadable, &Dictionary::Entry::second);
-}
+/// Whether what a value becomes is within a size and the reader's limits.
+class WriteCheck {
+  public:
+    explicit WriteCheck(std::size_t limit) : bytesLeft_(limit) {}
+
+    bool allows(const Value& value) {
+        if (objectsLeft_-- == 0) return false;
+        auto isAllowed = [this](const Value& element) { return allows(element); };
+        if (const std::string* text = value.string()) return allowsText(*text);
+        if (const Data* data = value.data()) return takeBytes(data->bytes().size() / 3 * 4);
+        if (const Array* array = value.array()) return std::ranges::all_of(*array, isAllowed);
+        const Dictionary* dictionary = value.dictionary();
+        if (!dictionary) return true;
+        return allowsKeys(*dictionary) &&
+               std::ranges::all_of(*dictionary, isAllowed, &Dictionary::Entry::second);
+    }
+
+  private:
+    bool takeBytes(std::size_t count) {
+        if (count > bytesLeft_) return false;
+        bytesLeft_ -= count;
+        return true;
+    }
+
+    bool allowsText(std::string_view text) {
+        std::size_t size = text.size();
+        std::size_t references = 0;
+        for (char character : text) {
+            if (character != '&' && character != '<' && character != '>') continue;
+            ++references;
+            size += character == '&' ? 4 : 3;
+        }
+        return takeBytes(size) && work_.addText(references, size) == nullptr;
+    }
+
+    bool allowsKeys(const Dictionary& dictionary) {
+        if (dictionary.size() > objectsLeft_) return false;
+        objectsLeft_ -= dictionary.size();
+        std::vector<std::string_view> keys;
+        keys.reserve(dictionary.size());
+        for (const auto& [key, value] : dictionary) {
+            if (!allowsText(key)) return false;
+            keys.push_back(key);
+        }
+        return work_.addKeys(keys) == nullptr;
+    }
+
+    /// The element around them all is one of the reader's objects.
+    std::size_t objectsLeft_ = kMaxPropertyListObjects - 1;
+    std::size_t bytesLeft_;
+    PropertyListWork work_;
+};
 
 plist_t nodeOf(const Value& value);
 
@@ -241,7 +263,7 @@ plist_t nodeOfInteger(const Value& value) {
 }
 
 plist_t nodeOfDate(Date date) {
-    double seconds = std::floor(date.secondsSince1970) - kReferenceDate;
+    double seconds = std::floor(date.secondsSince1970) - kPropertyListReferenceDate;
     return nodeOfBinary(0x33, 8, std::bit_cast<std::uint64_t>(seconds));
 }
 
@@ -291,9 +313,9 @@ Result<Value> parsePropertyList(std::string_view bytes) {
     if (bytes.empty()) return failure("empty");
     if (bytes.size() > UINT32_MAX) return failure("too large");
     bool isBinary = bytes.starts_with("bplist");
-    const char* problem =
-        isBinary ? problemOfBinaryPropertyList(bytes) : problemOfXmlPropertyList(bytes);
-    if (problem) return failure(problem);
+    const PropertyListCheck check =
+        isBinary ? checkBinaryPropertyList(bytes) : checkXmlPropertyList(bytes);
+    if (check.problem) return failure(check.problem);
 
     NumbersInC numbers;
     plist_t raw = nullptr;
@@ -301,8 +323,8 @@ Result<Value> parsePropertyList(std::string_view bytes) {
     (isBinary ? ::plist_from_bin : ::plist_from_xml)(bytes.data(), size, &raw);
     OwnedNode root(raw);
     if (!root) return failure("malformed");
-    Reader reader;
-    auto value = reader.read(root.get(), 1);
+    Reader reader(check);
+    auto value = reader.readRoot(root.get());
     if (!value) return failure(reader.problem());
     return std::move(*value);
 }
@@ -317,13 +339,13 @@ Result<Value> readPropertyListFile(const std::string& path, std::size_t limit) {
     return error;
 }
 
-Result<std::string> writeXmlPropertyList(const Value& value) {
+Result<std::string> writeXmlPropertyList(const Value& value, std::size_t limit) {
     if (!isPropertyList(value, kMaxPropertyListFileDepth))
         return Error{"PropertyList", 2, "not a property list"};
-    // One of the reader's objects is the element around them all.
-    std::size_t objectsLeft = kMaxPropertyListObjects - 1;
-    if (!isReadable(value, objectsLeft))
-        return Error{"PropertyList", 3, "too many objects for a property list"};
+    // Before anything is built: objects, and texts, which may grow fivefold. What tags and
+    // indentation add to them is bounded and only known in the end.
+    const Error tooLarge{"PropertyList", 3, "too large for a property list"};
+    if (!WriteCheck(limit).allows(value)) return tooLarge;
     OwnedNode root(nodeOf(value));
     NumbersInC numbers;
     char* text = nullptr;
@@ -331,6 +353,7 @@ Result<std::string> writeXmlPropertyList(const Value& value) {
     ::plist_to_xml(root.get(), &text, &length);
     Allocated<char> owned(text);
     if (!text) return Error{"PropertyList", 4, "could not be written as a property list"};
+    if (length > limit) return tooLarge;
     return std::string(text, length);
 }
 

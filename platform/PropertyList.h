@@ -15,13 +15,13 @@ namespace platform {
 /// binary list may share objects; each use counts).
 inline constexpr int kMaxPropertyListFileDepth = 128;
 inline constexpr std::size_t kMaxPropertyListObjects = 1u << 20;
-/// Most entries of one dictionary: libplist's work grows with the square of their number.
-inline constexpr std::size_t kMaxPropertyListEntries = 1u << 17;
-/// Largest file of `readPropertyListFile` unless the caller says otherwise.
+/// Largest file of `readPropertyListFile` and `writeXmlPropertyList` unless the caller says
+/// otherwise.
 inline constexpr std::size_t kMaxPropertyListFile = 16u << 20;
 
-/// Reads an XML or binary property list. Size, depth and the number of objects are checked before
-/// anything is built. The error (domain "PropertyList") says what is wrong.
+/// Reads an XML or binary property list. Depth, the number of objects and the work that they cause
+/// (platform/PropertyListWork.h) are checked before anything is built. The error (domain
+/// "PropertyList") says what is wrong.
 Result<Value> parsePropertyList(std::string_view bytes);
 
 /// Reads the file at `path` and parses it. Errors: those of `readFile` (EFBIG for a file over
@@ -29,9 +29,11 @@ Result<Value> parsePropertyList(std::string_view bytes);
 Result<Value> readPropertyListFile(const std::string& path,
                                    std::size_t limit = kMaxPropertyListFile);
 
-/// The XML form of a value. Errors: the value is not a property list (`isPropertyList`, at the
-/// depth that is read), or larger than the limits above. What this writes, `parsePropertyList`
-/// reads back equal (dates lose the fraction of their second).
-Result<std::string> writeXmlPropertyList(const Value& value);
+/// The XML form of a value, of at most `limit` bytes (which is at most 1 GiB). Errors: the value is
+/// not a property list (`isPropertyList`, at the depth that is read), or over the limits, the
+/// reader's among them. What this writes, `parsePropertyList` reads back equal (dates lose the
+/// fraction of their second).
+Result<std::string> writeXmlPropertyList(const Value& value,
+                                         std::size_t limit = kMaxPropertyListFile);
 
 }  // namespace platform

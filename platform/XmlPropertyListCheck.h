@@ -2,12 +2,15 @@
 
 #include <string_view>
 
+#include "platform/PropertyListCheck.h"
+
 namespace platform {
 
-/// Says why the bytes of an XML property list must not be handed to a parser, or null when they
-/// may: incomplete, followed by something else, over the limits of platform/PropertyList.h (each
-/// element is an object), or with markup in which the depth cannot be told for sure (declarations
-/// inside the document type, instructions between elements).
-const char* problemOfXmlPropertyList(std::string_view bytes);
+/// Looks at the bytes of an XML property list. A problem is: whatever is no complete list of one
+/// value, over the limits of platform/PropertyList.h (each element is an object), markup in which
+/// the depth cannot be told for sure (declarations inside the document type, instructions between
+/// elements), and text that is not what its element says, of which the parser would make something
+/// else. What is inside strings and keys is left to the parser.
+PropertyListCheck checkXmlPropertyList(std::string_view bytes);
 
 }  // namespace platform

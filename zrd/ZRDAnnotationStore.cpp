@@ -108,7 +108,7 @@ std::optional<ZRError> ZRDAnnotationStore::loadDb() {
 
 std::optional<ZRError> ZRDAnnotationStore::saveDb() const {
     auto bytes = platform::writeXmlPropertyList(
-        Dictionary{{kVersionKey, kVersion}, {kDataKey, annotations_}});
+        Dictionary{{kVersionKey, kVersion}, {kDataKey, annotations_}}, kMaxFileSize);
     if (!bytes) return zrError(bytes.error());
     if (auto error = platform::writeFileAtomically(annotationsURL_, *bytes)) return zrError(*error);
     return std::nullopt;

@@ -36,7 +36,7 @@ Outcome present(const Listing& listing, Format format) {
     if (format == Format::Json) {
         outcome.output = jsonText(listing.forms());
     } else if (format == Format::PropertyList) {
-        const Result<std::string> xml = platform::writeXmlPropertyList(listing.forms());
+        const Result<std::string> xml = platform::writeXmlPropertyList(listing.forms(), 1u << 30);
         if (!xml) return Outcome::failure(describe(xml.error()));
         outcome.output = *xml;
     } else if (listing.empty()) {
