@@ -48,8 +48,7 @@ std::optional<std::vector<std::uint64_t>> patternKeys(const Value& pattern) {
 template <class List>
 void sortUnique(List& list) {
     std::ranges::sort(list);
-    auto repeated = std::ranges::unique(list);
-    list.erase(repeated.begin(), repeated.end());
+    list.erase(std::unique(list.begin(), list.end()), list.end());
 }
 
 std::string_view pathOf(const TDPlugInProxyRef& plugIn) {
