@@ -17,7 +17,7 @@ inline constexpr std::size_t kMaxBundleFile = 1u << 20;
 /// Most values in one property list of a bundle, also with its SDK dictionary merged.
 inline constexpr std::size_t kMaxBundleValues = 16384;
 /// Most bytes of a plug-in's encoded dictionaries: Info.plist and entitlements.
-inline constexpr std::size_t kMaxRecordSize = 256u << 10;
+inline constexpr std::size_t kMaxRecordSize = 512u << 10;
 
 /// Where a bundle lies: its canonical path, and how its files are reached with few look-ups.
 struct BundleFolder {
