@@ -57,6 +57,13 @@ DecodedPayload decodePayload(std::shared_ptr<const std::string> payload, FrameKi
     return UnknownObject{describe(*item)};
 }
 
+std::size_t FrameReader::announced() const {
+    if (headerSize_ < kFrameHeaderSize) return 0;
+    std::size_t size = 0;
+    for (unsigned char byte : header_) size = size << 8 | byte;
+    return size;
+}
+
 Result<std::shared_ptr<const std::string>> FrameReader::take(std::string_view& input) {
     while (headerSize_ < kFrameHeaderSize && !input.empty()) {
         header_[headerSize_++] = static_cast<unsigned char>(input.front());
@@ -64,8 +71,7 @@ Result<std::shared_ptr<const std::string>> FrameReader::take(std::string_view& i
     }
     if (headerSize_ < kFrameHeaderSize) return std::shared_ptr<const std::string>();
 
-    std::size_t size = 0;
-    for (unsigned char byte : header_) size = size << 8 | byte;
+    const std::size_t size = announced();
     if (size > maxPayload_)
         return Error{kDomain, 0,
                      fmt::format("a frame of {} bytes is over the limit of {}", size, maxPayload_)};

@@ -40,6 +40,9 @@ class FrameReader {
     /// frame is announced with more bytes than the limit; the stream cannot be read on.
     Result<std::shared_ptr<const std::string>> take(std::string_view& input);
 
+    /// The size of the payload of which a part is still to come; 0 while it is not known.
+    std::size_t announced() const;
+
     /// Whether part of a frame has been taken.
     bool insideFrame() const { return headerSize_ > 0; }
 

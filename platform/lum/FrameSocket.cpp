@@ -1,6 +1,5 @@
 #include "platform/lum/FrameSocket.h"
 
-#include <poll.h>
 #include <sys/socket.h>
 
 #include <algorithm>
@@ -42,13 +41,13 @@ FrameSocket::Flushed FrameSocket::flush() {
     constexpr std::size_t kMostAtOnce = 1u << 20;
     std::lock_guard lock(mutex_);
     if (!socket_) return {};
+    std::size_t written = 0;
     std::size_t freed = 0;
-    std::size_t most = kMostAtOnce;
-    while (!unsent_.empty() && most > 0) {
+    while (!unsent_.empty() && written < kMostAtOnce) {
         SliceList& next = unsent_.front();
         const std::size_t before = next.remaining();
-        const bool goesOn = write(next, most);
-        most -= std::min(most, before - next.remaining());
+        const bool goesOn = write(next, kMostAtOnce - written);
+        written += before - next.remaining();
         if (next.remaining() == 0) {
             freed += next.size();
             unsent_.pop_front();
@@ -57,7 +56,7 @@ FrameSocket::Flushed FrameSocket::flush() {
     }
     held_ -= freed;
     if (broken_) freed += dropUnsent();
-    return {freed, !unsent_.empty()};
+    return {written, freed, !unsent_.empty()};
 }
 
 std::size_t FrameSocket::dropUnsent() {

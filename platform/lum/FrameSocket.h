@@ -1,5 +1,7 @@
 #pragma once
 
+#include <poll.h>
+
 #include <atomic>
 #include <cstddef>
 #include <deque>
@@ -29,6 +31,7 @@ class FrameSocket {
     Sent send(SliceList frame);
 
     struct Flushed {
+        std::size_t written = 0;     // bytes that the socket took
         std::size_t freed = 0;       // bytes of frames that are held no more
         bool awaitWritable = false;  // more is left
     };
@@ -44,6 +47,10 @@ class FrameSocket {
 
     /// Whether both ends are closed, or the socket cannot be used on for another reason.
     bool isHungUp() const;
+
+    /// Whether there is something to receive, or room to send, at this moment.
+    bool isReadable() const { return polls(POLLIN); }
+    bool isWritable() const { return polls(POLLOUT); }
 
     /// Whether out-of-band data is to be had, which frames never are.
     bool hasOutOfBandData() const;

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <cstddef>
 
 namespace platform::lum {
@@ -22,6 +23,18 @@ inline constexpr std::size_t kMaxUnsentTotal = 256u << 20;
 /// it.
 inline constexpr std::size_t kMaxWaitingRequests = 64;
 inline constexpr std::size_t kMaxWaitingBytes = 16u << 20;
+
+/// A connection is read on only while the requests of all connections, from the moment that their
+/// length is known until they are served, have no more than this many bytes together. So many bytes
+/// of each connection are not counted.
+inline constexpr std::size_t kMaxReceivedTotal = 256u << 20;
+inline constexpr std::size_t kFreeReceived = 64u << 10;
+
+/// When others wait because one of the two limits over all connections is reached, a connection
+/// that counts in it is cut off if its peer has been expected to read, or to send the rest of a
+/// request, for so long and has moved less than this many bytes meanwhile.
+inline constexpr std::chrono::milliseconds kPatience{5000};
+inline constexpr std::size_t kLeastProgress = 1u << 20;
 
 /// No connection is accepted while fewer than this many file descriptors are left to the process:
 /// what clients cannot use up is there for the work itself.

@@ -18,6 +18,7 @@
 #include "platform/UniqueFd.h"
 #include "platform/lum/Limits.h"
 #include "platform/lum/PeerConnection.h"
+#include "platform/lum/ReceiveBudget.h"
 #include "platform/lum/ReplyBudget.h"
 #include "platform/lum/ServiceSocket.h"
 
@@ -53,7 +54,8 @@ bool hasFreeDescriptors(int count) {
 struct Listener::State : std::enable_shared_from_this<Listener::State> {
     SerialQueue& queue;
     lum::ServiceSocket socket;
-    std::shared_ptr<lum::ReplyBudget> budget;
+    const std::shared_ptr<lum::ReplyBudget> replyBudget;
+    const std::shared_ptr<lum::ReceiveBudget> receiveBudget;
     EventHandler handler;
     std::optional<RunLoop::Watch> watch;  // since `resume`
     // To be closed at the end. Those that are gone are dropped when the list is full.
@@ -66,7 +68,8 @@ struct Listener::State : std::enable_shared_from_this<Listener::State> {
     State(SerialQueue& eventQueue, lum::ServiceSocket serviceSocket)
         : queue(eventQueue),
           socket(std::move(serviceSocket)),
-          budget(std::make_shared<lum::ReplyBudget>(eventQueue.runLoop())),
+          replyBudget(std::make_shared<lum::ReplyBudget>(eventQueue.runLoop())),
+          receiveBudget(std::make_shared<lum::ReceiveBudget>(eventQueue.runLoop())),
           pause(eventQueue.runLoop()) {}
 
     void awaitConnections() {
@@ -130,7 +133,7 @@ void Listener::State::admit(UniqueFd connected) {
         return;
     }
     auto connection = std::make_shared<lum::PeerConnection>(std::move(connected), std::move(*token),
-                                                            queue, budget);
+                                                            queue, replyBudget, receiveBudget);
     remember(connection);
     handler(std::move(connection));
 }
@@ -152,6 +155,8 @@ void Listener::State::close() {
     closed = true;
     for (const auto& weak : std::exchange(connections, {}))
         if (auto connection = weak.lock()) connection->abandon();
+    replyBudget->close();
+    receiveBudget->close();
 }
 
 Result<std::unique_ptr<Listener>> Listener::make(const Directories& directories,

@@ -2,6 +2,7 @@
 
 #include <fmt/format.h>
 
+#include <algorithm>
 #include <utility>
 
 #include "platform/Log.h"
@@ -18,35 +19,43 @@ const Log& ops() {
 
 }  // namespace
 
-/// What a delivered request carries: its connection's turn and its place in the budget, given back
+/// What a delivered request carries: its connection's turn and its place in the budgets, given back
 /// on whichever thread drops the request's last copy.
 class PeerConnection::Turn {
   public:
     explicit Turn(PeerConnection& connection)
-        : connection_(connection.weak_from_this()), budget_(connection.budget_) {}
+        : connection_(connection.weak_from_this()),
+          replyBudget_(connection.replyBudget_),
+          requests_(connection.requests_) {}
     Turn(const Turn&) = delete;
     ~Turn() {
         if (auto connection = connection_.lock()) connection->endTurn();
-        budget_->leave();
+        requests_->remove(counted_);
+        replyBudget_->leave();
     }
+
+    /// Takes over bytes that count in the connection's share of requests.
+    void carry(std::size_t counted) { counted_ += counted; }
 
   private:
     std::weak_ptr<PeerConnection> connection_;
-    std::shared_ptr<ReplyBudget> budget_;
+    std::shared_ptr<ReplyBudget> replyBudget_;
+    std::shared_ptr<Budget::Share> requests_;
+    std::size_t counted_ = 0;
 };
 
 PeerConnection::PeerConnection(UniqueFd socket, AuditToken token, SerialQueue& queue,
-                               std::shared_ptr<ReplyBudget> budget)
+                               std::shared_ptr<ReplyBudget> replyBudget,
+                               std::shared_ptr<ReceiveBudget> receiveBudget)
     : queue_(queue),
       loop_(queue.runLoop()),
       token_(std::move(token)),
-      budget_(std::move(budget)),
+      replyBudget_(std::move(replyBudget)),
+      receiveBudget_(std::move(receiveBudget)),
+      replies_(replyBudget_->open()),
+      requests_(receiveBudget_->open()),
       socket_(std::move(socket)),
       reader_(kMaxRequestPayload) {}
-
-PeerConnection::~PeerConnection() {
-    budget_->remove(socket_.held());
-}
 
 void PeerConnection::resume() {
     if (queue_.isCurrent()) return start();
@@ -56,6 +65,8 @@ void PeerConnection::resume() {
 void PeerConnection::start() {
     queue_.assertCurrent();
     if (watch_ || invalid_) return;
+    replies_->setHolder(weak_from_this());
+    requests_->setHolder(weak_from_this());
     watch_.emplace(loop_, socket_.fd());
     watch_->awaitHangup([self = shared_from_this()] { self->hungUp(); });
     if (socket_.held() > 0) awaitWritable();
@@ -93,7 +104,8 @@ void PeerConnection::writable() {
     auto self = shared_from_this();
     const FrameSocket::Flushed flushed = socket_.flush();
     if (flushed.awaitWritable) awaitWritable();
-    budget_->remove(flushed.freed);
+    peerReads_.progress(flushed.written);
+    replies_->remove(flushed.freed);
     proceed();
 }
 
@@ -102,6 +114,7 @@ bool PeerConnection::receiveSome() {
     char buffer[64 * 1024];
     const auto count = socket_.receive(buffer, sizeof buffer);
     if (!count) return false;
+    peerSends_.progress(*count);
     if (*count > 0) {
         cutFrames({buffer, *count});
     } else {
@@ -134,8 +147,27 @@ bool PeerConnection::hasRoomForRequests() const {
     return waiting_.size() < kMaxWaitingRequests && waitingBytes_ < kMaxWaitingBytes;
 }
 
-bool PeerConnection::mayReadOn() const {
-    return !invalid_ && !ended_ && uncut_.empty() && hasRoomForRequests();
+bool PeerConnection::mayReadOn() {
+    return !invalid_ && !ended_ && uncut_.empty() && hasRoomForRequests() && takeCounted();
+}
+
+std::size_t PeerConnection::countedBytes() const {
+    const std::size_t bytes = waitingBytes_ + uncut_.size() + reader_.announced();
+    return bytes - std::min(bytes, kFreeReceived);
+}
+
+bool PeerConnection::takeCounted() {
+    const std::size_t wanted = countedBytes();
+    if (wanted > counted_) {
+        const std::size_t more = wanted - counted_;
+        if (requests_->isWaiting() || !receiveBudget_->tryTake(*requests_, more)) {
+            requests_->await(more);
+            return false;
+        }
+        counted_ = wanted;
+    }
+    requests_->stopWaiting();
+    return true;
 }
 
 void PeerConnection::proceed() {
@@ -153,6 +185,7 @@ void PeerConnection::proceed() {
                                  "the peer will send nothing more"});
     }
     if (mayReadOn() && !awaitsReadable_) awaitReadable();
+    noteExpectations();
 }
 
 void PeerConnection::deliverWaiting() {
@@ -162,12 +195,14 @@ void PeerConnection::deliverWaiting() {
         auto payload = std::move(waiting_.front());
         waiting_.pop_front();
         waitingBytes_ -= payload->size();
+        const std::size_t stillCounted = std::min(counted_, countedBytes());
+        turn->carry(std::exchange(counted_, stillCounted) - stillCounted);
         deliver(std::move(payload), std::move(turn));
     }
 }
 
 void PeerConnection::deliver(std::shared_ptr<const std::string> payload,
-                             std::shared_ptr<void> turn) {
+                             std::shared_ptr<Turn> turn) {
     DecodedPayload decoded = decodePayload(std::move(payload), FrameKind::Request);
     if (auto* message = std::get_if<Message>(&decoded)) {
         message->setTurn(std::move(turn));
@@ -179,21 +214,15 @@ void PeerConnection::deliver(std::shared_ptr<const std::string> payload,
     }
 }
 
-std::shared_ptr<void> PeerConnection::takeTurn() {
+std::shared_ptr<PeerConnection::Turn> PeerConnection::takeTurn() {
     // Only this queue takes turns: a free one stays free. Held replies shrink on this queue too,
     // which then proceeds.
     if (socket_.held() > kMaxUnsentPerConnection) return nullptr;
     TurnState state = turn_;
     if (state == Taken && turn_.compare_exchange_strong(state, Awaited)) return nullptr;
-    if (state == Awaited || awaitsBudget_) return nullptr;
-    if (!budget_->tryEnter()) {
-        awaitsBudget_ = true;
-        budget_->await([weak = weak_from_this()] {
-            auto self = weak.lock();
-            if (!self) return;
-            self->awaitsBudget_ = false;
-            self->proceed();
-        });
+    if (state == Awaited || replies_->isWaiting()) return nullptr;
+    if (!replyBudget_->tryEnter()) {
+        replies_->await();
         return nullptr;
     }
     turn_ = Taken;
@@ -217,12 +246,30 @@ void PeerConnection::send(const Message& reply) {
     }
     const FrameSocket::Sent sent = socket_.send(std::move(*frame));
     if (sent.kept == 0) return;
-    budget_->add(sent.kept);
+    replies_->add(sent.kept);
     if (!sent.awaitWritable) return;
     loop_.post([weak = weak_from_this()] {
         auto self = weak.lock();
-        if (self && self->watch_) self->awaitWritable();
+        if (!self || !self->watch_) return;
+        self->awaitWritable();
+        self->noteExpectations();
     });
+}
+
+void PeerConnection::noteExpectations() {
+    peerReads_.expect(socket_.held() > 0);
+    peerSends_.expect(awaitsReadable_ && reader_.insideFrame());
+}
+
+std::optional<StallClock::Time> PeerConnection::stalledSince(const Budget& budget) const {
+    if (invalid_) return std::nullopt;
+    // After a time in which this process did nothing it is not the peer who is behind.
+    auto reads = socket_.isWritable() ? std::nullopt : peerReads_.since();
+    if (&budget == replyBudget_.get()) return reads;
+    // Requests may also wait because the peer does not read the replies to those before them.
+    if (waiting_.empty() || socket_.held() <= kMaxUnsentPerConnection) reads.reset();
+    const auto sends = socket_.isReadable() ? std::nullopt : peerSends_.since();
+    return reads && sends ? std::min(reads, sends) : reads ? reads : sends;
 }
 
 void PeerConnection::breakOff(const std::string& reason) {
@@ -235,10 +282,14 @@ void PeerConnection::becomeInvalid(const std::string& reason) {
     invalid_ = true;
     auto self = shared_from_this();
     watch_.reset();
-    budget_->remove(socket_.close());
+    replies_->remove(socket_.close());
+    replies_->stopWaiting();
     waiting_.clear();
     waitingBytes_ = 0;
     uncut_.clear();
+    reader_ = FrameReader(kMaxRequestPayload);
+    requests_->remove(std::exchange(counted_, 0));
+    requests_->stopWaiting();
     // Its closures may hold the context, which may hold anything: let go of it after the event.
     auto handler = std::exchange(handler_, nullptr);
     if (handler) handler(ConnectionError{ConnectionError::Kind::Invalid, reason});

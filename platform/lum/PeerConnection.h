@@ -14,7 +14,9 @@
 #include "platform/lum/Connection.h"
 #include "platform/lum/Frame.h"
 #include "platform/lum/FrameSocket.h"
+#include "platform/lum/ReceiveBudget.h"
 #include "platform/lum/ReplyBudget.h"
+#include "platform/lum/StallClock.h"
 
 namespace platform::lum {
 
@@ -24,11 +26,12 @@ namespace platform::lum {
 /// What keeps it alive from `resume` to its invalid event is the callback that waits for the
 /// hang-up. So a loop that is destroyed takes its connections along.
 class PeerConnection final : public Connection,
+                             public Budget::Holder,
                              public std::enable_shared_from_this<PeerConnection> {
   public:
     PeerConnection(UniqueFd socket, AuditToken token, SerialQueue& queue,
-                   std::shared_ptr<ReplyBudget> budget);
-    ~PeerConnection() override;
+                   std::shared_ptr<ReplyBudget> replyBudget,
+                   std::shared_ptr<ReceiveBudget> receiveBudget);
 
     pid_t pid() const override { return token_.pid(); }
     const AuditToken& auditToken() const override { return token_; }
@@ -41,6 +44,10 @@ class PeerConnection final : public Connection,
     /// Becomes invalid because the service ends, and lets go of the handler and the context. The
     /// event is for the queue alone: off the queue, where the loop may not run, there is none.
     void abandon();
+
+    void retry() override { proceed(); }
+    std::optional<StallClock::Time> stalledSince(const Budget& budget) const override;
+    void cutOff(const std::string& reason) override { breakOff(reason); }
 
   private:
     class Turn;
@@ -59,14 +66,21 @@ class PeerConnection final : public Connection,
     /// Delivers what may be delivered, reads on when there is room: after every change.
     void proceed();
     void deliverWaiting();
-    void deliver(std::shared_ptr<const std::string> payload, std::shared_ptr<void> turn);
+    void deliver(std::shared_ptr<const std::string> payload, std::shared_ptr<Turn> turn);
     bool hasRoomForRequests() const;
-    bool mayReadOn() const;
+    bool mayReadOn();
+    /// What counts in the budget of all connections of what has been received; whether that has
+    /// room for it, else it is awaited.
+    std::size_t countedBytes() const;
+    bool takeCounted();
     void awaitReadable();
     void awaitWritable();
 
-    std::shared_ptr<void> takeTurn();
+    std::shared_ptr<Turn> takeTurn();
     void endTurn();
+
+    /// Whether the peer has to act for things to go on: after every change.
+    void noteExpectations();
 
     void breakOff(const std::string& reason);
     void becomeInvalid(const std::string& reason);
@@ -74,7 +88,10 @@ class PeerConnection final : public Connection,
     SerialQueue& queue_;
     RunLoop& loop_;
     const AuditToken token_;
-    const std::shared_ptr<ReplyBudget> budget_;
+    const std::shared_ptr<ReplyBudget> replyBudget_;
+    const std::shared_ptr<ReceiveBudget> receiveBudget_;
+    const std::shared_ptr<Budget::Share> replies_;
+    const std::shared_ptr<Budget::Share> requests_;
     std::shared_ptr<void> context_;
     EventHandler handler_;
 
@@ -85,12 +102,15 @@ class PeerConnection final : public Connection,
     bool ended_ = false;  // the peer sends nothing more
     bool announcedEnd_ = false;
     bool awaitsReadable_ = false;
-    bool awaitsBudget_ = false;
 
     // Requests that wait for their turn, still encoded, and bytes behind the last one that fitted.
     std::deque<std::shared_ptr<const std::string>> waiting_;
     std::size_t waitingBytes_ = 0;
     std::string uncut_;
+    std::size_t counted_ = 0;  // in `requests_`, of what no turn carries yet
+
+    StallClock peerReads_;
+    StallClock peerSends_;  // the rest of a request
 
     std::atomic<TurnState> turn_ = Free;  // taken on the queue, given back on any thread
 };

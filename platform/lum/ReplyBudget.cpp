@@ -1,77 +1,45 @@
 #include "platform/lum/ReplyBudget.h"
 
+#include <fmt/format.h>
+
+#include <algorithm>
 #include <utility>
 
 namespace platform::lum {
 
+constexpr auto kLimit = static_cast<std::int64_t>(kMaxUnsentTotal);
+
 bool ReplyBudget::hasRoom() const {
-    constexpr auto kLimit = static_cast<std::int64_t>(kMaxUnsentTotal);
-    if (inService_ == 0) return held_ <= kLimit;
+    if (inService_ == 0) return !isOverfull();
     return held_ + (inService_ + 1) * expected_ <= kLimit;
+}
+
+bool ReplyBudget::isOverfull() const {
+    return held_ > kLimit;
 }
 
 bool ReplyBudget::tryEnter() {
     std::lock_guard lock(mutex_);
-    if ((isAwaited_ && !retrying_) || !hasRoom()) return false;
+    if (isBehind() || !hasRoom()) return false;
     inService_ += 1;
     return true;
-}
-
-void ReplyBudget::await(std::function<void()> retry) {
-    awaiting_.push_back(std::move(retry));
-    std::unique_lock lock(mutex_);
-    isAwaited_ = true;
-    wake(std::move(lock));  // room may have come since the refusal
 }
 
 void ReplyBudget::leave() {
     std::unique_lock lock(mutex_);
     inService_ -= 1;
+    heldChanged(0);
     wake(std::move(lock));
 }
 
-void ReplyBudget::add(std::size_t bytes) {
-    const auto count = static_cast<std::int64_t>(bytes);
-    std::lock_guard lock(mutex_);
-    held_ += count;
-    expected_ = std::max(expected_, count);
+void ReplyBudget::heldChanged(std::int64_t by) {
+    expected_ = std::max(expected_, by);
+    // One client's large replies are no reason to serve others one by one for ever after.
+    if (held_ == 0 && inService_ == 0) expected_ = kMaxUnsentPerConnection;
 }
 
-void ReplyBudget::remove(std::size_t bytes) {
-    if (bytes == 0) return;
-    std::unique_lock lock(mutex_);
-    held_ -= static_cast<std::int64_t>(bytes);
-    wake(std::move(lock));
-}
-
-void ReplyBudget::wake(std::unique_lock<std::mutex> lock) {
-    if (!isAwaited_ || retryPosted_ || !hasRoom()) return;
-    retryPosted_ = true;
-    lock.unlock();
-    loop_.post([weak = weak_from_this()] {
-        if (auto self = weak.lock()) self->retryAwaiting();
-    });
-}
-
-void ReplyBudget::retryAwaiting() {
-    {
-        std::lock_guard lock(mutex_);
-        retryPosted_ = false;
-    }
-    retrying_ = true;
-    const auto roomLeft = [this] {
-        std::lock_guard lock(mutex_);
-        return hasRoom();
-    };
-    // Whoever is refused again goes to the end; each is called at most once.
-    for (std::size_t count = awaiting_.size(); count > 0 && roomLeft(); --count) {
-        auto retry = std::move(awaiting_.front());
-        awaiting_.pop_front();
-        retry();
-    }
-    retrying_ = false;
-    std::lock_guard lock(mutex_);
-    isAwaited_ = !awaiting_.empty();
+std::string ReplyBudget::blame(std::int64_t held) const {
+    return fmt::format("it does not read its replies, {} bytes, and others wait", held);
 }
 
 }  // namespace platform::lum

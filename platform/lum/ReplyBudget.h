@@ -1,55 +1,34 @@
 #pragma once
 
-#include <algorithm>
-#include <cstddef>
-#include <cstdint>
-#include <deque>
-#include <functional>
-#include <memory>
-#include <mutex>
-
-#include "platform/RunLoop.h"
-#include "platform/lum/Limits.h"
+#include "platform/lum/Budget.h"
 
 namespace platform::lum {
 
-/// Keeps the memory of all unsent replies of a listener's connections bounded, by deciding when one
-/// more request may be served. A request in service is expected to need as much as the largest
-/// reply that had to be kept so far, so that many requests let in at the same moment cannot exceed
-/// the limit together.
+/// Bounds the memory of all unsent replies, by deciding when one more request may be served. A
+/// request in service is expected to need as much as the largest reply that had to be kept lately,
+/// so that many requests let in at the same moment cannot exceed the limit together.
 ///
-/// `tryEnter` and `await` belong to the loop's thread; the others may be called from any thread.
-class ReplyBudget : public std::enable_shared_from_this<ReplyBudget> {
+/// A share holds the unsent replies of its connection.
+class ReplyBudget final : public Budget {
   public:
-    /// `loop` must outlive it.
-    explicit ReplyBudget(RunLoop& loop) : loop_(loop) {}
+    explicit ReplyBudget(RunLoop& loop, std::chrono::milliseconds patience = kPatience)
+        : Budget(loop, patience) {}
 
-    /// Whether a request may be served now; if so it counts as in service until `leave`. Others
-    /// that were refused before come first.
+    /// Whether a request may be served now; if so it counts as in service until `leave`. Those in
+    /// line come first. On the loop.
     bool tryEnter();
-    /// Calls `retry` once, on the loop, when it has become worth trying again.
-    void await(std::function<void()> retry);
+    /// From any thread.
     void leave();
 
-    /// Unsent bytes come and go. They may be reported in either order.
-    void add(std::size_t bytes);
-    void remove(std::size_t bytes);
-
   private:
-    bool hasRoom() const;
-    void wake(std::unique_lock<std::mutex> lock);
-    void retryAwaiting();
+    bool hasRoom() const override;
+    bool isOverfull() const override;
+    void heldChanged(std::int64_t by) override;
+    std::string blame(std::int64_t held) const override;
 
-    RunLoop& loop_;
-    std::deque<std::function<void()>> awaiting_;  // loop only
-    bool retrying_ = false;                       // loop only
-
-    std::mutex mutex_;  // guards what follows
-    std::int64_t held_ = 0;
+    // Guarded by the mutex.
     std::int64_t inService_ = 0;
     std::int64_t expected_ = kMaxUnsentPerConnection;
-    bool isAwaited_ = false;
-    bool retryPosted_ = false;
 };
 
 }  // namespace platform::lum

@@ -1,0 +1,234 @@
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+
+#include <functional>
+
+#include "platform/Cbor.h"
+#include "platform/lum/PeerConnection.h"
+#include "tests/platform/lum/LumFixture.h"
+
+namespace platform::lum {
+namespace {
+
+struct FakeHolder : Budget::Holder {
+    std::function<void()> onRetry;
+    std::function<void()> onCutOff;
+    std::optional<StallClock::Time> stalled;
+
+    void retry() override { onRetry(); }
+    std::optional<StallClock::Time> stalledSince(const Budget&) const override { return stalled; }
+    void cutOff(const std::string&) override { onCutOff(); }
+};
+
+TEST(ReplyBudget, LetsRequestsInWhileTheirRepliesFit) {
+    RunLoop loop;
+    auto budget = std::make_shared<ReplyBudget>(loop);
+    auto share = budget->open();
+    const auto enterAll = [&budget] {
+        std::size_t entered = 0;
+        while (budget->tryEnter()) entered += 1;
+        return entered;
+    };
+    std::size_t entered = enterAll();
+    EXPECT_EQ(entered, kMaxUnsentTotal / kMaxUnsentPerConnection);
+
+    // The first reply shows that replies are large: from now on one request at a time.
+    share->add(kMaxUnsentTotal);
+    for (; entered > 0; --entered) budget->leave();
+    EXPECT_EQ(enterAll(), 1u);
+    budget->leave();
+
+    share->add(1);
+    EXPECT_FALSE(budget->tryEnter());
+    std::string order;
+    std::vector<std::pair<std::shared_ptr<FakeHolder>, std::shared_ptr<Budget::Share>>> line;
+    for (char name : {'a', 'b', 'x', 'c'}) {
+        auto& [holder, waiting] = line.emplace_back(std::make_shared<FakeHolder>(), budget->open());
+        holder->onRetry = [&order, &budget, name] {
+            if (budget->tryEnter()) order += name;
+        };
+        waiting->setHolder(holder);
+        waiting->await();
+    }
+    line[2].second->stopWaiting();
+    loop.poll();
+    EXPECT_EQ(order, "");
+    share->remove(1);
+    EXPECT_FALSE(budget->tryEnter()) << "those who wait come first";
+    loop.poll();
+    EXPECT_EQ(order, "a");
+    budget->leave();
+    loop.poll();
+    EXPECT_EQ(order, "ab");
+    share.reset();
+    budget->leave();
+    loop.poll();
+    EXPECT_EQ(order, "abc");
+
+    budget->leave();
+    EXPECT_EQ(enterAll(), kMaxUnsentTotal / kMaxUnsentPerConnection) << "large replies forgotten";
+}
+
+TEST(Budget, CutsOffTheLargestOfTheStalledUntilThereIsRoom) {
+    RunLoop loop;
+    const std::chrono::milliseconds patience(20);
+    auto budget = std::make_shared<ReplyBudget>(loop, patience);
+    const auto longAgo = std::chrono::steady_clock::now() - std::chrono::hours(1);
+    std::string cut;
+    struct Member {
+        std::shared_ptr<FakeHolder> holder = std::make_shared<FakeHolder>();
+        std::shared_ptr<Budget::Share> share;
+    };
+    std::vector<Member> members;
+    const auto join = [&](char name, std::size_t holds, std::optional<StallClock::Time> stalled) {
+        Member& member = members.emplace_back();
+        member.share = budget->open();
+        member.share->setHolder(member.holder);
+        member.share->add(holds);
+        member.holder->stalled = stalled;
+        member.holder->onCutOff = [&cut, share = std::weak_ptr(member.share), holds, name] {
+            cut += name;
+            share.lock()->remove(holds);
+        };
+    };
+    join('a', kMaxUnsentTotal / 8, longAgo);
+    join('b', kMaxUnsentTotal / 4, longAgo);
+    join('c', kMaxUnsentTotal / 2, std::nullopt);  // reads
+    join('d', kMaxUnsentTotal / 4, longAgo);
+    join('e', kMaxUnsentTotal / 4, std::nullopt);
+    loop.poll();
+    EXPECT_EQ(cut, "") << "nobody waits";
+
+    bool entered = false;
+    Member waiting{std::make_shared<FakeHolder>(), budget->open()};
+    waiting.holder->onRetry = [&] { entered = budget->tryEnter(); };
+    waiting.share->setHolder(waiting.holder);
+    waiting.share->await();
+    loop.poll();
+    EXPECT_TRUE(cut == "bd" || cut == "db") << cut;
+    loop.poll();
+    EXPECT_TRUE(entered);
+
+    // Over the limit once more, by those whose time is not up: the budget looks again by itself.
+    budget->leave();
+    members[2].share->add(kMaxUnsentTotal / 4);
+    for (Member& member : {std::ref(members[0]), std::ref(members[4])})
+        member.holder->stalled = std::chrono::steady_clock::now();
+    waiting.share->await();
+    entered = false;
+    const auto begin = std::chrono::steady_clock::now();
+    while (!entered && std::chrono::steady_clock::now() - begin < std::chrono::seconds(20))
+        loop.runOnce(patience);
+    EXPECT_TRUE(entered);
+    EXPECT_EQ(cut.substr(2), "e");
+}
+
+/// Connections of this process with itself, over budgets with little patience.
+class SharedBudgetsTest : public LumTest {
+  protected:
+    struct Pair {
+        std::shared_ptr<PeerConnection> connection;
+        std::unique_ptr<RawPeer> peer;
+    };
+    Pair connect() {
+        int ends[2];
+        if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) != 0) return {};
+        auto peer = std::make_unique<RawPeer>(UniqueFd(ends[1]));
+        auto connection = std::make_shared<PeerConnection>(UniqueFd(ends[0]), *AuditToken::ofSelf(),
+                                                           queue, replies, requests);
+        connection->setEventHandler(
+            [this, weak = std::weak_ptr(connection)](const ConnectionEvent& event) {
+                auto self = weak.lock();
+                if (auto* message = std::get_if<Message>(&event)) {
+                    served += 1;
+                    if (keeps) kept.emplace_back(*message).set("b", 0);  // its turn matters
+                    self->send(Message::replyTo(*message));
+                }
+            });
+        queue.async([connection] { connection->resume(); });
+        loop.poll();
+        return {std::move(connection), std::move(peer)};
+    }
+    bool isAnswered(Pair& pair, std::string_view request) {
+        std::size_t written = 0;
+        return stepUntil([&] {
+            written += pair.peer->write(request.substr(written));
+            return pair.peer->read().has_value();
+        });
+    }
+
+    static constexpr std::chrono::milliseconds kLittlePatience{30};
+    std::shared_ptr<ReplyBudget> replies = std::make_shared<ReplyBudget>(loop, kLittlePatience);
+    std::shared_ptr<ReceiveBudget> requests =
+        std::make_shared<ReceiveBudget>(loop, kLittlePatience);
+    std::size_t served = 0;
+    bool keeps = false;
+    std::vector<Message> kept;
+};
+
+TEST_F(SharedBudgetsTest, WhoDoesNotReadRepliesIsCutOffWhenOthersWait) {
+    Dictionary large{{"data", Data(std::string(16u << 20, 'x'))}};
+    keepCborEncoded(large);
+    Message reply;
+    reply.set("shared", large);
+    std::vector<Pair> hoarders;
+    for (std::size_t i = 0; i < kMaxUnsentTotal / (16u << 20); ++i) {
+        hoarders.push_back(connect());
+        hoarders.back().connection->send(reply);
+    }
+    Pair modest = connect();
+    EXPECT_TRUE(isAnswered(modest, requestFrame(1)));
+    EXPECT_EQ(errorLines("does not read its replies"), 1u);
+    for (auto& [connection, peer] : hoarders) connection->abandon();
+    modest.connection->abandon();
+}
+
+TEST_F(SharedBudgetsTest, UnfinishedRequestsOfAllConnectionsAreBounded) {
+    const std::string large = requestFrame(1, {{"b", std::string(kMaxRequestPayload - 64, 'b')}});
+    std::vector<Pair> hoarders;
+    // All but the last announce a request and send little of it.
+    for (std::size_t i = 0; i <= kMaxReceivedTotal / kMaxRequestPayload; ++i) {
+        hoarders.push_back(connect());
+        hoarders.back().peer->write(std::string_view(large).substr(0, 10'000));
+        loop.poll();
+    }
+    Pair modest = connect();
+    for (std::uint64_t serial = 1; serial < 10; ++serial)
+        EXPECT_TRUE(isAnswered(modest, requestFrame(serial, {{"b", std::string(60'000, 'b')}})));
+
+    // The last waits, and those who hold it up are cut off, until there is room.
+    EXPECT_TRUE(isAnswered(hoarders.back(), std::string_view(large).substr(10'000)));
+    EXPECT_GE(errorLines("do not go on"), 1u);
+    EXPECT_LT(errorLines("do not go on"), hoarders.size());
+    for (auto& [connection, peer] : hoarders) connection->abandon();
+    modest.connection->abandon();
+}
+
+TEST_F(SharedBudgetsTest, ARequestCountsUntilItIsServedToItsEnd) {
+    const std::string large = requestFrame(1, {{"b", std::string(kMaxRequestPayload - 64, 'b')}});
+    keeps = true;
+    std::vector<Pair> busy;
+    for (std::size_t i = 0; i < kMaxReceivedTotal / kMaxRequestPayload; ++i) {
+        busy.push_back(connect());
+        EXPECT_TRUE(isAnswered(busy.back(), large));
+    }
+    // Neither the end of its connection nor patience ends a request in service.
+    busy.front().connection->abandon();
+    Pair next = connect();
+    std::size_t written = 0;
+    const auto begin = std::chrono::steady_clock::now();
+    stepUntil([&] {
+        written += next.peer->write(std::string_view(large).substr(written));
+        return std::chrono::steady_clock::now() - begin > 3 * kLittlePatience;
+    });
+    EXPECT_EQ(served, busy.size());
+    EXPECT_LT(written, 1u << 20);
+    EXPECT_EQ(errorLines(), 0u);
+    kept.erase(kept.begin());
+    EXPECT_TRUE(isAnswered(next, std::string_view(large).substr(written)));
+    for (auto& [connection, peer] : busy) connection->abandon();
+    next.connection->abandon();
+}
+
+}  // namespace
+}  // namespace platform::lum
