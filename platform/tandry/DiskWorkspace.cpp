@@ -67,13 +67,14 @@ class DiskWorkspace final : public Workspace {
     std::optional<Error> afterFirstScan(const std::function<std::optional<Error>()>& work);
 
     void firstScan();
-    void publish();
+    void publish(RegistryChanges& changes);
+    void withdrawContainers(const std::set<std::string>& identifiers, RegistryChanges& changes);
     std::optional<Error> registerOnQueue(const std::string& bundlePath);
     std::optional<Error> unregisterOnQueue(const std::string& bundlePath);
     void dropApplications(const std::string& path, RegistryChanges& changes);
     bool dropRegistrations(const std::string& path, RegistryChanges& changes);
     bool forgetWithin(const std::string& path, RegistryChanges& changes);
-    std::optional<Error> apply(const RegistryChanges& changes);
+    std::optional<Error> apply(RegistryChanges& changes);
 
     SdkDictionaries& sdks_;
     CurrentSnapshot current_;
@@ -143,23 +144,42 @@ void DiskWorkspace::firstScan() {
     if (closing_ || std::exchange(isScanned_, true)) return;
     // Filled in place: the scanner refers to the state.
     state_ = catalogue_->load();
-    const RegistryChanges changes = scanner_.scanAll();
+    RegistryChanges changes = scanner_.scanAll();
     EVLOG_INFO(ops(), "{} plug-ins in {} applications, {} new, {} gone", state_.plugIns.size(),
                state_.applications.size(), changes.installed.size(), changes.uninstalled.size());
-    if (!changes.records()) publish();
+    if (!changes.records()) publish(changes);
     // The catalogue has told of a failure, and nobody waits for an answer.
     static_cast<void>(apply(changes));
 }
 
-void DiskWorkspace::publish() {
+void DiskWorkspace::publish(RegistryChanges& changes) {
     current_.publish(std::make_shared<const Snapshot>(state_));
-    containers_.makeMissing();
+    const std::set<std::string> impossible = containers_.makeMissing();
+    if (impossible.empty()) return;
+    withdrawContainers(impossible, changes);
+    current_.publish(std::make_shared<const Snapshot>(state_));
+}
+
+/// Records that were published are what they are: others take their places.
+void DiskWorkspace::withdrawContainers(const std::set<std::string>& identifiers,
+                                       RegistryChanges& changes) {
+    for (auto& [path, entry] : state_.plugIns) {
+        const TDPlugInProxyRef before = entry.record;
+        if (!before->dataContainerPath || !identifiers.contains(*before->plugInIdentifier))
+            continue;
+        entry.record = std::make_shared<TDPlugInProxy>(*before);
+        entry.record->plugInUuid = Uuid::random();
+        entry.record->dataContainerPath.reset();
+        std::erase(changes.installed, before);
+        changes.uninstalled.push_back(before);
+        changes.installed.push_back(entry.record);
+    }
 }
 
 /// The record that goes is hidden before its observers hear of it, so that what they drop is not
 /// built again; the catalogue changes after them. The error says why it did not.
-std::optional<Error> DiskWorkspace::apply(const RegistryChanges& changes) {
-    if (changes.records()) publish();
+std::optional<Error> DiskWorkspace::apply(RegistryChanges& changes) {
+    if (changes.records()) publish(changes);
     if (!changes.uninstalled.empty())
         for (WorkspaceObserver* observer : observers_)
             observer->pluginsWillUninstall(changes.uninstalled);

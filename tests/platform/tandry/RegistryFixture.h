@@ -57,6 +57,7 @@ class RegistryTest : public testing::Test {
         auto opened = openDiskWorkspace(directories, *sdks,
                                         [this](const Dictionary& sdk, const Dictionary& infoPlist) {
                                             ++merges;
+                                            if (onMerge) onMerge();
                                             Dictionary merged = infoPlist;
                                             for (const auto& [key, value] : sdk)
                                                 if (!merged.contains(key)) merged.set(key, value);
@@ -114,7 +115,8 @@ class RegistryTest : public testing::Test {
     Directories directories;
     std::unique_ptr<SdkDictionaries> sdks;
     Recorder recorder;
-    int merges = 0;  // how many plug-ins with an SDK dictionary were read
+    int merges = 0;                 // how many plug-ins with an SDK dictionary were read
+    std::function<void()> onMerge;  // called in the midst of a walk, when such a plug-in is read
     std::unique_ptr<Workspace> workspace;
     std::unique_ptr<Workspace::Observation> observation;
 };

@@ -227,6 +227,35 @@ TEST_F(RegistryTest, MakesDataContainersThatAreTheUsersOwn) {
     start();
     EXPECT_EQ(plugIn("d")->dataContainerPath, containers + "/d");
     EXPECT_EQ(plugIn("a")->dataContainerPath, containers + "/a");
+
+    fs::remove_all(containers + "/a/tmp");
+    start();
+    EXPECT_TRUE(fs::exists(containers + "/a/tmp"));
+    fs::remove_all(containers);
+    EXPECT_EQ(workspace->registerPlugIn(addPlugIn(folder + "E.appex", "e")), std::nullopt);
+    EXPECT_TRUE(fs::exists(containers + "/e/tmp"));
+    fs::remove_all(containers);
+    files.write("home/zorvan/Containers", "a file");
+    ErrorLines errors;
+    start();
+    EXPECT_EQ(plugIn("a")->dataContainerPath, std::nullopt);
+    EXPECT_EQ(plugIn("e")->dataContainerPath, std::nullopt);
+    EXPECT_THAT(errors.lines, ElementsAre(HasSubstr("no data containers")));
+}
+
+TEST_F(RegistryTest, WithdrawsAContainerThatCannotBeMadeAfterAll) {
+    addApplication(apps + "A.app");
+    writePlist("home/zorvan/SDKs/org.point.plist", {{"FromSdk", true}});
+    for (const char* name : {"a", "b"}) addPlugIn(apps + "A.app/PlugIns/" + name, name);
+    addPlugIn(apps + "A.app/PlugIns/c", "c", {{"VXExtensionPointIdentifier", "org.point"}});
+    onMerge = [this] { files.write("home/zorvan/Containers/b", "in the way"); };
+    start();
+    EXPECT_EQ(plugIn("b")->dataContainerPath, std::nullopt);
+    EXPECT_THAT(recorder.take(), ElementsAre("-b", "+a", "+c", "+b"));
+    const Uuid uuid = plugIn("b")->plugInUuid;
+    start();
+    EXPECT_EQ(plugIn("b")->plugInUuid, uuid);
+    EXPECT_TRUE(plugIn("c")->dataContainerPath);
 }
 
 }  // namespace
