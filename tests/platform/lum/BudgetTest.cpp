@@ -10,7 +10,7 @@
 namespace platform::lum {
 namespace {
 
-struct FakeHolder : Budget::Holder {
+struct FakeHolder final : Budget::Holder {
     std::function<void()> onRetry;
     std::function<void()> onCutOff;
     std::optional<StallClock::Time> stalled;
