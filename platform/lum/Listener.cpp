@@ -45,6 +45,8 @@ bool hasFreeDescriptors(int count) {
     rlimit limit{};
     if (getrlimit(RLIMIT_NOFILE, &limit) != 0) return true;
     auto fd = static_cast<int>(std::min<rlim_t>(limit.rlim_cur, INT_MAX));
+    // The lowest are given out first: while one well below the top is free, so are those above it.
+    if (fd > 4 * count && fcntl(fd - 4 * count, F_GETFD) < 0) return true;
     while (count > 0 && fd > 0) count -= fcntl(--fd, F_GETFD) < 0 ? 1 : 0;
     return count == 0;
 }
