@@ -25,10 +25,13 @@ bool ZRDatabase::initWithDatabase(const std::optional<std::string>& path,
 }
 
 ZRDPlugInRef ZRDatabase::plugInForProxy(const platform::TDPlugInProxyRef& proxy) {
-    return sync_.sync([&]() -> ZRDPlugInRef {
-        auto cached = cache_.find(proxy->plugInUuid);
-        return cached != cache_.end() ? cached->second : createPlugInForProxy(proxy);
-    });
+    return sync_.sync([&] { return recordForProxy(proxy); });
+}
+
+ZRDPlugInRef ZRDatabase::recordForProxy(const platform::TDPlugInProxyRef& proxy) {
+    sync_.assertCurrent();
+    auto cached = cache_.find(proxy->plugInUuid);
+    return cached != cache_.end() ? cached->second : createPlugInForProxy(proxy);
 }
 
 ZRDPlugInRef ZRDatabase::createPlugInForProxy(const platform::TDPlugInProxyRef& proxy) {

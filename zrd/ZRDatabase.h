@@ -79,6 +79,7 @@ class ZRDatabase : public AnnotationReader, public platform::WorkspaceObserver {
 
   private:
     // On sync_ only.
+    ZRDPlugInRef recordForProxy(const platform::TDPlugInProxyRef& proxy);
     ZRDPlugInRef createPlugInForProxy(const platform::TDPlugInProxyRef& proxy);
     void purgeCachesToLimit(std::uint32_t limit);
     void autoElect(const ZRDPlugIn& plugIn);

@@ -35,7 +35,20 @@ std::string describe(const ProxyList& list) {
     return text + ")";
 }
 
-/// A set of at most `most` UUIDs in one piece of memory: thousands pass through here at a request.
+/// Whether a discovery may answer a record; what it leaves out is logged.
+bool isUsable(const platform::TDPlugInProxyRef& proxy) {
+    if (!proxy->bundlePath) {
+        EVLOG_INFO(ops(), "skipping td proxy {} with nil bundleURL", *proxy);
+        return false;
+    }
+    if (proxy->containingApplication && proxy->containingApplication->isPlaceholder) {
+        EVLOG_INFO(ops(), "skipping td proxy {} because its app is a placeholder", *proxy);
+        return false;
+    }
+    return true;
+}
+
+/// A set of at most `most` UUIDs in one piece of memory.
 class SeenUuids {
   public:
     explicit SeenUuids(std::size_t most) : slots_(std::bit_ceil(2 * most + 1)) {}
@@ -124,11 +137,14 @@ std::optional<TDPlugInProxyList> ZRDatabase::candidates(const Dictionary* query)
         EVLOG_DEBUG(td(), "{} installedPlugins: {}", installed.size(), ProxyList{&installed});
         return installed;
     }
-    auto elections = electionFilter(*query);
-    auto matching = workspace().plugInsMatching(
-        *query, [&](const std::optional<std::string>& identifier, const Dictionary& entitlements) {
-            return !elections || electionAdmits(*elections, identifier, entitlements);
-        });
+    platform::Workspace::Filter filter;
+    if (auto elections = electionFilter(*query)) {
+        filter = [this, elections = *std::move(elections)](
+                     const std::optional<std::string>& identifier, const Dictionary& entitlements) {
+            return electionAdmits(elections, identifier, entitlements);
+        };
+    }
+    auto matching = workspace().plugInsMatching(*query, filter);
     TDPlugInProxyList none;
     const TDPlugInProxyList& found = matching ? *matching : none;
     EVLOG_DEBUG(td(), "{} plugin(s) matching {} = {}", found.size(), *query, ProxyList{&found});
@@ -142,18 +158,14 @@ std::optional<ZRDPlugInList> ZRDatabase::findPlugIns(const Dictionary* query) {
     ZRDPlugInList plugIns;
     plugIns.reserve(proxies->size());
     SeenUuids seen(proxies->size());
-    for (const auto& proxy : *proxies) {
-        if (!proxy->bundlePath) {
-            EVLOG_INFO(ops(), "skipping td proxy {} with nil bundleURL", *proxy);
-            continue;
+    // Entered once for all: thousands pass through here at a request.
+    sync_.sync([&] {
+        for (const auto& proxy : *proxies) {
+            if (!isUsable(proxy)) continue;
+            auto plugIn = recordForProxy(proxy);
+            if (plugIn && seen.insert(proxy->plugInUuid)) plugIns.push_back(std::move(plugIn));
         }
-        if (proxy->containingApplication && proxy->containingApplication->isPlaceholder) {
-            EVLOG_INFO(ops(), "skipping td proxy {} because its app is a placeholder", *proxy);
-            continue;
-        }
-        auto plugIn = plugInForProxy(proxy);
-        if (plugIn && seen.insert(plugIn->uuid())) plugIns.push_back(std::move(plugIn));
-    }
+    });
     EVLOG_DEBUG(ops(), "TD reported {} plug-ins (cache {}/{})", plugIns.size(), cachedBefore,
                 cacheCount_.load());
     return plugIns;

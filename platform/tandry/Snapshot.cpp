@@ -148,9 +148,10 @@ TDPlugInProxyList Snapshot::candidates(const Dictionary& query) const {
     std::optional<Positions> byIdentifier = find(identifiers_, query.find("VXExtensionIdentifier"));
     if (!byPoint && !byIdentifier) return plugIns_;
     const bool pointIsBetter = byPoint && (!byIdentifier || byPoint->size() < byIdentifier->size());
+    const Positions& positions = pointIsBetter ? *byPoint : *byIdentifier;
     TDPlugInProxyList list;
-    for (Position position : pointIsBetter ? *byPoint : *byIdentifier)
-        list.push_back(plugIns_[position]);
+    list.reserve(positions.size());
+    for (Position position : positions) list.push_back(plugIns_[position]);
     return list;
 }
 

@@ -57,11 +57,10 @@ class Workspace {
     virtual TDPlugInProxyList plugInsOfApplication(const std::string& bundlePath) = 0;
 
     virtual TDPlugInProxyList installedPlugIns() = 0;
-    /// The plug-ins that may match `query` (a rules dictionary) and that `filter` keeps. Narrows by
-    /// "VXExtensionPointIdentifier" and "VXExtensionIdentifier" when their pattern is a plain
-    /// string,
-    /// "=" and a string, or an array of those; never drops a plug-in that matching would accept.
-    /// None when the query fails.
+    /// The plug-ins that may match `query` (a rules dictionary) and that `filter` keeps; an empty
+    /// one keeps all. Narrows by "VXExtensionPointIdentifier" and "VXExtensionIdentifier" when
+    /// their pattern is a plain string, "=" and a string, or an array of those; never drops a
+    /// plug-in that matching would accept. None when the query fails.
     virtual std::optional<TDPlugInProxyList> plugInsMatching(const Dictionary& query,
                                                              const Filter& filter) = 0;
 

@@ -123,7 +123,8 @@ struct FakeWorkspace final : platform::Workspace {
         if (queryFails) return std::nullopt;
         List found;
         for (const auto& proxy : installed) {
-            if (filter(proxy->plugInIdentifier, proxy->entitlements.get())) found.push_back(proxy);
+            if (!filter || filter(proxy->plugInIdentifier, proxy->entitlements.get()))
+                found.push_back(proxy);
         }
         return found;
     }
