@@ -5,6 +5,7 @@
 #include "platform/CodeSigning.h"
 #include "platform/Consent.h"
 #include "platform/Directories.h"
+#include "platform/Launcher.h"
 #include "platform/Notifications.h"
 #include "platform/RunLoop.h"
 #include "platform/Sandbox.h"
@@ -24,6 +25,7 @@ struct Services {
     std::shared_ptr<CodeSigning> codeSigning;
     std::shared_ptr<Sandbox> sandbox;
     std::shared_ptr<Consent> consent;
+    std::shared_ptr<Launcher> launcher;
     std::shared_ptr<Notifications> notifications;
     std::shared_ptr<Types> types;
 };

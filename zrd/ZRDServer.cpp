@@ -17,6 +17,17 @@ std::shared_ptr<ZRDServer>& theServer() {
     return server;
 }
 
+void reportTermination(platform::Launcher::Status status) {
+    using platform::Launcher;
+    if (status == Launcher::kDone) {
+        EVLOG_DEBUG(ops(), "spawnerd reported plug-ins have been terminated");
+    } else if (status == Launcher::kNoneOnRecord) {
+        EVLOG_DEBUG(ops(), "spawnerd reported no plug-ins on record");
+    } else {
+        EVLOG_INFO(ops(), "spawnerd error attempting to terminate plug-ins: error={}", status);
+    }
+}
+
 }  // namespace
 
 ZRDServer::ZRDServer(platform::Services services)
@@ -34,6 +45,7 @@ std::shared_ptr<ZRDServer> ZRDServer::initForService(const std::string& serviceN
         std::lock_guard lock(serverMutex);
         theServer() = server;
     }
+    server->setDelegate(server);
     server->service_->setEventHandler(
         [weak = std::weak_ptr(server)](std::shared_ptr<platform::Connection> connection) {
             if (auto self = weak.lock()) ZRDLumClient::initWithConnection(connection, self);
@@ -58,6 +70,15 @@ bool ZRDServer::listen(const std::string& serviceName) {
 std::shared_ptr<ZRDServer> ZRDServer::server() {
     std::lock_guard lock(serverMutex);
     return theServer();
+}
+
+void ZRDServer::removedPlugIns(const platform::TDPlugInProxyList& plugIns) {
+    for (const auto& proxy : plugIns) {
+        EVLOG_DEBUG(ops(), "requesting spawnerd termination of plug-in: {}({}) {}",
+                    proxy->bundleIdentifier, proxy->bundleVersion, pub(proxy->plugInUuid));
+        services().launcher->terminatePlugInInstances(proxy->bundleIdentifier, proxy->bundleVersion,
+                                                      mainQueue_, reportTermination);
+    }
 }
 
 void ZRDServer::run() {

@@ -18,7 +18,7 @@ namespace zorvan {
 /// on the queue "service", one after another.
 ///
 /// Made on the main thread, whose run loop it uses, and shared with its clients.
-class ZRDServer final : public ZRDatabase {
+class ZRDServer final : public ZRDatabase, public ZRDatabaseDelegate {
   public:
     /// The server of a service, listening but not yet accepting. `databasePath` is the annotation
     /// file's, or none for the default place. Null when there is no registry or the service's name
@@ -33,6 +33,10 @@ class ZRDServer final : public ZRDatabase {
 
     /// Begins to accept and runs the main run loop; returns when the loop is stopped.
     void run();
+
+    /// Has the launcher end running instances of these plug-ins, one after another; what it reports
+    /// is logged.
+    void removedPlugIns(const platform::TDPlugInProxyList& plugIns) override;
 
     /// Runs `work` on the service queue, after all work submitted before. From any thread.
     void submitWork(std::function<void()> work) { mainQueue_.async(std::move(work)); }

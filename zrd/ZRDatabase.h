@@ -22,6 +22,17 @@ class ZRDPlugIn;
 using ZRDPlugInRef = std::shared_ptr<ZRDPlugIn>;
 using ZRDPlugInList = std::vector<ZRDPlugInRef>;
 
+/// Told about plug-ins that go.
+class ZRDatabaseDelegate {
+  public:
+    /// The plug-ins are about to be uninstalled, and have left the database's cache. Called on a
+    /// thread of the registry; the database may be used.
+    virtual void removedPlugIns(const platform::TDPlugInProxyList& plugIns) = 0;
+
+  protected:
+    ~ZRDatabaseDelegate() = default;
+};
+
 /// The daemon's view of the installed plug-ins: the registry is the source of truth, this keeps
 /// records that were built from it, and the user's annotations. One a process; `ZRDServer` derives
 /// from it.
@@ -32,6 +43,11 @@ using ZRDPlugInList = std::vector<ZRDPlugInRef>;
 class ZRDatabase : public AnnotationReader, public platform::WorkspaceObserver {
   public:
     virtual ~ZRDatabase();
+
+    /// Held weakly; none until set, which must happen before the registry is activated.
+    void setDelegate(std::weak_ptr<ZRDatabaseDelegate> delegate) {
+        delegate_ = std::move(delegate);
+    }
 
     /// The most records that the cache may hold before it is emptied. 0 until set.
     std::uint32_t cacheLimit() const { return cacheLimit_; }
@@ -90,6 +106,7 @@ class ZRDatabase : public AnnotationReader, public platform::WorkspaceObserver {
                         const platform::Dictionary& entitlements);
 
     const platform::Services services_;
+    std::weak_ptr<ZRDatabaseDelegate> delegate_;
     std::atomic<std::uint32_t> cacheLimit_{0};
     platform::SyncQueue sync_{"ZRDatabase"};
     std::shared_ptr<PlugInContext> context_;

@@ -32,6 +32,7 @@ void ZRDatabase::pluginsWillUninstall(const platform::TDPlugInProxyList& plugIns
         }
         cacheCount_ = cache_.size();
     });
+    if (auto delegate = delegate_.lock()) delegate->removedPlugIns(plugIns);
 }
 
 void ZRDatabase::autoElect(const ZRDPlugIn& plugIn) {

@@ -17,6 +17,7 @@ platform::Services diskServices() {
     services.sandbox = platform::makeKernelSandbox();
     services.consent = platform::makeFileConsent(services.directories);
     services.notifications = platform::makeFileNotifications(services.directories);
+    services.launcher = platform::makeLauncher();
     services.types = platform::makeMimeTypes(services.directories);
     services.sdks = std::make_shared<platform::SdkDictionaries>(services.directories);
     auto workspace = platform::tandry::openDiskWorkspace(services.directories, *services.sdks,

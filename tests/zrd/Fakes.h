@@ -9,6 +9,7 @@
 #include <utility>
 #include <vector>
 
+#include "platform/SerialQueue.h"
 #include "platform/Services.h"
 #include "platform/lum/Connection.h"
 #include "zrd/HostProcess.h"
@@ -177,6 +178,19 @@ struct FakeCodeSigning final : platform::CodeSigning {
 struct FakeSandbox final : platform::Sandbox {
     bool isSandboxed(const platform::AuditToken&) override { return sandboxed; }
     bool sandboxed = false;
+};
+
+/// Knows no instances, until told what to answer; keeps what it was asked for.
+struct FakeLauncher final : platform::Launcher {
+    void terminatePlugInInstances(const std::string& identifier, const std::string& version,
+                                  platform::SerialQueue& queue, Completion completion) override {
+        terminated.push_back(identifier + " " + version);
+        Status status = statuses.empty() ? kNoneOnRecord : statuses.front();
+        if (!statuses.empty()) statuses.erase(statuses.begin());
+        queue.async([completion = std::move(completion), status] { completion(status); });
+    }
+    std::vector<std::string> terminated;
+    std::vector<Status> statuses;
 };
 
 struct FakeNotifications final : platform::Notifications {

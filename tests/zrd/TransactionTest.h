@@ -1,0 +1,86 @@
+#pragma once
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <future>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "tests/Zorvan/LogLines.h"
+#include "tests/support/TemporaryDirectory.h"
+#include "tests/zrd/Fakes.h"
+#include "zrd/ZRDLumClient.h"
+#include "zrd/ZRDServer.h"
+
+namespace zorvan {
+
+/// A server over a registry in memory, with one client whose connection is the test's.
+class TransactionTest : public testing::Test {
+  protected:
+    void SetUp() override {
+        services_.directories.runtime = directory_.path("run");
+        services_.directories.stateHome = directory_.path("state");
+        services_.directories.configHome = directory_.path("config");
+        services_.mainLoop = std::make_shared<platform::RunLoop>();
+        services_.workspace = workspace_;
+        services_.codeSigning = codeSigning_;
+        services_.sandbox = sandbox_;
+        services_.launcher = launcher_;
+        services_.notifications = notifications_;
+        server_ = ZRDServer::initForService("zrd", std::nullopt, services_);
+        ASSERT_TRUE(server_);
+        server_->setCacheLimit(100);
+        ZRDLumClient::initWithConnection(connection_, server_);
+        ASSERT_TRUE(connection_->resumed && workspace_->active);
+    }
+    void TearDown() override {
+        deliver(platform::ConnectionError{platform::ConnectionError::Kind::Invalid, "closed"});
+        drain();
+    }
+
+    void deliver(const platform::ConnectionEvent& event) { connection_->deliver(event); }
+    /// Waits for everything that has been submitted.
+    void drain() {
+        std::promise<void> reached;
+        server_->submitWork([&] { reached.set_value(); });
+        reached.get_future().wait();
+    }
+    Dictionary ask(Dictionary contents) {
+        if (!contents.contains("version")) contents.set("version", 3);
+        deliver(platform::Message(std::move(contents)));
+        drain();
+        EXPECT_EQ(connection_->sent.size(), 1u);
+        Dictionary reply = connection_->sent.back().contents();
+        connection_->sent.clear();
+        return reply;
+    }
+    static Dictionary error(int code, const std::string& text) {
+        return {{"errorcode", code}, {"error", text}};
+    }
+    ZRDLumClient& client() { return *static_cast<ZRDLumClient*>(connection_->context.get()); }
+    /// The names in the reply to "match".
+    std::vector<std::string> match(Dictionary contents) {
+        contents.set("request", "match");
+        std::vector<std::string> found;
+        const Dictionary reply = ask(std::move(contents));
+        const Value* matches = reply.find("matches");
+        if (!matches || !matches->packed()) return {"no matches"};
+        for (const Value& form : *matches->packed()->value()->array())
+            found.push_back(*form.dictionary()->find("identifier")->string());
+        return found;
+    }
+
+    ::test::TemporaryDirectory directory_;
+    std::shared_ptr<FakeWorkspace> workspace_ = std::make_shared<FakeWorkspace>();
+    std::shared_ptr<FakeCodeSigning> codeSigning_ = std::make_shared<FakeCodeSigning>();
+    std::shared_ptr<FakeSandbox> sandbox_ = std::make_shared<FakeSandbox>();
+    std::shared_ptr<FakeLauncher> launcher_ = std::make_shared<FakeLauncher>();
+    std::shared_ptr<FakeNotifications> notifications_ = std::make_shared<FakeNotifications>();
+    std::shared_ptr<FakeConnection> connection_ = std::make_shared<FakeConnection>();
+    platform::Services services_;
+    std::shared_ptr<ZRDServer> server_;
+};
+
+}  // namespace zorvan
