@@ -49,6 +49,8 @@ void Transaction::dispatch() {
         {request::kRemove, &Transaction::removePlugIns},
         {request::kBulk, &Transaction::bulkPlugIns},
         {request::kMatch, &Transaction::matchPlugIns},
+        {request::kAnnotate, &Transaction::annotatePlugIns},
+        {request::kBulkAnnotate, &Transaction::bulkAnnotatePlugIns},
     };
     server().mainQueue().assertCurrent();
 

@@ -39,6 +39,11 @@ class Transaction {
     void removePlugIns();
     void bulkPlugIns();
     void matchPlugIns();
+    void annotatePlugIns();
+    void bulkAnnotatePlugIns();
+
+    /// The request's "annotations"; null when they cannot be stored, and the failure has been sent.
+    const platform::Dictionary* requestedAnnotations();
 
     /// Visits "paths" in order: each element resolved to its canonical path (`resolved`), or as it
     /// was sent when it cannot be. True when every element was visited and none answered `Stop`;

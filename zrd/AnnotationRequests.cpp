@@ -1,0 +1,80 @@
+// The requests "annotate" and "bulk-annotate".
+
+#include "Zorvan/Keys.h"
+#include "Zorvan/LogHandles.h"
+#include "platform/Value.h"
+#include "zrd/Transaction.h"
+#include "zrd/ZRDLumClient.h"
+#include "zrd/ZRDPlugIn.h"
+#include "zrd/ZRDServer.h"
+
+namespace zorvan {
+
+using platform::Dictionary;
+using platform::Value;
+
+const Dictionary* Transaction::requestedAnnotations() {
+    const Value* annotations = request_.find(message::kAnnotations);
+    // What the store's file could not give back counts as no dictionary.
+    if (annotations && annotations->dictionary() && platform::isPropertyList(*annotations)) {
+        return annotations->dictionary();
+    }
+    fail(kZRErrorInvalidRequest, "invalid request format (bad annotations dictionary)");
+    return nullptr;
+}
+
+void Transaction::annotatePlugIns() {
+    const Dictionary* annotations = requestedAnnotations();
+    if (!annotations) return;
+    Dictionary change;
+    const Value* election = annotations->find(annotation::kElection);
+    if (election) {
+        if (!election->isNumber()) {
+            return fail(kZRErrorInvalidRequest, "invalid request format (annotation election)");
+        }
+        change.set(annotation::kElection, *election);
+    }
+    if (const Value* extension = annotations->find(annotation::kExtension)) {
+        if (!extension->dictionary()) {
+            return fail(kZRErrorInvalidRequest, "invalid request format (annotation extension)");
+        }
+        change.set(annotation::kExtension, *extension);
+    }
+    if (change.empty()) return done();
+
+    bool completed = processUuidList([&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
+        EVLOG_DEBUG(ops(), "client {} plug-in {}({}) annotation change: {}", client_->pid(),
+                    plugIn->identifier(), pub(plugIn->uuid()), change);
+        if (election) {
+            EVLOG_INFO(ops(), "client {} plug-in {}({}) election := {}", client_->pid(),
+                       plugIn->identifier(), pub(plugIn->uuid()), *election);
+        }
+        server().setAnnotation(change, *plugIn);
+        return Walk::Continue;
+    });
+    if (!completed) return;
+    server().notifyAnnotationChange();
+    done();
+}
+
+void Transaction::bulkAnnotatePlugIns() {
+    const Dictionary* annotations = requestedAnnotations();
+    if (!annotations) return;
+    EVLOG_DEBUG(ops(), "bulk change requested for {} plug-ins", annotations->size());
+    for (const auto& [key, value] : *annotations) {
+        if (!value.dictionary()) {
+            return fail(kZRErrorAnnotation, "annotations values must be dictionaries");
+        }
+        auto uuid = platform::Uuid::parse(key);
+        if (!uuid) return fail(kZRErrorAnnotation, "invalid plug-in UUID value");
+        auto plugIn = server().findPlugIn(*uuid);
+        if (!plugIn) return fail(kZRErrorRegistration, "no plug-in with the requested uuid");
+        EVLOG_DEBUG(ops(), "client {} bulk plug-in {}({}) annotation change: {}", client_->pid(),
+                    plugIn->identifier(), pub(plugIn->uuid()), value);
+        server().setAnnotation(Dictionary{{annotation::kExtension, value}}, *plugIn);
+    }
+    server().notifyAnnotationChange();
+    done();
+}
+
+}  // namespace zorvan
