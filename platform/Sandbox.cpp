@@ -57,6 +57,9 @@ class KernelSandbox : public Sandbox {
             return true;
         return mayHaveFlatpakInfo(token.procDirectory());
     }
+    Result<std::string> issueReadExtension(const std::string& path) override {
+        return Error::posix(ENOTSUP, path);
+    }
 };
 
 }  // namespace

@@ -2,6 +2,7 @@
 
 #include <memory>
 
+#include "platform/Assertions.h"
 #include "platform/CodeSigning.h"
 #include "platform/Consent.h"
 #include "platform/Directories.h"
@@ -24,6 +25,7 @@ struct Services {
     std::shared_ptr<Workspace> workspace;   // null when the registry could not be opened
     std::shared_ptr<CodeSigning> codeSigning;
     std::shared_ptr<Sandbox> sandbox;
+    std::shared_ptr<Assertions> assertions;
     std::shared_ptr<Consent> consent;
     std::shared_ptr<Launcher> launcher;
     std::shared_ptr<Notifications> notifications;

@@ -15,6 +15,7 @@ platform::Services diskServices() {
     services.mainLoop = std::make_shared<platform::RunLoop>();
     services.codeSigning = platform::makeFileCodeSigning();
     services.sandbox = platform::makeKernelSandbox();
+    services.assertions = platform::makeFileAssertions(services.directories);
     services.consent = platform::makeFileConsent(services.directories);
     services.notifications = platform::makeFileNotifications(services.directories);
     services.launcher = platform::makeLauncher();

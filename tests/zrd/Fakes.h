@@ -177,11 +177,33 @@ struct FakeCodeSigning final : platform::CodeSigning {
 
 struct FakeSandbox final : platform::Sandbox {
     bool isSandboxed(const platform::AuditToken&) override { return sandboxed; }
+    platform::Result<std::string> issueReadExtension(const std::string& path) override {
+        if (unreadable.contains(path)) return platform::Error::posix(EACCES, path);
+        return "token " + std::to_string(++issued) + " " + path;
+    }
+    std::set<std::string> unreadable;
+    int issued = 0;
     bool sandboxed = false;
 };
 
 /// Knows no instances, until told what to answer; keeps what it was asked for.
 struct FakeLauncher final : platform::Launcher {
+    int addExternalService(const platform::AuditToken&, const std::string& executable,
+                           const Dictionary& overlay) override {
+        granted.emplace_back(executable, overlay);
+        return refused.contains(executable) ? EACCES : 0;
+    }
+    std::unique_ptr<WorkMarker> beginOutstandingWork() override {
+        struct Marker final : WorkMarker {
+            explicit Marker(int& value) : count(value) { ++count; }
+            ~Marker() override { --count; }
+            int& count;
+        };
+        return std::make_unique<Marker>(markers);
+    }
+    std::vector<std::pair<std::string, Dictionary>> granted;
+    std::set<std::string> refused;
+    int markers = 0;
     void terminatePlugInInstances(const std::string& identifier, const std::string& version,
                                   platform::SerialQueue& queue, Completion completion) override {
         terminated.push_back(identifier + " " + version);
@@ -191,6 +213,22 @@ struct FakeLauncher final : platform::Launcher {
     }
     std::vector<std::string> terminated;
     std::vector<Status> statuses;
+};
+
+/// Reports that a test chooses, and the bundles that it was asked about.
+struct FakeAssertions final : platform::Assertions {
+    std::vector<Dictionary> busyInstancesForBundleIdentifiers(
+        const std::set<std::string>& identifiers) override {
+        std::vector<Dictionary> found;
+        for (const std::string& identifier : identifiers) {
+            asked.push_back(identifier);
+            auto [first, last] = reports.equal_range(identifier);
+            for (; first != last; ++first) found.push_back(first->second);
+        }
+        return found;
+    }
+    std::multimap<std::string, Dictionary> reports;
+    std::vector<std::string> asked;
 };
 
 struct FakeNotifications final : platform::Notifications {
