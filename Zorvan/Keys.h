@@ -44,6 +44,10 @@ inline constexpr unsigned long ZRDiscoverDuplicates = 0x4;  // with Versions: eq
 inline constexpr unsigned long ZRDiscoverSystemOnly = 0x8;  // only the system volume
 inline constexpr unsigned long ZRDiscoverAll = 0x200;  // managers: without visibility and admission
 
+/// What the paths of "lock" name.
+inline constexpr unsigned long ZRHoldApplications = 1;
+inline constexpr unsigned long ZRHoldPlugIns = 2;
+
 /// Keys of Info.plist dictionaries and of the plug-in dictionary in them.
 namespace key {
 inline constexpr const char* kExtension = "VXExtension";
@@ -59,6 +63,7 @@ inline constexpr const char* kPassProxy = "PassProxy";
 inline constexpr const char* kExtensionPoint = "VXExtensionPointIdentifier";
 inline constexpr const char* kHubProtocolVersion = "HubProtocolVersion";
 inline constexpr const char* kShared = "Shared";
+inline constexpr const char* kRequestsOpenAccess = "RequestsOpenAccess";
 inline constexpr const char* kHostEntitlement = "VXExtensionHostEntitlement";
 inline constexpr const char* kCleanTimeout = "CleanTimeout";
 inline constexpr const char* kExtensionVersion = "VXExtensionVersion";
@@ -102,7 +107,24 @@ inline constexpr const char* kHash = "hash";
 inline constexpr const char* kRequirement = "requirement";
 inline constexpr const char* kOverrider = "overrider";
 inline constexpr const char* kOverriding = "overriding";
+inline constexpr const char* kExtensions = "extensions";
 }  // namespace form
+
+/// Keys of the activation overlay that tells the launcher how to start a plug-in, and of the
+/// service dictionary in it.
+namespace overlay {
+inline constexpr const char* kService = "LUMService";
+inline constexpr const char* kPackageType = "QFBundlePackageType";
+inline constexpr const char* kLumPackage = "LUM!";
+inline constexpr const char* kEnvironment = "EnvironmentVariables";
+inline constexpr const char* kProfile = "_SandboxProfile";
+inline constexpr const char* kOmitParameters = "_OmitSandboxParameters";
+}  // namespace overlay
+
+/// Keys of an entry of "conflicts".
+namespace conflict {
+inline constexpr const char* kBundleIdentifier = "bundle-identifier";
+}  // namespace conflict
 
 /// Keys of an annotation.
 namespace annotation {

@@ -29,6 +29,11 @@ Refusal dedicated(const ZRDPlugIn& plugIn, const CandidateQuery& query) {
     return "it is dedicated to the application around it";
 }
 
+Refusal holds(const ZRDPlugIn& plugIn, const CandidateQuery& query) {
+    if (!query.isOnHold(plugIn)) return std::nullopt;
+    return "it is on hold";
+}
+
 Refusal rules(const ZRDPlugIn& plugIn, const CandidateQuery& query) {
     if (plugIn.match(query.rules)) return std::nullopt;
     return "a rule does not hold";
@@ -61,6 +66,7 @@ constexpr CandidateGate kGates[] = {
     {"application", true, insideApplication, nullptr},
     {"system-only", true, systemOnly, nullptr},
     {"dedicated", true, dedicated, nullptr},
+    {"holds", true, holds, nullptr},
     {"rules", false, rules, nullptr},
     {"exclusions", false, exclusions, reportExclusion},
     {"admission", true, admission, reportAdmission},

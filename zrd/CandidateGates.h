@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <optional>
 #include <span>
 #include <string>
@@ -21,6 +22,7 @@ struct CandidateQuery {
     std::vector<platform::Dictionary> exclusions;
     const HostProcess* host = nullptr;
     std::optional<std::string> hostPlugInsPath;  // of the plug-ins inside the host's own bundle
+    std::function<bool(const ZRDPlugIn&)> isOnHold;
 };
 
 /// Why a gate turns a candidate away, in words for people; none: the candidate passes.

@@ -8,6 +8,7 @@
 
 #include "Zorvan/ZRBundle.h"
 #include "platform/Value.h"
+#include "platform/lum/AuditToken.h"
 
 namespace zorvan {
 
@@ -18,6 +19,10 @@ class HostProcess {
 
     /// 0 when its connection is gone.
     virtual pid_t pid() const = 0;
+    /// None when its connection is gone.
+    virtual std::optional<platform::AuditToken> auditToken() const = 0;
+    /// The executable; empty when it cannot be told.
+    virtual const std::string& path() const = 0;
     /// The bundle around its executable, or a bundle made of the bare executable's own path; null
     /// when the executable cannot be told.
     virtual const std::shared_ptr<ZRBundle>& bundle() const = 0;

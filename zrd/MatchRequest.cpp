@@ -52,6 +52,7 @@ void Transaction::matchPlugIns() {
     }
     query.exclusions = exclusionRules(server().userPrefs().exclusions());
     query.host = client_.get();
+    query.isOnHold = [this](const ZRDPlugIn& plugIn) { return server().holdOnPlugIn(plugIn); };
     if (client_->bundle()) query.hostPlugInsPath = client_->bundle()->plugInsPath();
 
     auto candidates = server().findPlugIns(query.rules).value_or(ZRDPlugInList());

@@ -6,7 +6,10 @@
 #include "platform/Value.h"
 
 namespace platform {
+class Assertions;
 class Consent;
+class Launcher;
+class Sandbox;
 class Types;
 }  // namespace platform
 
@@ -26,6 +29,9 @@ class AnnotationReader {
 /// What a plug-in record needs of the world around it. Shared by all records of a database.
 struct PlugInContext {
     std::weak_ptr<AnnotationReader> annotations;
+    std::shared_ptr<platform::Launcher> launcher;
+    std::shared_ptr<platform::Assertions> assertions;
+    std::shared_ptr<platform::Sandbox> sandbox;
     std::shared_ptr<platform::Consent> consent;
     std::shared_ptr<platform::Types> types;
 };

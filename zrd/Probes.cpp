@@ -21,6 +21,7 @@ ZRD_PROBE_SEMAPHORE(request);
 ZRD_PROBE_SEMAPHORE(request__output);
 ZRD_PROBE_SEMAPHORE(plugin__add);
 ZRD_PROBE_SEMAPHORE(plugin__remove);
+ZRD_PROBE_SEMAPHORE(plugin__ready);
 ZRD_PROBE_SEMAPHORE(discover__raw);
 ZRD_PROBE_SEMAPHORE(db__load);
 }
@@ -61,6 +62,9 @@ void pluginAdd(const char* path) {
 }
 void pluginRemove(const char* path, bool resolved) {
     ZRD_PROBE2(plugin__remove, path, resolved);
+}
+void pluginReady(const char* uuid) {
+    ZRD_PROBE1(plugin__ready, uuid);
 }
 void discoverRaw(unsigned int plugIns) {
     ZRD_PROBE1(discover__raw, plugIns);

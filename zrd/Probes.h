@@ -20,6 +20,7 @@ void requestOutput(int pid, const char* reply);
 void request(int pid, const char* type);
 void pluginAdd(const char* path);
 void pluginRemove(const char* path, bool resolved);
+void pluginReady(const char* uuid);
 void discoverRaw(unsigned int plugIns);
 void dbLoad(const char* errorDomain, std::uint64_t errorCode);
 

@@ -49,8 +49,11 @@ void Transaction::dispatch() {
         {request::kRemove, &Transaction::removePlugIns},
         {request::kBulk, &Transaction::bulkPlugIns},
         {request::kMatch, &Transaction::matchPlugIns},
+        {request::kReady, &Transaction::readyPlugIns},
+        {request::kAccess, &Transaction::accessPlugIns},
         {request::kAnnotate, &Transaction::annotatePlugIns},
         {request::kBulkAnnotate, &Transaction::bulkAnnotatePlugIns},
+        {request::kLock, &Transaction::lockDownPlugIns},
     };
     server().mainQueue().assertCurrent();
 

@@ -5,6 +5,7 @@
 #include <functional>
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "Zorvan/ZRError.h"
 #include "platform/lum/Message.h"
@@ -39,8 +40,20 @@ class Transaction {
     void removePlugIns();
     void bulkPlugIns();
     void matchPlugIns();
+    void readyPlugIns();
+    void accessPlugIns();
     void annotatePlugIns();
     void bulkAnnotatePlugIns();
+    void lockDownPlugIns();
+
+    /// Whether the host may have a plug-in made ready; otherwise the failure has been sent.
+    bool admitToReady(const ZRDPlugIn& plugIn);
+    void releaseHolds(const platform::Array& tokens);
+    /// The plug-ins that "paths" names; false when the failure has been sent.
+    bool collectPlugInsToHold(std::vector<std::shared_ptr<ZRDPlugIn>>& plugIns);
+    /// Whether none of them is busy; otherwise the failure has been sent, with the conflicts.
+    bool areIdle(const std::vector<std::shared_ptr<ZRDPlugIn>>& plugIns);
+    void takeHold(const std::vector<std::shared_ptr<ZRDPlugIn>>& plugIns);
 
     /// The request's "annotations"; null when they cannot be stored, and the failure has been sent.
     const platform::Dictionary* requestedAnnotations();

@@ -50,6 +50,11 @@ pid_t ZRDLumClient::pid() const {
     return connection ? connection->pid() : 0;
 }
 
+std::optional<platform::AuditToken> ZRDLumClient::auditToken() const {
+    auto connection = connection_.lock();
+    return connection ? std::optional(connection->auditToken()) : std::nullopt;
+}
+
 void ZRDLumClient::handleEvent(const platform::ConnectionEvent& event) {
     if (const auto* message = std::get_if<Message>(&event)) {
         receive(*message);
@@ -91,8 +96,11 @@ void ZRDLumClient::dying() {
 }
 
 void ZRDLumClient::dead() {
+    server_->unholdClient(*this);
     EVLOG_DEBUG(ops(), "client {} is dead", pid());
     setAcceptWork(false);
+    // A hold that was being taken meanwhile is found here, or by its taker, who looks afterwards.
+    server_->unholdClient(*this);
     probes::clientDone(pid());
 }
 

@@ -26,6 +26,8 @@ class ZRDLumClient final : public HostProcess, public std::enable_shared_from_th
         const std::shared_ptr<platform::Connection>& connection, std::shared_ptr<ZRDServer> server);
 
     pid_t pid() const override;
+    std::optional<platform::AuditToken> auditToken() const override;
+    const std::string& path() const override { return path_; }
     const std::shared_ptr<ZRBundle>& bundle() const override { return bundle_; }
     std::optional<platform::Value> entitlementValueForKey(const std::string& name) const override;
     bool hasEntitlement(const std::string& name) const override;
@@ -40,8 +42,6 @@ class ZRDLumClient final : public HostProcess, public std::enable_shared_from_th
     /// Null when the connection is gone.
     std::shared_ptr<platform::Connection> connection() const { return connection_.lock(); }
     const std::shared_ptr<ZRDServer>& server() const { return server_; }
-    /// The executable; empty when it cannot be told.
-    const std::string& path() const { return path_; }
     platform::CodeSigningTask& task() const { return *task_; }
     /// Requests received so far. On the service queue only.
     std::uint32_t requestCount() const { return requestCount_; }

@@ -145,6 +145,8 @@ std::optional<Dictionary> ZRDPlugIn::form(std::optional<ZRError>& error) const {
     }
     auto made = exportForm(error);
     if (!made) return std::nullopt;
+    // Tokens that could not be issued now may be another time.
+    if (!augmentForm(*made)) return made;
     platform::keepCborEncoded(*made);
     std::lock_guard lock(mutex_);
     if (namesAtStart == nameChanges_) form_ = made;

@@ -45,8 +45,9 @@ class ZRDPlugIn final : public ZRPlugInCore {
     /// around what is not part of the system.
     std::optional<ZRError> diagnose() const override;
 
-    /// The record's form as `exportForm` makes it, made and encoded at the first call and shared
-    /// from then on; setting a name makes it afresh. An error: there is none, as with `exportForm`.
+    /// The record's form as `exportForm` makes it and `augmentForm` completes it, made and encoded
+    /// at the first call and shared from then on; setting a name makes it afresh. An error: there
+    /// is none, as with `exportForm`.
     std::optional<platform::Dictionary> form(std::optional<ZRError>& error) const;
 
     /// The plug-in's value for an entitlement, or null.
@@ -69,6 +70,17 @@ class ZRDPlugIn final : public ZRPlugInCore {
     // Admission.
     /// Why the host may not use this plug-in; none: it may.
     std::optional<std::string> allowForClient(const HostProcess& host) const;
+    // Enabling. On the service queue.
+    /// Tells the launcher that the host may start this plug-in, and how. The error says why not.
+    std::optional<ZRError> enableForClient(const HostProcess& host) const;
+    /// A token for each named resource of the bundle ("." is the bundle), under its name; those for
+    /// which there is none are left out, with a log line. `resources` is a text or a list.
+    platform::Dictionary issueResourceExtensions(const platform::Value& resources) const;
+    /// Adds the tokens for what the plug-in shares with hosts. Whether there is one for everything.
+    bool augmentForm(platform::Dictionary& form) const;
+    /// What a busy running instance says of itself, or none.
+    std::optional<platform::Dictionary> checkBusy() const;
+
     /// The consent services that the user has granted to the containing application.
     std::set<std::string> allowedVSKServices() const;
 
@@ -83,6 +95,9 @@ class ZRDPlugIn final : public ZRPlugInCore {
     RuleValue valueForRule(const std::string& key) const;
     const platform::Value* attributeOrInfoKey(std::string_view key) const;
     std::string userElection() const;
+    const char* sandboxProfile() const;
+    platform::Dictionary containerEnvironment() const;
+    platform::Dictionary launchService() const;
     bool matchValue(const platform::Value& value, const platform::Value& patterns) const;
     bool matchText(const std::string& value, const std::string& pattern) const;
     bool matchDictionary(const platform::Value& value, const platform::Dictionary& pattern) const;

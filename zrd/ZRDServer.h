@@ -5,9 +5,12 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <unordered_map>
+#include <vector>
 
 #include "platform/SerialQueue.h"
 #include "platform/lum/Listener.h"
+#include "zrd/ZRDPlugInHold.h"
 #include "zrd/ZRDUserPrefs.h"
 #include "zrd/ZRDatabase.h"
 
@@ -38,6 +41,18 @@ class ZRDServer final : public ZRDatabase, public ZRDatabaseDelegate {
     /// is logged.
     void removedPlugIns(const platform::TDPlugInProxyList& plugIns) override;
 
+    // Holds. Each enters the queue "serverSync" synchronously: from any thread, but not from
+    // inside.
+    /// Whether any hold, of whichever client, has the plug-in.
+    bool holdOnPlugIn(const ZRDPlugIn& plugIn);
+    std::vector<std::shared_ptr<ZRDPlugInHold>> holds();
+    /// Adds a hold and, like the two that release holds, posts the change notification.
+    void addHold(std::shared_ptr<ZRDPlugInHold> hold);
+    /// Releases the hold with a token; an unknown one is ignored.
+    void unholdToken(const platform::Uuid& token);
+    /// Releases every hold of this very client.
+    void unholdClient(const ZRDLumClient& client);
+
     /// Runs `work` on the service queue, after all work submitted before. From any thread.
     void submitWork(std::function<void()> work) { mainQueue_.async(std::move(work)); }
 
@@ -51,12 +66,18 @@ class ZRDServer final : public ZRDatabase, public ZRDatabaseDelegate {
     using ZRDatabase::services;
 
   private:
+    using HoldList = std::vector<std::shared_ptr<ZRDPlugInHold>>;
+
     explicit ZRDServer(platform::Services services);
     bool listen(const std::string& serviceName);
+    HoldList::iterator releaseHold(HoldList::iterator hold);
 
     std::atomic<std::uint32_t> verbose_{0};
     platform::SerialQueue lumQueue_;
     platform::SerialQueue mainQueue_;
+    platform::SyncQueue syncQueue_{"serverSync"};
+    HoldList holds_;                                               // guarded by syncQueue_
+    std::unordered_map<platform::Uuid, std::size_t> heldPlugIns_;  // by how many holds; likewise
     std::unique_ptr<platform::Listener> service_;
     std::unique_ptr<ZRDUserPrefs> userPrefs_;
 };

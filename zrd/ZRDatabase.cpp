@@ -18,8 +18,12 @@ bool ZRDatabase::initWithDatabase(const std::optional<std::string>& path,
                                   const std::shared_ptr<ZRDatabase>& self) {
     if (!services_.workspace) return false;
     annotations_ = ZRDAnnotationStore::initWithDatabase(path, services_.directories);
-    context_ = std::make_shared<PlugInContext>(
-        PlugInContext{.annotations = self, .consent = services_.consent, .types = services_.types});
+    context_ = std::make_shared<PlugInContext>(PlugInContext{.annotations = self,
+                                                             .launcher = services_.launcher,
+                                                             .assertions = services_.assertions,
+                                                             .sandbox = services_.sandbox,
+                                                             .consent = services_.consent,
+                                                             .types = services_.types});
     observation_ = services_.workspace->addObserver(*this);
     return true;
 }

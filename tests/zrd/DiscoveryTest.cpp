@@ -21,6 +21,7 @@ class GatesTest : public testing::Test {
     std::string closed(const platform::TDPlugInProxyRef& proxy) {
         query_.rules = &rules_;
         query_.host = &host_;
+        query_.isOnHold = [this](const ZRDPlugIn&) { return isOnHold_; };
         const CandidateGate* gate = firstClosedGate(*world_.record(proxy), query_);
         return gate ? std::string(gate->name) : "";
     }
@@ -29,6 +30,7 @@ class GatesTest : public testing::Test {
     FakeHost host_;
     Dictionary rules_;
     CandidateQuery query_;
+    bool isOnHold_ = true;
 };
 
 TEST_F(GatesTest, ACandidateMeetsThemInOrderUnlessAllAreAskedFor) {
@@ -51,6 +53,8 @@ TEST_F(GatesTest, ACandidateMeetsThemInOrderUnlessAllAreAskedFor) {
     query_.hostPlugInsPath.reset();
     EXPECT_EQ(closed(proxy), "dedicated");
     query_.hostPlugInsPath = "/Apps/Host.app/PlugIns";
+    EXPECT_EQ(closed(proxy), "holds");
+    isOnHold_ = false;
     EXPECT_EQ(closed(proxy), "rules");
 
     const std::string who = " 7 plugin " + proxy->plugInUuid.string();
@@ -62,8 +66,10 @@ TEST_F(GatesTest, ACandidateMeetsThemInOrderUnlessAllAreAskedFor) {
     EXPECT_EQ(closed(proxy), "exclusions");
     query_.exclusions.clear();
     query_.hostPlugInsPath.reset();
+    isOnHold_ = true;
     log.take();
     EXPECT_EQ(closed(proxy), "");
+    isOnHold_ = false;
     query_.flags = 0;
     query_.hostPlugInsPath = "/Apps/Host.app/PlugIns";
     EXPECT_EQ(closed(proxy), "admission");

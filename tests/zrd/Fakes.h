@@ -47,6 +47,8 @@ struct FakeConsent final : platform::Consent {
 
 struct FakeHost final : HostProcess {
     pid_t pid() const override { return 7; }
+    std::optional<platform::AuditToken> auditToken() const override { return token; }
+    const std::string& path() const override { return path_; }
     const std::shared_ptr<ZRBundle>& bundle() const override { return bundle_; }
     std::optional<Value> entitlementValueForKey(const std::string& name) const override {
         const Value* value = entitlements.find(name);
@@ -58,6 +60,8 @@ struct FakeHost final : HostProcess {
     }
     std::shared_ptr<ZRBundle> bundle_;
     Dictionary entitlements;
+    std::optional<platform::AuditToken> token = platform::AuditToken::ofSelf();
+    std::string path_ = "/Apps/Host.app/Host";
 };
 
 inline platform::TDApplicationProxyRef makeApplication(const std::string& path,
@@ -82,6 +86,62 @@ inline std::shared_ptr<platform::TDPlugInProxy> makeProxy(const std::string& ide
     return proxy;
 }
 
+struct FakeSandbox final : platform::Sandbox {
+    bool isSandboxed(const platform::AuditToken&) override { return sandboxed; }
+    platform::Result<std::string> issueReadExtension(const std::string& path) override {
+        if (unreadable.contains(path)) return platform::Error::posix(EACCES, path);
+        return "token " + std::to_string(++issued) + " " + path;
+    }
+    std::set<std::string> unreadable;
+    int issued = 0;
+    bool sandboxed = false;
+};
+
+/// Knows no instances, until told what to answer; keeps what it was asked for.
+struct FakeLauncher final : platform::Launcher {
+    int addExternalService(const platform::AuditToken&, const std::string& executable,
+                           const Dictionary& overlay) override {
+        granted.emplace_back(executable, overlay);
+        return refused.contains(executable) ? EACCES : 0;
+    }
+    std::unique_ptr<WorkMarker> beginOutstandingWork() override {
+        struct Marker final : WorkMarker {
+            explicit Marker(int& value) : count(value) { ++count; }
+            ~Marker() override { --count; }
+            int& count;
+        };
+        return std::make_unique<Marker>(markers);
+    }
+    std::vector<std::pair<std::string, Dictionary>> granted;
+    std::set<std::string> refused;
+    int markers = 0;
+    void terminatePlugInInstances(const std::string& identifier, const std::string& version,
+                                  platform::SerialQueue& queue, Completion completion) override {
+        terminated.push_back(identifier + " " + version);
+        Status status = statuses.empty() ? kNoneOnRecord : statuses.front();
+        if (!statuses.empty()) statuses.erase(statuses.begin());
+        queue.async([completion = std::move(completion), status] { completion(status); });
+    }
+    std::vector<std::string> terminated;
+    std::vector<Status> statuses;
+};
+
+/// Reports that a test chooses, and the bundles that it was asked about.
+struct FakeAssertions final : platform::Assertions {
+    std::vector<Dictionary> busyInstancesForBundleIdentifiers(
+        const std::set<std::string>& identifiers) override {
+        std::vector<Dictionary> found;
+        for (const std::string& identifier : identifiers) {
+            asked.push_back(identifier);
+            auto [first, last] = reports.equal_range(identifier);
+            for (; first != last; ++first) found.push_back(first->second);
+        }
+        return found;
+    }
+    std::multimap<std::string, Dictionary> reports;
+    std::vector<std::string> asked;
+};
+
 /// What records need of the world, and records in it.
 struct FakeWorld {
     std::shared_ptr<ZRDPlugIn> record(platform::TDPlugInProxyRef proxy) const {
@@ -89,8 +149,16 @@ struct FakeWorld {
     }
     std::shared_ptr<FakeAnnotations> annotations = std::make_shared<FakeAnnotations>();
     std::shared_ptr<FakeConsent> consent = std::make_shared<FakeConsent>();
-    std::shared_ptr<PlugInContext> context = std::make_shared<PlugInContext>(PlugInContext{
-        .annotations = annotations, .consent = consent, .types = std::make_shared<FakeTypes>()});
+    std::shared_ptr<FakeSandbox> sandbox = std::make_shared<FakeSandbox>();
+    std::shared_ptr<FakeLauncher> launcher = std::make_shared<FakeLauncher>();
+    std::shared_ptr<FakeAssertions> assertions = std::make_shared<FakeAssertions>();
+    std::shared_ptr<PlugInContext> context =
+        std::make_shared<PlugInContext>(PlugInContext{.annotations = annotations,
+                                                      .launcher = launcher,
+                                                      .assertions = assertions,
+                                                      .sandbox = sandbox,
+                                                      .consent = consent,
+                                                      .types = std::make_shared<FakeTypes>()});
 };
 
 /// A registry in memory. Its query keeps whatever the filter keeps, or fails.
@@ -173,62 +241,6 @@ struct FakeCodeSigning final : platform::CodeSigning {
     }
     Dictionary entitlements;
     std::optional<platform::Error> error;
-};
-
-struct FakeSandbox final : platform::Sandbox {
-    bool isSandboxed(const platform::AuditToken&) override { return sandboxed; }
-    platform::Result<std::string> issueReadExtension(const std::string& path) override {
-        if (unreadable.contains(path)) return platform::Error::posix(EACCES, path);
-        return "token " + std::to_string(++issued) + " " + path;
-    }
-    std::set<std::string> unreadable;
-    int issued = 0;
-    bool sandboxed = false;
-};
-
-/// Knows no instances, until told what to answer; keeps what it was asked for.
-struct FakeLauncher final : platform::Launcher {
-    int addExternalService(const platform::AuditToken&, const std::string& executable,
-                           const Dictionary& overlay) override {
-        granted.emplace_back(executable, overlay);
-        return refused.contains(executable) ? EACCES : 0;
-    }
-    std::unique_ptr<WorkMarker> beginOutstandingWork() override {
-        struct Marker final : WorkMarker {
-            explicit Marker(int& value) : count(value) { ++count; }
-            ~Marker() override { --count; }
-            int& count;
-        };
-        return std::make_unique<Marker>(markers);
-    }
-    std::vector<std::pair<std::string, Dictionary>> granted;
-    std::set<std::string> refused;
-    int markers = 0;
-    void terminatePlugInInstances(const std::string& identifier, const std::string& version,
-                                  platform::SerialQueue& queue, Completion completion) override {
-        terminated.push_back(identifier + " " + version);
-        Status status = statuses.empty() ? kNoneOnRecord : statuses.front();
-        if (!statuses.empty()) statuses.erase(statuses.begin());
-        queue.async([completion = std::move(completion), status] { completion(status); });
-    }
-    std::vector<std::string> terminated;
-    std::vector<Status> statuses;
-};
-
-/// Reports that a test chooses, and the bundles that it was asked about.
-struct FakeAssertions final : platform::Assertions {
-    std::vector<Dictionary> busyInstancesForBundleIdentifiers(
-        const std::set<std::string>& identifiers) override {
-        std::vector<Dictionary> found;
-        for (const std::string& identifier : identifiers) {
-            asked.push_back(identifier);
-            auto [first, last] = reports.equal_range(identifier);
-            for (; first != last; ++first) found.push_back(first->second);
-        }
-        return found;
-    }
-    std::multimap<std::string, Dictionary> reports;
-    std::vector<std::string> asked;
 };
 
 struct FakeNotifications final : platform::Notifications {

@@ -28,6 +28,7 @@ class TransactionTest : public testing::Test {
         services_.codeSigning = codeSigning_;
         services_.sandbox = sandbox_;
         services_.launcher = launcher_;
+        services_.assertions = assertions_;
         services_.notifications = notifications_;
         server_ = ZRDServer::initForService("zrd", std::nullopt, services_);
         ASSERT_TRUE(server_);
@@ -76,6 +77,7 @@ class TransactionTest : public testing::Test {
     std::shared_ptr<FakeWorkspace> workspace_ = std::make_shared<FakeWorkspace>();
     std::shared_ptr<FakeCodeSigning> codeSigning_ = std::make_shared<FakeCodeSigning>();
     std::shared_ptr<FakeSandbox> sandbox_ = std::make_shared<FakeSandbox>();
+    std::shared_ptr<FakeAssertions> assertions_ = std::make_shared<FakeAssertions>();
     std::shared_ptr<FakeLauncher> launcher_ = std::make_shared<FakeLauncher>();
     std::shared_ptr<FakeNotifications> notifications_ = std::make_shared<FakeNotifications>();
     std::shared_ptr<FakeConnection> connection_ = std::make_shared<FakeConnection>();

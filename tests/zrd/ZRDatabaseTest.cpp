@@ -38,6 +38,7 @@ class ZRDatabaseTest : public testing::Test {
         platform::Services services;
         services.workspace = workspace_;
         services.notifications = notifications_;
+        services.sandbox = std::make_shared<FakeSandbox>();
         database_ = TestDatabase::make(services, directory_.path("Annotations"));
         database_->setCacheLimit(100);
     }

@@ -1,0 +1,140 @@
+#include <algorithm>
+
+#include "Zorvan/Keys.h"
+#include "tests/zrd/TransactionTest.h"
+
+namespace zorvan {
+
+namespace {
+
+using platform::ConnectionError;
+using platform::Uuid;
+using testing::Contains;
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::IsEmpty;
+
+/// Two plug-ins of one application, where "lock" and the registry's paths agree.
+class HoldsTest : public TransactionTest {
+  protected:
+    void SetUp() override {
+        TransactionTest::SetUp();
+        for (const char* name : {"com.a", "com.b"}) {
+            auto proxy = makeProxy(name);
+            proxy->bundlePath = directory_.makeDirectory(std::string(name) + ".appex");
+            proxy->containingApplication = makeApplication(directory_.path());
+            Dictionary info = proxy->infoPlist.get();
+            info.set("QFBundleIdentifier", std::string("bundle.") + name);
+            proxy->infoPlist = info;
+            workspace_->installed.push_back(proxy);
+        }
+        a_ = *workspace_->installed[0]->bundlePath;
+        b_ = *workspace_->installed[1]->bundlePath;
+    }
+    Dictionary lock(std::uint64_t flags, Array paths) {
+        return ask({{"request", "lock"}, {"flags", flags}, {"paths", paths}});
+    }
+    static Uuid tokenOf(const Dictionary& reply) {
+        const Value* token = reply.find("uuids");
+        return token ? token->uuid().value() : Uuid();
+    }
+    Dictionary release(Array tokens) { return ask({{"request", "lock"}, {"uuids", tokens}}); }
+    std::size_t posts() { return std::exchange(notifications_->posted, {}).size(); }
+
+    std::string a_, b_;
+};
+
+TEST_F(HoldsTest, WhatIsHeldIsNeitherFoundNorMadeReady) {
+    LogLines log;
+    const Dictionary reply = lock(ZRHoldApplications, {directory_.path()});
+    const Uuid token = tokenOf(reply);
+    EXPECT_THAT(log.take(), Contains("ops D: hold request granted uuid:" + token.string()));
+    EXPECT_EQ(posts(), 1u);
+    EXPECT_EQ(launcher_->markers, 1);
+    EXPECT_THAT(match({}), IsEmpty());
+    codeSigning_->entitlements = {{entitlement::kManager, true}};
+    EXPECT_THAT(match({{"flags", ZRDiscoverAll}}), ElementsAre("com.a", "com.b"));
+    log.take();
+    EXPECT_EQ(ask({{"request", "ready"}, {"uuids", Array{workspace_->installed[0]->plugInUuid}}}),
+              error(11, "access to plugin com.a denied: the plug-in is on hold"));
+    EXPECT_THAT(
+        log.take(),
+        Contains("ops -: denied access to " + std::to_string(getpid()) + " for plugin com.a(" +
+                 workspace_->installed[0]->plugInUuid.string() + "): the plug-in is on hold"));
+    EXPECT_THAT(launcher_->granted, IsEmpty());
+
+    const Uuid second = tokenOf(lock(ZRHoldPlugIns, {a_}));
+    EXPECT_EQ(posts(), 1u);
+    EXPECT_EQ(release({7, Uuid::random(), token}), Dictionary());
+    EXPECT_THAT(log.take(), Contains("ops D: releasing plug-in hold " + token.string() +
+                                     " at client's request"));
+    EXPECT_EQ(posts(), 1u);
+    EXPECT_THAT(match({}), ElementsAre("com.b")) << "another hold has it still";
+    EXPECT_EQ(release({second, second}), Dictionary());
+    EXPECT_THAT(match({}), ElementsAre("com.a", "com.b"));
+    EXPECT_EQ(launcher_->markers, 0);
+}
+
+TEST_F(HoldsTest, BusyPlugInsKeepTheirApplicationInService) {
+    assertions_->reports = {{"bundle.com.b", Dictionary()},
+                            {"bundle.com.b", {{platform::kAssertionBundleIdentifier, "bundle.x"}}},
+                            {"bundle.com.b", {{platform::kAssertionBundleIdentifier, "bundle.y"}}}};
+    LogLines log;
+    Dictionary refusal = error(14, "plug-ins are busy");
+    refusal.set("conflicts", Array{Dictionary{{"bundle-identifier", "bundle.x"}}});
+    EXPECT_EQ(lock(ZRHoldApplications, {directory_.path()}), refusal);
+    const auto lines = log.take();
+    EXPECT_THAT(lines, Contains(HasSubstr("ops E: tenurd reported incomplete bundle for plug-in "
+                                          "com.b/")));
+    EXPECT_THAT(lines, Contains(HasSubstr("ops D: hold rejected. Busy plug-ins:(")));
+    EXPECT_THAT(server_->holds(), IsEmpty());
+    EXPECT_EQ(posts(), 0u);
+    EXPECT_TRUE(lock(ZRHoldPlugIns, {b_}).contains("uuids")) << "not asked for a plug-in's path";
+    assertions_->reports = {{"bundle.com.a", Dictionary()}};
+    EXPECT_TRUE(lock(ZRHoldApplications, {directory_.path()}).contains("uuids"))
+        << "who does not say what it is does not count";
+}
+
+TEST_F(HoldsTest, BadHoldsAreRefusedAtTheFirstPath) {
+    const std::string gone = directory_.path("gone"), other = directory_.makeDirectory("other");
+    const Dictionary flags = error(4, "invalid request format (unsupported hold flags)");
+    EXPECT_EQ(lock(ZRHoldPlugIns, {a_, gone}), error(9, "invalid path: " + gone));
+    EXPECT_EQ(lock(ZRHoldPlugIns, {a_, other}), error(9, "no plug-in at path:" + other));
+    EXPECT_EQ(lock(ZRHoldPlugIns, {"a"}), error(9, "absolute path required: a"));
+    for (std::uint64_t bad : {0, 3, 4}) EXPECT_EQ(lock(bad, {a_}), flags);
+    EXPECT_EQ(ask({{"request", "lock"}, {"flags", 1}, {"uuids", "x"}}),
+              error(4, "invalid request format"));
+    EXPECT_THAT(server_->holds(), IsEmpty());
+    EXPECT_TRUE(lock(3, {}).contains("uuids")) << "nobody looks at the flags";
+    EXPECT_TRUE(lock(ZRHoldApplications, {other}).contains("uuids"));
+}
+
+TEST_F(HoldsTest, ADyingClientGivesItsHoldsBack) {
+    constexpr int kHolds = 1000;
+    for (int i = 0; i < kHolds; ++i) lock(ZRHoldPlugIns, {a_});
+    auto other = std::make_shared<FakeConnection>();
+    ZRDLumClient::initWithConnection(other, server_);
+    other->deliver(platform::Message(
+        {{"request", "lock"}, {"version", 3}, {"flags", ZRHoldPlugIns}, {"paths", Array{b_}}}));
+    drain();
+    posts();
+    LogLines log;
+    auto survivor = client().shared_from_this();
+    deliver(ConnectionError{ConnectionError::Kind::Invalid, "gone"});
+    EXPECT_EQ(posts(), std::size_t{kHolds});
+    auto lines = log.take();
+    EXPECT_EQ(std::ranges::count_if(lines,
+                                    [](const std::string& line) {
+                                        return line.find("for dead client pid ") !=
+                                               std::string::npos;
+                                    }),
+              kHolds);
+    EXPECT_EQ(server_->holds().size(), 1u);
+    EXPECT_EQ(launcher_->markers, 1);
+    other->deliver(ConnectionError{ConnectionError::Kind::Invalid, "gone"});
+    EXPECT_THAT(server_->holds(), IsEmpty());
+}
+
+}  // namespace
+
+}  // namespace zorvan

@@ -1,0 +1,196 @@
+#include <cstdlib>
+#include <filesystem>
+
+#include "Zorvan/Keys.h"
+#include "tests/zrd/TransactionTest.h"
+#include "zrd/ZRDPlugInSignature.h"
+
+namespace zorvan {
+
+namespace {
+
+using testing::Contains;
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::IsEmpty;
+
+class ReadyAccessTest : public TransactionTest {
+  protected:
+    void SetUp() override {
+        TransactionTest::SetUp();
+        workspace_->installed = {
+            makeProxy("com.a"), makeProxy("com.data", {}, {{"VXExtensionProtocol", "#Data"}}),
+            makeProxy("com.c", {}, {{"VXExtensionHostEntitlement", "com.demand"}}),
+            makeProxy("com.d")};
+    }
+    Dictionary ask(const char* request, std::vector<int> plugIns) {
+        Array uuids;
+        for (int i : plugIns) uuids.append(workspace_->installed[i]->plugInUuid);
+        return TransactionTest::ask({{"request", request}, {"uuids", uuids}});
+    }
+    std::string executable(int i) { return *workspace_->installed[i]->bundlePath; }
+};
+
+TEST_F(ReadyAccessTest, AllAreAdmittedBeforeAnyIsEnabled) {
+    EXPECT_EQ(ask("ready", {0, 2, 3}),
+              error(11,
+                    "access to plugin com.c denied: the host does not have the "
+                    "\"com.demand\" entitlement"));
+    EXPECT_THAT(launcher_->granted, IsEmpty());
+    codeSigning_->entitlements = {{"com.demand", true}};
+    EXPECT_EQ(ask("ready", {0, 1, 2, 0}), Dictionary());
+    ASSERT_EQ(launcher_->granted.size(), 2u);
+    EXPECT_EQ(launcher_->granted[0].first, executable(0));
+    EXPECT_EQ(launcher_->granted[1].first, executable(2));
+    EXPECT_EQ(ask("ready", {}), Dictionary());
+    EXPECT_EQ(ask("ready", {1}), Dictionary()) << "data needs no admission";
+
+    launcher_->refused = {executable(0)};
+    launcher_->granted.clear();
+    LogLines log;
+    EXPECT_EQ(ask("ready", {0, 3}),
+              error(4, "unable to enable plug-in com.a(" +
+                           workspace_->installed[0]->plugInUuid.string() + ")"));
+    EXPECT_EQ(launcher_->granted.size(), 2u) << "the others are enabled all the same";
+    EXPECT_THAT(log.take(), Contains(HasSubstr("ops E: spawnerd error 13 trying to allow ")));
+}
+
+TEST_F(ReadyAccessTest, AccessGivesOneTokenForEach) {
+    const Dictionary reply = ask("access", {0, 0, 1});
+    const auto& tokens = *reply.find("extensions")->array();
+    ASSERT_EQ(tokens.size(), 3u);
+    EXPECT_NE(tokens[0], tokens[1]);
+    EXPECT_THAT(*tokens[2].string(), HasSubstr(executable(1)));
+    EXPECT_EQ(*ask("access", {}).find("extensions"), Value(Array()));
+    sandbox_->unreadable = {executable(1)};
+    EXPECT_EQ(ask("access", {0, 1}),
+              error(4, "cannot create extension to " + executable(1) + ": 13"));
+    const Dictionary unknown = error(4, "no such plugin (uuid not found)");
+    for (const char* request : {"ready", "access"})
+        EXPECT_EQ(TransactionTest::ask(
+                      {{"request", request}, {"uuids", Array{platform::Uuid::random()}}}),
+                  unknown);
+}
+
+TEST_F(ReadyAccessTest, MatchGivesTokensWithEachForm) {
+    const Value matches = *TransactionTest::ask({{"request", "match"}}).find("matches");
+    for (const Value& form : *matches.packed()->value()->array()) {
+        const Dictionary& extensions = *form.dictionary()->find("extensions")->dictionary();
+        EXPECT_EQ(extensions.size(), 1u);
+        EXPECT_TRUE(extensions.contains("."));
+    }
+}
+
+/// The overlay with which a record is enabled for a host.
+Dictionary overlayOf(const FakeWorld& world, const platform::TDPlugInProxyRef& proxy) {
+    EXPECT_EQ(world.record(proxy)->enableForClient(FakeHost()), std::nullopt);
+    return world.launcher->granted.back().second;
+}
+
+TEST(Enabling, TheOverlayFixesEnvironmentAndSandbox) {
+    FakeWorld world;
+    auto proxy = makeProxy("com.a");
+    Dictionary info = proxy->infoPlist.get();
+    info.set("LUMService",
+             Dictionary{{"EnvironmentVariables", Dictionary{{"HOME", "/mine"}, {"OWN", "1"}}},
+                        {"_SandboxProfile", "none"},
+                        {"Kept", 7}});
+    proxy->infoPlist = info;
+    ::setenv("ZRTEST_SDK", "sdk", 1);
+    LogLines log;
+    EXPECT_EQ(overlayOf(world, proxy),
+              (Dictionary{
+                  {"QFBundlePackageType", "LUM!"},
+                  {"LUMService", Dictionary{{"EnvironmentVariables",
+                                             Dictionary{{"HOME", "/mine"},
+                                                        {"OWN", "1"},
+                                                        {"QFFIXED_USER_HOME", "/Containers/com.a"},
+                                                        {"TMPDIR", "/Containers/com.a/tmp"},
+                                                        {"ZRTEST_SDK", "sdk"}}},
+                                            {"Kept", 7},
+                                            {"_OmitSandboxParameters", true},
+                                            {"_SandboxProfile", "plugin"}}}}));
+    ::unsetenv("ZRTEST_SDK");
+    const std::string uuid = proxy->plugInUuid.string();
+    EXPECT_THAT(log.take(),
+                ElementsAre(HasSubstr("td D: raw LUMService={"),
+                            "ops I: assigning plug-in com.a(1) " + uuid + " to plugin sandbox",
+                            "ops -: allowing host 7 /Apps/Host.app/Host to use plug-in com.a(1) "
+                            "uuid=" +
+                                uuid + " at " + *proxy->bundlePath,
+                            HasSubstr("ops D: activation overlay={")));
+
+    auto bare = makeProxy("com.data", {}, {{"VXExtensionProtocol", "#Data"}});
+    bare->dataContainerPath.reset();
+    EXPECT_EQ(*overlayOf(world, bare).find("LUMService"),
+              Value(Dictionary{{"EnvironmentVariables", Dictionary()},
+                               {"_OmitSandboxParameters", true},
+                               {"_SandboxProfile", "plugin"}}));
+    EXPECT_THAT(log.take(),
+                testing::IsSupersetOf(
+                    {std::string("ops I: no LUMService for plug-in; database returned (null)"),
+                     "ops D: no data container for plug-in com.data(1) " +
+                         bare->plugInUuid.string() + " at " + *bare->bundlePath}));
+
+    FakeHost gone;
+    gone.token.reset();
+    EXPECT_EQ(world.record(proxy)->enableForClient(gone)->code, 4);
+}
+
+TEST(Enabling, TheProfileFollowsTheExtensionPointAndTheUsersConsent) {
+    FakeWorld world;
+    const auto profile = [&](const char* point, Dictionary attributes) {
+        const Dictionary overlay = overlayOf(
+            world, makeProxy("com.p", attributes, {{"VXExtensionPointIdentifier", point}}));
+        return *overlay.find("LUMService")->dictionary()->find("_SandboxProfile")->string();
+    };
+    const char* keyboard = "com.orbel.keyboard-service";
+    const Dictionary open{{"RequestsOpenAccess", true}};
+    EXPECT_EQ(profile("com.other", {}), "plugin");
+    EXPECT_EQ(profile("com.orbel.netvane.filter-data", {}), "network-filter");
+    EXPECT_EQ(profile("com.orbel.glimse.extension.preview", {}), "glimsed");
+    EXPECT_EQ(profile(keyboard, open), "keyboard") << "without the user's consent";
+    world.consent->records = {
+        {Dictionary{{"granted", true}, {"service", platform::kKeyboardNetworkConsent}}}};
+    EXPECT_EQ(profile(keyboard, open), "plugin");
+    EXPECT_EQ(profile(keyboard, {{"RequestsOpenAccess", "true"}}), "keyboard");
+    EXPECT_EQ(profile(keyboard, {}), "keyboard");
+}
+
+TEST(Enabling, OnlyWhatLiesInTheBundleIsShared) {
+    ::test::TemporaryDirectory directory;
+    FakeWorld world;
+    auto proxy = makeProxy(
+        "com.a", {},
+        {{"Shared", Array{"in", 7, "../out", "none", "link"}}, {"VXExtensionProtocol", "P"}});
+    proxy->bundlePath = directory.makeDirectory("Plug.plugin");
+    directory.write("Plug.plugin/in", "x");
+    directory.write("out", "x");
+    std::filesystem::create_symlink("../out", directory.path("Plug.plugin/link"));
+    world.sandbox->unreadable = {*proxy->bundlePath + "/none"};
+    LogLines log;
+    Dictionary form;
+    EXPECT_FALSE(world.record(proxy)->augmentForm(form));
+    const Dictionary& extensions = *form.find("extensions")->dictionary();
+    EXPECT_EQ(extensions.size(), 1u);
+    EXPECT_TRUE(extensions.contains("in"));
+    EXPECT_THAT(log.take(),
+                Contains("ops I: failed to make extension for " + *proxy->bundlePath +
+                         "/../out in plug-in at " + *proxy->bundlePath + ": Permission denied"));
+    auto unshared = makeProxy("com.b", {}, {{"VXExtensionProtocol", "P"}});
+    unshared->bundlePath = "/Apps/Host.app/PlugIns/b.plugin";
+    Dictionary untouched;
+    EXPECT_TRUE(world.record(unshared)->augmentForm(untouched));
+    EXPECT_EQ(untouched, Dictionary());
+}
+
+TEST(Signature, StandsForNoRealOne) {
+    const ZRDPlugInSignature one("/a"), other("/a");
+    EXPECT_EQ(one.cdhash().bytes().size(), 20u);
+    EXPECT_NE(one.cdhash(), other.cdhash());
+    EXPECT_EQ(one.requirement(), "dummy requirement");
+}
+
+}  // namespace
+
+}  // namespace zorvan

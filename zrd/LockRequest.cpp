@@ -1,0 +1,110 @@
+// The request "lock": takes plug-ins out of service, and gives them back.
+
+#include <fmt/format.h>
+
+#include <algorithm>
+#include <vector>
+
+#include "Zorvan/Keys.h"
+#include "Zorvan/LogHandles.h"
+#include "zrd/Transaction.h"
+#include "zrd/ZRDLumClient.h"
+#include "zrd/ZRDPlugIn.h"
+#include "zrd/ZRDServer.h"
+
+namespace zorvan {
+
+using platform::Array;
+using platform::Dictionary;
+using platform::Value;
+
+namespace {
+
+/// A client may hold this much at once: what a hold costs is the daemon's.
+constexpr std::ptrdiff_t kMaxHoldsOfClient = 4096;
+
+/// Plug-ins for a log line.
+std::string describePlugIns(const ZRDPlugInList& plugIns) {
+    std::string text = "(";
+    for (const auto& plugIn : plugIns) {
+        if (text.size() > 1) text += ", ";
+        text += fmt::format("{} {}", plugIn->uuid().string(), plugIn->identifier());
+    }
+    return text + ")";
+}
+
+}  // namespace
+
+void Transaction::lockDownPlugIns() {
+    const Value* tokens = request_.find(message::kUuids);
+    if (tokens && tokens->array()) return releaseHolds(*tokens->array());
+    ZRDPlugInList plugIns;
+    if (!collectPlugInsToHold(plugIns)) return;
+    if (unsignedUnder(message::kFlags) != ZRHoldPlugIns && !areIdle(plugIns)) return;
+    takeHold(plugIns);
+}
+
+void Transaction::releaseHolds(const Array& tokens) {
+    for (const Value& element : tokens) {
+        // What is no token releases nothing: this never fails.
+        if (auto token = element.uuid()) server().unholdToken(*token);
+    }
+    done();
+}
+
+bool Transaction::collectPlugInsToHold(ZRDPlugInList& plugIns) {
+    const std::uint64_t flags = unsignedUnder(message::kFlags);
+    return marshalPaths([&](const std::string& path, bool resolved) {
+        if (!resolved) {
+            fail(kZRErrorPath, fmt::format("invalid path: {}", path));
+            return Walk::Stop;
+        }
+        if (flags == ZRHoldPlugIns) {
+            auto plugIn = server().findPlugInAtPath(path);
+            if (!plugIn) {
+                fail(kZRErrorPath, fmt::format("no plug-in at path:{}", path));
+                return Walk::Stop;
+            }
+            plugIns.push_back(std::move(plugIn));
+        } else if (flags == ZRHoldApplications) {
+            auto inside = server().plugInsWithinApplication(path).value_or(ZRDPlugInList());
+            std::ranges::move(inside, std::back_inserter(plugIns));
+        } else {
+            fail(kZRErrorInvalidRequest, "invalid request format (unsupported hold flags)");
+            return Walk::Stop;
+        }
+        return Walk::Continue;
+    });
+}
+
+bool Transaction::areIdle(const ZRDPlugInList& plugIns) {
+    ZRDPlugInList busy;
+    Array conflicts;
+    for (const auto& plugIn : plugIns) {
+        if (auto conflict = plugIn->checkBusy()) {
+            busy.push_back(plugIn);
+            conflicts.append(*std::move(conflict));
+        }
+    }
+    if (busy.empty()) return true;
+    EVLOG_DEBUG(ops(), "hold rejected. Busy plug-ins:{}", describePlugIns(busy));
+    reply_.set(message::kConflicts, std::move(conflicts));
+    fail(kZRErrorBusy, "plug-ins are busy");
+    return false;
+}
+
+void Transaction::takeHold(const ZRDPlugInList& plugIns) {
+    const auto held = server().holds();
+    const auto mine =
+        std::ranges::count_if(held, [this](const auto& hold) { return hold->client() == client_; });
+    if (mine >= kMaxHoldsOfClient) return fail(kZRErrorDenied, "too many holds");
+    auto hold = std::make_shared<ZRDPlugInHold>(plugIns, client_, *server().services().launcher);
+    server().addHold(hold);
+    // The client may have died meanwhile, and its holds been looked for before this one was there.
+    if (!client_->acceptWork()) server().unholdClient(*client_);
+    reply_.set(message::kUuids, hold->uuid());
+    EVLOG_DEBUG(ops(), "hold request granted uuid:{}", pub(hold->uuid()));
+    done();
+}
+
+}  // namespace zorvan

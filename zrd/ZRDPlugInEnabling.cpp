@@ -1,0 +1,159 @@
+// What lets a host start a plug-in, and read what it shares.
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+
+#include "Zorvan/Keys.h"
+#include "Zorvan/LogHandles.h"
+#include "Zorvan/ZRBundle.h"
+#include "Zorvan/ZRError.h"
+#include "platform/Consent.h"
+#include "platform/Files.h"
+#include "platform/Launcher.h"
+#include "platform/Sandbox.h"
+#include "zrd/HostProcess.h"
+#include "zrd/PlugInContext.h"
+#include "zrd/ZRDPlugIn.h"
+
+namespace zorvan {
+
+using platform::Array;
+using platform::Dictionary;
+using platform::Value;
+
+namespace {
+
+constexpr std::string_view kKeyboardService = "com.orbel.keyboard-service";
+constexpr std::string_view kFilterDataService = "com.orbel.netvane.filter-data";
+constexpr std::string_view kPreviewService = "com.orbel.glimse.extension.preview";
+
+bool isText(const Value* value, std::string_view text) {
+    return value && value->string() && *value->string() == text;
+}
+
+/// Whether a canonical path is the canonical directory or lies inside it.
+bool isInside(std::string_view path, std::string_view directory) {
+    return path.starts_with(directory) &&
+           (path.size() == directory.size() || path[directory.size()] == '/');
+}
+
+}  // namespace
+
+const char* ZRDPlugIn::sandboxProfile() const {
+    const Value* point = pluginKey(key::kExtensionPoint);
+    if (isText(point, kKeyboardService)) {
+        const Value* openAccess = attribute(key::kRequestsOpenAccess);
+        bool isOpen = openAccess && platform::equalsTrue(*openAccess) &&
+                      allowedVSKServices().contains(platform::kKeyboardNetworkConsent);
+        return isOpen ? "plugin" : "keyboard";
+    }
+    if (isText(point, kFilterDataService)) return "network-filter";
+    const auto& stored = plugInDictionary();
+    if (stored && isText(stored->find(key::kExtensionPoint), kPreviewService)) return "glimsed";
+    return "plugin";
+}
+
+/// Where the plug-in may write, as variables of its environment.
+Dictionary ZRDPlugIn::containerEnvironment() const {
+    const auto& container = tdproxy_->dataContainerPath;
+    if (!container) {
+        EVLOG_DEBUG(ops(), "no data container for plug-in {}({}) {} at {}", identifier(), version(),
+                    pub(uuid()), path());
+        return {};
+    }
+    return {{"HOME", *container},
+            {"QFFIXED_USER_HOME", *container},
+            {"TMPDIR", platform::joinPath(*container, "tmp")}};
+}
+
+/// The service dictionary: the plug-in's own, under what is not the plug-in's to choose.
+Dictionary ZRDPlugIn::launchService() const {
+    Dictionary environment = containerEnvironment();
+    const char* profile = sandboxProfile();
+    if (const char* sdk = std::getenv("ZRTEST_SDK")) environment.set("ZRTEST_SDK", sdk);
+    Dictionary service;
+    const Value* raw = infoKey(overlay::kService);
+    if (raw && raw->dictionary()) {
+        EVLOG_DEBUG(td(), "raw LUMService={}", *raw);
+        service = *raw->dictionary();
+    } else {
+        EVLOG_INFO(ops(), "no LUMService for plug-in; database returned {}", raw);
+    }
+    const Value* own = service.find(overlay::kEnvironment);
+    if (own && own->dictionary()) {
+        for (const auto& [name, value] : *own->dictionary()) environment.set(name, value);
+    }
+    service.set(overlay::kEnvironment, std::move(environment));
+    service.set(overlay::kProfile, profile);
+    service.set(overlay::kOmitParameters, true);
+    EVLOG_INFO(ops(), "assigning plug-in {}({}) {} to {} sandbox", identifier(), version(),
+               pub(uuid()), profile);
+    return service;
+}
+
+std::optional<ZRError> ZRDPlugIn::enableForClient(const HostProcess& host) const {
+    const Dictionary overlay{{overlay::kService, launchService()},
+                             {overlay::kPackageType, overlay::kLumPackage}};
+    EVLOG_DEFAULT(ops(), "allowing host {} {} to use plug-in {}({}) uuid={} at {}", host.pid(),
+                  host.path(), identifier(), version(), pub(uuid()), path());
+    const auto bundle = ZRBundle::initWithPath(path());
+    const auto executable = bundle ? bundle->executablePath() : std::nullopt;
+    if (!executable) {
+        EVLOG_ERROR(ops(), "failed to obtain execPath for plug-in {}({}) bundle={}", identifier(),
+                    pub(uuid()), bundle.get());
+        return ZRErrorWithFormat(kZRErrorInvalidRequest,
+                                 "cannot obtain executable path for plug-in {}({})", identifier(),
+                                 uuid().string());
+    }
+    EVLOG_DEBUG(ops(), "activation overlay={}", overlay);
+    const auto token = host.auditToken();
+    int failure =
+        token ? context_->launcher->addExternalService(*token, *executable, overlay) : ESRCH;
+    if (failure == 0) return std::nullopt;
+    EVLOG_ERROR(ops(),
+                "spawnerd error {} trying to allow {} {} to use plug-in {}({}) uuid={} at {}",
+                failure, host.pid(), host.path(), identifier(), version(), pub(uuid()), path());
+    return ZRErrorWithFormat(kZRErrorInvalidRequest, "unable to enable plug-in {}({})",
+                             identifier(), uuid().string());
+}
+
+Dictionary ZRDPlugIn::issueResourceExtensions(const Value& resources) const {
+    const Value* begin = resources.array() ? resources.array()->begin() : &resources;
+    const Value* end = resources.array() ? resources.array()->end() : &resources + 1;
+    Dictionary extensions;
+    for (const Value* element = begin; element != end; ++element) {
+        const std::string* name = element->string();
+        if (!name) continue;
+        const std::string location = *name == "." ? path() : platform::joinPath(path(), *name);
+        // What leads out of the bundle is not the plug-in's to share.
+        const auto canonical = platform::canonicalPath(location);
+        platform::Result<std::string> token =
+            canonical && !isInside(*canonical, path())
+                ? platform::Result<std::string>(platform::Error::posix(EACCES, location))
+                : context_->sandbox->issueReadExtension(location);
+        if (token) {
+            extensions.set(*name, *std::move(token));
+        } else {
+            EVLOG_INFO(ops(), "failed to make extension for {} in plug-in at {}: {}", location,
+                       path(), pub(std::strerror(token.error().code)));
+        }
+    }
+    return extensions;
+}
+
+bool ZRDPlugIn::augmentForm(Dictionary& form) const {
+    static const Value bundleItself = Array{"."};
+    const Value* resources = isAppExtension() ? &bundleItself : pluginKey(key::kShared);
+    if (!resources) return true;
+    const Dictionary extensions = issueResourceExtensions(*resources);
+    form.set(form::kExtensions, extensions);
+    const auto isThere = [&](const Value& name) {
+        return !name.string() || extensions.contains(*name.string());
+    };
+    return resources->array() ? std::ranges::all_of(*resources->array(), isThere)
+                              : isThere(*resources);
+}
+
+}  // namespace zorvan

@@ -1,0 +1,51 @@
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+#include <memory>
+#include <unordered_set>
+#include <vector>
+
+#include "platform/Launcher.h"
+#include "platform/Uuid.h"
+
+namespace zorvan {
+
+class ZRDLumClient;
+class ZRDPlugIn;
+
+/// Plug-ins are the same when their UUIDs are.
+struct PlugInIdentity {
+    std::size_t operator()(const std::shared_ptr<ZRDPlugIn>& plugIn) const;
+    bool operator()(const std::shared_ptr<ZRDPlugIn>& a, const std::shared_ptr<ZRDPlugIn>& b) const;
+};
+
+/// Plug-ins that a client has taken out of service, until it gives them back or dies. While a hold
+/// exists, an outstanding-work marker keeps the daemon from being stopped for idleness. Immutable;
+/// shared by the server's list and whoever looks at it.
+class ZRDPlugInHold {
+  public:
+    /// A hold with a fresh token, made now.
+    ZRDPlugInHold(const std::vector<std::shared_ptr<ZRDPlugIn>>& plugIns,
+                  std::weak_ptr<ZRDLumClient> client, platform::Launcher& launcher);
+
+    /// The token: whoever presents it may release the hold.
+    const platform::Uuid& uuid() const { return uuid_; }
+    using PlugIns = std::unordered_set<std::shared_ptr<ZRDPlugIn>, PlugInIdentity, PlugInIdentity>;
+    const PlugIns& blocked() const { return blocked_; }
+    /// Null once the client's record is gone.
+    std::shared_ptr<ZRDLumClient> client() const { return client_.lock(); }
+    std::chrono::system_clock::time_point created() const { return created_; }
+
+    bool operator==(const ZRDPlugInHold& other) const { return uuid_ == other.uuid_; }
+    std::size_t hash() const { return std::hash<platform::Uuid>()(uuid_); }
+
+  private:
+    const platform::Uuid uuid_ = platform::Uuid::random();
+    const PlugIns blocked_;
+    const std::weak_ptr<ZRDLumClient> client_;
+    const std::chrono::system_clock::time_point created_ = std::chrono::system_clock::now();
+    const std::unique_ptr<platform::Launcher::WorkMarker> workMarker_;
+};
+
+}  // namespace zorvan
