@@ -49,6 +49,14 @@ TEST_F(Start, ASecondDaemonIsNotConstructedAndTheFirstGoesOn) {
     EXPECT_THAT(match(), ElementsAre("one 1"));
 }
 
+TEST_F(Start, ClosedStandardStreamsAreNoFilesOfItsOwn) {
+    auto zrd = spawn("/bin/sh", {"-c", "exec " ZRD_PROGRAM " <&- >&- 2>&-"});
+    ASSERT_TRUE(waitUntil([&] { return std::filesystem::exists(socket_); }));
+    const std::string descriptors = "/proc/" + std::to_string(zrd->pid()) + "/fd/";
+    for (const char* number : {"0", "1", "2"})
+        EXPECT_EQ(std::filesystem::read_symlink(descriptors + number), "/dev/null");
+}
+
 TEST_F(Start, AKilledDaemonComesBackWithTheSameUuids) {
     writePlugIn(plugInPath("A", "one"), info("one"));
     const std::string path = writePlugIn("else/E.app/PlugIns/two.appex", info("two"));
