@@ -57,6 +57,16 @@ TEST_F(Start, ClosedStandardStreamsAreNoFilesOfItsOwn) {
         EXPECT_EQ(std::filesystem::read_symlink(descriptors + number), "/dev/null");
 }
 
+TEST_F(Start, AJournalOutOfReachLosesNoLines) {
+    if (std::filesystem::exists("/run/systemd/journal/socket")) GTEST_SKIP();
+    auto zrd =
+        spawn("/bin/sh",
+              {"-c", "export JOURNAL_STREAM=$(stat -L -c %d:%i /proc/$$/fd/2); exec " ZRD_PROGRAM
+                     " -S a/b"});
+    EXPECT_EQ(zrd->wait(), 1);
+    EXPECT_EQ(zrd->errLines("unable to construct server"), 1u);
+}
+
 TEST_F(Start, AKilledDaemonComesBackWithTheSameUuids) {
     writePlugIn(plugInPath("A", "one"), info("one"));
     const std::string path = writePlugIn("else/E.app/PlugIns/two.appex", info("two"));
