@@ -85,9 +85,10 @@ TEST_F(TransactionTest, RemovingNeedsTheManagersEntitlement) {
     }
     codeSigning_->error = platform::Error{"POSIX", 5, "unreadable"};
     LogLines log;
-    EXPECT_EQ(ask(request), error(11, "caller lacks entitlement for this operation"));
+    for (int i = 0; i < 2; ++i)
+        EXPECT_EQ(ask(request), error(11, "caller lacks entitlement for this operation"));
     EXPECT_THAT(log.take(),
-                Contains(HasSubstr("ops E: error retrieving entitlements for client ")));
+                Contains(HasSubstr("ops E: error retrieving entitlements for client ")).Times(1));
     EXPECT_THAT(workspace_->changes, IsEmpty());
 }
 
