@@ -98,9 +98,7 @@ void ZRDLumClient::dead() {
 
 std::optional<Value> ZRDLumClient::entitlementValueForKey(const std::string& name) const {
     auto answer = task_->entitlement(name);
-    // Every candidate of every discovery asks: one line tells of them all.
-    if (answer.error && !reportedEntitlements_.exchange(true))
-        EVLOG_ERROR(ops(), "error retrieving entitlements for client {}", pid());
+    if (answer.error) EVLOG_ERROR(ops(), "error retrieving entitlements for client {}", pid());
     return answer.value;
 }
 

@@ -67,7 +67,6 @@ class ZRDLumClient final : public HostProcess, public std::enable_shared_from_th
     std::string path_;
     std::shared_ptr<ZRBundle> bundle_;
     std::unique_ptr<platform::CodeSigningTask> task_;
-    mutable std::atomic<bool> reportedEntitlements_{false};  // that they cannot be retrieved
     std::uint32_t requestCount_ = 0;
 };
 
