@@ -74,12 +74,13 @@ class ZRDServer final : public ZRDatabase, public ZRDatabaseDelegate {
 
     std::atomic<std::uint32_t> verbose_{0};
     platform::SerialQueue lumQueue_;
-    platform::SerialQueue mainQueue_;
     platform::SyncQueue syncQueue_{"serverSync"};
     HoldList holds_;                                               // guarded by syncQueue_
     std::unordered_map<platform::Uuid, std::size_t> heldPlugIns_;  // by how many holds; likewise
     std::unique_ptr<platform::Listener> service_;
     std::unique_ptr<ZRDUserPrefs> userPrefs_;
+    // The last member: it goes first, and the work that still waits in it uses the others.
+    platform::SerialQueue mainQueue_;
 };
 
 }  // namespace zorvan
