@@ -1,0 +1,116 @@
+#include "Zorvan/ZRProtocols.h"
+
+#include <fmt/format.h>
+
+#include <charconv>
+#include <string_view>
+#include <vector>
+
+#include "Zorvan/LogHandles.h"
+
+namespace zorvan {
+
+using platform::ObjectInterface;
+using platform::ObjectRuntime;
+using platform::ProtocolRef;
+
+namespace {
+
+void report(std::optional<ZRError>* error, const std::string& text) {
+    if (error) *error = ZRErrorWithCode(kZRErrorPlugIn, text);
+}
+
+std::vector<std::string> split(std::string_view text, char separator) {
+    std::vector<std::string> parts;
+    for (;;) {
+        const std::size_t end = text.find(separator);
+        parts.emplace_back(text.substr(0, end));
+        if (end == std::string_view::npos) return parts;
+        text.remove_prefix(end + 1);
+    }
+}
+
+/// What a field's digits say; 0 without any.
+std::size_t decimalValue(const std::string& text) {
+    std::size_t value = 0;
+    std::from_chars(text.data(), text.data() + text.size(), value);
+    return value;
+}
+
+ZRError wrong(const std::string& what) {
+    return ZRErrorWithCode(kZRErrorInterfaceSpecification, what);
+}
+
+/// The classes of "{A+B}".
+std::optional<ZRError> setClasses(ObjectRuntime& runtime, ObjectInterface& interface,
+                                  const ObjectInterface::Argument& argument,
+                                  const std::string& type) {
+    if (!type.ends_with('}')) return wrong(type);
+    std::set<std::string> classes;
+    for (std::string& name : split(std::string_view(type).substr(1, type.size() - 2), '+')) {
+        if (!runtime.hasClass(name)) return wrong(name);
+        classes.insert(std::move(name));
+    }
+    interface.setClasses(argument, std::move(classes));
+    return std::nullopt;
+}
+
+}  // namespace
+
+ProtocolRef ZRProtocolNamed(ObjectRuntime& runtime, const std::string& name,
+                            std::optional<ZRError>* error) {
+    if (auto protocol = runtime.protocol(name)) return protocol;
+    const std::string text = fmt::format(
+        "unable to locate protocol \"{}\" - check that it is defined and not inadvertently "
+        "optimized away",
+        name);
+    EVLOG_DEFAULT(ops(), "{}", text);
+    report(error, text);
+    return nullptr;
+}
+
+ProtocolRef ZRCompoundProtocol(ObjectRuntime& runtime, const platform::Value& specification,
+                               std::optional<ZRError>* error) {
+    if (specification.string()) return ZRProtocolNamed(runtime, *specification.string(), error);
+    if (!specification.array()) return nullptr;
+    std::string name = "__XX_COMPOUND";
+    for (const platform::Value& member : *specification.array()) {
+        if (!member.string()) return nullptr;
+        name += "__" + *member.string();
+    }
+    auto compound = runtime.allocateProtocol(name);
+    if (!compound) {
+        auto existing = runtime.protocol(name);
+        if (!existing) report(error, "unable to create compound protocol");
+        return existing;
+    }
+    for (const platform::Value& member : *specification.array()) {
+        auto protocol = ZRProtocolNamed(runtime, *member.string(), error);
+        if (!protocol) return nullptr;
+        compound->incorporated.push_back(std::move(protocol));
+    }
+    return runtime.registerProtocol(std::move(compound));
+}
+
+std::optional<ZRError> ZRDescribeInterface(ObjectRuntime& runtime, ObjectInterface& interface,
+                                           const std::string& operation,
+                                           const std::string& description) {
+    for (const std::string& entry : split(description, ',')) {
+        const std::vector<std::string> fields = split(entry, ':');
+        if (fields.size() != 3) return wrong(description);
+        const std::string &direction = fields[0], &type = fields[2];
+        if (direction != "request" && direction != "reply") return wrong(direction);
+        const ObjectInterface::Argument argument{operation, decimalValue(fields[1]),
+                                                 direction == "reply"};
+        if (type.starts_with('{')) {
+            if (auto error = setClasses(runtime, interface, argument, type)) return error;
+            continue;
+        }
+        auto protocol = ZRProtocolNamed(runtime, type);
+        if (!protocol) return wrong(type);
+        interface.setInterface(argument, std::make_shared<ObjectInterface>(std::move(protocol)));
+    }
+    return std::nullopt;
+}
+
+}  // namespace zorvan
