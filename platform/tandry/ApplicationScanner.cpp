@@ -70,7 +70,7 @@ bool ApplicationScanner::isHeld(const std::string& path) const {
 void ApplicationScanner::begin(bool overEverything) {
     ++pass_;
     metPlugIns_ = 0;
-    isIncomplete_ = false;
+    isIncomplete_ = hasTransientFailure_ = false;
     unreachable_.clear();
     reader_.beginPass();
     watch_.beginWalk(overEverything);
@@ -173,7 +173,7 @@ void ApplicationScanner::visitFolder(const std::string& folder) {
                         fmt::format("cannot look for applications: {}", found.error().text));
         unreachable_.push_back(folder);
         // Its links may lead anywhere.
-        if (isTransient(found.error())) isIncomplete_ = true;
+        if (noteTransient(found.error())) isIncomplete_ = true;
         return;
     }
     for (const auto& [name, target] : found->entries) {
@@ -225,7 +225,7 @@ void ApplicationScanner::visitPlugIns(const std::string& application, const std:
         complaints_.add(folder, fmt::format("cannot look for plug-ins: {}", found.error().text));
         if (changes_.refusal.empty()) changes_.refusal = found.error().text;
         unreachable_.push_back(application);
-        if (isTransient(found.error())) isIncomplete_ = true;
+        if (noteTransient(found.error())) isIncomplete_ = true;
         return;
     }
     TDApplicationProxyRef record = applicationAt(application);
@@ -247,12 +247,24 @@ TDApplicationProxyRef ApplicationScanner::applicationAt(const std::string& path)
     if (std::exchange(entry.pass, pass_) == pass_) return entry.record;
     watch_.markContents(path, path);
     BundleFolder folder(path);
-    if (!entry.record || reader_.applicationStamps(folder) != entry.stamps) {
-        entry = reader_.readApplication(folder);
-        entry.pass = pass_;
-        changes_.applications.insert(path);
-    }
+    if (entry.record && reader_.applicationStamps(folder) == entry.stamps) return entry.record;
+    BundleReader::ApplicationReading reading = reader_.readApplication(folder);
+    // What cannot be read just now is not known to have changed.
+    if (reading.failure && noteTransient(*reading.failure) && entry.record) return entry.record;
+    if (reading.failure && !reading.record->isPlaceholder)
+        complaints_.add(path, fmt::format("application without name and identifier: {}",
+                                          reading.failure->text));
+    entry.record = std::move(reading.record);
+    entry.stamps = std::move(reading.stamps);
+    changes_.applications.insert(path);
     return entry.record;
+}
+
+/// Whether an error says nothing about the disk: then another walk has to come.
+bool ApplicationScanner::noteTransient(const Error& error) {
+    const bool isSo = isTransient(error);
+    hasTransientFailure_ = hasTransientFailure_ || isSo;
+    return isSo;
 }
 
 TDApplicationProxyRef ApplicationScanner::applicationOf(const std::string& plugInPath) {
@@ -325,7 +337,7 @@ void ApplicationScanner::refuse(const BundleFolder& folder, BundleReader::Readin
     if (changes_.refusal.empty()) changes_.refusal = error.text;
     if (error.domain == "POSIX") {
         auto known = state_.plugIns.find(folder.path);
-        if (isTransient(error) && known != state_.plugIns.end()) known->second.pass = pass_;
+        if (noteTransient(error) && known != state_.plugIns.end()) known->second.pass = pass_;
         return;
     }
     state_.refusals[folder.path] = {std::move(reading.entry.print), error.text, pass_};

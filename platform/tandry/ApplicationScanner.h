@@ -34,8 +34,9 @@ class ApplicationScanner {
     /// The same for what the watch says was touched.
     RegistryChanges scanTouched(const Scopes& scopes);
 
-    /// Whether the last walk could look at everything, and all of it is watched.
-    bool isComplete() const { return !isIncomplete_ && !watch_.isShort(); }
+    /// Whether the last walk could read whatever it met, but for what only a change on disk can
+    /// mend, and all that matters is watched.
+    bool isComplete() const { return !hasTransientFailure_ && !watch_.isShort(); }
 
     /// Whether an application folder holds the plug-in or application at a path, so that a walk
     /// would find it by itself.
@@ -57,6 +58,7 @@ class ApplicationScanner {
     void visitPlugIn(const BundleFolder& folder, const TDApplicationProxyRef& application,
                      const std::string& scope);
     void refuse(const BundleFolder& folder, BundleReader::Reading reading);
+    bool noteTransient(const Error& error);
     void install(const BundleFolder& folder, PlugInEntry entry,
                  const TDApplicationProxyRef& application);
     TDApplicationProxyRef applicationAt(const std::string& path);
@@ -83,7 +85,8 @@ class ApplicationScanner {
     Pass pass_ = 0;
     RegistryChanges changes_;
     std::size_t metPlugIns_ = 0;            // good ones that were looked at
-    bool isIncomplete_ = false;             // something failed that says nothing about the disk
+    bool isIncomplete_ = false;             // what was not met may be there all the same
+    bool hasTransientFailure_ = false;      // something failed that says nothing about the disk
     std::vector<std::string> unreachable_;  // paths that could not be looked into
 };
 

@@ -29,7 +29,8 @@ void ChangeGatherer::walkEnded(bool isComplete) {
     if (isComplete || std::exchange(willRetry_, true)) return;
     retryTimer_.start(settings_.retry, [this] {
         willRetry_ = false;
-        gather({std::string()});
+        touched_.emplace();
+        finishBurst();
     });
 }
 
@@ -53,6 +54,7 @@ void ChangeGatherer::gather(Scopes touched) {
 }
 
 void ChangeGatherer::finishBurst() {
+    burstTimer_.cancel();
     handler_(std::exchange(touched_, {}));
 }
 

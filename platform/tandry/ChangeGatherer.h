@@ -33,8 +33,8 @@ class ChangeGatherer {
                    Handler handler);
     ChangeGatherer(const ChangeGatherer&) = delete;
 
-    /// To be called after each walk. One that was not `isComplete` is followed by a burst that
-    /// touches everything, once the time to try again has come.
+    /// To be called after each walk. After one that was not `isComplete`, everything counts as
+    /// touched once the time to try again has come.
     void walkEnded(bool isComplete);
 
   private:

@@ -123,6 +123,41 @@ TEST_F(LiveRegistryTest, WithoutEnoughWatchesItLooksFromTimeToTime) {
     EXPECT_THAT(errors.lines, testing::Contains(HasSubstr("cannot watch all")).Times(1));
 }
 
+TEST_F(LiveRegistryTest, WhatCannotBeReadJustNowStaysAndIsReadLater) {
+    ::setenv("LC_ALL", "de", 1);
+    // Nothing but the next try tells of an end of the shortage.
+    watching.quiet = watching.longest = std::chrono::hours(1);
+    watching.retry = std::chrono::milliseconds(20);
+    addApplication(apps + "A.app", {{"QFBundleIdentifier", "app"}});
+    const std::string a = addPlugIn(apps + "A.app/PlugIns/A.appex", "a");
+    addPlugIn(apps + "A.app/PlugIns/B.appex", "b");
+    start();
+    recorder.take();
+    const Uuid uuid = plugIn("a")->plugInUuid;
+    // Reading this file fails with EIO.
+    const std::string names = "/Localized.plist";
+    for (const std::string& bundle : {a, files.path(apps + "A.app")})
+        fs::create_symlink("/proc/self/mem", bundle + names);
+    fs::remove_all(at(apps + "A.app/PlugIns/B.appex"));
+    static_cast<void>(workspace->registerPlugIn(files.path(apps + "A.app")));
+    EXPECT_THAT(recorder.take(), ElementsAre("-b"));
+    EXPECT_EQ(plugIn("a")->plugInUuid, uuid);
+    for (const std::string& bundle : {a, files.path(apps + "A.app")}) {
+        const Dictionary german{{"de", Dictionary{{"QFBundleDisplayName", "Anna"}}}};
+        auto xml = writeXmlPropertyList(german);
+        ASSERT_TRUE(xml);
+        files.write("names", *xml);
+        fs::rename(at("names"), bundle + names);
+    }
+    ::unsetenv("LC_ALL");
+    // The application's names may be read in one walk, the plug-in's in the next.
+    ASSERT_TRUE(recorder.waitUntil([&] {
+        const TDPlugInProxyRef now = plugIn("a");
+        return now->localizedName == "Anna" && now->containingApplication->localizedName == "Anna";
+    }));
+    EXPECT_EQ(plugIn("a")->containingApplication->bundleIdentifier, "app");
+}
+
 /// Whatever happens on disk, the registry ends where one that starts then would begin.
 TEST_F(LiveRegistryTest, EndsWhereAFreshStartWouldBegin) {
     const std::string shared = "share/zorvan/Applications/";
