@@ -176,6 +176,7 @@ void ApplicationScanner::visitFolder(const std::string& folder) {
         if (noteTransient(found.error())) isIncomplete_ = true;
         return;
     }
+    for (const std::string& target : found->nowhere) unreachable_.push_back(target);
     for (const auto& [name, target] : found->entries) {
         if (!isApplication(name)) continue;
         const std::string entry = joinPath(folder, name);
@@ -231,6 +232,7 @@ void ApplicationScanner::visitPlugIns(const std::string& application, const std:
     TDApplicationProxyRef record = applicationAt(application);
     state_.applications[application].plugInsPass = pass_;
     if (!found) return;
+    for (const std::string& target : found->nowhere) unreachable_.push_back(target);
     const bool isInside = isWithin(folder, application);
     for (const auto& [name, target] : found->entries)
         if (!target.empty()) {

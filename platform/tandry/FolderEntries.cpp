@@ -6,6 +6,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <filesystem>
 #include <optional>
 
 #include "platform/Files.h"
@@ -28,18 +29,22 @@ bool isLink(int directory, const dirent& entry) {
            S_ISLNK(status.st_mode);
 }
 
-void add(FolderEntries& found, const std::string& folder, const dirent& entry, FolderWatch& watch,
-         Complaints& complaints) {
+void add(FolderEntries& found, const std::filesystem::path& folder, const dirent& entry,
+         FolderWatch& watch, Complaints& complaints) {
     if (entry.d_name[0] == '.' ||
         (entry.d_type != DT_DIR && entry.d_type != DT_LNK && entry.d_type != DT_UNKNOWN))
         return;
-    std::string path = joinPath(folder, entry.d_name);
+    std::string path = joinPath(folder.native(), entry.d_name);
     std::string target;
     if (isLink(found.directory(), entry)) {
         watch.markWay(path);
         std::optional<std::string> canonical = canonicalPath(path);
         if (!canonical) {
             complaints.add(path, fmt::format("skipping {}: a link that cannot be resolved", path));
+            std::error_code ignored;
+            const auto end = std::filesystem::read_symlink(path, ignored);
+            const auto missing = std::filesystem::weakly_canonical(folder / end, ignored);
+            found.nowhere.push_back(missing.string());
             return;
         }
         target = *canonical;

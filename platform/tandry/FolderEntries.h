@@ -24,6 +24,7 @@ struct FolderEntries {
     };
     std::unique_ptr<DIR, Closer> stream;
     std::vector<Entry> entries;
+    std::vector<std::string> nowhere;  // where links that cannot be resolved would lead
 
     /// The open directory, owned here.
     int directory() const { return ::dirfd(stream.get()); }
