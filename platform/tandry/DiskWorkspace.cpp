@@ -73,6 +73,7 @@ class DiskWorkspace final : public Workspace {
     void firstScan();
     void rescan(const Scopes& touched);
     void publish(RegistryChanges& changes);
+    void publishSnapshot(const RegistryChanges& changes);
     void withdrawContainers(const std::set<std::string>& identifiers, RegistryChanges& changes);
     std::optional<Error> registerOnQueue(const std::string& bundlePath);
     std::optional<Error> unregisterOnQueue(const std::string& bundlePath);
@@ -91,6 +92,7 @@ class DiskWorkspace final : public Workspace {
     DataContainers containers_;
     bool isScanned_ = false;
     RegistryState state_;
+    std::shared_ptr<const Snapshot> published_;
     FolderWatch watch_;
     ApplicationScanner scanner_;
     const WatchSettings settings_;
@@ -173,11 +175,17 @@ void DiskWorkspace::rescan(const Scopes& touched) {
 }
 
 void DiskWorkspace::publish(RegistryChanges& changes) {
-    current_.publish(std::make_shared<const Snapshot>(state_));
+    publishSnapshot(changes);
     const std::set<std::string> impossible = containers_.makeMissing();
     if (impossible.empty()) return;
     withdrawContainers(impossible, changes);
-    current_.publish(std::make_shared<const Snapshot>(state_));
+    publishSnapshot(changes);
+}
+
+void DiskWorkspace::publishSnapshot(const RegistryChanges& changes) {
+    published_ = published_ ? std::make_shared<const Snapshot>(*published_, state_, changes)
+                            : std::make_shared<const Snapshot>(state_);
+    current_.publish(published_);
 }
 
 /// Records that were published are what they are: others take their places.
