@@ -56,7 +56,7 @@ TEST(Rules, ARepeatedKeyGivesTheListOfItsPatterns) {
     const auto rules = parseRules({"K=a", "Other=x", "K=true", "K=c"});
     ASSERT_TRUE(rules);
     EXPECT_EQ(*rules, (Dictionary{{"K", Array{"a", true, "c"}}, {"Other", "x"}}));
-    EXPECT_EQ(mergeRules({{"K", "file"}, {"Kept", "file"}}, *rules),
+    EXPECT_EQ(merged({{"K", "file"}, {"Kept", "file"}}, *rules),
               (Dictionary{{"K", Array{"a", true, "c"}}, {"Kept", "file"}, {"Other", "x"}}));
 }
 
