@@ -63,6 +63,16 @@ void Budget::serveLine() {
     serving_ = false;
 }
 
+/// How long a peer may be stalled while others wait.
+std::chrono::milliseconds Budget::patienceAt(StallClock::Time now) {
+    constexpr int kHurry = 20;
+    std::lock_guard lock(mutex_);
+    const bool isUsedUp = std::any_of(line_.begin(), line_.end(), [&](const Share* share) {
+        return now - *share->waitsSince_ >= patience_;
+    });
+    return isUsedUp ? patience_ / kHurry : patience_;
+}
+
 void Budget::relieve() {
     if (!timer_) return;
     std::vector<std::pair<std::int64_t, std::weak_ptr<Holder>>> holders;
@@ -76,13 +86,14 @@ void Budget::relieve() {
     std::sort(holders.begin(), holders.end(),
               [](const auto& a, const auto& b) { return a.first > b.first; });
     const auto now = Clock::now();
-    auto next = now + patience_;
+    const auto patience = patienceAt(now);
+    auto next = now + patience;
     for (const auto& [held, weak] : holders) {
         const auto holder = weak.lock();
         const auto since = holder ? holder->stalledSince(*this) : std::nullopt;
         if (!since) continue;
-        if (now - *since < patience_) {
-            next = std::min(next, *since + patience_);
+        if (now - *since < patience) {
+            next = std::min(next, *since + patience);
             continue;
         }
         holder->cutOff(blame(held));
@@ -129,6 +140,7 @@ void Budget::Share::remove(std::size_t bytes) {
 }
 
 void Budget::Share::await(std::size_t bytes) {
+    if (!waitsSince_) waitsSince_ = Clock::now();
     std::unique_lock lock(budget_->mutex_);
     wanted_ = static_cast<std::int64_t>(bytes);
     if (!std::exchange(waits_, true)) budget_->line_.push_back(this);
@@ -136,6 +148,7 @@ void Budget::Share::await(std::size_t bytes) {
 }
 
 void Budget::Share::stopWaiting() {
+    waitsSince_.reset();
     if (!waits_) return;
     std::unique_lock lock(budget_->mutex_);
     waits_ = false;

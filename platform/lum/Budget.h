@@ -21,7 +21,8 @@ namespace platform::lum {
 ///
 /// Nobody waits for long because of a peer that does nothing: while what is held stands in the way
 /// of those in line, holders whose peers are stalled for longer than the budget's patience are cut
-/// off, the largest first, until it does not.
+/// off, the largest first, until it does not. Patience is short once somebody has waited for all of
+/// it, so that peers that stall in turn do not make others wait in turn.
 class Budget : public std::enable_shared_from_this<Budget> {
   public:
     /// A connection, as the budget sees it. Called on the loop.
@@ -76,6 +77,7 @@ class Budget : public std::enable_shared_from_this<Budget> {
     bool needsRelief() const { return !line_.empty() && isOverfull(); }
     void serveLine();
     void relieve();
+    std::chrono::milliseconds patienceAt(StallClock::Time now);
 
     std::unordered_set<Share*> shares_;
     bool attentionPosted_ = false;
@@ -105,13 +107,16 @@ class Budget::Share {
     /// Enters the line, for `bytes` more; whoever is in line already changes that number. Being
     /// called ends it.
     void await(std::size_t bytes = 0);
+    /// Room was found, or is not looked for any more.
     void stopWaiting();
     bool isWaiting() const { return waits_; }
 
   private:
     friend class Budget;
     const std::shared_ptr<Budget> budget_;
-    bool waits_ = false;            // the loop's
+    bool waits_ = false;  // this and the next are the loop's
+    /// Since when it finds no room, called in vain or not; none while it does not look for any.
+    std::optional<StallClock::Time> waitsSince_;
     std::weak_ptr<Holder> holder_;  // this and what follows is guarded by the budget's mutex
     std::int64_t held_ = 0;
     std::int64_t wanted_ = 0;

@@ -225,6 +225,7 @@ std::shared_ptr<PeerConnection::Turn> PeerConnection::takeTurn() {
         replies_->await();
         return nullptr;
     }
+    replies_->stopWaiting();
     turn_ = Taken;
     return std::make_shared<Turn>(*this);
 }

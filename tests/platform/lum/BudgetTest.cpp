@@ -123,6 +123,32 @@ TEST(Budget, CutsOffTheLargestOfTheStalledUntilThereIsRoom) {
     EXPECT_EQ(cut.substr(2), "e");
 }
 
+TEST(Budget, WhoeverStallsInTurnIsNotGivenAllThePatienceInTurn) {
+    RunLoop loop;
+    const std::chrono::milliseconds patience(200);
+    auto budget = std::make_shared<ReplyBudget>(loop, patience);
+    auto staller = std::make_shared<FakeHolder>(), waiting = std::make_shared<FakeHolder>();
+    auto stalled = budget->open(), waits = budget->open();
+    stalled->setHolder(staller);
+    waits->setHolder(waiting);
+    stalled->add(kMaxUnsentTotal + 1);
+    int cut = 0;
+    const auto begin = std::chrono::steady_clock::now();
+    staller->stalled = begin;
+    // As if another one had got the room and stalled as well.
+    staller->onCutOff = [&] {
+        staller->stalled = std::chrono::steady_clock::now();
+        if (++cut == 10) stalled->remove(kMaxUnsentTotal + 1);
+    };
+    bool entered = false;
+    waiting->onRetry = [&] { entered = budget->tryEnter(); };
+    waits->await();
+    while (!entered && std::chrono::steady_clock::now() - begin < std::chrono::seconds(20))
+        loop.runOnce(patience);
+    EXPECT_TRUE(entered);
+    EXPECT_LT(std::chrono::steady_clock::now() - begin, 5 * patience);
+}
+
 /// Connections of this process with itself, over budgets with little patience.
 class SharedBudgetsTest : public LumTest {
   protected:
