@@ -1,6 +1,7 @@
 #include "zrd/AnnotationText.h"
 
-#include <optional>
+#include <algorithm>
+#include <numeric>
 
 #include "platform/PropertyList.h"
 
@@ -17,86 +18,84 @@ Dictionary rootOf(const Dictionary& annotations) {
             {AnnotationText::kDataKey, annotations}};
 }
 
-/// A file's text, cut up: what stands before the annotations, they, and what stands behind.
-struct Pieces {
-    std::string_view head;
-    std::vector<std::string_view> annotations;
-    std::string_view tail;
-};
-
+/// Where a file's text can be cut: before each annotation and after the last one.
+///
 /// Each annotation begins with its key, on a line indented by two levels, and the last one ends
 /// before the end of their dictionary, indented by one. No text in the file can look like either,
-/// because its "<" are escaped. None when that is not how it looks.
-std::optional<Pieces> cut(std::string_view text) {
+/// because its "<" are escaped. Empty when that is not how it looks.
+std::vector<std::size_t> cutsOf(std::string_view text) {
     constexpr std::string_view kStart = "\n\t\t<key>";
     constexpr std::string_view kEnd = "\n\t</dict>\n";
-    std::size_t start = text.find(kStart);
     const std::size_t end = text.find(kEnd);
-    if (start == std::string_view::npos || end == std::string_view::npos || end < start)
-        return std::nullopt;
-    Pieces pieces{text.substr(0, start + 1), {}, text.substr(end + 1)};
-    text = text.substr(0, end + 1);
-    while (start != std::string_view::npos) {
-        const std::size_t next = text.find(kStart, start + 1);
-        const std::size_t after = next == std::string_view::npos ? text.size() : next + 1;
-        pieces.annotations.push_back(text.substr(start + 1, after - start - 1));
-        start = next;
-    }
-    return pieces;
+    std::vector<std::size_t> cuts;
+    for (std::size_t at = text.find(kStart); at < end; at = text.find(kStart, at + 1))
+        cuts.push_back(at + 1);
+    if (end == std::string_view::npos || cuts.empty()) return {};
+    cuts.push_back(end + 1);
+    return cuts;
 }
 
 }  // namespace
 
-Result<std::string> AnnotationText::text(const Dictionary& annotations) {
-    if (kept_.empty() || !encodeChanged(annotations)) return encodeAll(annotations);
-    // Each may have its place, and still all together be more than could be read back.
-    if (!platform::fitsXmlPropertyList(rootOf(annotations), kMaxSize))
+Result<std::string_view> AnnotationText::text(const Dictionary& annotations) {
+    // Each may be within the limits, and still all together be more than could be read back.
+    if (pieces_.empty() || !encodeChanged(annotations) || whole_.size() > kMaxSize ||
+        !platform::fitsXmlPropertyList(rootOf(annotations), kMaxSize))
         return encodeAll(annotations);
-    std::string text = joined();
-    return text.size() <= kMaxSize ? Result<std::string>(std::move(text)) : encodeAll(annotations);
+    return std::string_view(whole_);
 }
 
-/// Encodes all, and keeps their texts if these can be told apart.
-Result<std::string> AnnotationText::encodeAll(const Dictionary& annotations) {
-    kept_.clear();
+/// Encodes all, and keeps the pieces if they can be told apart.
+Result<std::string_view> AnnotationText::encodeAll(const Dictionary& annotations) {
+    pieces_.clear();
     changed_.clear();
     Result<std::string> text = platform::writeXmlPropertyList(rootOf(annotations), kMaxSize);
-    const auto pieces = text ? cut(*text) : std::nullopt;
-    if (!pieces || pieces->annotations.size() != annotations.size()) return text;
-    head_ = pieces->head;
-    tail_ = pieces->tail;
-    const std::string_view* piece = pieces->annotations.data();
-    for (const auto& [key, annotation] : annotations)
-        kept_.emplace_hint(kept_.end(), key, *piece++);
-    return text;
+    if (!text) return text.error();
+    whole_ = std::move(*text);
+    const std::vector<std::size_t> cuts = cutsOf(whole_);
+    if (cuts.size() != annotations.size() + 1) return std::string_view(whole_);
+    headSize_ = cuts[0];
+    const std::size_t* cut = cuts.data();
+    for (const auto& [key, annotation] : annotations) {
+        pieces_.push_back({key, cut[1] - cut[0]});
+        ++cut;
+    }
+    return std::string_view(whole_);
 }
 
-/// False when one cannot be encoded by itself; then nothing is said about it that would not be said
-/// about all.
+/// False when that is better done for all: an annotation could not be encoded by itself, or none is
+/// left.
 bool AnnotationText::encodeChanged(const Dictionary& annotations) {
     for (const std::string& key : changed_) {
         const Value* annotation = annotations.find(key);
         if (!annotation) {
-            kept_.erase(key);
+            replacePiece(key, {});
             continue;
         }
         const auto text = platform::writeXmlPropertyList(rootOf({{key, *annotation}}), kMaxSize);
-        const auto pieces = text ? cut(*text) : std::nullopt;
-        if (!pieces || pieces->annotations.size() != 1) return false;
-        kept_[key] = pieces->annotations[0];
+        const auto cuts = text ? cutsOf(*text) : std::vector<std::size_t>();
+        if (cuts.size() != 2) return false;
+        replacePiece(key, std::string_view(*text).substr(cuts[0], cuts[1] - cuts[0]));
     }
     changed_.clear();
-    return kept_.size() == annotations.size() && !kept_.empty();
+    return !pieces_.empty();
 }
 
-std::string AnnotationText::joined() const {
-    std::size_t size = head_.size() + tail_.size();
-    for (const auto& [key, text] : kept_) size += text.size();
-    std::string all;
-    all.reserve(size);
-    all += head_;
-    for (const auto& [key, text] : kept_) all += text;
-    return all += tail_;
+/// Puts a piece in the place of the one with its key, if there is one; an empty text is none.
+void AnnotationText::replacePiece(const std::string& key, std::string_view text) {
+    const auto piece = std::ranges::lower_bound(pieces_, key, {}, &Piece::key);
+    const std::size_t place =
+        std::accumulate(pieces_.begin(), piece, headSize_,
+                        [](std::size_t sum, const Piece& before) { return sum + before.size; });
+    const bool exists = piece != pieces_.end() && piece->key == key;
+    whole_.replace(place, exists ? piece->size : 0, text);
+    if (text.empty()) {
+        if (exists) pieces_.erase(piece);
+    } else if (exists) {
+        piece->size = text.size();
+    } else {
+        pieces_.insert(piece, {key, text.size()});
+    }
 }
 
 }  // namespace zorvan

@@ -1,6 +1,6 @@
 #pragma once
 
-#include <map>
+#include <cstdint>
 #include <set>
 #include <string>
 #include <string_view>
@@ -25,23 +25,26 @@ class AnnotationText {
 
     /// Says that the annotation under a key is another one now, or gone. Without a key: all are.
     void changed(std::string_view key) { changed_.emplace(key); }
-    void allChanged() { kept_.clear(); }
+    void allChanged() { pieces_.clear(); }
 
-    /// The text for all annotations as they are now. Errors: those of `writeXmlPropertyList`.
-    platform::Result<std::string> text(const platform::Dictionary& annotations);
+    /// The text for all annotations as they are now, which is good until the next change. Errors:
+    /// those of `writeXmlPropertyList`.
+    platform::Result<std::string_view> text(const platform::Dictionary& annotations);
 
   private:
-    using Texts = std::map<std::string, std::string, std::less<>>;
+    /// The text of one annotation, which is a piece of the whole.
+    struct Piece {
+        std::string key;
+        std::size_t size;
+    };
 
-    platform::Result<std::string> encodeAll(const platform::Dictionary& annotations);
+    platform::Result<std::string_view> encodeAll(const platform::Dictionary& annotations);
     bool encodeChanged(const platform::Dictionary& annotations);
-    std::string joined() const;
+    void replacePiece(const std::string& key, std::string_view text);
 
-    // The whole text is the head, the kept texts in the order of their keys, and the tail. Nothing
-    // is kept until all have been encoded once.
-    std::string head_;
-    Texts kept_;
-    std::string tail_;
+    std::string whole_;
+    std::size_t headSize_ = 0;   // what is before the first piece
+    std::vector<Piece> pieces_;  // in the order of their keys; none until all were encoded once
     std::set<std::string> changed_;
 };
 
