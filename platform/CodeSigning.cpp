@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <fcntl.h>
+#include <atomic>
 #include <cerrno>
 #include <mutex>
 #include <string_view>
@@ -79,8 +80,10 @@ class FileTask : public CodeSigningTask {
     Answer entitlement(const std::string& name) override {
         std::call_once(read_, [this] { read(); });
         if (error_) {
-            if (name == kRestriction) return {Value(kUnreadableRestriction), error_};
-            return {std::nullopt, error_};
+            // Every candidate of every discovery asks: the failure is told once.
+            auto error = isTold_.exchange(true) ? std::nullopt : error_;
+            if (name == kRestriction) return {Value(kUnreadableRestriction), error};
+            return {std::nullopt, error};
         }
         const Value* value = holds(name) ? values_.find(name) : nullptr;
         return {value ? std::optional(*value) : std::nullopt, std::nullopt};
@@ -115,6 +118,7 @@ class FileTask : public CodeSigningTask {
 
     const AuditToken token_;
     const std::shared_ptr<Sandbox> sandbox_;
+    std::atomic<bool> isTold_ = false;
     std::once_flag read_;  // what follows does not change any more afterwards
     std::optional<Error> error_;
     Dictionary values_;

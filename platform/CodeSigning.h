@@ -15,7 +15,7 @@ class CodeSigningTask {
   public:
     struct Answer {
         std::optional<Value> value;
-        std::optional<Error> error;  // the entitlements could not be read
+        std::optional<Error> error;  // the entitlements could not be read; told once
     };
 
     virtual ~CodeSigningTask() = default;
@@ -40,8 +40,9 @@ class CodeSigning {
 /// begins with "com.orbel.private.".
 ///
 /// A missing file holds no entitlements. One that is there but cannot be read, is no regular file
-/// or is no dictionary makes every query an error; the restriction, which such a file may have
-/// meant to set, then has a value that is no restriction, so that everything is denied.
+/// or is no dictionary makes the first query an error and holds none; the restriction, which such a
+/// file may have meant to set, then has a value that is no restriction, so that everything is
+/// denied.
 std::unique_ptr<CodeSigning> makeFileCodeSigning();
 
 }  // namespace platform

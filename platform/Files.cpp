@@ -59,27 +59,26 @@ Result<std::string> followLinks(std::string path) {
     return Error::posix(ELOOP, path);
 }
 
-/// A file that exists under its temporary name until it is renamed or given up.
+/// A file without a name until it is whole, so that a crash leaves nothing behind; where the file
+/// system has no such files, one under a temporary name until it is renamed or given up.
 class TemporaryFile {
   public:
     explicit TemporaryFile(int dirfd) : dirfd_(dirfd) {}
     TemporaryFile(const TemporaryFile&) = delete;
     ~TemporaryFile() {
-        if (fd_) ::unlinkat(dirfd_, name_.c_str(), 0);
+        if (!name_.empty()) ::unlinkat(dirfd_, name_.c_str(), 0);
     }
 
     /// Each operation answers 0 or the errno.
     int create() {
-        for (int i = 0; i < kMaxTemporaryNames; ++i) {
-            std::uint64_t random = 0;
-            if (::getrandom(&random, sizeof random, 0) != sizeof random) return errno;
-            name_ = fmt::format(".tmp-{:016x}", random);
-            fd_.reset(::openat(dirfd_, name_.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC,
-                               S_IRUSR | S_IWUSR));
-            if (fd_) return 0;
-            if (errno != EEXIST) return errno;
-        }
-        return EEXIST;
+        constexpr int kFlags = O_WRONLY | O_CLOEXEC;
+        constexpr mode_t kMode = S_IRUSR | S_IWUSR;
+        fd_.reset(::openat(dirfd_, ".", kFlags | O_TMPFILE, kMode));
+        if (fd_) return 0;
+        return takeName([this](const char* name) {
+            fd_.reset(::openat(dirfd_, name, kFlags | O_CREAT | O_EXCL, kMode));
+            return static_cast<bool>(fd_);
+        });
     }
 
     int setMode(mode_t mode) { return ::fchmod(fd_.get(), mode) == 0 ? 0 : errno; }
@@ -95,14 +94,37 @@ class TemporaryFile {
     }
 
     int rename(const char* name) {
+        if (name_.empty()) {
+            const std::string file = fmt::format("/proc/self/fd/{}", fd_.get());
+            const int failure = takeName([&](const char* temporary) {
+                return ::linkat(AT_FDCWD, file.c_str(), dirfd_, temporary, AT_SYMLINK_FOLLOW) == 0;
+            });
+            if (failure) return failure;
+        }
         if (::renameat(dirfd_, name_.c_str(), dirfd_, name) != 0) return errno;
-        fd_.reset();
+        name_.clear();
         return 0;
     }
 
   private:
+    /// Has `use` make the file's entry under a name that nothing has.
+    template <class Use>
+    int takeName(Use use) {
+        for (int i = 0; i < kMaxTemporaryNames; ++i) {
+            std::uint64_t random = 0;
+            if (::getrandom(&random, sizeof random, 0) != sizeof random) return errno;
+            std::string name = fmt::format(".tmp-{:016x}", random);
+            if (use(name.c_str())) {
+                name_ = std::move(name);
+                return 0;
+            }
+            if (errno != EEXIST) return errno;
+        }
+        return EEXIST;
+    }
+
     int dirfd_;
-    std::string name_;
+    std::string name_;  // while it has one
     UniqueFd fd_;
 };
 

@@ -20,7 +20,8 @@ Result<std::string> readFileAt(int dirfd, const std::string& name, std::size_t l
 
 /// Replaces the file at `path` by one that holds `bytes`, in one rename, so that whoever opens the
 /// path sees either the old file or the new one, also after a crash: file and directory are synced.
-/// The temporary file lies in the same directory under a random name of its own; no other file is
+/// The new file lies in the same directory and has no name until it is whole (on file systems
+/// without such files a random one of its own, which a crash leaves behind); no other file is
 /// touched. A new file gets mode 0600; an existing one keeps its mode. A symbolic link stays, and
 /// the file that it leads to is replaced. None on success. Errors: the system's; EINVAL when
 /// something other than a regular file is there.

@@ -23,6 +23,8 @@ namespace platform {
 
 namespace {
 
+constexpr const char* kJournalSocket = "/run/systemd/journal/socket";
+
 /// As many bytes of one text as a line shows.
 constexpr std::size_t kMaxText = 64 * 1024;
 
@@ -54,6 +56,9 @@ bool standardErrorIsJournal() {
 /// Where lines go, decided once at the first use of the log.
 struct Destination {
     bool journal = standardErrorIsJournal();
+    /// In a container the journal may be the standard error and yet out of reach, where sending
+    /// "succeeds" all the same.
+    bool takesFields = journal && ::access(kJournalSocket, W_OK) == 0;
     bool hidesPrivate = journal && environment("ZR_LOG_PRIVATE") != "1";
 };
 
@@ -200,7 +205,7 @@ void Log::writeLine(LogLevel level, const std::string& text) const {
     // Only a capture wanted it, perhaps one that has gone meanwhile.
     if (level < configured_) return;
     // A line must not be lost because the journal is away.
-    if (destination().journal && sendToJournal(subsystem_, category_, level, text)) return;
+    if (destination().takesFields && sendToJournal(subsystem_, category_, level, text)) return;
     writeToStandardError(category_, level, text);
 }
 

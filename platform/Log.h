@@ -98,10 +98,10 @@ auto loggable(const T& argument) {
 /// process; every operation may be called from any thread.
 ///
 /// Lines go to the journal, with the fields SUBSYSTEM, CATEGORY and PRIORITY, when standard error
-/// is the journal; else to standard error with time, category and level. Strings and objects that
-/// are not wrapped in `pub` appear as "<private>" in the journal, unless the environment has
-/// ZR_LOG_PRIVATE=1. The level of a category comes from ZR_LOG: "debug" for all, or a list like
-/// "ops=debug,td=info"; "off" writes nothing. Both variables are read once.
+/// is a journal that can be reached; else to standard error with time, category and level.
+/// Strings and objects that are not wrapped in `pub` appear as "<private>" in the journal, unless
+/// the environment has ZR_LOG_PRIVATE=1. The level of a category comes from ZR_LOG: "debug" for
+/// all, or a list like "ops=debug,td=info"; "off" writes nothing. Both variables are read once.
 ///
 /// Write through the macros below: they evaluate nothing while the level is off.
 class Log {

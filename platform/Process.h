@@ -2,6 +2,11 @@
 
 namespace platform {
 
+/// Opens /dev/null in place of standard input, output and error where they are closed: otherwise
+/// the first files opened would get their numbers, and what is written to a standard stream would
+/// end in such a file. To be called before anything opens a file.
+void openStandardDescriptors();
+
 /// What a daemon settles about its own process before it does anything else: files are its user's
 /// alone (umask 077), writing to a closed pipe or beyond a size limit is an error and no signal,
 /// and as many descriptors may be open as the system lets it have.

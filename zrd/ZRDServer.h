@@ -56,9 +56,10 @@ class ZRDServer final : public ZRDatabase, public ZRDatabaseDelegate {
 
     std::atomic<std::uint32_t> verbose_{0};
     platform::SerialQueue lumQueue_;
-    platform::SerialQueue mainQueue_;
     std::unique_ptr<platform::Listener> service_;
     std::unique_ptr<ZRDUserPrefs> userPrefs_;
+    // The last member: it goes first, and the work that still waits in it uses the others.
+    platform::SerialQueue mainQueue_;
 };
 
 }  // namespace zorvan

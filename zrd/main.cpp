@@ -34,6 +34,7 @@ platform::Services diskServices() {
 }  // namespace
 
 int main(int argc, char* argv[]) {
+    platform::openStandardDescriptors();
     EVLOG_INFO(zorvan::ops(), "zrd is launching");
     auto options = zorvan::CommandLine::parse(argc, argv);
     if (!options) return 2;

@@ -26,7 +26,7 @@ namespace platform {
 
 namespace {
 
-constexpr std::chrono::milliseconds kPauseWithoutDescriptors{100};
+constexpr std::chrono::milliseconds kPauseAfterFailure{100};
 // Accepted at once; then the loop's other work has its turn.
 constexpr int kMostAcceptedAtOnce = 32;
 
@@ -63,7 +63,7 @@ struct Listener::State : std::enable_shared_from_this<Listener::State> {
     // To be closed at the end. Those that are gone are dropped when the list is full.
     std::vector<std::weak_ptr<lum::PeerConnection>> connections;
     RunLoop::Timer pause;
-    bool exhausted = false;  // descriptors have run short, and hosts have waited since then
+    bool failing = false;  // accepting has failed, and hosts have waited since then
     bool closed = false;
     UniqueFd undecided;  // accepted when no descriptors were left to look at its peer
 
@@ -105,15 +105,14 @@ void Listener::State::acceptSome() {
 
 void Listener::State::acceptFailed(int errnum) {
     if (errnum == EAGAIN) {
-        exhausted = false;
+        failing = false;
         return awaitConnections();
     }
-    const bool first = !std::exchange(exhausted, true);
-    if (first || !isExhaustion(errnum)) {
+    if (!std::exchange(failing, true)) {
         EVLOG_ERROR(ops(), "cannot accept connections for now: {}",
                     pub(std::generic_category().message(errnum)));
     }
-    pause.start(kPauseWithoutDescriptors, [this] { acceptSome(); });
+    pause.start(kPauseAfterFailure, [this] { acceptSome(); });
 }
 
 void Listener::State::admit(UniqueFd connected) {

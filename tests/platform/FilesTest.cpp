@@ -9,6 +9,8 @@
 #include <filesystem>
 #include <fstream>
 
+#include "platform/UniqueFd.h"
+
 namespace platform {
 namespace {
 
@@ -108,6 +110,20 @@ TEST_F(Files, AFailedWriteLeavesEverythingAsItWas) {
     EXPECT_EQ(error->code, EFBIG);
     EXPECT_EQ(text("a"), "old");
     EXPECT_EQ(count(), 3);
+}
+
+TEST_F(Files, ACrashWhileWritingLeavesNothingBehind) {
+    // Not every file system has files without names.
+    const UniqueFd nameless(::open(directory.c_str(), O_TMPFILE | O_WRONLY | O_CLOEXEC, 0600));
+    if (!nameless) GTEST_SKIP();
+    put("a", "old");
+    struct rlimit small {};
+    small.rlim_cur = small.rlim_max = 1000;
+    EXPECT_EXIT(::setrlimit(RLIMIT_FSIZE, &small);
+                writeFileAtomically(at("a"), std::string(5000, 'x'));
+                , testing::KilledBySignal(SIGXFSZ), "");
+    EXPECT_EQ(text("a"), "old");
+    EXPECT_EQ(count(), 1);
 }
 
 TEST_F(Files, MakesMissingDirectories) {

@@ -49,6 +49,24 @@ TEST_F(Start, ASecondDaemonIsNotConstructedAndTheFirstGoesOn) {
     EXPECT_THAT(match(), ElementsAre("one 1"));
 }
 
+TEST_F(Start, ClosedStandardStreamsAreNoFilesOfItsOwn) {
+    auto zrd = spawn("/bin/sh", {"-c", "exec " ZRD_PROGRAM " <&- >&- 2>&-"});
+    ASSERT_TRUE(waitUntil([&] { return std::filesystem::exists(socket_); }));
+    const std::string descriptors = "/proc/" + std::to_string(zrd->pid()) + "/fd/";
+    for (const char* number : {"0", "1", "2"})
+        EXPECT_EQ(std::filesystem::read_symlink(descriptors + number), "/dev/null");
+}
+
+TEST_F(Start, AJournalOutOfReachLosesNoLines) {
+    if (std::filesystem::exists("/run/systemd/journal/socket")) GTEST_SKIP();
+    auto zrd =
+        spawn("/bin/sh",
+              {"-c", "export JOURNAL_STREAM=$(stat -L -c %d:%i /proc/$$/fd/2); exec " ZRD_PROGRAM
+                     " -S a/b"});
+    EXPECT_EQ(zrd->wait(), 1);
+    EXPECT_EQ(zrd->errLines("unable to construct server"), 1u);
+}
+
 TEST_F(Start, AKilledDaemonComesBackWithTheSameUuids) {
     writePlugIn(plugInPath("A", "one"), info("one"));
     const std::string path = writePlugIn("else/E.app/PlugIns/two.appex", info("two"));

@@ -136,8 +136,8 @@ TEST_F(RegistryTest, WhatIsForgottenStaysSoWhileItCannotBeRead) {
     EXPECT_EQ(workspace->unregisterPlugIn(a), std::nullopt);
     std::vector<std::optional<Error>> failures;
     {
-        // Nothing is judged in here: the undefined-behaviour sanitizer opens a pipe to look at an object of a class that
-        // it has not met.
+        // Nothing is judged in here: the undefined-behaviour sanitizer opens a pipe to look at an
+        // object of a class that it has not met.
         const NoDescriptors limit;
         for (const std::string& path : {a, app})
             failures.push_back(workspace->registerPlugIn(path));
