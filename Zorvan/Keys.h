@@ -143,4 +143,9 @@ inline constexpr const char* kAutoElectPlugIn = "com.orbel.developer.auto-elect-
 /// Posted when annotations (and with them match results) have changed.
 inline constexpr const char* kAnnotationChangeNotification = "com.orbel.zorvan.annotation-change";
 
+/// The preference domain with the user's choices about all plug-ins, and its key for the list of
+/// rules that take plug-ins out of every discovery.
+inline constexpr const char* kUserPreferences = "com.orbel.zorvan.userprefs";
+inline constexpr const char* kExclusions = "exclusions";
+
 }  // namespace zorvan

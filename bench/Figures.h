@@ -14,7 +14,7 @@ struct Run {
     const std::vector<World>& worlds;
     std::string scratch;  // a directory for the echo servers
     bool quick;
-    int freshScans;  // rounds of the one figure that is slow to prepare: files have to go
+    int freshScans;  // rounds of the figures that are slow: files have to go, or are written often
     Report& report;
 
     const World& largest() const { return worlds.back(); }
@@ -25,5 +25,8 @@ void measureStarts(const Run& run);
 
 /// How fast running daemons answer.
 void measureReplies(const Run& run);
+
+/// How fast choices get to the disk, and how soon an installed bundle is found.
+void measureChanges(const Run& run);
 
 }  // namespace bench

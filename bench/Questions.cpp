@@ -27,12 +27,16 @@ std::string requestFrame(const Dictionary& body) {
     return frameOf(payload);
 }
 
+std::string matchRequest(const Dictionary& rules) {
+    return requestFrame({{zorvan::message::kRequest, zorvan::request::kMatch},
+                         {zorvan::message::kVersion, zorvan::kProtocolVersion},
+                         {zorvan::message::kRules, rules},
+                         {zorvan::message::kFlags, 0}});
+}
+
 Question question(std::string key, std::string pattern, std::size_t answers) {
     Dictionary rules{{key, Value(pattern)}};
-    std::string frame = requestFrame({{zorvan::message::kRequest, zorvan::request::kMatch},
-                                      {zorvan::message::kVersion, zorvan::kProtocolVersion},
-                                      {zorvan::message::kRules, rules},
-                                      {zorvan::message::kFlags, 0}});
+    std::string frame = matchRequest(rules);
     return {std::move(key), std::move(pattern), answers, std::move(rules), std::move(frame)};
 }
 
@@ -58,6 +62,15 @@ const Value* attributeOf(const Value& form, const std::string& key) {
     return plugIn ? plugIn->find(key) : nullptr;
 }
 
+platform::Array formsIn(std::string_view frame) {
+    const Dictionary body = bodyOf(frame);
+    const Value* matches = body.find(zorvan::message::kMatches);
+    if (!matches || !matches->packed()) fail("a reply has no matches");
+    const platform::Result<Value> forms = platform::unpack(*matches->packed());
+    if (!forms || !forms->array()) fail("the matches of a reply are no list");
+    return *forms->array();
+}
+
 /// How many answers a reply holds, and how many of them were asked for.
 struct Count {
     std::size_t answers = 0;
@@ -65,13 +78,8 @@ struct Count {
 };
 
 Count countAnswers(const Question& question, std::string_view frame) {
-    const Dictionary body = bodyOf(frame);
-    const Value* matches = body.find(zorvan::message::kMatches);
-    if (!matches || !matches->packed()) fail("a reply has no matches");
-    const platform::Result<Value> forms = platform::unpack(*matches->packed());
-    if (!forms || !forms->array()) fail("the matches of a reply are no list");
     Count count;
-    for (const Value& form : *forms->array()) {
+    for (const Value& form : formsIn(frame)) {
         ++count.answers;
         const Value* attribute = attributeOf(form, question.key);
         if (attribute && *attribute == Value(question.pattern)) ++count.right;
@@ -82,7 +90,15 @@ Count countAnswers(const Question& question, std::string_view frame) {
 }  // namespace
 
 Question Question::byPoint(std::size_t answers) {
-    return question(zorvan::key::kExtensionPoint, World::pointOf(answers), answers);
+    return byPointNamed(World::pointOf(answers), answers);
+}
+
+Question Question::byPointNamed(std::string point, std::size_t answers) {
+    return question(zorvan::key::kExtensionPoint, std::move(point), answers);
+}
+
+Question Question::ofAll(std::size_t answers) {
+    return {{}, {}, answers, {}, matchRequest({})};
 }
 
 Question Question::byRareAttribute() {
@@ -93,6 +109,36 @@ std::string smallRequest() {
     return requestFrame({{zorvan::message::kRequest, zorvan::request::kBulk},
                          {zorvan::message::kVersion, zorvan::kProtocolVersion},
                          {zorvan::message::kFlags, 0}});
+}
+
+std::string annotateRequest(const platform::Uuid& uuid) {
+    return requestFrame(
+        {{zorvan::message::kRequest, zorvan::request::kAnnotate},
+         {zorvan::message::kVersion, zorvan::kProtocolVersion},
+         {zorvan::message::kUuids, platform::Array{uuid}},
+         {zorvan::message::kAnnotations, Dictionary{{zorvan::annotation::kElection, 1}}}});
+}
+
+std::string bulkAnnotateRequest(const std::vector<platform::Uuid>& uuids) {
+    Dictionary annotations;
+    for (const platform::Uuid& uuid : uuids)
+        annotations.set(uuid.string(), Dictionary{{"order", "after the others"}});
+    return requestFrame({{zorvan::message::kRequest, zorvan::request::kBulkAnnotate},
+                         {zorvan::message::kVersion, zorvan::kProtocolVersion},
+                         {zorvan::message::kAnnotations, annotations}});
+}
+
+std::vector<platform::Uuid> uuidsIn(std::string_view frame) {
+    std::vector<platform::Uuid> uuids;
+    for (const Value& form : formsIn(frame)) {
+        const Value* text =
+            form.dictionary() ? form.dictionary()->find(zorvan::form::kUuid) : nullptr;
+        const auto uuid =
+            text && text->string() ? platform::Uuid::parse(*text->string()) : std::nullopt;
+        if (!uuid) fail("a match has no UUID");
+        uuids.push_back(*uuid);
+    }
+    return uuids;
 }
 
 void expectSuccess(std::string_view frame) {

@@ -3,6 +3,7 @@
 #include <cstddef>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/Value.h"
 
@@ -18,14 +19,24 @@ struct Question {
 
     static Question byPoint(std::size_t answers);
     static Question byRareAttribute();
+    static Question byPointNamed(std::string point, std::size_t answers);
+    /// Every plug-in there is: without rules, so only the number of answers can be checked.
+    static Question ofAll(std::size_t answers);
 };
 
 /// The request that does nothing ("bulk"), as a frame.
 std::string smallRequest();
 
+/// Requests that set the election of a plug-in, and the extensions of several.
+std::string annotateRequest(const platform::Uuid& uuid);
+std::string bulkAnnotateRequest(const std::vector<platform::Uuid>& uuids);
+
 /// Whether a reply frame is a success without data. Throws a `Failure` with its text when it is an
 /// error, or no reply.
 void expectSuccess(std::string_view frame);
+
+/// The plug-ins in a match's reply frame.
+std::vector<platform::Uuid> uuidsIn(std::string_view frame);
 
 /// Whether a reply frame holds just the plug-ins that were asked for.
 bool isAnswered(const Question& question, std::string_view frame);

@@ -38,6 +38,10 @@ class World {
     std::size_t plugIns() const { return plugIns_; }
     std::string runtimeDirectory() const { return root_ + "/run"; }
     std::string socketPath() const;
+    /// Where applications are found.
+    std::string applications() const { return root_ + "/data/zorvan/Applications"; }
+    /// The daemon's file of annotations.
+    std::string annotationsFile() const { return root_ + "/state/com.orbel.zorvan/Annotations"; }
     /// Every file that a first scan reads.
     const std::vector<std::string>& files() const { return files_; }
 
@@ -54,7 +58,6 @@ class World {
     std::string pointOfPlugIn(std::size_t number) const;
     bool isOneOf(std::size_t matches, std::size_t offset, std::size_t number) const;
     void writeFile(const std::string& path, const std::string& text, bool isRead);
-    std::string applications() const { return root_ + "/data/zorvan/Applications"; }
 
     std::string root_;
     std::size_t plugIns_;

@@ -2,8 +2,6 @@
 
 #include <fmt/format.h>
 
-#include <cerrno>
-
 #include "platform/Log.h"
 #include "platform/PropertyList.h"
 
@@ -16,19 +14,14 @@ const Log& ops() {
     return handle;
 }
 
-/// Removed since its stamp was taken.
-bool isMissing(const Error& error) {
-    return error.domain == "POSIX" && error.code == ENOENT;
-}
+}  // namespace
 
-Result<Dictionary> readDictionary(const std::string& path) {
+Result<Dictionary> readDictionaryFile(const std::string& path) {
     const Result<Value> value = readPropertyListFile(path);
     if (!value) return value.error();
     if (const Dictionary* dictionary = value->dictionary()) return *dictionary;
     return Error{"PropertyList", 0, fmt::format("{}: not a dictionary", path)};
 }
-
-}  // namespace
 
 DictionaryFile::DictionaryFile(std::string path, std::string kind)
     : path_(std::move(path)), kind_(std::move(kind)) {}
@@ -37,11 +30,12 @@ std::optional<Error> DictionaryFile::update(const FileStamp& stamp) {
     if (stamp_ == stamp.text) return std::nullopt;
     std::optional<Dictionary> read;
     if (!stamp.text.empty()) {
-        Result<Dictionary> dictionary = readDictionary(path_);
+        // The file may be gone since its stamp was taken.
+        Result<Dictionary> dictionary = readDictionaryFile(path_);
         if (dictionary) {
             read = std::move(*dictionary);
             reported_.clear();
-        } else if (const Error& error = dictionary.error(); !isMissing(error)) {
+        } else if (const Error& error = dictionary.error(); !isMissingFile(error)) {
             report(stamp, error);
             if (error.domain == "POSIX") return error;
         }

@@ -9,6 +9,10 @@
 
 namespace platform {
 
+/// Reads a property-list file whose root is a dictionary. Errors: those of `readPropertyListFile`;
+/// the domain "PropertyList" when the root is something else. The text names the file.
+Result<Dictionary> readDictionaryFile(const std::string& path);
+
 /// The dictionary in a property-list file, read again whenever the file has changed. Use from one
 /// thread at a time.
 class DictionaryFile {

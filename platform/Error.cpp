@@ -17,6 +17,10 @@ std::string describe(const Error& error) {
     return fmt::format("{} ({} {})", error.text, error.domain, error.code);
 }
 
+bool isMissingFile(const Error& error) {
+    return error.domain == "POSIX" && error.code == ENOENT;
+}
+
 bool isTransient(const Error& error) {
     return error.domain == "POSIX" && (error.code == EMFILE || error.code == ENFILE ||
                                        error.code == ENOMEM || error.code == EIO);

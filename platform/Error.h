@@ -22,6 +22,9 @@ struct Error {
 
 std::string describe(const Error& error);
 
+/// Whether there was no such file.
+bool isMissingFile(const Error& error);
+
 /// Whether the same may succeed later with nothing changed on disk: out of descriptors or memory,
 /// or the device failed.
 bool isTransient(const Error& error);

@@ -168,7 +168,7 @@ Result<std::string> readFileAt(int dirfd, const std::string& name, std::size_t l
     return readAll(fd.get(), size, limit, name);
 }
 
-std::optional<Error> writeFileAtomically(const std::string& path, const std::string& bytes) {
+std::optional<Error> writeFileAtomically(const std::string& path, std::string_view bytes) {
     if (hasNul(path)) return Error::posix(EINVAL, path);
     auto target = followLinks(path);
     if (!target) return target.error();

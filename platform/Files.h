@@ -25,7 +25,7 @@ Result<std::string> readFileAt(int dirfd, const std::string& name, std::size_t l
 /// touched. A new file gets mode 0600; an existing one keeps its mode. A symbolic link stays, and
 /// the file that it leads to is replaced. None on success. Errors: the system's; EINVAL when
 /// something other than a regular file is there.
-std::optional<Error> writeFileAtomically(const std::string& path, const std::string& bytes);
+std::optional<Error> writeFileAtomically(const std::string& path, std::string_view bytes);
 
 /// Makes the directory and its missing parents, each with `mode`. An existing directory is fine.
 std::optional<Error> makeDirectories(const std::string& path, mode_t mode);

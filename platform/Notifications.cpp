@@ -5,7 +5,6 @@
 
 #include <cerrno>
 #include <charconv>
-#include <cstdint>
 #include <cstdio>
 #include <mutex>
 #include <optional>
@@ -22,13 +21,6 @@ namespace {
 const Log& ops() {
     static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
     return handle;
-}
-
-std::uint64_t readCount(const std::string& path) {
-    std::uint64_t count = 0;
-    if (const Result<std::string> text = readFile(path, 64))
-        std::from_chars(text->data(), text->data() + text->size(), count);
-    return count;
 }
 
 /// Replaces a file by rename, like `writeFileAtomically`, but without the syncs: counts live in
@@ -52,7 +44,7 @@ std::optional<Error> replaceFile(const std::string& folder, const std::string& n
 class FileNotifications : public Notifications {
   public:
     explicit FileNotifications(const Directories& directories)
-        : folder_(directories.zorvanRuntime() + "/notify") {}
+        : folder_(notificationFolder(directories)) {}
 
     void post(const std::string& name) override {
         if (!isSafeName(name)) {
@@ -63,7 +55,7 @@ class FileNotifications : public Notifications {
         const std::lock_guard lock(mutex_);
         std::optional<Error> error = makeDirectories(folder_, 0700);
         if (!error) {
-            const std::uint64_t count = readCount(joinPath(folder_, name)) + 1;
+            const std::uint64_t count = notificationPosts(joinPath(folder_, name)) + 1;
             error = replaceFile(folder_, name, std::to_string(count));
         }
         if (error) EVLOG_ERROR(ops(), "cannot post notification {}: {}", pub(name), pub(*error));
@@ -78,6 +70,17 @@ class FileNotifications : public Notifications {
 
 std::unique_ptr<Notifications> makeFileNotifications(const Directories& directories) {
     return std::make_unique<FileNotifications>(directories);
+}
+
+std::string notificationFolder(const Directories& directories) {
+    return directories.zorvanRuntime() + "/notify";
+}
+
+std::uint64_t notificationPosts(const std::string& path) {
+    std::uint64_t count = 0;
+    if (const Result<std::string> text = readFile(path, 64))
+        std::from_chars(text->data(), text->data() + text->size(), count);
+    return count;
 }
 
 }  // namespace platform

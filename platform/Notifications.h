@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstdint>
 #include <memory>
 #include <string>
 
@@ -7,7 +8,8 @@ namespace platform {
 
 struct Directories;
 
-/// System-wide notifications without payload, by name.
+/// System-wide notifications without payload, by name. platform/NotificationListener.h waits for
+/// them.
 class Notifications {
   public:
     virtual ~Notifications() = default;
@@ -18,5 +20,10 @@ class Notifications {
 /// Notifications as files: a post rewrites <runtime>/zorvan/notify/<name>, by rename, with the
 /// count of posts so far in decimal.
 std::unique_ptr<Notifications> makeFileNotifications(const Directories& directories);
+
+/// The folder of the files: <runtime>/zorvan/notify.
+std::string notificationFolder(const Directories& directories);
+/// The count that the file at `path` holds; 0 when there is none, or it is damaged.
+std::uint64_t notificationPosts(const std::string& path);
 
 }  // namespace platform

@@ -1,8 +1,15 @@
 #include "platform/Preferences.h"
 
+#include <fcntl.h>
+#include <sys/file.h>
+
+#include <cerrno>
+
 #include "platform/Directories.h"
 #include "platform/FileStamp.h"
 #include "platform/Files.h"
+#include "platform/PropertyList.h"
+#include "platform/UniqueFd.h"
 
 namespace platform {
 
@@ -40,6 +47,26 @@ std::optional<Value> Preferences::value(const std::string& domain, const std::st
     if (known == domains_.end() || !known->second.dictionary()) return std::nullopt;
     const Value* value = known->second.dictionary()->find(key);
     return value ? std::optional(*value) : std::nullopt;
+}
+
+Result<Dictionary> Preferences::read(const std::string& domain) const {
+    Result<Dictionary> dictionary = readDictionaryFile(path(domain));
+    if (!dictionary && isMissingFile(dictionary.error())) return Dictionary();
+    return dictionary;
+}
+
+std::optional<Error> Preferences::edit(const std::string& domain,
+                                       const std::function<bool(Dictionary&)>& change) const {
+    if (auto error = makeDirectories(folder_, 0700)) return error;
+    // The file itself is replaced, so a lock on it would not last: the folder's stands for it.
+    const UniqueFd folder(::open(folder_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!folder || ::flock(folder.get(), LOCK_EX) != 0) return Error::posix(errno, folder_);
+    Result<Dictionary> dictionary = read(domain);
+    if (!dictionary) return dictionary.error();
+    if (!change(*dictionary)) return std::nullopt;
+    const Result<std::string> text = writeXmlPropertyList(*dictionary);
+    if (!text) return text.error();
+    return writeFileAtomically(path(domain), *text);
 }
 
 }  // namespace platform

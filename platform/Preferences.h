@@ -1,10 +1,12 @@
 #pragma once
 
+#include <functional>
 #include <map>
 #include <optional>
 #include <string>
 
 #include "platform/DictionaryFile.h"
+#include "platform/Error.h"
 #include "platform/Value.h"
 
 namespace platform {
@@ -25,6 +27,16 @@ class Preferences {
     void synchronize(const std::string& domain);
     /// The value of a key as of the last `synchronize`; none when it is absent.
     std::optional<Value> value(const std::string& domain, const std::string& key) const;
+
+    /// What a domain's file holds now, read for somebody who must know when that is not possible:
+    /// empty when there is no file. Errors: those of `readDictionaryFile`.
+    Result<Dictionary> read(const std::string& domain) const;
+    /// Changes the dictionary in a domain's file as it is now (empty without a file, which is made
+    /// then), in one atomic step: `change` alters it, or answers false to leave all as it is. Two
+    /// edits never run at once. A damaged file is an error, and stays as it is. Errors: those of
+    /// `read`, and of writing.
+    std::optional<Error> edit(const std::string& domain,
+                              const std::function<bool(Dictionary&)>& change) const;
 
     /// The file of a domain.
     std::string path(const std::string& domain) const;

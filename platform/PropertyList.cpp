@@ -345,7 +345,7 @@ Result<std::string> writeXmlPropertyList(const Value& value, std::size_t limit) 
     // Before anything is built: objects, and texts, which may grow fivefold. What tags and
     // indentation add to them is bounded and only known in the end.
     const Error tooLarge{"PropertyList", 3, "too large for a property list"};
-    if (!WriteCheck(limit).allows(value)) return tooLarge;
+    if (!fitsXmlPropertyList(value, limit)) return tooLarge;
     OwnedNode root(nodeOf(value));
     NumbersInC numbers;
     char* text = nullptr;
@@ -355,6 +355,10 @@ Result<std::string> writeXmlPropertyList(const Value& value, std::size_t limit) 
     if (!text) return Error{"PropertyList", 4, "could not be written as a property list"};
     if (length > limit) return tooLarge;
     return std::string(text, length);
+}
+
+bool fitsXmlPropertyList(const Value& value, std::size_t limit) {
+    return WriteCheck(limit).allows(value);
 }
 
 }  // namespace platform

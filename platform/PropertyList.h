@@ -36,4 +36,8 @@ Result<Value> readPropertyListFile(const std::string& path,
 Result<std::string> writeXmlPropertyList(const Value& value,
                                          std::size_t limit = kMaxPropertyListFile);
 
+/// Whether a property list is within the limits of its writer and its reader, but for the bytes of
+/// tags and indentation: for those who put the XML form together from pieces.
+bool fitsXmlPropertyList(const Value& value, std::size_t limit);
+
 }  // namespace platform

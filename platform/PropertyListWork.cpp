@@ -33,7 +33,8 @@ std::size_t workOfTable(std::span<const std::string_view> keys) {
     for (std::string_view key : keys) {
         // One that XML spells in several ways may be in any bucket, or be there already: then it
         // replaces a value, for which the library walks through all of them.
-        bool isPlain = key.find_first_of("&<>") == std::string_view::npos;
+        bool isPlain =
+            std::ranges::none_of(key, [](char c) { return c == '&' || c == '<' || c == '>'; });
         work += costOfComparing(key) * (isPlain ? buckets[bucketOf(key)]++ : keys.size());
     }
     return work * (1 + keys.size() / kCachedKeys);

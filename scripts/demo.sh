@@ -14,11 +14,13 @@ PATH=$PWD/build/release/zrd:$PWD/build/release/tools/zrctl:$PATH
 
 home=$(mktemp -d /tmp/zrd-demo.XXXXXX)
 daemon=
+watcher=
 finish() {
-    if [ -n "$daemon" ]; then
-        kill "$daemon" 2> /dev/null || true
-        wait "$daemon" 2> /dev/null || true
-    fi
+    local process
+    for process in $daemon $watcher; do
+        kill "$process" 2> /dev/null || true
+        wait "$process" 2> /dev/null || true
+    done
     rm -rf "$home"
 }
 trap finish EXIT
@@ -67,6 +69,18 @@ show() {
     fi
 }
 
+# Waits, a few seconds at most, until the command ends with the status.
+soon() {
+    local expected=$1 status
+    shift
+    for _ in $(seq 50); do
+        status=0
+        "$@" > /dev/null 2>&1 || status=$?
+        [ "$status" = "$expected" ] && return
+        sleep 0.1
+    done
+}
+
 show "All plug-ins that this caller may use, of each identifier the newest version:" \
     zrctl match
 show "Those of one extension point:" \
@@ -103,6 +117,45 @@ show "... until it is added again:" \
     zrctl add "$applications/Scribe.app/PlugIns/WordCount.appex"
 show "There it is:" \
     zrctl match VXExtensionIdentifier=com.example.scribe.word-count
+show "The user decides what is used. An election is kept under a plug-in's identifier and outlives zrd:" \
+    zrctl elect ignore com.example.scribe.word-count
+show "Hosts may keep data of their own with a plug-in, and so may you:" \
+    zrctl annotate com.example.scribe.word-count language=en pinned=true
+show "Both come back with every match; it is the host that leaves out what is ignored:" \
+    zrctl match --long VXExtensionIdentifier=com.example.scribe.word-count
+show "An identifier that several plug-ins have is not enough to say which one is meant:" \
+    sh -c 'zrctl elect use com.example.shout 2>&1 || true'
+show "What is excluded is in no match at all. Besides the Telegraph, which the preferences had excluded,
+now everything from version 2.0 on:" \
+    zrctl exclude add 'VXExtensionVersion=>=2.0'
+show "The rules, written as \"exclude remove\" takes them:" \
+    zrctl exclude list
+show "Image Preview, version 2.0, is gone ..." \
+    zrctl match InputTypes=image/png
+show "... until its rule is removed:" \
+    zrctl exclude remove 'VXExtensionVersion=>=2.0'
+say "Every choice is announced to whoever waits for it; here is what \"zrctl watch\" writes meanwhile:"
+zrctl watch > "$home/watch" &
+watcher=$!
+for _ in $(seq 100); do
+    zrctl elect default com.example.scribe.word-count
+    [ -s "$home/watch" ] && break
+    sleep 0.1
+done
+kill "$watcher"
+wait "$watcher"
+watcher=
+tail -n 1 "$home/watch"
+say "Applications come and go while zrd runs. Paintbox is taken away:"
+mv "$applications/Paintbox.app" "$home/"
+soon 1 zrctl match VXExtensionIdentifier=com.example.paintbox.frames
+show "Its plug-ins went with it, and of Shout there is only Scribe's older version left:" \
+    zrctl match
+say "Paintbox is copied in again:"
+cp -R "$home/Paintbox.app" "$applications/"
+soon 0 zrctl match VXExtensionIdentifier=com.example.paintbox.frames
+show "Nobody had to tell zrd:" \
+    zrctl match
 say "Two bundles were refused; the log says which and why:"
 sed -n -e 's/.*\(leaving out a plug-in.*\)/\1/p' -e 's/.*\(ignoring mis-configured.*\)/\1/p' "$home/log" |
     sort -u

@@ -19,11 +19,6 @@ using platform::Value;
 
 namespace {
 
-constexpr std::int64_t kVersion = 16;
-constexpr const char* kVersionKey = "version";
-constexpr const char* kDataKey = "data";
-constexpr std::size_t kMaxFileSize = 256u << 20;
-
 ZRError zrError(const platform::Error& error) {
     return {error.domain, error.code, error.text};
 }
@@ -35,13 +30,13 @@ bool isMissingFile(const ZRError& error) {
 /// The "data" of an annotation file's root, or what is wrong with it.
 std::optional<ZRError> readRoot(const Value& root, Dictionary& data) {
     const Dictionary* dictionary = root.dictionary();
-    const Value* version = dictionary ? dictionary->find(kVersionKey) : nullptr;
+    const Value* version = dictionary ? dictionary->find(AnnotationText::kVersionKey) : nullptr;
     std::int64_t found = version ? version->numberAsInteger().value_or(0) : 0;
-    if (found != kVersion) {
+    if (found != AnnotationText::kVersion) {
         return ZRErrorWithFormat(kZRErrorVersion, "found database version {} needed version {}",
-                                 found, kVersion);
+                                 found, AnnotationText::kVersion);
     }
-    const Value* stored = dictionary->find(kDataKey);
+    const Value* stored = dictionary->find(AnnotationText::kDataKey);
     if (!stored || !stored->dictionary()) {
         return ZRErrorWithCode(kZRErrorVersion, "found no data in database");
     }
@@ -95,7 +90,8 @@ std::string ZRDAnnotationStore::defaultDatabaseURL(const platform::Directories& 
 
 std::optional<ZRError> ZRDAnnotationStore::loadDb() {
     std::optional<ZRError> error;
-    auto root = platform::readPropertyListFile(annotationsURL_, kMaxFileSize);
+    text_.allChanged();
+    auto root = platform::readPropertyListFile(annotationsURL_, AnnotationText::kMaxSize);
     if (!root) {
         error = zrError(root.error());
     } else {
@@ -106,9 +102,8 @@ std::optional<ZRError> ZRDAnnotationStore::loadDb() {
     return error;
 }
 
-std::optional<ZRError> ZRDAnnotationStore::saveDb() const {
-    auto bytes = platform::writeXmlPropertyList(
-        Dictionary{{kVersionKey, kVersion}, {kDataKey, annotations_}}, kMaxFileSize);
+std::optional<ZRError> ZRDAnnotationStore::saveDb() {
+    const auto bytes = text_.text(annotations_);
     if (!bytes) return zrError(bytes.error());
     if (auto error = platform::writeFileAtomically(annotationsURL_, *bytes)) return zrError(*error);
     return std::nullopt;
@@ -134,6 +129,7 @@ void ZRDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotati
     } else {
         annotations_.remove(key);
     }
+    text_.changed(key);
     if (auto error = saveDb()) {
         EVLOG_ERROR(ops(), "unable to save annotations:{} error:{}", pub(annotationsURL_),
                     pub(*error));

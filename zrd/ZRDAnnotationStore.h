@@ -6,6 +6,7 @@
 
 #include "Zorvan/ZRError.h"
 #include "platform/Value.h"
+#include "zrd/AnnotationText.h"
 
 namespace platform {
 struct Directories;
@@ -43,7 +44,7 @@ class ZRDAnnotationStore {
 
     /// Each answers what went wrong, or none.
     std::optional<ZRError> loadDb();
-    std::optional<ZRError> saveDb() const;
+    std::optional<ZRError> saveDb();
 
     /// <user directory>/com.orbel.zorvan/Annotations. Makes the directory (0700). Without one the
     /// daemon cannot do its work: an internal inconsistency.
@@ -57,6 +58,7 @@ class ZRDAnnotationStore {
 
     std::string annotationsURL_;
     platform::Dictionary annotations_;
+    AnnotationText text_;
 };
 
 }  // namespace zorvan

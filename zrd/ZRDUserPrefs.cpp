@@ -1,14 +1,12 @@
 #include "zrd/ZRDUserPrefs.h"
 
+#include "Zorvan/Keys.h"
+
 namespace zorvan {
 
-namespace {
-constexpr const char* kDomain = "com.orbel.zorvan.userprefs";
-}
-
 std::optional<platform::Value> ZRDUserPrefs::exclusions() {
-    preferences_.synchronize(kDomain);
-    return preferences_.value(kDomain, "exclusions");
+    preferences_.synchronize(kUserPreferences);
+    return preferences_.value(kUserPreferences, kExclusions);
 }
 
 }  // namespace zorvan

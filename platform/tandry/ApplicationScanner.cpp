@@ -1,5 +1,7 @@
 #include "platform/tandry/ApplicationScanner.h"
 
+#include <fmt/format.h>
+
 #include <algorithm>
 #include <cerrno>
 #include <chrono>
@@ -30,21 +32,16 @@ bool isMissing(const Error& error) {
     return error.code == ENOENT;
 }
 
-/// Whether a failure says nothing about the disk's content: nothing may be dropped for it.
-bool isPassing(const Error& error) {
-    return error.domain == "POSIX" && (error.code == EMFILE || error.code == ENFILE ||
-                                       error.code == ENOMEM || error.code == EIO);
-}
-
 }  // namespace
 
 ApplicationScanner::ApplicationScanner(RegistryState& state, BundleReader& reader,
-                                       DataContainers& containers,
-                                       std::vector<std::string> applicationFolders)
+                                       DataContainers& containers, FolderWatch& watch,
+                                       Folders folders)
     : state_(state),
       reader_(reader),
       containers_(containers),
-      folders_(std::move(applicationFolders)) {}
+      watch_(watch),
+      folders_(std::move(folders)) {}
 
 bool ApplicationScanner::isApplication(std::string_view path) {
     std::string_view name = lastPathComponent(path);
@@ -64,125 +61,212 @@ bool ApplicationScanner::isHeld(const std::string& path) const {
         if (lastPathComponent(folder) != kPlugIns) return false;
         application = parentPath(folder);
     }
-    return isApplication(application) && std::ranges::any_of(folders_, [&](const auto& folder) {
+    return isApplication(application) &&
+           std::ranges::any_of(folders_.applications, [&](const auto& folder) {
                return canonicalPath(folder) == parentPath(application);
            });
 }
 
-void ApplicationScanner::begin() {
+void ApplicationScanner::begin(bool overEverything) {
     ++pass_;
     metPlugIns_ = 0;
-    isIncomplete_ = false;
+    isIncomplete_ = hasTransientFailure_ = false;
     unreachable_.clear();
     reader_.beginPass();
+    watch_.beginWalk(overEverything);
+    complaints_.beginWalk();
+    if (overEverything) links_.clear();
 }
 
 RegistryChanges ApplicationScanner::scanAll() {
-    begin();
+    begin(true);
     visitAll();
-    return finish({});
+    return finish({std::string()});
 }
 
 RegistryChanges ApplicationScanner::scanPath(const std::string& path, bool& hasPlugIns) {
-    begin();
-    bool isKnown = state_.applications.contains(applicationAbove(path));
+    begin(false);
+    if (state_.registrations.contains(path)) watch_.markWay(path);
     visitPath(path);
     hasPlugIns = metPlugIns_ != 0;
-    // An application that changed is part of its other plug-ins' records too. What was not met may
-    // be there by another road: a registration of its own, or a link.
-    const bool hasChanged = isKnown && !isApplication(path) && !changes_.applications.empty();
-    if (!hasChanged && isAllMet(path)) return finish(path);
     std::string refusal = changes_.refusal;
-    visitAll();
+    const bool isAlone = isSelfContained(path) && visitScope(path);
+    if (!isAlone) visitAll();
     changes_.refusal = std::move(refusal);
-    return finish({});
+    return finish({isAlone ? path : std::string()});
+}
+
+RegistryChanges ApplicationScanner::scanTouched(const Scopes& scopes) {
+    auto isNamed = [this](const std::string& path) {
+        return (state_.registrations.contains(path) || isHeld(path)) && isSelfContained(path);
+    };
+    if (!std::ranges::all_of(scopes, isNamed)) return scanAll();
+    begin(false);
+    if (std::ranges::all_of(scopes, [this](const auto& path) { return visitScope(path); }))
+        return finish(scopes);
+    visitAll();
+    return finish({std::string()});
+}
+
+/// Whether nothing but what lies within an application or plug-in decides what is installed there,
+/// and nothing elsewhere depends on it: then a walk over it alone is enough.
+bool ApplicationScanner::isSelfContained(const std::string& scope) const {
+    std::error_code ignored;
+    bool hasLinks = std::filesystem::is_symlink(scope, ignored);
+    forEachWithin(links_, scope, [&](auto) { hasLinks = true; });
+    return !hasLinks;
+}
+
+/// Whether plug-ins refer to an application as it was before this walk.
+bool ApplicationScanner::isOutdated(const std::string& application) const {
+    auto found = state_.applications.find(application);
+    if (found == state_.applications.end()) return false;
+    bool result = false;
+    forEachWithin(state_.plugIns, application, [&](auto entry) {
+        const TDApplicationProxyRef& known = entry->second.record->containingApplication;
+        if (known && known->bundlePath == application && known != found->second.record)
+            result = true;
+    });
+    return result;
+}
+
+/// Visits a self-contained path and what is registered inside. Answers whether that was enough: an
+/// application that changed is part of its other plug-ins' records too, and a plug-in that is not
+/// there may leave an application that nothing needs any more.
+bool ApplicationScanner::visitScope(const std::string& path) {
+    if (canonicalPath(path) == path) visitPath(path);
+    forEachWithin(state_.registrations, path, [this](auto inside) { visitRegistration(*inside); });
+    return isApplication(path) || (isAllMet(path) && !isOutdated(applicationAbove(path)));
 }
 
 void ApplicationScanner::visitAll() {
-    for (const std::string& folder : folders_)
+    for (const std::string& folder : folders_.dictionaries) {
+        watch_.markWay(folder);
+        if (std::optional<std::string> canonical = canonicalPath(folder))
+            watch_.markContents(*canonical, {});
+    }
+    for (const std::string& folder : folders_.applications) {
+        watch_.markWay(folder);
         if (std::optional<std::string> canonical = canonicalPath(folder))
             visitFolder(*canonical);
         else
             unreachable_.push_back(folder);
-    for (const std::string& path : state_.registrations)
-        if (canonicalPath(path) == path) {
-            visitPath(path);
-        } else {
-            EVLOG_INFO(ops(), "nothing at registered path {}", path);
-            unreachable_.push_back(path);
-        }
+    }
+    for (const std::string& path : state_.registrations) visitRegistration(path);
+}
+
+void ApplicationScanner::visitRegistration(const std::string& path) {
+    watch_.markWay(path);
+    if (canonicalPath(path) == path) {
+        visitPath(path);
+    } else {
+        EVLOG_INFO(ops(), "nothing at registered path {}", path);
+        unreachable_.push_back(path);
+    }
 }
 
 void ApplicationScanner::visitFolder(const std::string& folder) {
-    Result<FolderEntries> found = FolderEntries::read(folder);
+    watch_.markEntries(folder, kApplicationSuffix);
+    Result<FolderEntries> found = FolderEntries::read(folder, watch_, complaints_);
     if (!found) {
-        EVLOG_ERROR(ops(), "cannot look for applications: {}", pub(found.error().text));
+        complaints_.add(folder,
+                        fmt::format("cannot look for applications: {}", found.error().text));
         unreachable_.push_back(folder);
         // Its links may lead anywhere.
-        if (isPassing(found.error())) isIncomplete_ = true;
+        if (noteTransient(found.error())) isIncomplete_ = true;
         return;
     }
+    for (const std::string& target : found->nowhere) unreachable_.push_back(target);
     for (const auto& [name, target] : found->entries) {
         if (!isApplication(name)) continue;
-        std::string path = target.empty() ? joinPath(folder, name) : target;
+        const std::string entry = joinPath(folder, name);
+        if (!target.empty()) noteLink(entry, target);
+        const std::string& path = target.empty() ? entry : target;
         if (isApplication(path))
             visitApplication(path);
         else
-            EVLOG_ERROR(ops(), "skipping {}: {} is not an application directory",
-                        pub(joinPath(folder, name)), pub(path));
+            complaints_.add(
+                entry, fmt::format("skipping {}: {} is not an application directory", entry, path));
     }
+}
+
+void ApplicationScanner::noteLink(const std::string& link, const std::string& target) {
+    links_.insert(link);
+    links_.insert(target);
 }
 
 void ApplicationScanner::visitPath(const std::string& path) {
     if (isApplication(path))
         visitApplication(path);
     else
-        visitPlugIn(BundleFolder(path), applicationOf(path));
+        visitPlugIn(BundleFolder(path), applicationOf(path), path);
 }
 
 void ApplicationScanner::visitApplication(const std::string& path) {
     // Two links may lead to one application.
     auto known = state_.applications.find(path);
     if (known != state_.applications.end() && known->second.plugInsPass == pass_) return;
+    watch_.markContents(path, path);
     std::string folder = joinPath(path, kPlugIns);
     std::error_code ignored;
-    if (std::filesystem::is_symlink(folder, ignored))
-        folder = canonicalPath(folder).value_or(folder);
+    if (std::filesystem::is_symlink(folder, ignored)) {
+        watch_.markWay(folder);
+        std::string target = canonicalPath(folder).value_or(folder);
+        noteLink(folder, target);
+        folder = std::move(target);
+    }
     visitPlugIns(path, folder);
 }
 
 /// An application that cannot be looked into is not known.
 void ApplicationScanner::visitPlugIns(const std::string& application, const std::string& folder) {
-    Result<FolderEntries> found = FolderEntries::read(folder);
+    watch_.markContents(folder, application);
+    Result<FolderEntries> found = FolderEntries::read(folder, watch_, complaints_);
     if (!found && !isMissing(found.error())) {
-        EVLOG_ERROR(ops(), "cannot look for plug-ins: {}", pub(found.error().text));
+        complaints_.add(folder, fmt::format("cannot look for plug-ins: {}", found.error().text));
         if (changes_.refusal.empty()) changes_.refusal = found.error().text;
         unreachable_.push_back(application);
-        if (isPassing(found.error())) isIncomplete_ = true;
+        if (noteTransient(found.error())) isIncomplete_ = true;
         return;
     }
     TDApplicationProxyRef record = applicationAt(application);
     state_.applications[application].plugInsPass = pass_;
     if (!found) return;
+    for (const std::string& target : found->nowhere) unreachable_.push_back(target);
     const bool isInside = isWithin(folder, application);
     for (const auto& [name, target] : found->entries)
-        if (!target.empty())
-            visitPlugIn(BundleFolder(target), applicationOf(target));
-        else
+        if (!target.empty()) {
+            noteLink(joinPath(folder, name), target);
+            visitPlugIn(BundleFolder(target), applicationOf(target), application);
+        } else {
             visitPlugIn(BundleFolder(found->directory(), folder, name),
-                        isInside ? record : applicationOf(joinPath(folder, name)));
+                        isInside ? record : applicationOf(joinPath(folder, name)), application);
+        }
 }
 
 TDApplicationProxyRef ApplicationScanner::applicationAt(const std::string& path) {
     ApplicationEntry& entry = state_.applications[path];
     if (std::exchange(entry.pass, pass_) == pass_) return entry.record;
+    watch_.markContents(path, path);
     BundleFolder folder(path);
-    if (!entry.record || reader_.applicationStamps(folder) != entry.stamps) {
-        entry = reader_.readApplication(folder);
-        entry.pass = pass_;
-        changes_.applications.insert(path);
-    }
+    if (entry.record && reader_.applicationStamps(folder) == entry.stamps) return entry.record;
+    BundleReader::ApplicationReading reading = reader_.readApplication(folder);
+    // What cannot be read just now is not known to have changed.
+    if (reading.failure && noteTransient(*reading.failure) && entry.record) return entry.record;
+    if (reading.failure && !reading.record->isPlaceholder)
+        complaints_.add(path, fmt::format("application without name and identifier: {}",
+                                          reading.failure->text));
+    entry.record = std::move(reading.record);
+    entry.stamps = std::move(reading.stamps);
+    changes_.applications.insert(path);
     return entry.record;
+}
+
+/// Whether an error says nothing about the disk: then another walk has to come.
+bool ApplicationScanner::noteTransient(const Error& error) {
+    const bool isSo = isTransient(error);
+    hasTransientFailure_ = hasTransientFailure_ || isSo;
+    return isSo;
 }
 
 TDApplicationProxyRef ApplicationScanner::applicationOf(const std::string& plugInPath) {
@@ -216,7 +300,9 @@ bool ApplicationScanner::isRefused(const BundleFolder& folder) {
 }
 
 void ApplicationScanner::visitPlugIn(const BundleFolder& folder,
-                                     const TDApplicationProxyRef& application) {
+                                     const TDApplicationProxyRef& application,
+                                     const std::string& scope) {
+    watch_.markContents(folder.path, scope);
     auto found = state_.plugIns.find(folder.path);
     if (found != state_.plugIns.end()) {
         PlugInEntry& entry = found->second;
@@ -249,11 +335,11 @@ void ApplicationScanner::visitPlugIn(const BundleFolder& folder,
 
 void ApplicationScanner::refuse(const BundleFolder& folder, BundleReader::Reading reading) {
     const Error& error = *reading.refusal;
-    EVLOG_ERROR(ops(), "leaving out a plug-in: {}", pub(error.text));
+    complaints_.add(folder.path, fmt::format("leaving out a plug-in: {}", error.text));
     if (changes_.refusal.empty()) changes_.refusal = error.text;
     if (error.domain == "POSIX") {
         auto known = state_.plugIns.find(folder.path);
-        if (isPassing(error) && known != state_.plugIns.end()) known->second.pass = pass_;
+        if (noteTransient(error) && known != state_.plugIns.end()) known->second.pass = pass_;
         return;
     }
     state_.refusals[folder.path] = {std::move(reading.entry.print), error.text, pass_};
@@ -292,24 +378,30 @@ bool ApplicationScanner::isUnreachable(const std::string& path) const {
 }
 
 /// Drops what lies within `scope` and was not met by this walk.
-RegistryChanges ApplicationScanner::finish(const std::string& scope) {
-    if (isIncomplete_) return std::exchange(changes_, {});
-    auto dropUnmet = [&](auto& map, auto note) {
+void ApplicationScanner::dropUnmet(const std::string& scope) {
+    auto drop = [&](auto& map, auto note) {
         forEachWithin(map, scope, [&](auto entry) {
             if (entry->second.pass == pass_) return;
             note(*entry);
             map.erase(entry);
         });
     };
-    dropUnmet(state_.plugIns,
-              [&](auto& entry) { changes_.uninstalled.push_back(entry.second.record); });
-    dropUnmet(state_.applications, [&](auto& entry) { changes_.applications.insert(entry.first); });
-    dropUnmet(state_.refusals, [&](auto& entry) { changes_.refusals.insert(entry.first); });
+    drop(state_.plugIns, [&](auto& entry) { changes_.uninstalled.push_back(entry.second.record); });
+    drop(state_.applications, [&](auto& entry) { changes_.applications.insert(entry.first); });
+    drop(state_.refusals, [&](auto& entry) { changes_.refusals.insert(entry.first); });
     forEachWithin(state_.forgotten, scope, [&](auto entry) {
         if (entry->second.pass == pass_ || isUnreachable(entry->first)) return;
         changes_.forgotten.insert(entry->first);
         state_.forgotten.erase(entry);
     });
+    watch_.releaseUnmarked(scope);
+    complaints_.forgetUnmet(scope);
+}
+
+RegistryChanges ApplicationScanner::finish(const Scopes& scopes) {
+    if (!isIncomplete_)
+        for (const std::string& scope : scopes) dropUnmet(scope);
+    watch_.endWalk();
     return std::exchange(changes_, {});
 }
 

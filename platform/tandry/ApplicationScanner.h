@@ -4,7 +4,9 @@
 #include <vector>
 
 #include "platform/tandry/BundleReader.h"
+#include "platform/tandry/Complaints.h"
 #include "platform/tandry/DataContainers.h"
+#include "platform/tandry/FolderWatch.h"
 #include "platform/tandry/RegistryState.h"
 
 namespace platform::tandry {
@@ -13,15 +15,28 @@ namespace platform::tandry {
 /// in line is only looked at, not read. Belongs to the registry's thread, as the state does.
 class ApplicationScanner {
   public:
-    /// `applicationFolders` hold the `.app` directories. All references must outlive this.
+    /// Which directories a walk starts from.
+    struct Folders {
+        std::vector<std::string> applications;  // hold the `.app` directories
+        std::vector<std::string> dictionaries;  // hold what the reader merges into bundles
+    };
+
+    /// Every directory that a walk looks into is marked in `watch`. All references must outlive
+    /// this.
     ApplicationScanner(RegistryState& state, BundleReader& reader, DataContainers& containers,
-                       std::vector<std::string> applicationFolders);
+                       FolderWatch& watch, Folders folders);
 
     /// Walks every application folder and everything that was registered by path.
     RegistryChanges scanAll();
-    /// The same for one canonical path alone: that of a plug-in or of an application.
-    /// `hasPlugIns` says whether good plug-ins were met there.
+    /// The same for one canonical path alone: that of a plug-in or of an application that is held
+    /// or registered. `hasPlugIns` says whether good plug-ins were met there.
     RegistryChanges scanPath(const std::string& path, bool& hasPlugIns);
+    /// The same for what the watch says was touched.
+    RegistryChanges scanTouched(const Scopes& scopes);
+
+    /// Whether the last walk could read whatever it met, but for what only a change on disk can
+    /// mend, and all that matters is watched.
+    bool isComplete() const { return !hasTransientFailure_ && !watch_.isShort(); }
 
     /// Whether an application folder holds the plug-in or application at a path, so that a walk
     /// would find it by itself.
@@ -32,14 +47,18 @@ class ApplicationScanner {
     static bool isApplication(std::string_view path);
 
   private:
-    void begin();
+    void begin(bool overEverything);
     void visitAll();
     void visitFolder(const std::string& folder);
+    void visitRegistration(const std::string& path);
+    bool visitScope(const std::string& path);
     void visitPath(const std::string& path);
     void visitApplication(const std::string& path);
     void visitPlugIns(const std::string& application, const std::string& folder);
-    void visitPlugIn(const BundleFolder& folder, const TDApplicationProxyRef& application);
+    void visitPlugIn(const BundleFolder& folder, const TDApplicationProxyRef& application,
+                     const std::string& scope);
     void refuse(const BundleFolder& folder, BundleReader::Reading reading);
+    bool noteTransient(const Error& error);
     void install(const BundleFolder& folder, PlugInEntry entry,
                  const TDApplicationProxyRef& application);
     TDApplicationProxyRef applicationAt(const std::string& path);
@@ -47,18 +66,27 @@ class ApplicationScanner {
     bool isForgotten(const BundleFolder& folder);
     bool isRefused(const BundleFolder& folder);
     bool isAllMet(const std::string& scope);
+    bool isSelfContained(const std::string& scope) const;
+    bool isOutdated(const std::string& application) const;
+    void noteLink(const std::string& link, const std::string& target);
     bool isUnreachable(const std::string& path) const;
-    RegistryChanges finish(const std::string& scope);
+    void dropUnmet(const std::string& scope);
+    RegistryChanges finish(const Scopes& scopes);
 
     RegistryState& state_;
     BundleReader& reader_;
     DataContainers& containers_;
-    std::vector<std::string> folders_;
+    FolderWatch& watch_;
+    Folders folders_;
+    Complaints complaints_;
+    std::set<std::string> links_;  // links to bundles since the last walk over everything, and
+                                   // what they lead to
     // Of the walk under way:
     Pass pass_ = 0;
     RegistryChanges changes_;
     std::size_t metPlugIns_ = 0;            // good ones that were looked at
-    bool isIncomplete_ = false;             // something failed that says nothing about the disk
+    bool isIncomplete_ = false;             // what was not met may be there all the same
+    bool hasTransientFailure_ = false;      // something failed that says nothing about the disk
     std::vector<std::string> unreachable_;  // paths that could not be looked into
 };
 

@@ -238,13 +238,14 @@ std::optional<Error> BundleReader::complete(Dictionary& info, const std::string&
     return std::nullopt;
 }
 
-Dictionary BundleReader::localizations(const BundleFolder& folder) {
-    if (languages_.empty()) return {};
+/// Names that cannot be used are left out. Error: the file cannot be read just now.
+Result<Dictionary> BundleReader::localizations(const BundleFolder& folder) {
+    if (languages_.empty()) return Dictionary();
     Result<Dictionary> dictionary = readDictionary(folder, kLocalized);
-    if (dictionary) return *dictionary;
+    if (dictionary || isTransient(dictionary.error())) return dictionary;
     if (!isMissing(dictionary.error()))
         EVLOG_ERROR(ops(), "ignoring names of a bundle: {}", pub(dictionary.error().text));
-    return {};
+    return Dictionary();
 }
 
 std::optional<Error> BundleReader::fill(const BundleFolder& folder, PlugInEntry& entry) {
@@ -315,7 +316,9 @@ std::optional<Error> BundleReader::describePlugIn(const BundleFolder& folder,
     if (!version) version = stringAt(info, kShortVersion);
     if (version) record.bundleVersion = *version;
     record.onSystemPartition = isOnSystemPartition(folder.path);
-    LocalizedNames names = localizedNames(info, localizations(folder), languages_);
+    const Result<Dictionary> localized = localizations(folder);
+    if (!localized) return localized.error();
+    LocalizedNames names = localizedNames(info, *localized, languages_);
     record.localizedName = std::move(names.display);
     record.localizedShortName = std::move(names.brief);
 
@@ -334,9 +337,9 @@ std::string BundleReader::applicationStamps(const BundleFolder& folder) {
     return stamps;
 }
 
-ApplicationEntry BundleReader::readApplication(const BundleFolder& folder) {
-    ApplicationEntry entry;
-    entry.stamps = applicationStamps(folder);
+BundleReader::ApplicationReading BundleReader::readApplication(const BundleFolder& folder) {
+    ApplicationReading reading;
+    reading.stamps = applicationStamps(folder);
     auto record = std::make_shared<TDApplicationProxy>();
     record->bundlePath = folder.path;
     std::string ignored;
@@ -344,20 +347,21 @@ ApplicationEntry BundleReader::readApplication(const BundleFolder& folder) {
     record->isPlaceholder = appendFileStamp(folder.dirfd, scratch_.c_str(), ignored);
 
     const std::string file = joinPath(folder.path, kInfoPlist);
-    Result<Dictionary> info = readDictionary(folder, kInfoPlist);
+    const Result<Dictionary> info = readDictionary(folder, kInfoPlist);
+    const Result<Dictionary> localized = info ? localizations(folder) : Dictionary();
     if (info) {
         const std::string* identifier = stringAt(*info, kBundleIdentifier);
         if (auto error = unsafeName(file, kBundleIdentifier, identifier))
             EVLOG_ERROR(ops(), "application without identifier: {}", pub(error->text));
         else if (identifier)
             record->bundleIdentifier = *identifier;
-        record->localizedName =
-            localizedNames(*info, localizations(folder), languages_).display.value_or("");
-    } else if (!record->isPlaceholder) {
-        EVLOG_ERROR(ops(), "application without name and identifier: {}", pub(info.error().text));
     }
-    entry.record = std::move(record);
-    return entry;
+    if (info && localized)
+        record->localizedName = localizedNames(*info, *localized, languages_).display.value_or("");
+    if (!info || !localized) reading.failure = info ? localized.error() : info.error();
+    if (reading.failure && isTransient(*reading.failure)) reading.stamps.clear();
+    reading.record = std::move(record);
+    return reading;
 }
 
 }  // namespace platform::tandry

@@ -57,9 +57,15 @@ class BundleReader {
 
     /// The stamps of the files that go into an application's record.
     std::string applicationStamps(const BundleFolder& folder);
-    /// Reads an application. One without a readable Info.plist, which is logged, has no identifier
-    /// and no name.
-    ApplicationEntry readApplication(const BundleFolder& folder);
+    struct ApplicationReading {
+        TDApplicationProxyRef record;
+        std::string stamps;  // empty after a failure that may pass, so that it is read again
+        std::optional<Error> failure;
+    };
+    /// Reads an application. One without a readable Info.plist has no identifier and no name, and
+    /// one whose names in the user's languages cannot be read just now no name; the failure says
+    /// why.
+    ApplicationReading readApplication(const BundleFolder& folder);
 
   private:
     bool appendStamp(const BundleFolder& folder, std::string_view file, std::string& stamps);
@@ -74,7 +80,7 @@ class BundleReader {
     std::optional<Error> describePlugIn(const BundleFolder& folder, const Dictionary& info,
                                         PlugInEntry& entry);
     std::optional<Error> complete(Dictionary& info, const std::string& sdk);
-    Dictionary localizations(const BundleFolder& folder);
+    Result<Dictionary> localizations(const BundleFolder& folder);
 
     SdkDictionaries& sdks_;
     SdkMerge merge_;

@@ -29,10 +29,14 @@ const Log& ops() {
     return handle;
 }
 
-std::vector<std::string> applicationFolders(const Directories& directories) {
-    std::vector<std::string> folders{directories.zorvanData() + "/Applications"};
-    for (const std::string& folder : directories.dataDirs)
-        folders.push_back(folder + "/zorvan/Applications");
+ApplicationScanner::Folders scannedFolders(const Directories& directories) {
+    ApplicationScanner::Folders folders;
+    auto add = [&folders](const std::string& data) {
+        folders.applications.push_back(data + "/Applications");
+        folders.dictionaries.push_back(data + "/SDKs");
+    };
+    add(directories.zorvanData());
+    for (const std::string& folder : directories.dataDirs) add(folder + "/zorvan");
     return folders;
 }
 
@@ -41,7 +45,7 @@ std::vector<std::string> applicationFolders(const Directories& directories) {
 class DiskWorkspace final : public Workspace {
   public:
     DiskWorkspace(const Directories& directories, SdkDictionaries& sdks, SdkMerge merge,
-                  std::unique_ptr<Catalogue> catalogue);
+                  std::unique_ptr<Catalogue> catalogue, const WatchSettings& settings);
     ~DiskWorkspace() override;
 
     std::unique_ptr<Observation> addObserver(WorkspaceObserver& observer) override;
@@ -67,7 +71,9 @@ class DiskWorkspace final : public Workspace {
     std::optional<Error> afterFirstScan(const std::function<std::optional<Error>()>& work);
 
     void firstScan();
+    void rescan(const Scopes& touched);
     void publish(RegistryChanges& changes);
+    void publishSnapshot(const RegistryChanges& changes);
     void withdrawContainers(const std::set<std::string>& identifiers, RegistryChanges& changes);
     std::optional<Error> registerOnQueue(const std::string& bundlePath);
     std::optional<Error> unregisterOnQueue(const std::string& bundlePath);
@@ -86,7 +92,11 @@ class DiskWorkspace final : public Workspace {
     DataContainers containers_;
     bool isScanned_ = false;
     RegistryState state_;
+    std::shared_ptr<const Snapshot> published_;
+    FolderWatch watch_;
     ApplicationScanner scanner_;
+    const WatchSettings settings_;
+    std::unique_ptr<ChangeGatherer> gatherer_;  // from the first scan until the end
     std::vector<WorkspaceObserver*> observers_;
 
     SerialQueue queue_;  // the last member: nothing runs on it once the others go
@@ -107,17 +117,20 @@ class DiskWorkspace::DiskObservation final : public Workspace::Observation {
 };
 
 DiskWorkspace::DiskWorkspace(const Directories& directories, SdkDictionaries& sdks, SdkMerge merge,
-                             std::unique_ptr<Catalogue> catalogue)
+                             std::unique_ptr<Catalogue> catalogue, const WatchSettings& settings)
     : sdks_(sdks),
       catalogue_(std::move(catalogue)),
       reader_(sdks, std::move(merge), userLanguages()),
       containers_(joinPath(directories.zorvanData(), "Containers")),
-      scanner_(state_, reader_, containers_, applicationFolders(directories)),
+      watch_(settings.mostWatches),
+      scanner_(state_, reader_, containers_, watch_, scannedFolders(directories)),
+      settings_(settings),
       queue_("tandry") {}
 
 DiskWorkspace::~DiskWorkspace() {
     closing_ = true;
     current_.close();
+    queue_.async([this] { gatherer_.reset(); });
 }
 
 /// Runs work on the registry's thread and waits for its answer.
@@ -148,16 +161,31 @@ void DiskWorkspace::firstScan() {
     EVLOG_INFO(ops(), "{} plug-ins in {} applications, {} new, {} gone", state_.plugIns.size(),
                state_.applications.size(), changes.installed.size(), changes.uninstalled.size());
     if (!changes.records()) publish(changes);
+    gatherer_ = std::make_unique<ChangeGatherer>(
+        queue_.runLoop(), watch_, settings_, [this](const Scopes& touched) { rescan(touched); });
     // The catalogue has told of a failure, and nobody waits for an answer.
     static_cast<void>(apply(changes));
 }
 
+void DiskWorkspace::rescan(const Scopes& touched) {
+    queue_.assertCurrent();
+    if (closing_) return;
+    RegistryChanges changes = scanner_.scanTouched(touched);
+    static_cast<void>(apply(changes));
+}
+
 void DiskWorkspace::publish(RegistryChanges& changes) {
-    current_.publish(std::make_shared<const Snapshot>(state_));
+    publishSnapshot(changes);
     const std::set<std::string> impossible = containers_.makeMissing();
     if (impossible.empty()) return;
     withdrawContainers(impossible, changes);
-    current_.publish(std::make_shared<const Snapshot>(state_));
+    publishSnapshot(changes);
+}
+
+void DiskWorkspace::publishSnapshot(const RegistryChanges& changes) {
+    published_ = published_ ? std::make_shared<const Snapshot>(*published_, state_, changes)
+                            : std::make_shared<const Snapshot>(state_);
+    current_.publish(published_);
 }
 
 /// Records that were published are what they are: others take their places.
@@ -179,6 +207,7 @@ void DiskWorkspace::withdrawContainers(const std::set<std::string>& identifiers,
 /// The record that goes is hidden before its observers hear of it, so that what they drop is not
 /// built again; the catalogue changes after them. The error says why it did not.
 std::optional<Error> DiskWorkspace::apply(RegistryChanges& changes) {
+    gatherer_->walkEnded(scanner_.isComplete());
     if (changes.records()) publish(changes);
     if (!changes.uninstalled.empty())
         for (WorkspaceObserver* observer : observers_)
@@ -327,11 +356,12 @@ std::optional<Error> DiskWorkspace::unregisterOnQueue(const std::string& bundleP
 }  // namespace
 
 Result<std::unique_ptr<Workspace>> openDiskWorkspace(const Directories& directories,
-                                                     SdkDictionaries& sdks, SdkMerge merge) {
+                                                     SdkDictionaries& sdks, SdkMerge merge,
+                                                     const WatchSettings& settings) {
     Result<std::unique_ptr<Catalogue>> catalogue = Catalogue::open(directories.zorvanData());
     if (!catalogue) return catalogue.error();
     return std::unique_ptr<Workspace>(std::make_unique<DiskWorkspace>(
-        directories, sdks, std::move(merge), std::move(*catalogue)));
+        directories, sdks, std::move(merge), std::move(*catalogue), settings));
 }
 
 }  // namespace platform::tandry

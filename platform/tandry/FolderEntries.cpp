@@ -1,25 +1,21 @@
 #include "platform/tandry/FolderEntries.h"
 
 #include <fcntl.h>
+#include <fmt/format.h>
 #include <sys/stat.h>
 
 #include <algorithm>
 #include <cerrno>
+#include <filesystem>
 #include <optional>
 
 #include "platform/Files.h"
-#include "platform/Log.h"
 #include "platform/Utf8.h"
 #include "platform/Value.h"
 
 namespace platform::tandry {
 
 namespace {
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 bool isDirectory(const std::string& path) {
     struct stat status;
@@ -33,16 +29,22 @@ bool isLink(int directory, const dirent& entry) {
            S_ISLNK(status.st_mode);
 }
 
-void add(FolderEntries& found, const std::string& folder, const dirent& entry) {
+void add(FolderEntries& found, const std::filesystem::path& folder, const dirent& entry,
+         FolderWatch& watch, Complaints& complaints) {
     if (entry.d_name[0] == '.' ||
         (entry.d_type != DT_DIR && entry.d_type != DT_LNK && entry.d_type != DT_UNKNOWN))
         return;
-    std::string path = joinPath(folder, entry.d_name);
+    std::string path = joinPath(folder.native(), entry.d_name);
     std::string target;
     if (isLink(found.directory(), entry)) {
+        watch.markWay(path);
         std::optional<std::string> canonical = canonicalPath(path);
         if (!canonical) {
-            EVLOG_ERROR(ops(), "skipping {}: a link that cannot be resolved", pub(path));
+            complaints.add(path, fmt::format("skipping {}: a link that cannot be resolved", path));
+            std::error_code ignored;
+            const auto end = std::filesystem::read_symlink(path, ignored);
+            const auto missing = std::filesystem::weakly_canonical(folder / end, ignored);
+            found.nowhere.push_back(missing.string());
             return;
         }
         target = *canonical;
@@ -52,8 +54,9 @@ void add(FolderEntries& found, const std::string& folder, const dirent& entry) {
     if (isUsablePath(real))
         found.entries.push_back({entry.d_name, std::move(target)});
     else
-        EVLOG_ERROR(ops(), "skipping {}: its path is not UTF-8 text, or has control characters",
-                    pub(real));
+        complaints.add(
+            real, fmt::format("skipping {}: its path is not UTF-8 text, or has control characters",
+                              real));
 }
 
 }  // namespace
@@ -64,13 +67,14 @@ bool isUsablePath(const std::string& path) {
            isPropertyList(Value(path));
 }
 
-Result<FolderEntries> FolderEntries::read(const std::string& path) {
+Result<FolderEntries> FolderEntries::read(const std::string& path, FolderWatch& watch,
+                                          Complaints& complaints) {
     FolderEntries found;
     found.stream.reset(::opendir(path.c_str()));
     if (!found.stream) return Error::posix(errno, path);
     errno = 0;
     while (const dirent* entry = ::readdir(found.stream.get())) {
-        add(found, path, *entry);
+        add(found, path, *entry, watch, complaints);
         errno = 0;
     }
     if (errno != 0) return Error::posix(errno, path);

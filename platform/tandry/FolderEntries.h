@@ -7,6 +7,8 @@
 #include <vector>
 
 #include "platform/Error.h"
+#include "platform/tandry/Complaints.h"
+#include "platform/tandry/FolderWatch.h"
 
 namespace platform::tandry {
 
@@ -22,13 +24,16 @@ struct FolderEntries {
     };
     std::unique_ptr<DIR, Closer> stream;
     std::vector<Entry> entries;
+    std::vector<std::string> nowhere;  // where links that cannot be resolved would lead
 
     /// The open directory, owned here.
     int directory() const { return ::dirfd(stream.get()); }
 
     /// Reads the directory at a canonical path. Links that lead nowhere, or to no directory, are
-    /// left out; the first kind is logged. Error: the system's.
-    static Result<FolderEntries> read(const std::string& path);
+    /// left out; the first kind is logged. Where links lead is marked in `watch`. Error: the
+    /// system's.
+    static Result<FolderEntries> read(const std::string& path, FolderWatch& watch,
+                                      Complaints& complaints);
 };
 
 /// Whether a path can stand in messages: valid UTF-8 without ASCII control characters.

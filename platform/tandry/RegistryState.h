@@ -94,14 +94,20 @@ inline bool isWithin(const std::string& path, const std::string& scope) {
     return path.starts_with(scope) && (path.size() == scope.size() || path[scope.size()] == '/');
 }
 
-/// Calls `visit` with the iterator of every entry of `map` within `scope` ("" is everything). The
-/// visitor may erase that entry.
-template <class Map, class Visit>
-void forEachWithin(Map& map, const std::string& scope, Visit visit) {
-    for (auto next = map.lower_bound(scope); next != map.end();) {
+/// Calls `visit` with the iterator of every entry of a map or set of paths within `scope` ("" is
+/// everything). The visitor may erase that entry.
+template <class Container, class Visit>
+void forEachWithin(Container& container, const std::string& scope, Visit visit) {
+    auto pathOf = [](const auto& entry) -> const std::string& {
+        if constexpr (requires { entry.first; })
+            return entry.first;
+        else
+            return entry;
+    };
+    for (auto next = container.lower_bound(scope); next != container.end();) {
         auto entry = next++;
-        if (!entry->first.starts_with(scope)) break;
-        if (scope.empty() || isWithin(entry->first, scope)) visit(entry);
+        if (!pathOf(*entry).starts_with(scope)) break;
+        if (scope.empty() || isWithin(pathOf(*entry), scope)) visit(entry);
     }
 }
 

@@ -1,6 +1,8 @@
 #include "platform/tandry/Snapshot.h"
 
 #include <algorithm>
+#include <limits>
+#include <set>
 
 namespace platform::tandry {
 
@@ -51,6 +53,19 @@ void sortUnique(List& list) {
     list.erase(std::unique(list.begin(), list.end()), list.end());
 }
 
+constexpr std::uint32_t kGone = std::numeric_limits<std::uint32_t>::max();
+
+/// Adds what is left of an older sorted index, whose plug-ins have moved, to a sorted one. Moving
+/// does not change their order.
+template <class Index>
+void mergeMoved(const Index& older, const std::vector<std::uint32_t>& moved, Index& index) {
+    const auto fresh = static_cast<std::ptrdiff_t>(index.size());
+    index.reserve(index.size() + older.size());
+    for (const auto& [key, position] : older)
+        if (moved[position] != kGone) index.emplace_back(key, moved[position]);
+    std::inplace_merge(index.begin(), index.begin() + fresh, index.end());
+}
+
 std::string_view pathOf(const TDPlugInProxyRef& plugIn) {
     return *plugIn->bundlePath;
 }
@@ -81,21 +96,62 @@ std::uint64_t comparisonKey(std::string_view text) {
 Snapshot::Snapshot(const RegistryState& state) {
     plugIns_.reserve(state.plugIns.size());
     uuids_.reserve(state.plugIns.size());
-    for (const auto& [path, entry] : state.plugIns) {
+    for (const auto& [path, entry] : state.plugIns) append(entry);
+    sort();
+    copyApplications(state);
+}
+
+Snapshot::Snapshot(const Snapshot& before, const RegistryState& state,
+                   const RegistryChanges& changes) {
+    std::set<std::string_view> changed;
+    for (const TDPlugInProxyList* list : {&changes.installed, &changes.uninstalled})
+        for (const TDPlugInProxyRef& plugIn : *list) changed.insert(pathOf(plugIn));
+    plugIns_.reserve(before.plugIns_.size() + changed.size());
+    Positions moved(before.plugIns_.size(), kGone);  // from an old position to the new one
+    Position next = 0;
+    auto copyUntil = [&](Position end) {
+        const auto first = before.plugIns_.begin();
         auto position = static_cast<Position>(plugIns_.size());
-        const TDPlugInProxyRef& record = plugIns_.emplace_back(entry.record);
-        uuids_.emplace_back(record->plugInUuid, position);
-        for (std::string_view rest = entry.points; !rest.empty();) {
-            std::string_view point = rest.substr(0, rest.find('\0'));
-            points_.emplace_back(comparisonKey(point), position);
-            rest.remove_prefix(point.size() + 1);
-        }
-        if (record->plugInIdentifier)
-            identifiers_.emplace_back(comparisonKey(*record->plugInIdentifier), position);
+        plugIns_.insert(plugIns_.end(), first + next, first + end);
+        while (next < end) moved[next++] = position++;
+    };
+    for (std::string_view path : changed) {
+        auto place = std::ranges::lower_bound(before.plugIns_, path, {},
+                                              [](const auto& plugIn) { return pathOf(plugIn); });
+        copyUntil(static_cast<Position>(place - before.plugIns_.begin()));
+        if (place != before.plugIns_.end() && pathOf(*place) == path) ++next;
+        auto found = state.plugIns.find(std::string(path));
+        if (found != state.plugIns.end()) append(found->second);
     }
+    copyUntil(static_cast<Position>(before.plugIns_.size()));
+    sort();
+    mergeMoved(before.uuids_, moved, uuids_);
+    mergeMoved(before.points_, moved, points_);
+    mergeMoved(before.identifiers_, moved, identifiers_);
+    copyApplications(state);
+}
+
+/// Adds a plug-in, and its entries at the ends of the indexes.
+void Snapshot::append(const PlugInEntry& entry) {
+    const auto position = static_cast<Position>(plugIns_.size());
+    const TDPlugInProxyRef& record = plugIns_.emplace_back(entry.record);
+    uuids_.emplace_back(record->plugInUuid, position);
+    for (std::string_view rest = entry.points; !rest.empty();) {
+        std::string_view point = rest.substr(0, rest.find('\0'));
+        points_.emplace_back(comparisonKey(point), position);
+        rest.remove_prefix(point.size() + 1);
+    }
+    if (record->plugInIdentifier)
+        identifiers_.emplace_back(comparisonKey(*record->plugInIdentifier), position);
+}
+
+void Snapshot::sort() {
     std::ranges::sort(uuids_);
     sortUnique(points_);
     sortUnique(identifiers_);
+}
+
+void Snapshot::copyApplications(const RegistryState& state) {
     applications_.reserve(state.applications.size());
     for (const auto& [path, entry] : state.applications) applications_.push_back(entry.record);
 }

@@ -20,6 +20,9 @@ std::uint64_t comparisonKey(std::string_view text);
 class Snapshot {
   public:
     explicit Snapshot(const RegistryState& state);
+    /// The same for a state that differs from the one of `before` by `changes`, at a fraction of
+    /// the cost.
+    Snapshot(const Snapshot& before, const RegistryState& state, const RegistryChanges& changes);
 
     /// In the order of their paths.
     const TDPlugInProxyList& plugIns() const { return plugIns_; }
@@ -39,6 +42,9 @@ class Snapshot {
     using Positions = std::vector<Position>;
 
     std::optional<Positions> find(const Index& index, const Value* pattern) const;
+    void append(const PlugInEntry& entry);
+    void sort();
+    void copyApplications(const RegistryState& state);
 
     TDPlugInProxyList plugIns_;
     std::vector<TDApplicationProxyRef> applications_;  // in the order of their paths

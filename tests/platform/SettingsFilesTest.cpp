@@ -160,6 +160,38 @@ TEST_F(SettingsFiles, PreferencesSeeWhatOthersWrite) {
     EXPECT_EQ(errors_, 3);
 }
 
+TEST_F(SettingsFiles, PreferencesAreEditedOneAfterTheOtherAndNeverLost) {
+    const Preferences preferences(directories_);
+    const auto append = [&](const char* item) {
+        return preferences.edit("d", [item](Dictionary& stored) {
+            const Value* list = stored.find("list");
+            Array items = list ? *list->array() : Array();
+            items.append(item);
+            stored.set("list", items);
+            return true;
+        });
+    };
+    EXPECT_FALSE(preferences.edit("d", [](Dictionary& stored) { return !stored.empty(); }));
+    EXPECT_EQ(fileStamp(preferences.path("d")).text, "") << "nothing was to be written";
+    const std::string file =
+        "config/" + preferences.path("d").substr(files_.path("config/").size());
+    write(file, Dictionary{{"other", true}});
+    std::vector<std::thread> editors;
+    for (int i = 0; i < 4; ++i)
+        editors.emplace_back([&] {
+            for (int edit = 0; edit < 10; ++edit) EXPECT_FALSE(append("item"));
+        });
+    for (std::thread& editor : editors) editor.join();
+    EXPECT_EQ(preferences.read("d")->find("list")->array()->size(), 40u);
+    EXPECT_EQ(*preferences.read("d")->find("other"), Value(true));
+
+    for (const char* bytes : {"garbage", "<plist><array/></plist>", ""}) {
+        files_.write(file, bytes);
+        EXPECT_TRUE(append("item"));
+        EXPECT_EQ(*readFile(preferences.path("d"), 100), bytes);
+    }
+}
+
 TEST_F(SettingsFiles, StampsSettleAfterAChange) {
     const std::string file = files_.path("file");
     do {

@@ -8,6 +8,7 @@
 #include "tools/zrctl/Outcome.h"
 #include "tools/zrctl/RegistrationCommands.h"
 #include "tools/zrctl/Rules.h"
+#include "tools/zrctl/ShellWord.h"
 #include "tools/zrctl/Table.h"
 #include "tools/zrctl/Terminal.h"
 
@@ -56,7 +57,7 @@ TEST(Rules, ARepeatedKeyGivesTheListOfItsPatterns) {
     const auto rules = parseRules({"K=a", "Other=x", "K=true", "K=c"});
     ASSERT_TRUE(rules);
     EXPECT_EQ(*rules, (Dictionary{{"K", Array{"a", true, "c"}}, {"Other", "x"}}));
-    EXPECT_EQ(mergeRules({{"K", "file"}, {"Kept", "file"}}, *rules),
+    EXPECT_EQ(merged({{"K", "file"}, {"Kept", "file"}}, *rules),
               (Dictionary{{"K", Array{"a", true, "c"}}, {"Kept", "file"}, {"Other", "x"}}));
 }
 
@@ -66,6 +67,37 @@ TEST(Rules, WhatIsNoRuleIsRefusedWithItsText) {
     const auto slip = parseRules({"Version>=1.2"});
     ASSERT_FALSE(slip);
     EXPECT_THAT(slip.error().text, HasSubstr("Version=>=1.2"));
+}
+
+TEST(Rules, TheirTextsAreTheRulesAgain) {
+    for (const auto& texts : std::vector<std::vector<std::string>>{
+             {"A=b", "A=c", "Dark=false", "Multi=true", "V=>=1.2"}, {"Title==true"}, {"Empty="}}) {
+        EXPECT_EQ(ruleTexts(*parseRules(texts)), texts);
+    }
+    EXPECT_EQ(ruleTexts({{"A", 1}, {"B", 0}, {"C", "true"}, {"D", Array{"false", 7}}}),
+              (std::vector<std::string>{"A=true", "B=false", "C==true", "D==false", "D=7"}));
+    EXPECT_EQ(ruleTexts({}), std::vector<std::string>{""});
+    EXPECT_EQ(ruleTexts({{"A", Array{}}}), std::vector<std::string>{"A=[]"});
+}
+
+TEST_F(Terminal, WordsAreQuotedForTheShellAsFarAsNeeded) {
+    EXPECT_EQ(shellWord("Key.a-b=1,2"), "Key.a-b=1,2");
+    EXPECT_EQ(shellWord(""), "''");
+    EXPECT_EQ(shellWord("V=>=1"), "'V=>=1'");
+    EXPECT_EQ(shellWord("it's ü"), "'it'\\''s ü'");
+    EXPECT_EQ(shellWord("a\n'\\\u202e"), "$'a\\012\\047\\134\\342\\200\\256'");
+}
+
+TEST(CommandLine, ChoicesAndExclusionsSayWhatIsMeant) {
+    const auto elected = parse({"elect", "ignore", "a", "b", "-S", "other"});
+    ASSERT_TRUE(std::holds_alternative<Options>(elected));
+    EXPECT_EQ(std::get<Options>(elected).election, 2);
+    EXPECT_EQ(std::get<Options>(elected).plugIns, (std::vector<std::string>{"a", "b"}));
+    EXPECT_EQ(std::get<Options>(elected).service, "other");
+    const auto excluded = parse({"exclude", "remove", "A=b", "C=<>d"});
+    ASSERT_TRUE(std::holds_alternative<Options>(excluded));
+    EXPECT_EQ(std::get<Options>(excluded).command, Options::Command::ExcludeRemove);
+    EXPECT_EQ(std::get<Options>(excluded).rules, (std::vector<std::string>{"A=b", "C=<>d"}));
 }
 
 TEST(CommandLine, MatchTakesRulesAndOptionsInAnyOrder) {
@@ -83,8 +115,18 @@ TEST(CommandLine, MatchTakesRulesAndOptionsInAnyOrder) {
 
 TEST(CommandLine, WrongUsageIsStatusTwo) {
     testing::internal::CaptureStderr();
-    for (const auto& arguments : std::vector<std::vector<const char*>>{
-             {}, {"find"}, {"add"}, {"match", "--json", "--long"}, {"match", "--no-such"}, {"-S"}})
+    for (const auto& arguments :
+         std::vector<std::vector<const char*>>{{},
+                                               {"find"},
+                                               {"add"},
+                                               {"match", "--json", "--long"},
+                                               {"match", "--no-such"},
+                                               {"-S"},
+                                               {"elect", "use"},
+                                               {"elect", "never", "a"},
+                                               {"annotate"},
+                                               {"exclude"},
+                                               {"exclude", "add"}})
         EXPECT_EQ(std::get<int>(parse(arguments)), kUsageError);
     testing::internal::GetCapturedStderr();
     testing::internal::CaptureStdout();

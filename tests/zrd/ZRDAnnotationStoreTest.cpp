@@ -121,6 +121,39 @@ TEST_F(AnnotationStoreTest, ChangesMergeAndNoneRemoves) {
     EXPECT_EQ(*root().find("data"), Value(Dictionary()));
 }
 
+TEST_F(AnnotationStoreTest, WhatIsWrittenPieceByPieceIsWhatWouldBeWrittenAtOnce) {
+    open();
+    Dictionary expected;
+    const auto change = [&](const char* key, std::optional<Dictionary> extension) {
+        const std::optional<Dictionary> annotation =
+            extension ? std::optional(Dictionary{{"extension", *extension}}) : std::nullopt;
+        store_->setAnnotation(annotation, *plugIn(key));
+        if (annotation)
+            expected.set(key, *annotation);
+        else
+            expected.remove(key);
+        EXPECT_EQ(text(),
+                  *platform::writeXmlPropertyList(Dictionary{{"version", 16}, {"data", expected}}))
+            << key;
+    };
+    const Dictionary deep{{"a", Dictionary{{"b", Dictionary{{"c", Array{Dictionary()}}}}}}};
+    const Dictionary sly{{"\n\t\t<key>", "\n\t</dict>\n"}, {"data", platform::Data("\n\t\t<key>")}};
+    for (int run : {1, 2}) {
+        change("m", Dictionary());
+        change("z", sly);
+        change("\n\t\t<key>m&", deep);
+        change("a", sly);
+        change("m", deep);
+        change("none", std::nullopt);
+        change("z", std::nullopt);
+        if (run == 1) open();
+    }
+    for (const char* key : {"a", "m", "\n\t\t<key>m&"}) change(key, std::nullopt);
+    change("m", sly);
+    open();
+    EXPECT_EQ(store_->annotations(), expected);
+}
+
 TEST_F(AnnotationStoreTest, AFailedSaveKeepsTheChangeForTheNextOne) {
     directory_.makeDirectory("Annotations");  // nothing can be written in its place
     LogLines log;

@@ -1,34 +1,19 @@
 #include "tools/zrctl/MatchCommand.h"
 
-#include <fmt/core.h>
-
-#include "Zorvan/Keys.h"
+#include "platform/DictionaryFile.h"
 #include "platform/PropertyList.h"
 #include "tools/zrctl/Json.h"
 #include "tools/zrctl/Listing.h"
 #include "tools/zrctl/Rules.h"
 #include "tools/zrctl/Session.h"
 
+using platform::Array;
 using platform::Dictionary;
-using platform::Error;
-using platform::Message;
 using platform::Result;
-using platform::Value;
 
 namespace zrctl {
 
 namespace {
-
-Result<Listing> ask(const std::string& service, const Dictionary& rules, std::uint64_t flags) {
-    Session session(service);
-    const Result<Message> reply = session.ask(
-        [&](auto& client, const auto& callback) { client.matchPlugIns(rules, flags, callback); });
-    if (!reply) return reply.error();
-    const Value* packed = reply->find(zorvan::message::kMatches);
-    const std::optional<Value> forms = packed ? session.unpack(*packed) : std::nullopt;
-    if (!forms || !forms->array()) return Error{"zrctl", 0, "zrd's reply has no list of matches"};
-    return Listing(*forms->array());
-}
 
 Outcome present(const Listing& listing, Format format) {
     Outcome outcome;
@@ -54,13 +39,14 @@ Outcome runMatch(const Options& options) {
     if (!given) return Outcome::usage(given.error().text);
     Dictionary rules;
     if (options.rulesFile) {
-        const Result<Dictionary> file = readRulesFile(*options.rulesFile);
+        const Result<Dictionary> file = platform::readDictionaryFile(*options.rulesFile);
         if (!file) return Outcome::failure(file.error().text);
         rules = *file;
     }
-    const Result<Listing> listing = ask(options.service, mergeRules(rules, *given), options.flags);
-    if (!listing) return Outcome::failure(listing.error().text);
-    return present(*listing, options.format);
+    const Result<Array> forms =
+        Session(options.service).match(merged(rules, *given), options.flags);
+    if (!forms) return Outcome::failure(forms.error().text);
+    return present(Listing(*forms), options.format);
 }
 
 }  // namespace zrctl

@@ -2,6 +2,8 @@
 
 #include <CLI/CLI.hpp>
 
+#include <string>
+
 #include "Zorvan/Keys.h"
 #include "tools/zrctl/Outcome.h"
 
@@ -21,6 +23,27 @@ and a text:
 The same KEY given again adds an alternative. Quote rules with "<", ">" and "?" for the shell.
 
 Exit status: 0 plug-ins found; 1 none found; 2 wrong usage; 3 failure.)";
+
+constexpr const char* kPlugInFooter =
+    R"(PLUGIN is the UUID of a plug-in (zrctl match --long shows it) or its identifier, when just one plug-in
+has that; one that is excluded can only be named by its UUID. Plug-ins are changed in their order, up
+to the first that the daemon does not know.
+
+Exit status: 0 done; 1 no such plug-in; 2 wrong usage; 3 failure.)";
+
+constexpr const char* kAnnotateFooter =
+    R"(An argument with "=" is a pair, every other one names a plug-in. VALUE is "true" or "false", which
+become booleans, or a text; the same KEY given again makes a list. Other keys that the plug-ins have
+stay, unless --replace is given: then the pairs are all that they have.
+
+)";
+
+constexpr const char* kExcludeFooter =
+    R"(A rule is one or more KEY=PATTERN, as "zrctl match --help" explains; a plug-in that fits all of them is
+excluded, whoever asks. "list" writes each rule on a line, as "remove" takes it. Nothing else in the
+preferences is touched. The daemon need not run; it sees the change at its next match.
+
+Exit status: 0 done; 1 no such rule, or none; 2 wrong usage; 3 failure.)";
 
 constexpr const char* kFooter =
     "Exit status: 0 done, or plug-ins found; 1 none found; 2 wrong usage; 3 failure.";
@@ -71,6 +94,56 @@ void addRegistration(CLI::App& app, Options& options, Options::Command command, 
     subcommand->callback([&options, command] { options.command = command; });
 }
 
+void addElect(CLI::App& app, Options& options) {
+    CLI::App* elect = app.add_subcommand("elect", "Choose which plug-ins are used");
+    elect->footer(kPlugInFooter);
+    const auto choose = [&options](const std::string& choice) {
+        options.election = choice == "use" ? 1 : choice == "ignore" ? 2 : 0;
+    };
+    elect->add_option_function<std::string>("choice", choose, "What hosts shall do with them")
+        ->check(CLI::IsMember({"use", "ignore", "default"}))
+        ->type_name("CHOICE")
+        ->required();
+    elect->add_option("plugin", options.plugIns, "The plug-ins")->type_name("PLUGIN")->required();
+    elect->callback([&options] { options.command = Options::Command::Elect; });
+}
+
+void addAnnotate(CLI::App& app, Options& options) {
+    CLI::App* annotate =
+        app.add_subcommand("annotate", "Keep data with plug-ins, in their annotation's extension");
+    annotate->footer(std::string(kAnnotateFooter) + kPlugInFooter);
+    annotate->add_option("argument", options.plugIns, "The plug-ins, and the data to keep")
+        ->type_name("PLUGIN... KEY=VALUE...")
+        ->required();
+    annotate->add_flag("--replace", options.replace, "Drop the keys that are not given");
+    annotate->callback([&options] { options.command = Options::Command::Annotate; });
+}
+
+void addWatch(CLI::App& app, Options& options) {
+    app.add_subcommand("watch", "Write a line whenever choices have changed, until interrupted")
+        ->callback([&options] { options.command = Options::Command::Watch; });
+}
+
+void addExclude(CLI::App& app, Options& options) {
+    using Command = Options::Command;
+    CLI::App* exclude =
+        app.add_subcommand("exclude", "Edit the rules that take plug-ins out of every match");
+    exclude->require_subcommand(1);
+    exclude->footer(kExcludeFooter);
+    const auto subcommand = [&](const char* name, Command command, const char* help) {
+        CLI::App* one = exclude->add_subcommand(name, help);
+        one->footer(kExcludeFooter);
+        one->callback([&options, command] { options.command = command; });
+        if (command == Command::ExcludeList) return;
+        one->add_option("rule", options.rules, "The pairs of one rule")
+            ->type_name("KEY=PATTERN")
+            ->required();
+    };
+    subcommand("list", Command::ExcludeList, "List the rules");
+    subcommand("add", Command::ExcludeAdd, "Add a rule, unless it is there");
+    subcommand("remove", Command::ExcludeRemove, "Remove a rule");
+}
+
 }  // namespace
 
 std::variant<Options, int> Options::parse(int argc, const char* const* argv) {
@@ -90,6 +163,10 @@ std::variant<Options, int> Options::parse(int argc, const char* const* argv) {
                     "Register plug-in bundles, or applications with all their plug-ins");
     addRegistration(app, options, Command::Remove, "remove",
                     "Unregister plug-in bundles, or applications with all their plug-ins");
+    addElect(app, options);
+    addAnnotate(app, options);
+    addWatch(app, options);
+    addExclude(app, options);
 
     try {
         app.parse(argc, argv);

@@ -13,19 +13,36 @@ enum class Format { Table, Long, Json, PropertyList };
 
 /// The command line, taken apart. A plain value.
 struct Options {
-    enum class Command { Match, Add, Remove };
+    enum class Command {
+        Match,
+        Add,
+        Remove,
+        Elect,
+        Annotate,
+        Watch,
+        ExcludeList,
+        ExcludeAdd,
+        ExcludeRemove
+    };
 
     std::string service;
     Command command = Command::Match;
 
-    // match
+    // match, exclude
     std::vector<std::string> rules;  // KEY=PATTERN, as given
+
+    // match
     std::optional<std::string> rulesFile;
     std::uint64_t flags = 0;
     Format format = Format::Table;
 
     // add, remove
     std::vector<std::string> paths;  // as given
+
+    // elect, annotate
+    std::vector<std::string> plugIns;  // as given; for annotate, with its KEY=VALUE among them
+    int election = 0;
+    bool replace = false;
 
     /// Reads the command line; or, when there is nothing (more) to do, the exit status: the help,
     /// the version or the complaint has been written then.

@@ -22,4 +22,8 @@ struct Outcome {
     static Outcome usage(std::string complaint) { return {kUsageError, {}, std::move(complaint)}; }
 };
 
+/// Writes a text to standard output, at once. Done, or why not; a reader that has gone away
+/// (`| head`) is no failure.
+Outcome writeOut(const std::string& text);
+
 }  // namespace zrctl

@@ -2,10 +2,11 @@
 
 #include <fmt/core.h>
 
+#include <optional>
 #include <string_view>
 
-#include "platform/PropertyList.h"
 #include "platform/Utf8.h"
+#include "platform/Value.h"
 
 using platform::Array;
 using platform::Dictionary;
@@ -21,53 +22,82 @@ Error ruleError(std::string text) {
     return {"zrctl", 0, std::move(text)};
 }
 
-Value pattern(std::string_view text) {
+Value valueOf(std::string_view text) {
     if (text == "true") return true;
     if (text == "false") return false;
     return text;
 }
 
-void addRule(Dictionary& rules, std::string_view key, Value value) {
-    const Value* existing = rules.find(key);
+void addPair(Dictionary& pairs, std::string_view key, Value value) {
+    const Value* existing = pairs.find(key);
     if (!existing) {
-        rules.set(key, std::move(value));
+        pairs.set(key, std::move(value));
         return;
     }
-    Array alternatives = existing->array() ? *existing->array() : Array{*existing};
-    alternatives.append(std::move(value));
-    rules.set(key, std::move(alternatives));
+    Array values = existing->array() ? *existing->array() : Array{*existing};
+    values.append(std::move(value));
+    pairs.set(key, std::move(values));
+}
+
+/// What is wrong with KEY<=PATTERN. No key ends so: the operator's own "=" was left out, and the
+/// rule would match nothing.
+std::optional<Error> misplacedOperator(const std::string& text) {
+    const std::size_t split = text.find('=');
+    if (split == std::string::npos || split == 0) return std::nullopt;
+    const std::size_t last = split - 1;
+    if (text[last] != '<' && text[last] != '>') return std::nullopt;
+    return ruleError(fmt::format("\"{}\": an operator follows the \"=\", as in {}={}", text,
+                                 text.substr(0, last), text.substr(last)));
+}
+
+std::string textOf(const Value& pattern) {
+    if (platform::equalsTrue(pattern)) return "true";
+    if (platform::equalsFalse(pattern)) return "false";
+    const std::string* text = pattern.string();
+    if (!text) return describe(pattern);
+    // The words would be read as booleans; with the operator they are the same pattern.
+    return *text == "true" || *text == "false" ? "=" + *text : *text;
 }
 
 }  // namespace
 
-Result<Dictionary> parseRules(const std::vector<std::string>& texts) {
-    Dictionary rules;
+Result<Dictionary> parsePairs(const std::vector<std::string>& texts) {
+    Dictionary pairs;
     for (const std::string& text : texts) {
         if (!platform::isValidUtf8(text))
             return ruleError(fmt::format("\"{}\" is not UTF-8 text", text));
         const std::size_t split = text.find('=');
         if (split == std::string::npos || split == 0)
-            return ruleError(fmt::format("\"{}\" is not of the form KEY=PATTERN", text));
-        const std::string_view key = std::string_view(text).substr(0, split);
-        // No key ends so: this is an operator whose "=" was left out, which would match nothing.
-        if (key.back() == '<' || key.back() == '>')
-            return ruleError(fmt::format("\"{}\": an operator follows the \"=\", as in {}={}", text,
-                                         key.substr(0, key.size() - 1),
-                                         text.substr(key.size() - 1)));
-        addRule(rules, key, pattern(std::string_view(text).substr(split + 1)));
+            return ruleError(fmt::format("\"{}\" is not of the form KEY=...", text));
+        if (!platform::isPropertyList(text))
+            return ruleError(fmt::format("\"{}\" has control characters", text));
+        addPair(pairs, text.substr(0, split), valueOf(std::string_view(text).substr(split + 1)));
     }
-    if (!platform::isPropertyList(rules)) return ruleError("a rule has control characters");
-    return rules;
+    return pairs;
 }
 
-Result<Dictionary> readRulesFile(const std::string& path) {
-    Result<Value> value = platform::readPropertyListFile(path);
-    if (!value) return value.error();
-    if (const Dictionary* rules = value->dictionary()) return *rules;
-    return ruleError(fmt::format("{}: not a dictionary of rules", path));
+Result<Dictionary> parseRules(const std::vector<std::string>& texts) {
+    for (const std::string& text : texts)
+        if (auto error = misplacedOperator(text)) return *error;
+    return parsePairs(texts);
 }
 
-Dictionary mergeRules(Dictionary base, const Dictionary& over) {
+std::vector<std::string> ruleTexts(const Dictionary& rules) {
+    std::vector<std::string> texts;
+    for (const auto& [key, pattern] : rules) {
+        const Array* alternatives = pattern.array();
+        if (!alternatives || alternatives->empty()) {
+            texts.push_back(key + '=' + textOf(pattern));
+            continue;
+        }
+        for (const Value& alternative : *alternatives)
+            texts.push_back(key + '=' + textOf(alternative));
+    }
+    if (texts.empty()) texts.emplace_back();
+    return texts;
+}
+
+Dictionary merged(Dictionary base, const Dictionary& over) {
     for (const auto& [key, value] : over) base.set(key, value);
     return base;
 }

@@ -2,6 +2,8 @@
 
 #include <future>
 
+#include "Zorvan/Keys.h"
+
 using platform::ConnectionError;
 using platform::Error;
 using zorvan::ZRDaemonClient;
@@ -34,6 +36,17 @@ platform::Result<platform::Message> Session::ask(const Question& question) {
     if (const auto refused = ZRDaemonClient::errorInReply(reply))
         return Error{refused->domain, refused->code, describe(*refused)};
     return std::get<platform::Message>(reply);
+}
+
+platform::Result<platform::Array> Session::match(const platform::Dictionary& rules,
+                                                 std::uint64_t flags) {
+    const platform::Result<platform::Message> reply = ask(
+        [&](auto& client, const auto& callback) { client.matchPlugIns(rules, flags, callback); });
+    if (!reply) return reply.error();
+    const platform::Value* packed = reply->find(zorvan::message::kMatches);
+    const auto forms = packed ? client_->convertFromLum(*packed) : std::nullopt;
+    if (!forms || !forms->array()) return Error{"zrctl", 0, "zrd's reply has no list of matches"};
+    return *forms->array();
 }
 
 }  // namespace zrctl

@@ -1,8 +1,8 @@
 #pragma once
 
+#include <cstdint>
 #include <functional>
 #include <memory>
-#include <optional>
 #include <string>
 
 #include "Zorvan/ZRDaemonClient.h"
@@ -23,10 +23,8 @@ class Session {
     /// or why there was no answer.
     platform::Result<platform::Message> ask(const Question& question);
 
-    /// Unpacks a value of a reply; none when it was not packed.
-    std::optional<platform::Value> unpack(const platform::Value& value) const {
-        return client_->convertFromLum(value);
-    }
+    /// The forms of the plug-ins that fit the rules; `flags`: ZRDiscover… in Zorvan/Keys.h.
+    platform::Result<platform::Array> match(const platform::Dictionary& rules, std::uint64_t flags);
 
   private:
     std::shared_ptr<zorvan::ZRDaemonClient> client_;

@@ -1,31 +1,46 @@
 #include <fmt/core.h>
 
-#include <cerrno>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
-#include <cstring>
 
+#include "tools/zrctl/AnnotationCommands.h"
+#include "tools/zrctl/ExcludeCommand.h"
 #include "tools/zrctl/MatchCommand.h"
 #include "tools/zrctl/Options.h"
 #include "tools/zrctl/Outcome.h"
 #include "tools/zrctl/RegistrationCommands.h"
 #include "tools/zrctl/Terminal.h"
+#include "tools/zrctl/WatchCommand.h"
 
 namespace {
 
 zrctl::Outcome run(const zrctl::Options& options) {
-    if (options.command == zrctl::Options::Command::Match) return zrctl::runMatch(options);
-    return zrctl::runRegistration(options);
+    using Command = zrctl::Options::Command;
+    switch (options.command) {
+        case Command::Match:
+            return zrctl::runMatch(options);
+        case Command::Add:
+        case Command::Remove:
+            return zrctl::runRegistration(options);
+        case Command::Elect:
+            return zrctl::runElect(options);
+        case Command::Annotate:
+            return zrctl::runAnnotate(options);
+        case Command::Watch:
+            return zrctl::runWatch();
+        case Command::ExcludeList:
+        case Command::ExcludeAdd:
+        case Command::ExcludeRemove:
+            return zrctl::runExclude(options);
+    }
+    return {};
 }
 
-/// Writes what a command has to say. A reader that has gone away (`| head`) is no failure.
+/// Writes what a command has to say.
 int finish(zrctl::Outcome outcome) {
-    const bool written = std::fwrite(outcome.output.data(), 1, outcome.output.size(), stdout) ==
-                             outcome.output.size() &&
-                         std::fflush(stdout) == 0;
-    if (!written && errno != EPIPE)
-        outcome = zrctl::Outcome::failure(std::string("cannot write: ") + std::strerror(errno));
+    const zrctl::Outcome written = zrctl::writeOut(outcome.output);
+    if (written.status != zrctl::kDone) outcome = written;
     if (!outcome.complaint.empty())
         fmt::print(stderr, "zrctl: {}\n", zrctl::terminal::safe(outcome.complaint));
     return outcome.status;

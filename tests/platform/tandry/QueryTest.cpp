@@ -156,5 +156,38 @@ TEST_F(RegistryTest, TheFilterSeesIdentifierAndEntitlements) {
     EXPECT_TRUE(workspace->plugInsMatching({{kPoint, "org"}}, nullptr)->empty());
 }
 
+TEST(Snapshot, ASuccessorIsAsOneMadeAnew) {
+    RegistryState state;
+    auto before = std::make_unique<const Snapshot>(state);
+    std::mt19937 random(3);
+    for (int round = 0; round < 200; ++round) {
+        RegistryChanges changes;
+        for (std::size_t i = 0; i < random() % 4; ++i) {
+            const std::string path = "/" + std::to_string(random() % 20);
+            if (auto found = state.plugIns.find(path); found != state.plugIns.end()) {
+                changes.uninstalled.push_back(found->second.record);
+                state.plugIns.erase(found);
+            }
+            if (random() % 3 == 0) continue;
+            PlugInEntry& entry = state.plugIns[path];
+            entry.record = std::make_shared<TDPlugInProxy>();
+            entry.record->plugInUuid = Uuid::random();
+            entry.record->bundlePath = path;
+            entry.record->plugInIdentifier = std::to_string(random() % 3);
+            entry.points = std::string("p") + (random() % 2 ? "1" : "2") + '\0';
+            changes.installed.push_back(entry.record);
+        }
+        auto after = std::make_unique<const Snapshot>(*before, state, changes);
+        const Snapshot anew(state);
+        ASSERT_EQ(after->plugIns(), anew.plugIns());
+        for (const TDPlugInProxyRef& plugIn : anew.plugIns())
+            ASSERT_EQ(after->plugInWithUuid(plugIn->plugInUuid), plugIn);
+        for (const Dictionary& query : {Dictionary{{"VXExtensionIdentifier", "1"}},
+                                        Dictionary{{"VXExtensionPointIdentifier", "p2"}}})
+            ASSERT_EQ(after->candidates(query), anew.candidates(query));
+        before = std::move(after);
+    }
+}
+
 }  // namespace
 }  // namespace platform::tandry

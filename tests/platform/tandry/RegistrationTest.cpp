@@ -147,13 +147,21 @@ TEST_F(RegistryTest, WhatIsForgottenStaysSoWhileItCannotBeRead) {
         EXPECT_THAT(failure->text, HasSubstr("Too many open files"));
     }
     EXPECT_THAT(installed(), ElementsAre("b"));
-    // As a volume that is not mounted.
-    fs::rename(files.path("opt"), files.path("away"));
-    start();
-    EXPECT_THAT(installed(), IsEmpty());
-    fs::rename(files.path("away"), files.path("opt"));
-    start();
-    EXPECT_THAT(installed(), ElementsAre("b"));
+    // As a volume that is not mounted, reached by registration or by a link.
+    files.makeDirectory(apps);
+    for (int i = 0; i < 2; ++i) {
+        fs::rename(files.path("opt"), files.path("away"));
+        start();
+        EXPECT_THAT(installed(), IsEmpty());
+        fs::rename(files.path("away"), files.path("opt"));
+        start();
+        EXPECT_THAT(installed(), ElementsAre("b"));
+        if (i != 0) continue;
+        fs::create_symlink("../../../opt/A.app", files.path(apps + "Link.app"));
+        start();
+        EXPECT_EQ(workspace->unregisterPlugIn(app), std::nullopt);
+        EXPECT_EQ(workspace->registerPlugIn(files.path("opt/A.app/PlugIns/B.appex")), std::nullopt);
+    }
 }
 
 }  // namespace

@@ -3,9 +3,11 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <condition_variable>
 #include <future>
 #include <map>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -18,7 +20,7 @@
 
 namespace platform::tandry {
 
-/// Collects what an observer is told: "+identifier" and "-identifier".
+/// Collects what an observer is told: "+identifier" and "-identifier". Usable from any thread.
 class Recorder : public WorkspaceObserver {
   public:
     void pluginsDidInstall(const TDPlugInProxyList& plugIns) override { add("+", plugIns); }
@@ -26,18 +28,38 @@ class Recorder : public WorkspaceObserver {
         add("-", plugIns);
         // Hidden before the observers hear of it.
         for (const auto& plugIn : plugIns)
-            if (workspace->plugInWithUuid(plugIn->plugInUuid)) events.push_back("visible");
+            if (workspace->plugInWithUuid(plugIn->plugInUuid)) add("visible ", {plugIn});
     }
-    std::vector<std::string> take() { return std::exchange(events, {}); }
+    std::vector<std::string> take() {
+        std::scoped_lock lock(mutex_);
+        return std::exchange(events_, {});
+    }
+    /// Waits until the condition holds, which is looked at after each event; answers whether it
+    /// does. It must not use this object.
+    template <class Condition>
+    bool waitUntil(Condition condition) {
+        std::unique_lock lock(mutex_);
+        return changed_.wait_for(lock, std::chrono::seconds(30), condition);
+    }
+    /// Waits for so many events, and answers all.
+    std::vector<std::string> take(std::size_t count) {
+        waitUntil([&] { return events_.size() >= count; });
+        return take();
+    }
 
     Workspace* workspace = nullptr;
-    std::vector<std::string> events;
 
   private:
     void add(const char* sign, const TDPlugInProxyList& plugIns) {
+        std::scoped_lock lock(mutex_);
         for (const auto& plugIn : plugIns)
-            events.push_back(sign + plugIn->plugInIdentifier.value_or("?"));
+            events_.push_back(sign + plugIn->plugInIdentifier.value_or("?"));
+        changed_.notify_all();
     }
+
+    std::mutex mutex_;  // guards events_
+    std::condition_variable changed_;
+    std::vector<std::string> events_;
 };
 
 /// A registry over a directory of its own.
@@ -54,15 +76,17 @@ class RegistryTest : public testing::Test {
         stop();
         merges = 0;
         sdks = std::make_unique<SdkDictionaries>(directories);
-        auto opened = openDiskWorkspace(directories, *sdks,
-                                        [this](const Dictionary& sdk, const Dictionary& infoPlist) {
-                                            ++merges;
-                                            if (onMerge) onMerge();
-                                            Dictionary merged = infoPlist;
-                                            for (const auto& [key, value] : sdk)
-                                                if (!merged.contains(key)) merged.set(key, value);
-                                            return merged;
-                                        });
+        auto opened = openDiskWorkspace(
+            directories, *sdks,
+            [this](const Dictionary& sdk, const Dictionary& infoPlist) {
+                ++merges;
+                if (onMerge) onMerge();
+                Dictionary merged = infoPlist;
+                for (const auto& [key, value] : sdk)
+                    if (!merged.contains(key)) merged.set(key, value);
+                return merged;
+            },
+            watching);
         ASSERT_TRUE(opened) << opened.error().text;
         workspace = std::move(*opened);
         recorder.workspace = workspace.get();
@@ -111,6 +135,8 @@ class RegistryTest : public testing::Test {
     }
 
     const std::string apps = "home/zorvan/Applications/";
+    /// Nothing is noticed by itself, unless a test wants that.
+    WatchSettings watching{.quiet = std::chrono::hours(1), .longest = std::chrono::hours(1)};
     test::TemporaryDirectory files;
     Directories directories;
     std::unique_ptr<SdkDictionaries> sdks;

@@ -1,0 +1,211 @@
+#include "platform/tandry/FolderWatch.h"
+
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <cstring>
+#include <filesystem>
+#include <utility>
+
+#include "platform/Error.h"
+#include "platform/Files.h"
+#include "platform/Log.h"
+#include "platform/tandry/RegistryState.h"
+
+namespace platform::tandry {
+
+namespace {
+
+constexpr std::uint32_t kEntries = IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO;
+constexpr std::uint32_t kSelf = IN_DELETE_SELF | IN_MOVE_SELF | IN_ATTRIB;
+constexpr std::uint32_t kContent = IN_MODIFY | IN_CLOSE_WRITE;
+
+constexpr std::size_t kBufferSize = 64u << 10;
+/// Buffers that one call reads at most, so that a flood does not hold up the thread.
+constexpr int kMostBuffers = 32;
+constexpr int kMostLinks = 40;
+
+const Log& ops() {
+    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
+    return handle;
+}
+
+bool isShortage(int errnum) {
+    return errnum == ENOSPC || errnum == ENOMEM || errnum == EMFILE || errnum == ENFILE;
+}
+
+bool isRealDirectory(const std::string& path) {
+    struct stat status;
+    return ::lstat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
+}
+
+/// Takes the first component off a path.
+std::string takeComponent(std::string& path) {
+    const std::size_t begin = path.find_first_not_of('/');
+    if (begin == std::string::npos) {
+        path.clear();
+        return {};
+    }
+    const std::size_t end = std::min(path.find('/', begin), path.size());
+    std::string component = path.substr(begin, end - begin);
+    path.erase(0, end);
+    return component;
+}
+
+}  // namespace
+
+void FolderWatch::beginWalk(bool overEverything) {
+    ++walk_;
+    isOverEverything_ = overEverything;
+    shortage_ = 0;
+    if (inotify_) return;
+    inotify_.reset(::inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
+    if (!inotify_) shortage_ = errno;
+}
+
+void FolderWatch::markContents(const std::string& path, const std::string& scope) {
+    mark(path, {Kind::Contents, {}, scope});
+}
+
+void FolderWatch::markEntries(const std::string& path, std::string_view suffix) {
+    mark(path, {Kind::Entries, std::string(suffix), path});
+}
+
+void FolderWatch::markWay(const std::string& path) {
+    std::string way = "/";
+    std::string rest = path;
+    int links = 0;
+    for (std::string name = takeComponent(rest); !name.empty(); name = takeComponent(rest)) {
+        if (name == ".") continue;
+        if (name == "..") {
+            way = parentPath(way);
+            continue;
+        }
+        const std::string next = joinPath(way, name);
+        bool isDirectory = isRealDirectory(next);
+        if (!isDirectory) {
+            mark(way, {Kind::Name, name, {}});
+            // It may have come before its directory was watched.
+            isDirectory = isRealDirectory(next);
+        }
+        if (isDirectory) {
+            // Being renamed shows on a directory itself, without the bustle around it.
+            if (!rest.empty()) mark(next, {Kind::Self, {}, {}});
+            way = next;
+            continue;
+        }
+        std::error_code failure;
+        const std::filesystem::path target = std::filesystem::read_symlink(next, failure);
+        if (failure || ++links > kMostLinks) return;
+        if (target.is_absolute()) way = "/";
+        rest.insert(0, '/' + target.string());
+    }
+}
+
+void FolderWatch::mark(const std::string& path, Reason reason) {
+    auto known = paths_.find(path);
+    const Descriptor before = known == paths_.end() ? -1 : known->second;
+    if (known != paths_.end()) {
+        const Watched& watched = watches_.at(before);
+        if (watched.walk == walk_ && watched.reasons.contains(reason)) return;
+    }
+    // Asked for each time: another directory may have taken the place of the one that is known.
+    const Descriptor descriptor = add(path, reason.kind, before >= 0);
+    if (before >= 0 && before != descriptor) release(known);
+    if (descriptor < 0) return;
+    Watched& watched = watches_[descriptor];
+    if (watched.path != path) {
+        // The directory was renamed, and the change of its old path is still to be read.
+        paths_.erase(watched.path);
+        watched.path = path;
+        paths_[path] = descriptor;
+    }
+    if (std::exchange(watched.walk, walk_) != walk_ && isOverEverything_) watched.reasons.clear();
+    watched.reasons.insert(std::move(reason));
+}
+
+FolderWatch::Descriptor FolderWatch::add(const std::string& path, Kind kind, bool isKnown) {
+    if (!inotify_) return -1;
+    std::uint32_t mask = IN_ONLYDIR | IN_MASK_ADD | kSelf;
+    if (kind != Kind::Self) mask |= kEntries;
+    if (kind == Kind::Contents) mask |= kContent;
+    const bool isTooMany = !isKnown && watches_.size() >= mostWatches_;
+    const Descriptor descriptor =
+        isTooMany ? -1 : ::inotify_add_watch(inotify_.get(), path.c_str(), mask);
+    if (descriptor < 0 && (isTooMany || isShortage(errno))) shortage_ = isTooMany ? ENOSPC : errno;
+    return descriptor;
+}
+
+void FolderWatch::release(std::map<std::string, Descriptor>::iterator place) {
+    ::inotify_rm_watch(inotify_.get(), place->second);
+    watches_.erase(place->second);
+    paths_.erase(place);
+}
+
+void FolderWatch::releaseUnmarked(const std::string& scope) {
+    forEachWithin(paths_, scope, [this](auto place) {
+        if (watches_.at(place->second).walk != walk_) release(place);
+    });
+}
+
+void FolderWatch::endWalk() {
+    if (shortage_ != 0 && !isShort_)
+        EVLOG_ERROR(ops(),
+                    "cannot watch all application directories, so they are looked at from time to "
+                    "time (fs.inotify.max_user_watches may be too small): {}",
+                    pub(Error::posix(shortage_, "inotify").text));
+    // Only a walk over everything has asked for all watches.
+    if (shortage_ == 0 && isShort_ && isOverEverything_)
+        EVLOG_DEFAULT(ops(), "all application directories are watched again");
+    isShort_ = shortage_ != 0 || (isShort_ && !isOverEverything_);
+}
+
+Scopes FolderWatch::takeTouched() {
+    Scopes touched;
+    alignas(inotify_event) std::array<char, kBufferSize> buffer;
+    for (int i = 0; i < kMostBuffers; ++i) {
+        const ssize_t count = ::read(inotify_.get(), buffer.data(), buffer.size());
+        if (count <= 0) break;
+        for (const char* next = buffer.data(); next < buffer.data() + count;) {
+            inotify_event event;
+            std::memcpy(&event, next, sizeof event);
+            const char* name = next + sizeof event;
+            take(event, {name, ::strnlen(name, event.len)}, touched);
+            next = name + event.len;
+        }
+    }
+    return touched;
+}
+
+void FolderWatch::take(const inotify_event& event, std::string_view name, Scopes& touched) {
+    if (event.mask & IN_Q_OVERFLOW) touched.emplace();
+    auto found = watches_.find(event.wd);
+    if (found == watches_.end()) return;
+    const Watched& watched = found->second;
+    for (const Reason& reason : watched.reasons) switch (reason.kind) {
+            case Kind::Self:
+                if (name.empty()) touched.emplace();
+                break;
+            case Kind::Name:
+                if (name == reason.name || name.empty()) touched.emplace();
+                break;
+            case Kind::Entries:
+                if (name.empty())
+                    touched.emplace();
+                else if (name.ends_with(reason.name))
+                    touched.insert(joinPath(reason.scope, name));
+                break;
+            case Kind::Contents:
+                touched.insert(reason.scope);
+                break;
+        }
+    if (event.mask & IN_IGNORED) {
+        paths_.erase(watched.path);
+        watches_.erase(found);
+    }
+}
+
+}  // namespace platform::tandry

@@ -1,0 +1,90 @@
+#pragma once
+
+#include <sys/inotify.h>
+
+#include <compare>
+#include <cstdint>
+#include <limits>
+#include <map>
+#include <set>
+#include <string>
+#include <string_view>
+#include <unordered_map>
+
+#include "platform/UniqueFd.h"
+
+namespace platform::tandry {
+
+/// Parts of the disk that a walk has to look at again, as canonical paths; "" is everything.
+using Scopes = std::set<std::string>;
+
+/// The directories that walks over the disk depend on, watched by inotify. A walk marks each
+/// directory before it looks into it, so that no later change is lost; at the walk's end the
+/// directories that it did not mark any more are let go. Belongs to the registry's thread.
+///
+/// A directory that is not there, or that may not be read, is not watched: whoever marks it marks
+/// the directory that holds it, too, where its coming or a change of its mode shows.
+class FolderWatch {
+  public:
+    /// At most `mostWatches` directories are watched, as if the system allowed no more.
+    explicit FolderWatch(std::size_t mostWatches = std::numeric_limits<std::size_t>::max())
+        : mostWatches_(mostWatches) {}
+
+    /// Begins a walk. `overEverything` says that it will mark all that still matters.
+    void beginWalk(bool overEverything);
+
+    /// Any change directly in the directory touches `scope`.
+    void markContents(const std::string& path, const std::string& scope);
+    /// A change of an entry whose name ends in `suffix` touches the path of that entry, a change of
+    /// the directory itself everything.
+    void markEntries(const std::string& path, std::string_view suffix);
+    /// Whatever makes an absolute path lead somewhere else touches everything: a directory on the
+    /// way comes, goes or is renamed, or a symbolic link on the way is replaced.
+    void markWay(const std::string& path);
+
+    /// Lets go what lies within `scope` and was not marked by this walk.
+    void releaseUnmarked(const std::string& scope);
+    void endWalk();
+
+    /// Whether directories stay unwatched because the system has no more watches, descriptors or
+    /// memory. Told in one error line when it begins; a walk over everything tries again.
+    bool isShort() const { return isShort_; }
+
+    /// Readable when there are changes. -1 when the system has no descriptor.
+    int descriptor() const { return inotify_.get(); }
+    /// What has been touched since the last call. Does not wait; after a flood some may be left for
+    /// the next call.
+    Scopes takeTouched();
+
+  private:
+    enum class Kind { Self, Name, Entries, Contents };
+    /// Why a directory is watched.
+    struct Reason {
+        Kind kind;
+        std::string name;   // the name, or the suffix of names, that matters
+        std::string scope;  // for `Entries` the directory
+        auto operator<=>(const Reason&) const = default;
+    };
+    struct Watched {
+        std::string path;
+        std::set<Reason> reasons;
+        std::uint32_t walk = 0;  // the last that marked it
+    };
+    using Descriptor = int;  // the kernel's, of one watched directory
+
+    void mark(const std::string& path, Reason reason);
+    Descriptor add(const std::string& path, Kind kind, bool isKnown);
+    void release(std::map<std::string, Descriptor>::iterator place);
+    void take(const inotify_event& event, std::string_view name, Scopes& touched);
+
+    std::size_t mostWatches_;
+    UniqueFd inotify_;
+    std::unordered_map<Descriptor, Watched> watches_;
+    std::map<std::string, Descriptor> paths_;
+    std::uint32_t walk_ = 0;
+    bool isOverEverything_ = false;
+    bool isShort_ = false;
+    int shortage_ = 0;  // the errno that kept this walk from a watch
+};
+
+}  // namespace platform::tandry
