@@ -62,13 +62,20 @@ int cloneMount(const char* path, dev_t device, ino_t inode) {
         0)
         return errno;
     ::close(file);
-    return tree == kTree || ::dup2(tree, kTree) == kTree ? 0 : errno;
+    if (tree == kTree) return 0;
+    if (::dup2(tree, kTree) < 0) return errno;
+    ::close(tree);
+    return 0;
 }
 
-/// The descriptor is open for reading, for peers without a /proc to reopen it through.
+/// The descriptor is open for reading, for peers without a /proc to reopen it through. The clone's
+/// own descriptor is closed before anything is sent: with that, the clone belongs to no namespace
+/// any more, and a peer with rights to mount in one of its own cannot make it writable, nor clone
+/// or mount it.
 int sendOpened() {
     const int opened = ::open(kTreePath, O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK);
     if (opened < 0) return errno;
+    ::close(kTree);
     char granted[sizeof MountChild::kGranted];
     std::memcpy(granted, MountChild::kGranted, sizeof granted);
     iovec data{granted, sizeof granted - 1};

@@ -67,6 +67,12 @@ void expectReadOnly(int directory) {
     ASSERT_EQ(::fstat(directory, &here), 0);
     ASSERT_EQ(::fstatat(directory, "../..", &above, 0), 0);
     EXPECT_EQ(here.st_ino, above.st_ino);
+
+    // Not even with rights to mount.
+    mount_attr writable{};
+    writable.attr_clr = MOUNT_ATTR_RDONLY;
+    EXPECT_NE(::mount_setattr(directory, "", AT_EMPTY_PATH, &writable, sizeof writable), 0);
+    EXPECT_LT(::open_tree(directory, "", OPEN_TREE_CLONE | OPEN_TREE_CLOEXEC | AT_EMPTY_PATH), 0);
 }
 
 /// A bundle, and a service for it with a run loop on a thread of its own.
@@ -304,6 +310,7 @@ TEST(SandboxedConsumer, DISABLED_ReadsTheBundle) {
     const std::string token = ::getenv(kTokenVariable);
     const Handle bundle(token);
     ASSERT_GT(bundle.fd, 0);
+    EXPECT_EQ(::unshare(CLONE_NEWUSER | CLONE_NEWNS), 0);
     expectReadOnly(bundle.fd);
     EXPECT_EQ(Handle(token.substr(1)).fd, 0);
     EXPECT_FALSE(fs::exists("/tmp")) << "nothing but the sockets is there";
