@@ -22,10 +22,12 @@ namespace platform {
 namespace {
 
 // A peer takes two descriptors and a child process.
-constexpr std::size_t kMostPeers = 16;
+constexpr std::size_t kMostPeers = 32;
 constexpr int kMostAcceptedAtOnce = 32;
 // For a peer to say its token, and then for the child to answer: file systems may be slow.
 constexpr std::chrono::seconds kPatience{5};
+// For a peer to say its token when others wait to be let in.
+constexpr std::chrono::milliseconds kPatienceWhenFull{50};
 constexpr std::chrono::milliseconds kPauseAfterFailure{100};
 
 const Log& ops() {
@@ -33,9 +35,12 @@ const Log& ops() {
     return handle;
 }
 
+using Clock = std::chrono::steady_clock;
+
 struct Peer {
     UniqueFd socket;
     const pid_t pid;
+    const Clock::time_point since = Clock::now();
     RunLoop::Watch watch;
     RunLoop::Timer deadline;
     std::string received;
@@ -62,7 +67,7 @@ struct SandboxBroker::State {
     RunLoop::Watch watch{loop, socket.fd()};
     RunLoop::Timer pause{loop};
     std::list<Peer> peers;  // in the order in which they came
-    bool full = false;      // nobody is accepted until a peer goes
+    bool full = false;      // nobody is accepted until a peer goes, or has been silent for too long
 
     using Place = std::list<Peer>::iterator;
 
@@ -83,7 +88,9 @@ struct SandboxBroker::State {
 };
 
 void SandboxBroker::State::acceptSome() {
+    full = false;
     for (int i = 0; i < kMostAcceptedAtOnce; ++i) {
+        if (i > 0 && peers.size() == kMostPeers) break;  // perhaps nobody waits
         if (!makeRoom()) {
             full = true;
             return;
@@ -103,19 +110,28 @@ void SandboxBroker::State::acceptSome() {
     acceptOnceReadable();
 }
 
-/// Whoever holds back its token does not keep out those who send theirs.
+/// Whoever holds back its token does not keep out those who send theirs: the one that has been
+/// silent for longest goes, now or soon.
 bool SandboxBroker::State::makeRoom() {
     if (peers.size() < kMostPeers) return true;
     const Place silent = std::find_if(peers.begin(), peers.end(),
                                       [](const Peer& peer) { return !peer.child.has_value(); });
     if (silent == peers.end()) return false;
+    const auto age =
+        std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now() - silent->since);
+    if (age < kPatienceWhenFull) {
+        pause.start(kPatienceWhenFull - age, [this] { acceptSome(); });
+        return false;
+    }
     peers.erase(silent);
     return true;
 }
 
 void SandboxBroker::State::drop(Place peer) {
     peers.erase(peer);
-    if (std::exchange(full, false)) acceptOnceReadable();
+    if (!std::exchange(full, false)) return;
+    pause.cancel();
+    acceptOnceReadable();
 }
 
 void SandboxBroker::State::read(Place peer) {

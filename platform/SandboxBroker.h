@@ -15,7 +15,7 @@ struct Directories;
 /// connects, sends one token and a newline, and gets one line: "0" with the descriptor, else the
 /// errno of the refusal (EACCES for what is no token of ours). Then it is cut off, as are peers
 /// that send something else, or nothing for some seconds. A few are served at a time; a silent one
-/// makes room for a new one.
+/// soon makes room for others.
 class SandboxBroker {
   public:
     /// Serves, as long as it lives, on `loop`, which must outlive it. Errors: those of

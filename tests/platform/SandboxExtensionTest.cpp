@@ -207,6 +207,9 @@ TEST_F(SandboxExtension, CoversMountsInTheBundleAndNoneThatFollow) {
         expectReadOnly(bundle.fd);
         EXPECT_EQ(openError(bundle.fd, "inner/file", O_RDONLY), 0);
         EXPECT_EQ(openError(bundle.fd, "inner/file", O_RDWR), EROFS);
+        mount_attr writable{};
+        writable.attr_clr = MOUNT_ATTR_RDONLY;
+        EXPECT_NE(::mount_setattr(bundle.fd, "inner", 0, &writable, sizeof writable), 0);
         ASSERT_EQ(::mount("none", later.c_str(), "tmpfs", 0, nullptr), 0);
         home_.write("bundle/later/file", "text");
         EXPECT_EQ(openError(bundle.fd, "later/file", O_RDONLY), ENOENT);
