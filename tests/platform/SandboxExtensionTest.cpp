@@ -98,6 +98,7 @@ class SandboxExtension : public testing::Test {
         sandbox_.reset();
         loop_.reset();
     }
+    void tryMounts();
     std::string issue(const std::string& relative = "bundle") const {
         const auto token = sandbox_->issueReadExtension(home_.path(relative));
         EXPECT_TRUE(token) << token.error().text;
@@ -192,7 +193,7 @@ TEST_F(SandboxExtension, MeansTheVeryFile) {
     EXPECT_GT(Handle(bundle).fd, 0);
 }
 
-TEST_F(SandboxExtension, CoversMountsInTheBundleAndNoneThatFollow) {
+void SandboxExtension::tryMounts() {
     if (::unshare(CLONE_NEWNS) != 0) GTEST_SKIP() << "may not mount";
     ASSERT_EQ(::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr), 0);
     const std::string root = home_.path("bundle"), inner = home_.makeDirectory("bundle/inner"),
@@ -215,7 +216,12 @@ TEST_F(SandboxExtension, CoversMountsInTheBundleAndNoneThatFollow) {
         EXPECT_EQ(openError(bundle.fd, "later/file", O_RDONLY), ENOENT);
         EXPECT_EQ(openError(bundle.fd, "later/new", O_RDWR | O_CREAT), EROFS);
     }
+    stop();
     EXPECT_EQ(::umount2(root.c_str(), MNT_DETACH), 0);
+}
+
+TEST_F(SandboxExtension, CoversMountsInTheBundleAndNoneThatFollow) {
+    std::thread([this] { tryMounts(); }).join();  // a thread with a namespace of its own
 }
 
 TEST_F(SandboxExtension, PeersThatSayNothingOrTooMuchHinderNobody) {
@@ -243,9 +249,15 @@ TEST_F(SandboxExtension, PeersThatSayNothingOrTooMuchHinderNobody) {
     EXPECT_EQ(std::string_view(answer, 2), "0\n");
 }
 
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr int kManyRounds = 100;  // with their memory, a fork takes long
+#else
+constexpr int kManyRounds = 1000;
+#endif
+
 TEST_F(SandboxExtension, LeavesNothingBehind) {
     std::size_t descriptors = 0, mounted = 0;
-    for (const int rounds : {1, 1000}) {
+    for (const int rounds : {1, kManyRounds}) {
         start();
         const std::string token = issue();
         for (int i = 0; i < rounds; ++i) ASSERT_GT(Handle(token).fd, 0);
@@ -268,6 +280,7 @@ TEST_F(SandboxExtension, AChildThatHangsIsKilled) {
                                    while (hangAfterFork) ::pause();
                                }),
               0);
+    start();  // in a process with threads, as daemons are
     const auto tokens = SandboxTokens::make("test");
     const auto file = tokens->check(*tokens->issue(home_.path()));
     int ends[2];
