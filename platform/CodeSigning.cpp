@@ -74,8 +74,7 @@ Result<Entitlements> readEntitlements(const std::string& executable) {
 
 class FileTask : public CodeSigningTask {
   public:
-    FileTask(const AuditToken& token, std::shared_ptr<Sandbox> sandbox)
-        : token_(token), sandbox_(std::move(sandbox)) {}
+    explicit FileTask(const AuditToken& token) : token_(token) {}
 
     Answer entitlement(const std::string& name) override {
         std::call_once(read_, [this] { read(); });
@@ -102,7 +101,7 @@ class FileTask : public CodeSigningTask {
         }
         values_ = std::move(entitlements->values);
         if (values_.empty()) return;
-        const bool sandboxed = sandbox_->isSandboxed(token_);
+        const bool sandboxed = isSandboxed(token_);
         trusted_ = entitlements->trust >= (sandboxed ? FileTrust::Root : FileTrust::User);
         if (!trusted_)
             EVLOG_INFO(ops(), "entitlements of process {} do not count: others may write {}",
@@ -117,7 +116,6 @@ class FileTask : public CodeSigningTask {
     }
 
     const AuditToken token_;
-    const std::shared_ptr<Sandbox> sandbox_;
     std::atomic<bool> isTold_ = false;
     std::once_flag read_;  // what follows does not change any more afterwards
     std::optional<Error> error_;
@@ -129,11 +127,8 @@ class FileTask : public CodeSigningTask {
 class FileCodeSigning : public CodeSigning {
   public:
     std::unique_ptr<CodeSigningTask> makeTask(const AuditToken& token) override {
-        return std::make_unique<FileTask>(token, sandbox_);
+        return std::make_unique<FileTask>(token);
     }
-
-  private:
-    const std::shared_ptr<Sandbox> sandbox_ = makeKernelSandbox();
 };
 
 }  // namespace

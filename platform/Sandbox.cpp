@@ -9,7 +9,10 @@
 #include <string_view>
 
 #include "platform/Files.h"
+#include "platform/Log.h"
 #include "platform/Namespaces.h"
+#include "platform/SandboxBroker.h"
+#include "platform/SandboxTokens.h"
 #include "platform/UniqueFd.h"
 
 namespace platform {
@@ -46,26 +49,50 @@ bool mayHaveFlatpakInfo(int procDirectory) {
     return errno != ENOENT && errno != ENOTDIR;
 }
 
+Result<std::unique_ptr<SandboxBroker>> makeBroker(const Directories& directories,
+                                                  const std::string& serviceName,
+                                                  const Result<SandboxTokens>& tokens,
+                                                  RunLoop& loop) {
+    if (!tokens) return tokens.error();
+    return SandboxBroker::make(directories, serviceName, *tokens, loop);
+}
+
 class KernelSandbox : public Sandbox {
   public:
-    bool isSandboxed(const AuditToken& token) override {
-        // The namespaces come first: a process that shares ours did not build the root that the
-        // last test looks into. Those of a process that is gone cannot be read.
-        for (NamespaceKind kind : {NamespaceKind::User, NamespaceKind::Mount, NamespaceKind::Pid})
-            if (!sharesNamespace(token, kind)) return true;
-        if (hasSeccompFilter(token.procDirectory()).value_or(true) && !haveSeccompFilter())
-            return true;
-        return mayHaveFlatpakInfo(token.procDirectory());
+    KernelSandbox(const Directories& directories, const std::string& serviceName, RunLoop& loop)
+        : tokens_(SandboxTokens::make(serviceName)),
+          broker_(makeBroker(directories, serviceName, tokens_, loop)) {
+        if (!broker_)
+            EVLOG_ERROR(Log::make("com.orbel.Zorvan", "ops"), "cannot issue sandbox extensions: {}",
+                        pub(broker_.error()));
     }
+
+    bool isSandboxed(const AuditToken& token) override { return platform::isSandboxed(token); }
+
     Result<std::string> issueReadExtension(const std::string& path) override {
-        return Error::posix(ENOTSUP, path);
+        if (!broker_) return broker_.error();
+        return tokens_->issue(path);
     }
+
+  private:
+    const Result<SandboxTokens> tokens_;
+    const Result<std::unique_ptr<SandboxBroker>> broker_;
 };
 
 }  // namespace
 
-std::unique_ptr<Sandbox> makeKernelSandbox() {
-    return std::make_unique<KernelSandbox>();
+bool isSandboxed(const AuditToken& token) {
+    // The namespaces come first: a process that shares ours did not build the root that the last
+    // test looks into. Those of a process that is gone cannot be read.
+    for (NamespaceKind kind : {NamespaceKind::User, NamespaceKind::Mount, NamespaceKind::Pid})
+        if (!sharesNamespace(token, kind)) return true;
+    if (hasSeccompFilter(token.procDirectory()).value_or(true) && !haveSeccompFilter()) return true;
+    return mayHaveFlatpakInfo(token.procDirectory());
+}
+
+std::unique_ptr<Sandbox> makeKernelSandbox(const Directories& directories,
+                                           const std::string& serviceName, RunLoop& loop) {
+    return std::make_unique<KernelSandbox>(directories, serviceName, loop);
 }
 
 }  // namespace platform

@@ -9,12 +9,13 @@
 namespace {
 
 /// The services of this machine. Without a registry the server cannot be constructed.
-platform::Services diskServices() {
+platform::Services diskServices(const std::string& serviceName) {
     platform::Services services;
     services.directories = platform::Directories::fromEnvironment();
     services.mainLoop = std::make_shared<platform::RunLoop>();
     services.codeSigning = platform::makeFileCodeSigning();
-    services.sandbox = platform::makeKernelSandbox();
+    services.sandbox =
+        platform::makeKernelSandbox(services.directories, serviceName, *services.mainLoop);
     services.assertions = platform::makeFileAssertions(services.directories);
     services.consent = platform::makeFileConsent(services.directories);
     services.notifications = platform::makeFileNotifications(services.directories);
@@ -40,7 +41,7 @@ int main(int argc, char* argv[]) {
     auto options = zorvan::CommandLine::parse(argc, argv);
     if (!options) return 2;
     platform::prepareDaemonProcess();
-    platform::Services services = diskServices();
+    platform::Services services = diskServices(options->serviceName);
     auto server =
         zorvan::ZRDServer::initForService(options->serviceName, options->databasePath, services);
     if (!server) {

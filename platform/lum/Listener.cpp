@@ -116,13 +116,8 @@ void Listener::State::acceptFailed(int errnum) {
 }
 
 void Listener::State::admit(UniqueFd connected) {
-    ucred peer{};
-    socklen_t size = sizeof peer;
-    if (getsockopt(connected.get(), SOL_SOCKET, SO_PEERCRED, &peer, &size) != 0) return;
-    if (peer.uid != geteuid() && peer.uid != 0) {
-        EVLOG_ERROR(ops(), "client {} of user {} is not let in", peer.pid, peer.uid);
-        return;
-    }
+    const auto peer = lum::admittedPeer(connected.get());
+    if (!peer) return;
     errno = 0;
     auto token = AuditToken::ofPeer(connected.get());
     if (!token && isExhaustion(errno)) {
@@ -130,7 +125,7 @@ void Listener::State::admit(UniqueFd connected) {
         return;
     }
     if (!token) {
-        EVLOG_ERROR(ops(), "client {} is not let in: it cannot be told who it is", peer.pid);
+        EVLOG_ERROR(ops(), "client {} is not let in: it cannot be told who it is", *peer);
         return;
     }
     auto connection = std::make_shared<lum::PeerConnection>(std::move(connected), std::move(*token),

@@ -11,11 +11,14 @@
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
+#include <mutex>
 #include <optional>
 #include <utility>
+#include <vector>
 
 #include "platform/Directories.h"
 #include "platform/Files.h"
+#include "platform/Log.h"
 #include "platform/lum/Listener.h"
 
 namespace platform::lum {
@@ -56,24 +59,43 @@ Result<UniqueFd> lockName(int directory, const std::string& serviceName) {
     return file;
 }
 
-/// The listening socket that socket activation has passed for this service, if any: one bound to
-/// its path, or one with its name. The variables that announce such sockets are cleared.
-UniqueFd passedSocket(const std::string& serviceName, const std::string& path) {
+/// A descriptor that socket activation has passed to this process.
+struct PassedSocket {
+    UniqueFd fd;
+    std::string name;
+};
+
+/// Notes the passed descriptors that are not noted yet, and clears the variables that announce
+/// them.
+void notePassedSockets(std::vector<PassedSocket>& passed) {
     char** names = nullptr;
-    const int count = sd_listen_fds_with_names(0, &names);
-    UniqueFd found;
+    const int count = sd_listen_fds_with_names(1, &names);
     for (int i = 0; i < count; ++i) {
-        const int fd = SD_LISTEN_FDS_START + i;
+        passed.push_back({UniqueFd(SD_LISTEN_FDS_START + i), names[i]});
+        free(names[i]);
+    }
+    free(names);
+}
+
+/// The listening socket that socket activation has passed for this service, if any: one bound to
+/// its path, or one with its name. The others wait for the services that they are for.
+UniqueFd passedSocket(const std::string& serviceName, const std::string& path) {
+    static std::mutex mutex;  // guards `passed`
+    static std::vector<PassedSocket> passed;
+    std::lock_guard lock(mutex);
+    notePassedSockets(passed);
+    for (auto socket = passed.begin(); socket != passed.end(); ++socket) {
+        const int fd = socket->fd.get();
         const bool bound = sd_is_socket_unix(fd, SOCK_STREAM, 1, path.c_str(), 0) > 0;
         const bool named =
-            serviceName == names[i] && sd_is_socket_unix(fd, SOCK_STREAM, 1, nullptr, 0) > 0;
-        if (!found && (bound || named)) found.reset(fd);
+            serviceName == socket->name && sd_is_socket_unix(fd, SOCK_STREAM, 1, nullptr, 0) > 0;
+        if (!bound && !named) continue;
+        UniqueFd found = std::move(socket->fd);
+        passed.erase(socket);
+        fcntl(found.get(), F_SETFL, fcntl(found.get(), F_GETFL) | O_NONBLOCK);
+        return found;
     }
-    for (int i = 0; i < count; ++i) free(names[i]);
-    free(names);
-    for (const char* variable : {"LISTEN_PID", "LISTEN_FDS", "LISTEN_FDNAMES"}) unsetenv(variable);
-    if (found) fcntl(found.get(), F_SETFL, fcntl(found.get(), F_GETFL) | O_NONBLOCK);
-    return found;
+    return {};
 }
 
 /// Removes the socket that an owner of the name before us has left behind. Nothing but a socket.
@@ -120,6 +142,16 @@ Result<ServiceSocket> ServiceSocket::make(const Directories& directories,
 
 ServiceSocket::~ServiceSocket() {
     if (socket_ && !ownPath_.empty()) unlink(ownPath_.c_str());
+}
+
+std::optional<pid_t> admittedPeer(int connected) {
+    ucred peer{};
+    socklen_t size = sizeof peer;
+    if (getsockopt(connected, SOL_SOCKET, SO_PEERCRED, &peer, &size) != 0) return std::nullopt;
+    if (peer.uid == geteuid() || peer.uid == 0) return peer.pid;
+    EVLOG_ERROR(Log::make("com.orbel.Zorvan", "ops"), "client {} of user {} is not let in",
+                peer.pid, peer.uid);
+    return std::nullopt;
 }
 
 }  // namespace platform::lum

@@ -1,5 +1,8 @@
 #pragma once
 
+#include <sys/types.h>
+
+#include <optional>
 #include <string>
 
 #include "platform/Error.h"
@@ -34,6 +37,10 @@ class ServiceSocket {
     UniqueFd socket_;
     std::string ownPath_;  // empty for a socket that was passed to this process
 };
+
+/// The process that connected to a service, if it may speak to it: processes of this user and of
+/// root may, others get a log line. The id may have come to mean another process already.
+std::optional<pid_t> admittedPeer(int connected);
 
 }  // namespace lum
 }  // namespace platform

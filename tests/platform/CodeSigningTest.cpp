@@ -137,20 +137,19 @@ class Tool : public testing::Test {
 };
 
 TEST_F(Tool, SandboxIsWhatConfinesAProcess) {
-    const auto sandbox = makeKernelSandbox();
-    EXPECT_FALSE(sandbox->isSandboxed(*AuditToken::ofSelf()));
+    EXPECT_FALSE(isSandboxed(*AuditToken::ofSelf()));
     Peer free(files_, tool_, unconfined);
     ASSERT_TRUE(free.token());
-    EXPECT_FALSE(sandbox->isSandboxed(*free.token()));
+    EXPECT_FALSE(isSandboxed(*free.token()));
     free.end();
-    EXPECT_TRUE(sandbox->isSandboxed(*free.token())) << "it is gone";
+    EXPECT_TRUE(isSandboxed(*free.token())) << "it is gone";
 
     const bool filtered = ::prctl(PR_GET_SECCOMP) != 0;
     for (bool (*confine)() : {inMountNamespace, inUserNamespace, withFilter}) {
         const Peer peer(files_, tool_, confine);
         if (!peer.token()) continue;  // not permitted here
         const bool counts = confine != withFilter || !filtered;
-        EXPECT_EQ(sandbox->isSandboxed(*peer.token()), counts);
+        EXPECT_EQ(isSandboxed(*peer.token()), counts);
     }
 }
 

@@ -154,12 +154,14 @@ TEST_F(PassedSocketTest, IsTakenOver) {
     EXPECT_EXIT(
         {
             dup2(byName.get(), 3);
+            dup2(unixSocket(directories.runtime + "/another", ::bind).release(), 4);
             setenv("LISTEN_PID", std::to_string(getpid()).c_str(), 1);
-            setenv("LISTEN_FDS", "1", 1);
-            setenv("LISTEN_FDNAMES", "test", 1);
+            setenv("LISTEN_FDS", "2", 1);
+            setenv("LISTEN_FDNAMES", "test:another", 1);
             RunLoop ownLoop;
             SerialQueue ownQueue("lum", ownLoop);
             int clients = 0;
+            const auto beside = Listener::make(directories, "test.beside", ownQueue);
             auto taken = Listener::make(directories, "test", ownQueue);
             if (!taken || Listener::make(directories, "test", ownQueue)) _exit(1);
             (*taken)->setEventHandler([&](std::shared_ptr<Connection>) { clients += 1; });
