@@ -201,31 +201,26 @@ class Reader {
     const char* problem_ = nullptr;
 };
 
-/// Whether what a value becomes is within a size and the reader's limits.
-class WriteCheck {
+/// Adds up what a value becomes.
+class CostSum {
   public:
-    explicit WriteCheck(std::size_t limit) : bytesLeft_(limit) {}
+    void add(const Value& value) {
+        ++cost_.objects;
+        if (const std::string* text = value.string()) addText(*text);
+        if (const Data* data = value.data()) cost_.bytes += data->bytes().size() / 3 * 4;
+        if (const Array* array = value.array())
+            for (const Value& element : *array) add(element);
+        if (const Dictionary* dictionary = value.dictionary()) addEntries(*dictionary);
+    }
 
-    bool allows(const Value& value) {
-        if (objectsLeft_-- == 0) return false;
-        auto isAllowed = [this](const Value& element) { return allows(element); };
-        if (const std::string* text = value.string()) return allowsText(*text);
-        if (const Data* data = value.data()) return takeBytes(data->bytes().size() / 3 * 4);
-        if (const Array* array = value.array()) return std::ranges::all_of(*array, isAllowed);
-        const Dictionary* dictionary = value.dictionary();
-        if (!dictionary) return true;
-        return allowsKeys(*dictionary) &&
-               std::ranges::all_of(*dictionary, isAllowed, &Dictionary::Entry::second);
+    PropertyListCost cost() const {
+        PropertyListCost cost = cost_;
+        cost.work = isTooMuchWork_ ? PropertyListWork::kMost + 1 : work_.used();
+        return cost;
     }
 
   private:
-    bool takeBytes(std::size_t count) {
-        if (count > bytesLeft_) return false;
-        bytesLeft_ -= count;
-        return true;
-    }
-
-    bool allowsText(std::string_view text) {
+    void addText(std::string_view text) {
         std::size_t size = text.size();
         std::size_t references = 0;
         for (char character : text) {
@@ -233,25 +228,25 @@ class WriteCheck {
             ++references;
             size += character == '&' ? 4 : 3;
         }
-        return takeBytes(size) && work_.addText(references, size) == nullptr;
+        cost_.bytes += size;
+        if (work_.addText(references, size)) isTooMuchWork_ = true;
     }
 
-    bool allowsKeys(const Dictionary& dictionary) {
-        if (dictionary.size() > objectsLeft_) return false;
-        objectsLeft_ -= dictionary.size();
+    void addEntries(const Dictionary& dictionary) {
         std::vector<std::string_view> keys;
         keys.reserve(dictionary.size());
         for (const auto& [key, value] : dictionary) {
-            if (!allowsText(key)) return false;
+            ++cost_.objects;
+            addText(key);
             keys.push_back(key);
+            add(value);
         }
-        return work_.addKeys(keys) == nullptr;
+        if (work_.addKeys(keys)) isTooMuchWork_ = true;
     }
 
-    /// The element around them all is one of the reader's objects.
-    std::size_t objectsLeft_ = kMaxPropertyListObjects - 1;
-    std::size_t bytesLeft_;
+    PropertyListCost cost_;
     PropertyListWork work_;
+    bool isTooMuchWork_ = false;
 };
 
 plist_t nodeOf(const Value& value);
@@ -345,7 +340,11 @@ Result<std::string> writeXmlPropertyList(const Value& value, std::size_t limit) 
     // Before anything is built: objects, and texts, which may grow fivefold. What tags and
     // indentation add to them is bounded and only known in the end.
     const Error tooLarge{"PropertyList", 3, "too large for a property list"};
-    if (!fitsXmlPropertyList(value, limit)) return tooLarge;
+    const PropertyListCost cost = costOfPropertyList(value);
+    // The element around them all is one of the reader's objects.
+    if (cost.objects >= kMaxPropertyListObjects || cost.bytes > limit ||
+        cost.work > PropertyListWork::kMost)
+        return tooLarge;
     OwnedNode root(nodeOf(value));
     NumbersInC numbers;
     char* text = nullptr;
@@ -357,8 +356,31 @@ Result<std::string> writeXmlPropertyList(const Value& value, std::size_t limit) 
     return std::string(text, length);
 }
 
-bool fitsXmlPropertyList(const Value& value, std::size_t limit) {
-    return WriteCheck(limit).allows(value);
+PropertyListCost& PropertyListCost::operator+=(const PropertyListCost& other) {
+    objects += other.objects;
+    bytes += other.bytes;
+    work += other.work;
+    return *this;
+}
+
+PropertyListCost& PropertyListCost::operator-=(const PropertyListCost& other) {
+    objects -= other.objects;
+    bytes -= other.bytes;
+    work -= other.work;
+    return *this;
+}
+
+bool PropertyListCost::fits(std::size_t limit) const {
+    // Tags and the deepest indentation of one object's line.
+    constexpr std::size_t kMostAround = 192;
+    return objects < kMaxPropertyListObjects / 2 && bytes + objects * kMostAround <= limit &&
+           work <= PropertyListWork::kMost / 2;
+}
+
+PropertyListCost costOfPropertyList(const Value& value) {
+    CostSum sum;
+    sum.add(value);
+    return sum.cost();
 }
 
 }  // namespace platform

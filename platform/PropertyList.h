@@ -36,8 +36,19 @@ Result<Value> readPropertyListFile(const std::string& path,
 Result<std::string> writeXmlPropertyList(const Value& value,
                                          std::size_t limit = kMaxPropertyListFile);
 
-/// Whether a property list is within the limits of its writer and its reader, but for the bytes of
-/// tags and indentation: for those who put the XML form together from pieces.
-bool fitsXmlPropertyList(const Value& value, std::size_t limit);
+/// What a value takes of the limits of `writeXmlPropertyList` and `parsePropertyList`. For those
+/// who put the XML form of a container together from pieces: the costs of its elements add up.
+struct PropertyListCost {
+    std::size_t objects = 0;
+    std::size_t bytes = 0;  // of texts and data in XML
+    std::size_t work = 0;   // as platform/PropertyListWork.h has it
+
+    PropertyListCost& operator+=(const PropertyListCost& other);
+    PropertyListCost& operator-=(const PropertyListCost& other);
+    /// Whether it is within the limits, with half of the objects and of the work left for what
+    /// holds the pieces together, and `limit` bytes of XML whatever tags and indentation add.
+    bool fits(std::size_t limit) const;
+};
+PropertyListCost costOfPropertyList(const Value& value);
 
 }  // namespace platform

@@ -14,17 +14,22 @@ namespace platform {
 /// (&amp;), a longer one has to have fewer.
 class PropertyListWork {
   public:
+    /// In comparisons of keys within the processor's caches: about 20 ns.
+    static constexpr std::size_t kMost = 1u << 24;
+
     /// Adds a dictionary with these keys, whose order may change. Says what is wrong, or null. Keys
     /// of XML may come as they stand there.
     const char* addKeys(std::span<std::string_view> keys);
     /// Adds a text of `length` bytes of XML, so many of them references. As above.
     const char* addText(std::size_t references, std::size_t length);
 
+    /// How much was added up, but for what was too much.
+    std::size_t used() const { return kMost - left_; }
+
   private:
     const char* take(std::size_t work, const char* problem);
 
-    /// In comparisons of keys within the processor's caches: about 20 ns.
-    std::size_t left_ = 1u << 24;
+    std::size_t left_ = kMost;
 };
 
 }  // namespace platform

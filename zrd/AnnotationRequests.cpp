@@ -23,6 +23,15 @@ const Dictionary* Transaction::requestedAnnotations() {
     return nullptr;
 }
 
+bool Transaction::hasRoomFor(const Dictionary& change, const ZRDPlugIn& plugIn) {
+    // The user's elections are small, and find room whatever hosts have stored.
+    if (!change.contains(annotation::kExtension)) return true;
+    if (server().hasRoomForAnnotation(change, plugIn)) return true;
+    EVLOG_INFO(ops(), "client {} plug-in {}({}) annotation refused: the annotations are too large",
+               client_->pid(), plugIn.identifier(), pub(plugIn.uuid()));
+    return false;
+}
+
 void Transaction::annotatePlugIns() {
     const Dictionary* annotations = requestedAnnotations();
     if (!annotations) return;
@@ -43,6 +52,10 @@ void Transaction::annotatePlugIns() {
     if (change.empty()) return done();
 
     bool completed = processUuidList([&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
+        if (!hasRoomFor(change, *plugIn)) {
+            fail(kZRErrorInvalidRequest, "invalid request format (annotation extension)");
+            return Walk::Stop;
+        }
         EVLOG_DEBUG(ops(), "client {} plug-in {}({}) annotation change: {}", client_->pid(),
                     plugIn->identifier(), pub(plugIn->uuid()), change);
         if (election) {
@@ -69,9 +82,13 @@ void Transaction::bulkAnnotatePlugIns() {
         if (!uuid) return fail(kZRErrorAnnotation, "invalid plug-in UUID value");
         auto plugIn = server().findPlugIn(*uuid);
         if (!plugIn) return fail(kZRErrorRegistration, "no plug-in with the requested uuid");
+        const Dictionary change{{annotation::kExtension, value}};
+        if (!hasRoomFor(change, *plugIn)) {
+            return fail(kZRErrorAnnotation, "annotations values must be dictionaries");
+        }
         EVLOG_DEBUG(ops(), "client {} bulk plug-in {}({}) annotation change: {}", client_->pid(),
                     plugIn->identifier(), pub(plugIn->uuid()), value);
-        server().setAnnotation(Dictionary{{annotation::kExtension, value}}, *plugIn);
+        server().setAnnotation(change, *plugIn);
     }
     server().notifyAnnotationChange();
     done();

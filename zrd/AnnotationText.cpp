@@ -3,8 +3,6 @@
 #include <algorithm>
 #include <numeric>
 
-#include "platform/PropertyList.h"
-
 namespace zorvan {
 
 using platform::Dictionary;
@@ -37,10 +35,11 @@ std::vector<std::size_t> cutsOf(std::string_view text) {
 
 }  // namespace
 
-Result<std::string_view> AnnotationText::text(const Dictionary& annotations) {
+Result<std::string_view> AnnotationText::text(const Dictionary& annotations,
+                                              const platform::PropertyListCost& cost) {
     // Each may be within the limits, and still all together be more than could be read back.
-    if (pieces_.empty() || !encodeChanged(annotations) || whole_.size() > kMaxSize ||
-        !platform::fitsXmlPropertyList(rootOf(annotations), kMaxSize))
+    if (pieces_.empty() || annotations.size() > kMostPieces || !cost.fits(kMaxSize) ||
+        !encodeChanged(annotations))
         return encodeAll(annotations);
     return std::string_view(whole_);
 }

@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "platform/Error.h"
+#include "platform/PropertyList.h"
 #include "platform/Value.h"
 
 namespace zorvan {
@@ -22,14 +23,17 @@ class AnnotationText {
     static constexpr const char* kVersionKey = "version";
     static constexpr const char* kDataKey = "data";
     static constexpr std::size_t kMaxSize = 256u << 20;
+    /// With more annotations than this the keys alone may be too much work for the reader.
+    static constexpr std::size_t kMostPieces = 40'000;
 
     /// Says that the annotation under a key is another one now, or gone. Without a key: all are.
     void changed(std::string_view key) { changed_.emplace(key); }
     void allChanged() { pieces_.clear(); }
 
-    /// The text for all annotations as they are now, which is good until the next change. Errors:
-    /// those of `writeXmlPropertyList`.
-    platform::Result<std::string_view> text(const platform::Dictionary& annotations);
+    /// The text for all annotations as they are now, which is good until the next change. `cost` is
+    /// theirs, each with its key. Errors: those of `writeXmlPropertyList`.
+    platform::Result<std::string_view> text(const platform::Dictionary& annotations,
+                                            const platform::PropertyListCost& cost);
 
   private:
     /// The text of one annotation, which is a piece of the whole.

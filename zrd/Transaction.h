@@ -57,6 +57,8 @@ class Transaction {
 
     /// The request's "annotations"; null when they cannot be stored, and the failure has been sent.
     const platform::Dictionary* requestedAnnotations();
+    /// Whether the store has room for a change; what has none counts as of the wrong kind.
+    bool hasRoomFor(const platform::Dictionary& change, const ZRDPlugIn& plugIn);
 
     /// Visits "paths" in order: each element resolved to its canonical path (`resolved`), or as it
     /// was sent when it cannot be. True when every element was visited and none answered `Stop`;

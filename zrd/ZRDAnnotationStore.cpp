@@ -44,6 +44,10 @@ std::optional<ZRError> readRoot(const Value& root, Dictionary& data) {
     return std::nullopt;
 }
 
+platform::PropertyListCost costOf(const std::string& key, const Value& annotation) {
+    return platform::costOfPropertyList(Dictionary{{key, annotation}});
+}
+
 /// Takes out what a binary file can hold but our own file and replies cannot: one such entry would
 /// keep every other from being saved.
 void dropUnstorable(Dictionary& data, const std::string& file) {
@@ -98,12 +102,14 @@ std::optional<ZRError> ZRDAnnotationStore::loadDb() {
         error = readRoot(*root, annotations_);
         if (!error) dropUnstorable(annotations_, annotationsURL_);
     }
+    cost_ = {};
+    for (const auto& [key, annotation] : annotations_) cost_ += costOf(key, annotation);
     if (error) probes::dbLoad(error->domain.c_str(), static_cast<std::uint64_t>(error->code));
     return error;
 }
 
 std::optional<ZRError> ZRDAnnotationStore::saveDb() {
-    const auto bytes = text_.text(annotations_);
+    const auto bytes = text_.text(annotations_, cost_);
     if (!bytes) return zrError(bytes.error());
     if (auto error = platform::writeFileAtomically(annotationsURL_, *bytes)) return zrError(*error);
     return std::nullopt;
@@ -118,14 +124,30 @@ const Dictionary* ZRDAnnotationStore::annotationForPlugIn(const ZRDPlugIn& plugI
     return annotationForIdentifier(plugIn.annotationKey());
 }
 
+Dictionary ZRDAnnotationStore::merged(const Dictionary& annotation, const std::string& key) const {
+    const Dictionary* current = annotationForIdentifier(key);
+    Dictionary merged = current ? *current : Dictionary();
+    for (const auto& [name, value] : annotation) merged.set(name, value);
+    return merged;
+}
+
+bool ZRDAnnotationStore::hasRoomFor(const Dictionary& annotation, const ZRDPlugIn& plugIn) const {
+    const std::string& key = plugIn.annotationKey();
+    platform::PropertyListCost after = cost_;
+    after += costOf(key, merged(annotation, key));
+    if (const Value* current = annotations_.find(key)) after -= costOf(key, *current);
+    return after.fits(AnnotationText::kMaxSize);
+}
+
 void ZRDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,
                                        const ZRDPlugIn& plugIn) {
     const std::string& key = plugIn.annotationKey();
-    if (annotation) {
-        const Dictionary* current = annotationForIdentifier(key);
-        Dictionary merged = current ? *current : Dictionary();
-        for (const auto& [name, value] : *annotation) merged.set(name, value);
-        annotations_.set(key, std::move(merged));
+    std::optional<Dictionary> changed;
+    if (annotation) changed = merged(*annotation, key);
+    if (const Value* current = annotations_.find(key)) cost_ -= costOf(key, *current);
+    if (changed) {
+        cost_ += costOf(key, *changed);
+        annotations_.set(key, *std::move(changed));
     } else {
         annotations_.remove(key);
     }

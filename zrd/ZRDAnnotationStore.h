@@ -36,6 +36,10 @@ class ZRDAnnotationStore {
     const platform::Dictionary* annotationForIdentifier(std::string_view key) const;
     const platform::Dictionary* annotationForPlugIn(const ZRDPlugIn& plugIn) const;
 
+    /// Whether the file, which has a largest size, could hold a change as well. One that is made
+    /// all the same would keep every later one from being saved.
+    bool hasRoomFor(const platform::Dictionary& annotation, const ZRDPlugIn& plugIn) const;
+
     /// Merges the entries of `annotation` into the plug-in's annotation, or removes that when there
     /// are none, then saves. A failed save is logged; the change stays and reaches the file with
     /// the next successful one.
@@ -54,10 +58,14 @@ class ZRDAnnotationStore {
     const platform::Dictionary& annotations() const { return annotations_; }
 
   private:
+    platform::Dictionary merged(const platform::Dictionary& annotation,
+                                const std::string& key) const;
+
     explicit ZRDAnnotationStore(std::string path) : annotationsURL_(std::move(path)) {}
 
     std::string annotationsURL_;
     platform::Dictionary annotations_;
+    platform::PropertyListCost cost_;  // of the annotations
     AnnotationText text_;
 };
 

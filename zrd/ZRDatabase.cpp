@@ -110,6 +110,10 @@ std::optional<Dictionary> ZRDatabase::annotationForPlugIn(const ZRDPlugIn& plugI
     });
 }
 
+bool ZRDatabase::hasRoomForAnnotation(const Dictionary& annotation, const ZRDPlugIn& plugIn) {
+    return sync_.sync([&] { return annotations_->hasRoomFor(annotation, plugIn); });
+}
+
 std::optional<ZRError> ZRDatabase::setAnnotation(const std::optional<Dictionary>& annotation,
                                                  const ZRDPlugIn& plugIn) {
     sync_.sync([&] { annotations_->setAnnotation(annotation, plugIn); });

@@ -73,6 +73,8 @@ class ZRDatabase : public AnnotationReader, public platform::WorkspaceObserver {
     std::optional<ZRError> removePlugIn(const std::string& bundlePath);
 
     std::optional<platform::Dictionary> annotationForPlugIn(const ZRDPlugIn& plugIn) override;
+    /// Whether a change of the plug-in's annotation could be stored together with all others.
+    bool hasRoomForAnnotation(const platform::Dictionary& annotation, const ZRDPlugIn& plugIn);
     /// Merges `annotation` into the plug-in's, or removes that, and saves. Always answers none: a
     /// failed save is logged, and the change kept.
     std::optional<ZRError> setAnnotation(const std::optional<platform::Dictionary>& annotation,

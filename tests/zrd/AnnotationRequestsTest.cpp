@@ -90,6 +90,23 @@ TEST_F(AnnotationRequestsTest, BadChangesChangeNothing) {
     EXPECT_EQ(posts(), 1u);
 }
 
+TEST_F(AnnotationRequestsTest, NoHostCanFillTheStoreForOthers) {
+    // Each may be stored, both together could not be read back.
+    Array many(std::vector<Value>(263'000, Value(1)));
+    const Dictionary large{{"extension", Dictionary{{"k", many}}}};
+    EXPECT_EQ(annotate(large, Array{uuid(0)}), Dictionary());
+    EXPECT_EQ(annotate(large, Array{uuid(1)}),
+              error(4, "invalid request format (annotation extension)"));
+    EXPECT_EQ(bulkAnnotate(Dictionary{{uuid(1).string(), Dictionary{{"k", many}}}}),
+              error(18, "annotations values must be dictionaries"));
+    LogLines log;
+    EXPECT_EQ(annotate(Dictionary{{"election", 2}}, Array{uuid(1)}), Dictionary());
+    EXPECT_THAT(log.take(), Not(Contains(HasSubstr("unable to save"))));
+    EXPECT_EQ(annotate(large, Array{uuid(0)}), Dictionary()) << "it takes its own place";
+    EXPECT_EQ(annotate(Dictionary{{"extension", Dictionary()}}, Array{uuid(0)}), Dictionary());
+    EXPECT_EQ(annotate(large, Array{uuid(1)}), Dictionary());
+}
+
 TEST_F(AnnotationRequestsTest, TheListIsWalkedUpToTheFirstFailure) {
     const Dictionary unknown = error(4, "no such plugin (uuid not found)");
     const Dictionary noUuid = error(4, "invalid request (bad uuid array)");
