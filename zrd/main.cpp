@@ -9,7 +9,7 @@
 namespace {
 
 /// The services of this machine. Without a registry the server cannot be constructed.
-platform::Services diskServices() {
+platform::Services diskServices(const std::string& serviceName) {
     platform::Services services;
     services.directories = platform::Directories::fromEnvironment();
     services.mainLoop = std::make_shared<platform::RunLoop>();
@@ -18,7 +18,8 @@ platform::Services diskServices() {
     services.assertions = platform::makeFileAssertions(services.directories);
     services.consent = platform::makeFileConsent(services.directories);
     services.notifications = platform::makeFileNotifications(services.directories);
-    services.launcher = platform::makeLauncher();
+    services.launcher =
+        platform::makeLauncher(services.directories, serviceName, services.mainLoop);
     services.types = platform::makeMimeTypes(services.directories);
     services.sdks = std::make_shared<platform::SdkDictionaries>(services.directories);
     auto workspace = platform::tandry::openDiskWorkspace(services.directories, *services.sdks,
@@ -39,7 +40,7 @@ int main(int argc, char* argv[]) {
     auto options = zorvan::CommandLine::parse(argc, argv);
     if (!options) return 2;
     platform::prepareDaemonProcess();
-    platform::Services services = diskServices();
+    platform::Services services = diskServices(options->serviceName);
     auto server =
         zorvan::ZRDServer::initForService(options->serviceName, options->databasePath, services);
     if (!server) {
