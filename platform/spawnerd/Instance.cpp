@@ -17,7 +17,7 @@ namespace platform::spawnerd {
 namespace {
 
 constexpr std::size_t kMaxInfo = 4096;
-constexpr int kInfoPatience = 1000;  // milliseconds
+constexpr int kPatience = 1000;  // milliseconds
 
 void sendKill(const UniqueFd& pidFd) {
     if (pidFd) ::syscall(SYS_pidfd_send_signal, pidFd.get(), SIGKILL, nullptr, 0);
@@ -61,11 +61,13 @@ Instance::Instance(RunLoop& loop, SandboxedProcess process, std::string name,
 Instance::~Instance() {
     if (status_ && !first_) return;
     takeInfoNow();
-    isDoomed_ = true;
     sendKill(first_);
-    if (status_) return;
-    sendKill(process_.pidFd);
-    ::waitpid(process_.pid, nullptr, 0);
+    if (!status_) {
+        sendKill(process_.pidFd);
+        ::waitpid(process_.pid, nullptr, 0);
+    }
+    pollfd first{first_.get(), POLLIN, 0};
+    if (first_) ::poll(&first, 1, kPatience);
 }
 
 /// Before its first process is known, killing our child would leave that one without the tie that
@@ -93,7 +95,7 @@ bool Instance::readInfo() {
 void Instance::takeInfoNow() {
     while (process_.info) {
         pollfd state{process_.info.get(), POLLIN, 0};
-        if (::poll(&state, 1, kInfoPatience) <= 0) return;
+        if (::poll(&state, 1, kPatience) <= 0) return;
         readInfo();
     }
 }
