@@ -30,6 +30,7 @@ class PlugInProcess : public testing::Test {
         run([this] {
             launcher_.emplace(platform::Directories::fromEnvironment(), "com.test.zrd", loop());
         });
+        run([] {});  // it listens from the loop's next turn
         home_.write("upper.appex/Info.plist", *platform::writeXmlPropertyList(info_));
         std::filesystem::copy_file(TEST_PLUGIN, executable_);
     }

@@ -27,6 +27,7 @@ class Launcher : public SystemTest {
 
 TEST_F(Launcher, StartsNothingThatWasNotMadeReady) {
     start();
+    EXPECT_THAT(match(), testing::IsEmpty());
     EXPECT_EQ(startError().code, EPERM);
     RawClient broken(service_);
     broken.send(RawClient::frame("\xff"));
