@@ -19,7 +19,8 @@ platform::Services diskServices(const std::string& serviceName) {
     services.assertions = platform::makeFileAssertions(services.directories);
     services.consent = platform::makeFileConsent(services.directories);
     services.notifications = platform::makeFileNotifications(services.directories);
-    services.launcher = platform::makeLauncher();
+    services.launcher =
+        platform::makeLauncher(services.directories, serviceName, services.mainLoop);
     services.types = platform::makeMimeTypes(services.directories);
     services.sdks = std::make_shared<platform::SdkDictionaries>(services.directories);
     auto workspace = platform::tandry::openDiskWorkspace(services.directories, *services.sdks,

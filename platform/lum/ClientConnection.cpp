@@ -7,6 +7,7 @@
 #include <atomic>
 #include <cerrno>
 #include <cstring>
+#include <deque>
 #include <map>
 #include <mutex>
 #include <optional>
@@ -64,6 +65,7 @@ struct ClientConnection::State : std::enable_shared_from_this<ClientConnection::
     // what follows, is the queue's.
     std::optional<lum::FrameSocket> socket;
     lum::FrameReader reader{lum::kMaxReplyPayload};
+    std::deque<UniqueFd> descriptors;  // each came before the end of the reply that it belongs to
     std::optional<RunLoop::Watch> watch;
 
     State(const Directories& directories, const std::string& serviceName, SerialQueue& eventQueue)
@@ -118,8 +120,10 @@ void ClientConnection::State::readable() {
     auto self = shared_from_this();
     char buffer[64 * 1024];
     for (int i = 0; i < kMostSteps && watch; ++i) {
-        const auto count = socket->receive(buffer, sizeof buffer);
+        UniqueFd descriptor;
+        const auto count = socket->receive(buffer, sizeof buffer, descriptor);
         if (!count) break;
+        if (descriptor) descriptors.push_back(std::move(descriptor));
         if (*count == 0) return interrupted("the service has gone away");
         received({buffer, *count});
         if (*count < sizeof buffer) break;
@@ -150,6 +154,11 @@ void ClientConnection::State::deliver(std::shared_ptr<const std::string> payload
         return;
     }
     auto& message = std::get<Message>(decoded);
+    const Value* withDescriptor = message.find(Message::kDescriptor);
+    if (withDescriptor && equalsTrue(*withDescriptor) && !descriptors.empty()) {
+        message.attach(std::move(descriptors.front()));
+        descriptors.pop_front();
+    }
     decltype(waiting)::node_type entry;
     {
         std::lock_guard lock(mutex);

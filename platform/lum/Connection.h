@@ -56,8 +56,8 @@ class Connection {
     virtual void resume() = 0;
 
     /// Sends a reply (made with `Message::replyTo`); never blocks. What cannot be written at once
-    /// is kept and written later. On a dead connection it vanishes. A reply over its limit ends the
-    /// connection. From any thread.
+    /// is kept and written later. The reply's descriptor, if it has one, is taken from it. On a
+    /// dead connection it vanishes. A reply over its limit ends the connection. From any thread.
     virtual void send(const Message& reply) = 0;
 
     virtual std::string description() const = 0;

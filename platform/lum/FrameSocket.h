@@ -28,7 +28,8 @@ class FrameSocket {
     };
     /// Writes what the socket takes at once and keeps the frame while a rest of it is unsent. On a
     /// closed or broken socket the frame vanishes.
-    Sent send(SliceList frame);
+    /// A descriptor goes with the frame's first byte.
+    Sent send(SliceList frame, UniqueFd descriptor = {});
 
     struct Flushed {
         std::size_t written = 0;     // bytes that the socket took
@@ -40,10 +41,14 @@ class FrameSocket {
 
     /// Bytes of frames that are not sent whole: what their memory costs.
     std::size_t held() const { return held_.load(std::memory_order_relaxed); }
+    /// Whether a descriptor waits to be sent.
+    bool holdsDescriptor() const;
 
     /// Receives into `buffer`: the number of bytes, 0 at the end of the stream (or when the peer is
     /// gone); none when there is nothing to be had now.
     std::optional<std::size_t> receive(char* buffer, std::size_t size);
+    /// The same, and keeps a descriptor that came along. The bytes end before a second one.
+    std::optional<std::size_t> receive(char* buffer, std::size_t size, UniqueFd& descriptor);
 
     /// Whether both ends are closed, or the socket cannot be used on for another reason.
     bool isHungUp() const;
@@ -59,17 +64,21 @@ class FrameSocket {
     std::size_t close();
 
   private:
+    struct Outgoing {
+        SliceList bytes;
+        UniqueFd descriptor;  // until the first byte is sent
+    };
     /// Sends `most` bytes of `frame` (or somewhat more, or all it has) and consumes them; false
     /// when the socket takes no more for now.
-    bool write(SliceList& frame, std::size_t most);
+    bool write(Outgoing& frame, std::size_t most);
     std::size_t dropUnsent();
     bool polls(short events) const;
 
     mutable std::mutex mutex_;
     // Written under the mutex, so that nobody sends on a descriptor number that has been closed.
     UniqueFd socket_;
-    std::deque<SliceList> unsent_;  // guarded by mutex_
-    bool broken_ = false;           // guarded by mutex_: the peer reads no more
+    std::deque<Outgoing> unsent_;  // guarded by mutex_
+    bool broken_ = false;          // guarded by mutex_: the peer reads no more
     std::atomic<std::size_t> held_ = 0;
 };
 

@@ -4,7 +4,9 @@
 #include <memory>
 #include <string>
 #include <string_view>
+#include <utility>
 
+#include "platform/UniqueFd.h"
 #include "platform/Value.h"
 
 namespace platform {
@@ -31,10 +33,26 @@ class Message {
     /// only when the last copy of this one is gone. Replies hold nothing.
     void setTurn(std::shared_ptr<void> turn) { turn_ = std::move(turn); }
 
+    /// The key, with the value true, of a reply that a descriptor comes with.
+    static constexpr const char* kDescriptor = "descriptor";
+    /// Has a descriptor travel with a reply: the receiver gets a duplicate. Copies share it.
+    void setDescriptor(UniqueFd descriptor) {
+        set(kDescriptor, true);
+        attach(std::move(descriptor));
+    }
+    /// The descriptor that came, or is to go, with this message; none once it, or a copy's, has
+    /// been taken. Not from two threads at once.
+    UniqueFd takeDescriptor() const { return descriptor_ ? std::move(*descriptor_) : UniqueFd(); }
+    /// The same without the key, which a received message has.
+    void attach(UniqueFd descriptor) {
+        descriptor_ = std::make_shared<UniqueFd>(std::move(descriptor));
+    }
+
   private:
     Dictionary contents_;
     std::uint64_t serial_ = 0;
     std::shared_ptr<void> turn_;
+    std::shared_ptr<UniqueFd> descriptor_;
 };
 
 std::string describe(const Message& message);

@@ -218,6 +218,8 @@ std::shared_ptr<PeerConnection::Turn> PeerConnection::takeTurn() {
     // Only this queue takes turns: a free one stays free. Held replies shrink on this queue too,
     // which then proceeds.
     if (socket_.held() > kMaxUnsentPerConnection) return nullptr;
+    // A host that does not take its descriptors gets no more of them.
+    if (socket_.held() > 0 && socket_.holdsDescriptor()) return nullptr;
     TurnState state = turn_;
     if (state == Taken && turn_.compare_exchange_strong(state, Awaited)) return nullptr;
     if (state == Awaited || replies_->isWaiting()) return nullptr;
@@ -245,7 +247,7 @@ void PeerConnection::send(const Message& reply) {
         });
         return;
     }
-    const FrameSocket::Sent sent = socket_.send(std::move(*frame));
+    const FrameSocket::Sent sent = socket_.send(std::move(*frame), reply.takeDescriptor());
     if (sent.kept == 0) return;
     replies_->add(sent.kept);
     if (!sent.awaitWritable) return;

@@ -1,0 +1,55 @@
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "platform/RunLoop.h"
+#include "platform/UniqueFd.h"
+#include "platform/spawnerd/OutputLog.h"
+#include "platform/spawnerd/SandboxedProcess.h"
+
+namespace platform::spawnerd {
+
+/// A plug-in that is being started, runs, or ends: the bubblewrap process outside, a child of ours,
+/// and the first process of the sandbox's pid namespace, with which everything in there ends,
+/// whatever the plug-in forked. On the loop's thread.
+class Instance {
+  public:
+    /// `runs` is called once the sandbox is there; `ended`, once, when no process of it is left,
+    /// with the plug-in's exit status, or 128 and the number of the signal that ended it. The
+    /// instance may be destroyed in `ended`.
+    Instance(RunLoop& loop, SandboxedProcess process, std::string name, std::function<void()> runs,
+             std::function<void(int status)> ended);
+    Instance(const Instance&) = delete;
+    /// Ends it, if it has not ended.
+    ~Instance();
+
+    /// Ends everything in the sandbox; `ended` follows. The plug-in is not asked: the sandbox's
+    /// first process takes no other signal, and what is to go must not be able to delay it.
+    void kill();
+
+  private:
+    /// Reads of `info` what is there; true once all is read that will be.
+    bool readInfo();
+    void takeInfoNow();
+    void awaitInfo();
+    void watchFirst();
+    void reap();
+    void endedPartly();
+
+    RunLoop& loop_;
+    SandboxedProcess process_;
+    const std::function<void()> runs_;
+    const std::function<void(int)> ended_;
+    OutputLog output_;
+    std::string infoText_;
+    UniqueFd first_;             // pidfd of the sandbox's first process, once it is known
+    std::optional<int> status_;  // once our child is reaped
+    bool isDoomed_ = false;
+    // Behind the descriptors that they watch.
+    std::optional<RunLoop::Watch> childWatch_, infoWatch_, firstWatch_;
+};
+
+}  // namespace platform::spawnerd

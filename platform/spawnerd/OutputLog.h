@@ -1,0 +1,41 @@
+#pragma once
+
+#include <cstddef>
+#include <optional>
+#include <string>
+
+#include "platform/RunLoop.h"
+#include "platform/UniqueFd.h"
+
+namespace platform::spawnerd {
+
+/// Logs what a plug-in, or bubblewrap on its behalf, writes to its standard output and error, a
+/// line at a time, at info level. After so many bytes it reads on but logs no more. On the loop's
+/// thread.
+class OutputLog {
+  public:
+    static constexpr std::size_t kMaxLogged = 64u << 10;
+    static constexpr std::size_t kMaxLine = 1024;
+
+    /// `pipe` is non-blocking.
+    OutputLog(RunLoop& loop, UniqueFd pipe, std::string name);
+    OutputLog(const OutputLog&) = delete;
+
+    /// Logs what is left: nobody writes any more.
+    void finish();
+
+  private:
+    void await();
+    /// Whether there may be more to come.
+    bool readOn();
+    void take(const char* bytes, std::size_t count);
+    void endLine();
+
+    const UniqueFd pipe_;
+    const std::string name_;
+    std::string line_;
+    std::size_t logged_ = 0;
+    std::optional<RunLoop::Watch> watch_;  // until the end of the output
+};
+
+}  // namespace platform::spawnerd

@@ -1,0 +1,62 @@
+#include "platform/spawnerd/ProcessLauncher.h"
+
+#include <utility>
+
+#include "platform/SerialQueue.h"
+
+namespace platform {
+
+namespace spawnerd {
+
+namespace {
+
+class CountedMarker final : public Launcher::WorkMarker {
+  public:
+    explicit CountedMarker(std::shared_ptr<std::atomic<int>> count) : count_(std::move(count)) {
+        ++*count_;
+    }
+    ~CountedMarker() override { --*count_; }
+
+  private:
+    const std::shared_ptr<std::atomic<int>> count_;
+};
+
+}  // namespace
+
+ProcessLauncher::ProcessLauncher(const Directories& directories, const std::string& daemonService,
+                                 std::shared_ptr<RunLoop> loop, const std::string& program)
+    : outstanding_(std::make_shared<std::atomic<int>>(0)),
+      service_(SpawnService::make(directories, daemonService, std::move(loop), program)) {
+    // Not before the daemon runs: only then does its name, and so this one, belong to it.
+    service_->queue().async([weak = std::weak_ptr(service_)] {
+        if (auto service = weak.lock()) service->listen();
+    });
+}
+
+int ProcessLauncher::addExternalService(const AuditToken& host, const std::string& executable,
+                                        const Dictionary& overlay) {
+    return service_->grant(host, executable, overlay);
+}
+
+std::unique_ptr<Launcher::WorkMarker> ProcessLauncher::beginOutstandingWork() {
+    return std::make_unique<CountedMarker>(outstanding_);
+}
+
+void ProcessLauncher::terminatePlugInInstances(const std::string& bundleIdentifier,
+                                               const std::string& bundleVersion, SerialQueue& queue,
+                                               Completion completion) {
+    service_->terminate(
+        bundleIdentifier, bundleVersion, [&queue, completion = std::move(completion)](bool found) {
+            queue.async([completion, found] { completion(found ? kDone : kNoneOnRecord); });
+        });
+}
+
+}  // namespace spawnerd
+
+std::unique_ptr<Launcher> makeLauncher(const Directories& directories,
+                                       const std::string& daemonService,
+                                       std::shared_ptr<RunLoop> loop) {
+    return std::make_unique<spawnerd::ProcessLauncher>(directories, daemonService, std::move(loop));
+}
+
+}  // namespace platform

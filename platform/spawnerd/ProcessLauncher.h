@@ -1,0 +1,34 @@
+#pragma once
+
+#include <atomic>
+#include <memory>
+#include <string>
+
+#include "platform/Launcher.h"
+#include "platform/spawnerd/SandboxedProcess.h"
+#include "platform/spawnerd/SpawnService.h"
+
+namespace platform::spawnerd {
+
+/// The launcher that starts processes; see `makeLauncher`.
+class ProcessLauncher final : public Launcher {
+  public:
+    ProcessLauncher(const Directories& directories, const std::string& daemonService,
+                    std::shared_ptr<RunLoop> loop, const std::string& program = kBubblewrap);
+
+    int addExternalService(const AuditToken& host, const std::string& executable,
+                           const Dictionary& overlay) override;
+    std::unique_ptr<WorkMarker> beginOutstandingWork() override;
+    void terminatePlugInInstances(const std::string& bundleIdentifier,
+                                  const std::string& bundleVersion, SerialQueue& queue,
+                                  Completion completion) override;
+
+    /// How many work markers live. From any thread.
+    int outstandingWork() const { return *outstanding_; }
+
+  private:
+    const std::shared_ptr<std::atomic<int>> outstanding_;
+    const std::shared_ptr<SpawnService> service_;
+};
+
+}  // namespace platform::spawnerd

@@ -1,0 +1,33 @@
+#pragma once
+
+#include <sys/types.h>
+
+#include <string>
+#include <vector>
+
+#include "platform/Error.h"
+#include "platform/UniqueFd.h"
+
+namespace platform::spawnerd {
+
+/// The program that confines plug-ins.
+inline constexpr const char* kBubblewrap = "/usr/bin/bwrap";
+
+/// A bubblewrap process that was just started, and our ends of its pipes.
+struct SandboxedProcess {
+    pid_t pid = -1;  // a child of ours, to be reaped
+    UniqueFd pidFd;
+    UniqueFd info;    // what it tells about the sandbox; non-blocking
+    UniqueFd gate;    // the sandbox is set up when something is written here
+    UniqueFd output;  // what the plug-in writes to its standard output and error; non-blocking
+
+    /// Starts `program` (bubblewrap) with these arguments, and with `command` to be run inside. The
+    /// command inherits `connection` as `kConnectionDescriptor`, and nothing else but /dev/null and
+    /// `output`. On the thread that the process shall end with. Error: the system's.
+    static Result<SandboxedProcess> spawn(const std::string& program,
+                                          const std::vector<std::string>& arguments,
+                                          const std::vector<std::string>& command,
+                                          const UniqueFd& connection);
+};
+
+}  // namespace platform::spawnerd

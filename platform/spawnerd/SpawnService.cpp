@@ -1,0 +1,261 @@
+#include "platform/spawnerd/SpawnService.h"
+
+#include <sys/socket.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <utility>
+
+#include "platform/Log.h"
+#include "platform/spawnerd/Protocol.h"
+#include "platform/spawnerd/SandboxProfile.h"
+
+namespace platform::spawnerd {
+
+namespace {
+
+const Log& ops() {
+    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
+    return handle;
+}
+
+const std::string* textAt(const Message& message, const char* key) {
+    const Value* value = message.find(key);
+    return value ? value->string() : nullptr;
+}
+
+/// The arguments of a "start"; none of them when the key is absent.
+Result<std::vector<std::string>> argumentsIn(const Message& message) {
+    std::vector<std::string> arguments;
+    const Value* value = message.find(kArguments);
+    if (!value) return arguments;
+    if (!value->array()) return Error::posix(EINVAL, "\"arguments\" is no array");
+    std::size_t bytes = 0;
+    for (const Value& element : *value->array()) {
+        const std::string* text = element.string();
+        if (!text) return Error::posix(EINVAL, "an argument is no text");
+        bytes += text->size();
+        if (bytes > kMaxStringBytes || arguments.size() == kMaxStrings)
+            return Error::posix(E2BIG, "arguments");
+        arguments.push_back(*text);
+    }
+    return arguments;
+}
+
+template <class Asked>
+void reply(const Asked& asked, const Message& message) {
+    if (auto connection = asked.connection.lock()) connection->send(message);
+}
+
+template <class Asked>
+void refuse(const Asked& asked, const Error& error) {
+    Message message = Message::replyTo(asked.message);
+    message.set(kErrorCode, error.code);
+    message.set(kError, error.text);
+    reply(asked, message);
+}
+
+template <class Asked>
+void replyStatus(const Asked& asked, int status) {
+    Message message = Message::replyTo(asked.message);
+    message.set(kStatus, status);
+    reply(asked, message);
+}
+
+}  // namespace
+
+std::shared_ptr<SpawnService> SpawnService::make(Directories directories, std::string daemonService,
+                                                 std::shared_ptr<RunLoop> loop,
+                                                 std::string program) {
+    std::shared_ptr<SpawnService> service(new SpawnService(
+        std::move(directories), std::move(daemonService), std::move(loop), std::move(program)));
+    service->hosts_ = std::make_shared<GrantedHosts>(
+        service->queue_, [weak = std::weak_ptr(service)](const Host& host) {
+            if (auto self = weak.lock()) self->hostDied(host);
+        });
+    return service;
+}
+
+SpawnService::SpawnService(Directories directories, std::string daemonService,
+                           std::shared_ptr<RunLoop> loop, std::string program)
+    : directories_(std::move(directories)),
+      daemonService_(std::move(daemonService)),
+      loop_(std::move(loop)),
+      program_(std::move(program)),
+      queue_("spawnerd", *loop_) {}
+
+SpawnService::~SpawnService() = default;
+
+void SpawnService::listen() {
+    queue_.assertCurrent();
+    auto listener = Listener::make(directories_, serviceNameFor(daemonService_), queue_);
+    if (!listener) {
+        EVLOG_ERROR(ops(), "no plug-in will be started: {}", pub(listener.error()));
+        return;
+    }
+    listener_ = std::move(*listener);
+    listener_->setEventHandler([weak = weak_from_this()](std::shared_ptr<Connection> connection) {
+        if (auto self = weak.lock()) self->accept(std::move(connection));
+    });
+    listener_->resume();
+}
+
+int SpawnService::grant(const AuditToken& host, const std::string& executable,
+                        const Dictionary& overlay) {
+    auto grant = Grant::make(directories_, executable, overlay);
+    if (grant) return hosts_->add(host, std::move(*grant));
+    EVLOG_INFO(ops(), "{} cannot be started as a plug-in: {}", executable, grant.error());
+    return grant.error().code;
+}
+
+void SpawnService::accept(std::shared_ptr<Connection> connection) {
+    // The connection holds the handler, so the handler must not hold it.
+    connection->setEventHandler(
+        [weak = weak_from_this(), peer = std::weak_ptr(connection)](const ConnectionEvent& event) {
+            const auto* message = std::get_if<Message>(&event);
+            auto self = weak.lock();
+            auto connection = peer.lock();
+            if (message && self && connection)
+                self->serve(self->hosts_->find(connection->auditToken()), {peer, *message});
+        });
+    connection->resume();
+}
+
+void SpawnService::serve(const Host& host, Asked asked) {
+    const std::string* request = textAt(asked.message, kRequest);
+    if (!request) return refuse(asked, Error::posix(EINVAL, "\"request\" is missing"));
+    if (*request == kStart) return start(host, std::move(asked));
+    if (*request == kWait) return awaitEnd(host, asked, false);
+    if (*request == kTerminate) return awaitEnd(host, asked, true);
+    refuse(asked, Error::posix(ENOSYS, "unrecognized request"));
+}
+
+std::optional<Error> SpawnService::checkRoom(const Host& host) const {
+    const auto own = std::ranges::count_if(
+        instances_, [&](const auto& entry) { return entry.second.host == host; });
+    if (static_cast<std::size_t>(own) >= kMaxInstancesPerHost)
+        return Error::posix(EAGAIN, "this process has started too many plug-ins");
+    if (instances_.size() >= kMaxInstances)
+        return Error::posix(EAGAIN, "too many plug-ins are running");
+    return std::nullopt;
+}
+
+void SpawnService::start(const Host& host, Asked asked) {
+    const std::string* executable = textAt(asked.message, kExecutable);
+    if (!executable) return refuse(asked, Error::posix(EINVAL, "\"executable\" is missing"));
+    const auto arguments = argumentsIn(asked.message);
+    if (!arguments) return refuse(asked, arguments.error());
+    auto grant = host ? hosts_->grant(host, *executable) : nullptr;
+    if (!grant) {
+        EVLOG_INFO(ops(), "refusing to start {}: it was not made ready for its host", *executable);
+        return refuse(asked, Error::posix(EPERM, "this process may not start " + *executable));
+    }
+    if (auto error = checkRoom(host)) return refuse(asked, *error);
+    Running running;
+    running.host = host;
+    running.grant = std::move(grant);
+    running.starting = asked;
+    if (auto error = spawn(++lastId_, std::move(running), *arguments)) {
+        EVLOG_ERROR(ops(), "cannot start {}: {}", *executable, pub(*error));
+        refuse(asked, *error);
+    }
+}
+
+std::optional<Error> SpawnService::spawn(std::uint64_t id, Running running,
+                                         const std::vector<std::string>& plugInArguments) {
+    const Grant& grant = *running.grant;
+    const auto arguments = sandboxArguments(grant, directories_, daemonService_);
+    if (!arguments) return arguments.error();
+    int ends[2];
+    if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) != 0)
+        return Error::posix(errno, "no connection");
+    running.connection.reset(ends[0]);
+    const UniqueFd plugInEnd(ends[1]);
+
+    std::vector<std::string> command{grant.executable};
+    command.insert(command.end(), plugInArguments.begin(), plugInArguments.end());
+    auto process = SandboxedProcess::spawn(program_, *arguments, command, plugInEnd);
+    if (!process) return process.error();
+    running.instance = std::make_unique<Instance>(
+        *loop_, std::move(*process), grant.bundleIdentifier, [this, id] { runs(id); },
+        [this, id](int status) { ended(id, status); });
+    instances_.emplace(id, std::move(running));
+    return std::nullopt;
+}
+
+void SpawnService::runs(std::uint64_t id) {
+    Running& running = instances_.at(id);
+    EVLOG_INFO(ops(), "client {} has started plug-in {} as instance {}", running.host->token.pid(),
+               running.grant->bundleIdentifier, id);
+    // Without the connection over which it was asked for, nobody could ever speak to it.
+    if (running.starting->connection.expired()) return running.instance->kill();
+    Message message = Message::replyTo(running.starting->message);
+    message.set(kInstance, id);
+    message.setDescriptor(std::move(running.connection));
+    reply(*running.starting, message);
+    running.starting.reset();
+}
+
+void SpawnService::awaitEnd(const Host& host, const Asked& asked, bool kill) {
+    const Value* value = asked.message.find(kInstance);
+    const auto id = value ? value->unsignedInteger() : std::nullopt;
+    if (!id) return refuse(asked, Error::posix(EINVAL, "\"instance\" is missing"));
+    const auto found = instances_.find(*id);
+    if (!host || found == instances_.end() || found->second.host != host) {
+        if (host)
+            for (const auto& [ended, status] : host->ended)
+                if (ended == *id) return replyStatus(asked, status);
+        return refuse(asked, Error::posix(ESRCH, "no instance of this process"));
+    }
+    Running& running = found->second;
+    if (running.waiters.size() >= kMaxWaitersPerInstance)
+        return refuse(asked, Error::posix(EBUSY, "too many requests wait for this instance"));
+    // Without the turn: the connection goes on meanwhile.
+    Asked later = asked;
+    later.message.setTurn(nullptr);
+    running.waiters.push_back([later](int status) { replyStatus(later, status); });
+    if (kill) running.instance->kill();
+}
+
+void SpawnService::ended(std::uint64_t id, int status) {
+    auto node = instances_.extract(id);
+    Running& running = node.mapped();
+    EVLOG_INFO(ops(), "instance {} of plug-in {} has ended with status {}", id,
+               running.grant->bundleIdentifier, status);
+    if (running.starting)
+        refuse(*running.starting, Error::posix(EIO, "the sandbox of " + running.grant->executable));
+    auto& last = running.host->ended;
+    last.emplace_back(id, status);
+    if (last.size() > kMaxEndedPerHost) last.pop_front();
+    for (const Waiter& waiter : running.waiters) waiter(status);
+}
+
+void SpawnService::hostDied(const Host& host) {
+    for (auto& [id, running] : instances_)
+        if (running.host == host) running.instance->kill();
+}
+
+void SpawnService::terminate(const std::string& bundleIdentifier, const std::string& bundleVersion,
+                             std::function<void(bool)> completion) {
+    // At once: the same plug-in may be granted anew before the loop has its turn.
+    hosts_->takeBack(bundleIdentifier, bundleVersion);
+    queue_.async([weak = weak_from_this(), bundleIdentifier, bundleVersion,
+                  completion = std::move(completion)] {
+        auto self = weak.lock();
+        if (!self) return;
+        auto left = std::make_shared<std::size_t>(0);
+        for (auto& [id, running] : self->instances_) {
+            const Grant& grant = *running.grant;
+            if (grant.bundleIdentifier != bundleIdentifier || grant.bundleVersion != bundleVersion)
+                continue;
+            ++*left;
+            running.waiters.push_back([left, completion](int) {
+                if (--*left == 0) completion(true);
+            });
+            running.instance->kill();
+        }
+        if (*left == 0) completion(false);
+    });
+}
+
+}  // namespace platform::spawnerd

@@ -1,0 +1,89 @@
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/Directories.h"
+#include "platform/SerialQueue.h"
+#include "platform/UniqueFd.h"
+#include "platform/lum/Listener.h"
+#include "platform/spawnerd/GrantedHosts.h"
+#include "platform/spawnerd/Instance.h"
+
+namespace platform::spawnerd {
+
+/// The service that hosts ask to start what they were granted, and the instances that run.
+///
+/// An instance belongs to the host process, not to a connection: it ends when the plug-in exits,
+/// when the host asks for that or ends, when the plug-in is removed, and with the daemon.
+/// Everything happens on the loop unless it says otherwise.
+class SpawnService : public std::enable_shared_from_this<SpawnService> {
+  public:
+    /// `program` is bubblewrap's.
+    static std::shared_ptr<SpawnService> make(Directories directories, std::string daemonService,
+                                              std::shared_ptr<RunLoop> loop, std::string program);
+    SpawnService(const SpawnService&) = delete;
+    /// Ends the instances. On the loop, or where it does not run.
+    ~SpawnService();
+
+    /// Begins to listen; an error line when that cannot be done.
+    void listen();
+
+    /// As `Launcher::addExternalService`. From any thread.
+    int grant(const AuditToken& host, const std::string& executable, const Dictionary& overlay);
+    /// As `Launcher::terminatePlugInInstances`, with a completion that is told whether there were
+    /// any, on the loop. From any thread.
+    void terminate(const std::string& bundleIdentifier, const std::string& bundleVersion,
+                   std::function<void(bool found)> completion);
+
+    /// From any thread.
+    SerialQueue& queue() { return queue_; }
+
+  private:
+    using Waiter = std::function<void(int status)>;
+    using Host = GrantedHosts::Host;
+    /// A request, with where its reply goes.
+    struct Asked {
+        std::weak_ptr<Connection> connection;
+        Message message;  // holds the connection's turn as long as it is kept
+    };
+    struct Running {
+        Host host;
+        std::shared_ptr<const Grant> grant;
+        std::optional<Asked> starting;  // until it is answered
+        UniqueFd connection;            // the host's end, until then
+        std::unique_ptr<Instance> instance;
+        std::vector<Waiter> waiters;
+    };
+
+    SpawnService(Directories directories, std::string daemonService, std::shared_ptr<RunLoop> loop,
+                 std::string program);
+
+    void accept(std::shared_ptr<Connection> connection);
+    void serve(const Host& host, Asked asked);
+    void start(const Host& host, Asked asked);
+    std::optional<Error> spawn(std::uint64_t id, Running running,
+                               const std::vector<std::string>& plugInArguments);
+    void runs(std::uint64_t id);
+    void awaitEnd(const Host& host, const Asked& asked, bool kill);
+    void ended(std::uint64_t id, int status);
+    void hostDied(const Host& host);
+    std::optional<Error> checkRoom(const Host& host) const;
+
+    const Directories directories_;
+    const std::string daemonService_;
+    const std::shared_ptr<RunLoop> loop_;
+    const std::string program_;
+    SerialQueue queue_;
+    std::shared_ptr<GrantedHosts> hosts_;  // set once, before this object is shared
+    std::unique_ptr<Listener> listener_;
+    std::uint64_t lastId_ = 0;
+    std::map<std::uint64_t, Running> instances_;
+};
+
+}  // namespace platform::spawnerd

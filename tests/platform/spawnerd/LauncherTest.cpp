@@ -1,0 +1,191 @@
+#include "platform/Files.h"
+#include "tests/platform/spawnerd/LauncherFixture.h"
+
+namespace platform::spawnerd {
+
+namespace {
+
+using namespace std::string_literals;
+
+TEST_F(LauncherTest, APlugInTalksToItsHostAndSeesNothingElse) {
+    const std::string secret = home.write("secret.txt", "secret");
+    const std::string place = container("one");
+    const std::string executable =
+        plugIn("one",
+               "read -r word\n"
+               "echo $word-$1-$GREETING-$ZORVAN_BUNDLE_IDENTIFIER\n"
+               "cat " +
+                   secret +
+                   "\n"
+                   "touch $HOME/mine && echo wrote\n"
+                   "touch ${0%/*}/mine || touch /mine || echo may not\n"
+                   "echo $XDG_RUNTIME_DIR/zorvan/services/*\n"
+                   "for n in 4 5 6 7 8 9; do test -e /proc/$$/fd/$n && echo leak $n; done\n"
+                   "ls /root /home /run/user\n"
+                   "tr '\\0' '\\n' < /proc/1/environ | grep GREETING");
+    EXPECT_EQ(grant(executable, overlay(Dictionary{{"GREETING", "hi there"}, {"HOME", place}})), 0);
+    const Message reply = start(executable, Array{"argument"});
+    const UniqueFd plugIn = reply.takeDescriptor();
+    ASSERT_TRUE(plugIn);
+    // Outside: what the overlay sets is in no environment and in no command line.
+    const auto outside = processesWith(executable);
+    ASSERT_FALSE(outside.empty());
+    for (const std::string& process : outside) {
+        EXPECT_EQ(readFile(process + "/cmdline", 1u << 20)->find("GREETING"), std::string::npos);
+        const auto environment = readFile(process + "/environ", 1u << 20);
+        const bool isBubblewrap = readFile(process + "/comm", 64)->starts_with("bwrap");
+        EXPECT_TRUE(!isBubblewrap || *environment == "PATH=/usr/bin:/bin\0"s) << process;
+    }
+    EXPECT_EQ(talk(plugIn, "word\n"),
+              "word-argument-hi there-one\nwrote\nmay not\n" + path("test.spawnerd") + "\n");
+    EXPECT_TRUE(std::filesystem::exists(place + "/mine"));
+    EXPECT_EQ(number(askAbout(kWait, reply), kStatus), 1);
+}
+
+TEST_F(LauncherTest, OnlyPlugInsThatMayUseItHaveTheNetwork) {
+    const std::string executable = plugIn("one", "readlink /proc/self/ns/net");
+    const std::string ours = std::filesystem::read_symlink("/proc/self/ns/net").string() + "\n";
+    for (const std::string profile : {"plugin", "keyboard", "network-filter", "glimsed"}) {
+        EXPECT_EQ(grant(executable, overlay(Dictionary(), profile)), 0);
+        const std::string seen = talk(start(executable).takeDescriptor());
+        EXPECT_TRUE(seen.starts_with("net:")) << profile;
+        EXPECT_EQ(seen == ours, profile == "plugin") << profile;
+    }
+}
+
+TEST_F(LauncherTest, BadGrantsAreRefused) {
+    const std::string good = plugIn("one", "");
+    const std::string bare = home.write("bare/run", "");
+    std::filesystem::permissions(bare, std::filesystem::perms::owner_all);
+    EXPECT_EQ(grant(home.path("one.appex/missing")), ENOENT);
+    EXPECT_EQ(grant(home.path("one.appex/Info.plist")), EACCES);
+    EXPECT_EQ(grant(home.path("one.appex")), EACCES);
+    EXPECT_EQ(grant("run"), EINVAL);
+    EXPECT_EQ(grant(bare), EINVAL);
+    for (const Dictionary& wrong :
+         {Dictionary(), Dictionary{{"LUMService", Array()}, {"QFBundlePackageType", "LUM!"}},
+          overlay(Array()), overlay(Dictionary{{"A", 1}}), overlay(Dictionary{{"A=B", "c"}}),
+          overlay(Dictionary(), "other"), overlay(Dictionary(), 1),
+          Dictionary{{"LUMService", *overlay().find("LUMService")}}})
+        EXPECT_EQ(grant(good, wrong), EINVAL) << describe(wrong);
+    EXPECT_EQ(grant(good, overlay(Dictionary{{"A", std::string(kMaxStringBytes, 'x')}})), E2BIG);
+    writeInfo("one", {{"QFBundleIdentifier", "../../one"}});
+    EXPECT_EQ(grant(good), EINVAL);
+}
+
+TEST_F(LauncherTest, AContainerThatLeadsElsewhereIsRefusedAlsoLater) {
+    const std::string executable = plugIn("one", "echo $HOME");
+    const std::string place = container("one");
+    EXPECT_EQ(grant(executable), 0);
+    std::filesystem::remove(place);
+    std::filesystem::create_directory_symlink(home.path(), place);
+    EXPECT_EQ(grant(executable), ENOTDIR);
+    EXPECT_EQ(number(start(executable), kErrorCode), ENOTDIR);
+    const std::string busy = directories.zorvanRuntime() + "/tenurd";
+    std::filesystem::remove(place);
+    std::filesystem::remove_all(busy);
+    std::filesystem::create_directories(busy);
+    std::filesystem::create_directory_symlink(home.path(), busy + "/one");
+    EXPECT_EQ(number(start(executable), kErrorCode), ENOTDIR);
+}
+
+TEST_F(LauncherTest, BadRequestsAreAnsweredAndTheConnectionGoesOn) {
+    const std::string executable = plugIn("one", "echo fine");
+    EXPECT_EQ(number(start(executable), kErrorCode), EPERM);
+    EXPECT_EQ(grant(executable), 0);
+    EXPECT_EQ(number(ask({}), kErrorCode), EINVAL);
+    EXPECT_EQ(number(ask({{"request", "stop"}}), kErrorCode), ENOSYS);
+    EXPECT_EQ(number(ask({{"request", "start"}}), kErrorCode), EINVAL);
+    EXPECT_EQ(number(ask({{"request", "wait"}, {"instance", -1}}), kErrorCode), EINVAL);
+    EXPECT_EQ(number(ask({{"request", "terminate"}, {"instance", 1}}), kErrorCode), ESRCH);
+    EXPECT_EQ(number(start(executable, "text"), kErrorCode), EINVAL);
+    EXPECT_EQ(number(start(executable, Array{1}), kErrorCode), EINVAL);
+    EXPECT_EQ(number(start(executable, Array{std::string(kMaxStringBytes + 1, 'x')}), kErrorCode),
+              E2BIG);
+    EXPECT_EQ(number(start(home.path("one.appex/other")), kErrorCode), EPERM);
+    EXPECT_EQ(talk(start(executable).takeDescriptor()), "fine\n");
+}
+
+TEST_F(LauncherTest, NothingRunsWithoutBubblewrap) {
+    useLauncher(home.path("bwrap"));
+    const std::string executable = plugIn("one", "touch $HOME/ran");
+    EXPECT_EQ(grant(executable, overlay(Dictionary{{"HOME", home.path()}})), 0);
+    const Message reply = start(executable);
+    EXPECT_EQ(number(reply, kErrorCode), ENOENT);
+    EXPECT_NE(reply.find(kError)->string()->find(home.path("bwrap")), std::string::npos);
+    EXPECT_EQ(errorLines("cannot confine plug-ins without"), 1u);
+
+    useLauncher("/bin/false");
+    EXPECT_EQ(grant(executable), 0);
+    EXPECT_EQ(number(start(executable), kErrorCode), EIO);
+    EXPECT_FALSE(std::filesystem::exists(home.path("ran")));
+}
+
+TEST_F(LauncherTest, AHostLearnsHowItsPlugInsEnd) {
+    const std::string executable = plugIn("one", "read -r status\nexit $status");
+    EXPECT_EQ(grant(executable), 0);
+    const Message first = start(executable), second = start(executable);
+    talk(first.takeDescriptor(), "7\n");
+    EXPECT_EQ(number(askAbout(kWait, first), kStatus), 7);
+    EXPECT_EQ(number(askAbout(kTerminate, second), kStatus), 128 + SIGKILL);
+    EXPECT_EQ(number(askAbout(kWait, first), kStatus), 7);
+    EXPECT_EQ(number(askAbout(kTerminate, second), kStatus), 128 + SIGKILL);
+}
+
+TEST_F(LauncherTest, AHostHasSoManyPlugInsAndNoMore) {
+    const std::string executable = plugIn("one", "read -r line");
+    EXPECT_EQ(grant(executable), 0);
+    std::vector<Message> started;
+    for (std::size_t i = 0; i < kMaxInstancesPerHost; ++i) started.push_back(start(executable));
+    EXPECT_GT(number(started.back(), kInstance), 0);
+    EXPECT_EQ(number(start(executable), kErrorCode), EAGAIN);
+    askAbout(kTerminate, started.front());
+    EXPECT_GT(number(start(executable), kInstance), 0);
+    // The launcher takes along what still runs.
+    launcher.reset();
+    EXPECT_TRUE(processesWith(executable).empty());
+}
+
+TEST_F(LauncherTest, RemovalEndsInstancesOfThatVersionAndTakesTheirGrantsBack) {
+    const std::string one = plugIn("one", "sleep 1000 &\nread -r line");
+    const std::string two = plugIn("two", "cat", "2");
+    EXPECT_EQ(grant(one), 0);
+    EXPECT_EQ(grant(two), 0);
+    const Message first = start(one), second = start(one), other = start(two);
+    std::optional<Launcher::Status> status;
+    const auto terminate = [&](const char* version) {
+        status.reset();
+        launcher->terminatePlugInInstances("one", version, queue, [&](auto s) { status = s; });
+        EXPECT_FALSE(status);
+        EXPECT_TRUE(stepUntil([&] { return status.has_value(); }));
+    };
+    terminate("2");
+    EXPECT_EQ(status, Launcher::kNoneOnRecord);
+    terminate("1");
+    EXPECT_EQ(status, Launcher::kDone);
+    EXPECT_TRUE(processesWith(one).empty());
+    EXPECT_EQ(number(start(one), kErrorCode), EPERM);
+    terminate("1");
+    EXPECT_EQ(status, Launcher::kNoneOnRecord);
+    EXPECT_EQ(talk(other.takeDescriptor(), "still here"), "still here");
+}
+
+TEST_F(LauncherTest, CountsWorkThatIsNotDone) {
+    auto first = launcher->beginOutstandingWork(), second = launcher->beginOutstandingWork();
+    EXPECT_EQ(launcher->outstandingWork(), 2);
+    second.reset();
+    EXPECT_EQ(launcher->outstandingWork(), 1);
+}
+
+TEST_F(LauncherTest, WithoutItsNameItGoesOnWithoutStarting) {
+    ProcessLauncher second(directories, "test", std::shared_ptr<RunLoop>(&loop, [](RunLoop*) {}));
+    loop.poll();
+    EXPECT_EQ(errorLines("no plug-in will be started"), 1u);
+    const std::string executable = plugIn("one", "echo fine");
+    EXPECT_EQ(grant(executable), 0);
+    EXPECT_EQ(talk(start(executable).takeDescriptor()), "fine\n");
+}
+
+}  // namespace
+
+}  // namespace platform::spawnerd
