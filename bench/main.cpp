@@ -45,7 +45,8 @@ void measure(const std::vector<World>& worlds, const Options& options, const std
         report.begin(title, onOneCpu ? "" : "/free");
         const int freshScans = onOneCpu && !options.quick ? 3 : 1;
         const Run run{worlds, scratch, options.quick, freshScans, report};
-
+        measureStarts(run);
+        measureReplies(run);
         measureChanges(run);
     }
 }
