@@ -176,6 +176,7 @@ void DiskWorkspace::rescan(const Scopes& touched) {
     queue_.assertCurrent();
     if (closing_) return;
     RegistryChanges changes = scanner_.scanTouched(touched);
+    if (!changes.records() && !changes.lists()) return gatherer_->walkEnded(scanner_.isComplete());
     static_cast<void>(apply(changes));
 }
 
