@@ -40,11 +40,11 @@ bool MatchResult::wins(const ZRDPlugIn& plugIn, const Dictionary& accepted,
 
 bool MatchResult::admit(const ZRDPlugIn& plugIn) {
     constexpr std::uint64_t kKeepAll = ZRDiscoverVersions | ZRDiscoverDuplicates;
+    // Where the one that is admitted is put.
+    place_ = &byIdentifier_[plugIn.identifier()];
     if ((flags_ & kKeepAll) == kKeepAll) return true;
-    auto rivals = byIdentifier_.find(plugIn.identifier());
-    if (rivals == byIdentifier_.end()) return true;
     std::size_t next = kNone;
-    for (std::size_t i = rivals->second.first; i != kNone; i = next) {
+    for (std::size_t i = place_->first; i != kNone; i = next) {
         Accepted& rival = accepted_[i];
         next = rival.nextOfIdentifier;
         if (rival.displaced) continue;
@@ -58,13 +58,9 @@ bool MatchResult::admit(const ZRDPlugIn& plugIn) {
 
 void MatchResult::append(std::shared_ptr<ZRDPlugIn> plugIn, Dictionary form) {
     std::size_t index = accepted_.size();
-    auto [rivals, isFirst] =
-        byIdentifier_.try_emplace(plugIn->identifier(), SameIdentifier{index, index});
-    if (!isFirst) {
-        accepted_[rivals->second.last].nextOfIdentifier = index;
-        rivals->second.last = index;
-    }
-    const Value* replaced = plugIn->valueForEntitlement(entitlement::kReplacePlugIn);
+    (place_->first == kNone ? place_->first : accepted_[place_->last].nextOfIdentifier) = index;
+    place_->last = index;
+    const Value* replaced = plugIn->replaced();
     accepted_.push_back({std::move(plugIn), std::move(form)});
     if (!replaced) return;
     if (replaced->string()) replacers_[*replaced->string()] = index;

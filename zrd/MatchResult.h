@@ -26,7 +26,7 @@ class MatchResult {
     /// Whether the plug-in wins against the accepted forms of its identifier; the form that it
     /// beats is taken out.
     bool admit(const ZRDPlugIn& plugIn);
-    /// Accepts the form of a plug-in that was admitted.
+    /// Accepts the form of the plug-in that was admitted last.
     void append(std::shared_ptr<ZRDPlugIn> plugIn, platform::Dictionary form);
     /// Sets "overrider" on the form of each replaced plug-in and "overriding" on its replacer's.
     void linkOverrides();
@@ -46,8 +46,8 @@ class MatchResult {
         bool displaced = false;
     };
     struct SameIdentifier {
-        std::size_t first;
-        std::size_t last;
+        std::size_t first = kNone;
+        std::size_t last = kNone;
     };
 
     bool wins(const ZRDPlugIn& plugIn, const platform::Dictionary& accepted,
@@ -56,7 +56,8 @@ class MatchResult {
     std::uint64_t flags_;
     std::vector<Accepted> accepted_;
     std::unordered_map<std::string_view, SameIdentifier>
-        byIdentifier_;  // keys of accepted plug-ins
+        byIdentifier_;                 // keys of accepted plug-ins
+    SameIdentifier* place_ = nullptr;  // of the plug-in that was admitted last
     /// Who replaces an identifier. It stays so when it is displaced itself.
     std::unordered_map<std::string, std::size_t> replacers_;
 };

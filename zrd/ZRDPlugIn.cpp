@@ -32,6 +32,7 @@ ZRDPlugIn::ZRDPlugIn(platform::TDPlugInProxyRef proxy, std::shared_ptr<const Plu
       registeredAttributes_(tdproxy_->attributes()),
       isDedicated_(ZRPlugInCore::isDedicated()),
       hostEntitlement_(pluginKey(key::kHostEntitlement)),
+      replaced_(tdproxy_->entitlements.get().find(entitlement::kReplacePlugIn)),
       extensionPoint_(attributeOrInfoKey(key::kExtensionPoint)),
       context_(std::move(context)) {}
 
@@ -175,9 +176,7 @@ bool ZRDPlugIn::hasEntitlement(std::string_view name) const {
 }
 
 const std::string& ZRDPlugIn::annotationKey() const {
-    const Value* replaced = valueForEntitlement(entitlement::kReplacePlugIn);
-    if (replaced && replaced->string()) return *replaced->string();
-    return identifier();
+    return replaced_ && replaced_->string() ? *replaced_->string() : identifier();
 }
 
 Dictionary ZRDPlugIn::prunedInfoDictionaryFor(const Dictionary& dictionary) {

@@ -54,6 +54,9 @@ class ZRDPlugIn final : public ZRPlugInCore {
     const platform::Value* valueForEntitlement(std::string_view name) const;
     /// Whether that value is there and does not equal boolean false.
     bool hasEntitlement(std::string_view name) const;
+    /// What its entitlement to replace other plug-ins names: a text, a list of texts, something
+    /// else, or null.
+    const platform::Value* replaced() const { return replaced_; }
     /// The key of the user's choices about this plug-in: the identifier that it replaces, else its
     /// own.
     const std::string& annotationKey() const;
@@ -114,6 +117,7 @@ class ZRDPlugIn final : public ZRPlugInCore {
     // What every discovery asks of every candidate.
     const bool isDedicated_;
     const platform::Value* const hostEntitlement_;
+    const platform::Value* const replaced_;
     const platform::Value* const extensionPoint_;
     const std::shared_ptr<const PlugInContext> context_;
     mutable std::mutex mutex_;  // guards what follows

@@ -157,7 +157,11 @@ void DiskWorkspace::firstScan() {
     if (closing_ || std::exchange(isScanned_, true)) return;
     // Filled in place: the scanner refers to the state.
     state_ = catalogue_->load();
+    // Marking every directory takes time, and lookups wait: it is left to a second walk, which
+    // finds what has changed since the first.
+    watch_.postpone(true);
     RegistryChanges changes = scanner_.scanAll();
+    watch_.postpone(false);
     EVLOG_INFO(ops(), "{} plug-ins in {} applications, {} new, {} gone", state_.plugIns.size(),
                state_.applications.size(), changes.installed.size(), changes.uninstalled.size());
     if (!changes.records()) publish(changes);
@@ -165,12 +169,14 @@ void DiskWorkspace::firstScan() {
         queue_.runLoop(), watch_, settings_, [this](const Scopes& touched) { rescan(touched); });
     // The catalogue has told of a failure, and nobody waits for an answer.
     static_cast<void>(apply(changes));
+    queue_.async([this] { rescan({std::string()}); });
 }
 
 void DiskWorkspace::rescan(const Scopes& touched) {
     queue_.assertCurrent();
     if (closing_) return;
     RegistryChanges changes = scanner_.scanTouched(touched);
+    if (!changes.records() && !changes.lists()) return gatherer_->walkEnded(scanner_.isComplete());
     static_cast<void>(apply(changes));
 }
 

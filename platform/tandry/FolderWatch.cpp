@@ -61,7 +61,7 @@ void FolderWatch::beginWalk(bool overEverything) {
     ++walk_;
     isOverEverything_ = overEverything;
     shortage_ = 0;
-    if (inotify_) return;
+    if (inotify_ || isPostponed_) return;
     inotify_.reset(::inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
     if (!inotify_) shortage_ = errno;
 }

@@ -30,6 +30,9 @@ class FolderWatch {
     explicit FolderWatch(std::size_t mostWatches = std::numeric_limits<std::size_t>::max())
         : mostWatches_(mostWatches) {}
 
+    /// Walks mark nothing until this is called with false.
+    void postpone(bool isPostponed) { isPostponed_ = isPostponed; }
+
     /// Begins a walk. `overEverything` says that it will mark all that still matters.
     void beginWalk(bool overEverything);
 
@@ -83,6 +86,7 @@ class FolderWatch {
     std::map<std::string, Descriptor> paths_;
     std::uint32_t walk_ = 0;
     bool isOverEverything_ = false;
+    bool isPostponed_ = false;
     bool isShort_ = false;
     int shortage_ = 0;  // the errno that kept this walk from a watch
 };

@@ -71,7 +71,7 @@ class RegistryTest : public testing::Test {
     }
     ~RegistryTest() override { stop(); }
 
-    /// Opens the registry and waits for its first scan.
+    /// Opens the registry and waits for its first scan, and until directories are watched.
     void start() {
         stop();
         merges = 0;
@@ -92,10 +92,10 @@ class RegistryTest : public testing::Test {
         recorder.workspace = workspace.get();
         observation = workspace->addObserver(recorder);
         workspace->activate();
+        settle();  // behind the first scan, which orders a second walk
         settle();
     }
-    /// Waits until the registry's thread has done what it was given: it is then behind the first
-    /// scan's announcements.
+    /// Waits until the registry's thread has done what it was given.
     void settle() { static_cast<void>(workspace->unregisterPlugIn("/nowhere")); }
     void stop() {
         observation.reset();
