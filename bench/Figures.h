@@ -26,6 +26,9 @@ void measureStarts(const Run& run);
 /// How fast running daemons answer.
 void measureReplies(const Run& run);
 
+/// How fast plug-ins are made ready and started.
+void measurePlugIns(const Run& run);
+
 /// How fast choices get to the disk, and how soon an installed bundle is found.
 void measureChanges(const Run& run);
 

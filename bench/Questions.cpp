@@ -111,6 +111,12 @@ std::string smallRequest() {
                          {zorvan::message::kFlags, 0}});
 }
 
+std::string readyRequest(const platform::Uuid& uuid) {
+    return requestFrame({{zorvan::message::kRequest, zorvan::request::kReady},
+                         {zorvan::message::kVersion, zorvan::kProtocolVersion},
+                         {zorvan::message::kUuids, platform::Array{uuid}}});
+}
+
 std::string annotateRequest(const platform::Uuid& uuid) {
     return requestFrame(
         {{zorvan::message::kRequest, zorvan::request::kAnnotate},
@@ -139,6 +145,17 @@ std::vector<platform::Uuid> uuidsIn(std::string_view frame) {
         uuids.push_back(*uuid);
     }
     return uuids;
+}
+
+std::vector<std::string> pathsIn(std::string_view frame) {
+    std::vector<std::string> paths;
+    for (const Value& form : formsIn(frame)) {
+        const Value* path =
+            form.dictionary() ? form.dictionary()->find(zorvan::form::kPath) : nullptr;
+        if (!path || !path->string()) fail("a match has no path");
+        paths.push_back(*path->string());
+    }
+    return paths;
 }
 
 void expectSuccess(std::string_view frame) {

@@ -27,6 +27,9 @@ struct Question {
 /// The request that does nothing ("bulk"), as a frame.
 std::string smallRequest();
 
+/// The request that makes a plug-in ready.
+std::string readyRequest(const platform::Uuid& uuid);
+
 /// Requests that set the election of a plug-in, and the extensions of several.
 std::string annotateRequest(const platform::Uuid& uuid);
 std::string bulkAnnotateRequest(const std::vector<platform::Uuid>& uuids);
@@ -37,6 +40,8 @@ void expectSuccess(std::string_view frame);
 
 /// The plug-ins in a match's reply frame.
 std::vector<platform::Uuid> uuidsIn(std::string_view frame);
+/// The bundles of the plug-ins in a match's reply frame.
+std::vector<std::string> pathsIn(std::string_view frame);
 
 /// Whether a reply frame holds just the plug-ins that were asked for.
 bool isAnswered(const Question& question, std::string_view frame);

@@ -114,7 +114,8 @@ void World::makePlugIn(const std::string& application, std::size_t number) {
     writeFile(path + "/Info.plist", plugInInfo(number, pointOfPlugIn(number), rare), true);
     if (number % 50 == 0) writeFile(path + "/Entitlements.plist", plugInEntitlements(number), true);
     const std::string executable = fmt::format("{}/PlugIn{:05}", path, number);
-    writeFile(executable, "#!/bin/sh\n", false);
+    // Says something as soon as it runs: to its host, or wherever else it may.
+    writeFile(executable, "#!/bin/sh\nprintf x >&\"${ZORVAN_PLUGIN_FD:-1}\"\n", false);
     ::chmod(executable.c_str(), 0755);
 }
 

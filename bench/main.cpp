@@ -47,6 +47,7 @@ void measure(const std::vector<World>& worlds, const Options& options, const std
         const Run run{worlds, scratch, options.quick, freshScans, report};
         measureStarts(run);
         measureReplies(run);
+        measurePlugIns(run);
         measureChanges(run);
     }
 }
