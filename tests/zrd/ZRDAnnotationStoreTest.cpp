@@ -168,6 +168,17 @@ TEST_F(AnnotationStoreTest, AFailedSaveKeepsTheChangeForTheNextOne) {
     EXPECT_TRUE(root().find("data")->dictionary()->contains("a"));
 }
 
+TEST_F(AnnotationStoreTest, WhatHostsStoreLeavesRoomForElections) {
+    open();
+    const auto fits = [&](std::size_t megabytes) {
+        // Each character takes five in the file.
+        const std::string text((megabytes << 20) / 5, '&');
+        return store_->hasRoomFor(Dictionary{{"extension", Dictionary{{"k", text}}}}, *plugIn("a"));
+    };
+    EXPECT_TRUE(fits(191));
+    EXPECT_FALSE(fits(193));
+}
+
 TEST_F(AnnotationStoreTest, TheDefaultPlaceIsMadePrivateAndItsLackStopsTheDaemon) {
     platform::Directories directories;
     directories.stateHome = directory_.path("deep/state");
