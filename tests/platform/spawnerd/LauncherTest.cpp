@@ -1,3 +1,9 @@
+#include <sys/socket.h>
+#include <sys/syscall.h>
+#include <sys/un.h>
+
+#include <cstddef>
+
 #include "platform/Files.h"
 #include "tests/platform/spawnerd/LauncherFixture.h"
 
@@ -51,6 +57,25 @@ TEST_F(LauncherTest, OnlyPlugInsThatMayUseItHaveTheNetwork) {
         EXPECT_TRUE(seen.starts_with("net:")) << profile;
         EXPECT_EQ(seen == ours, profile == "plugin") << profile;
     }
+}
+
+TEST_F(LauncherTest, NamesOutsideTheFilesAreOutOfReach) {
+    const std::string name = "zorvan-test-" + std::to_string(::getpid());
+    const UniqueFd socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    sockaddr_un address{AF_UNIX, {}};
+    std::ranges::copy(name, address.sun_path + 1);
+    const auto size = static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + 1 + name.size());
+    ASSERT_EQ(::bind(socket.get(), reinterpret_cast<sockaddr*>(&address), size), 0);
+    ASSERT_EQ(::listen(socket.get(), 1), 0);
+    if (::syscall(444, nullptr, 0, 1) < 6) GTEST_SKIP() << "this kernel cannot keep them apart";
+    const std::string executable =
+        plugIn("one",
+               "exec python3 -c 'import socket, sys\n"
+               "try: socket.socket(socket.AF_UNIX).connect(chr(0) + sys.argv[1])\n"
+               "except PermissionError: print(\"refused\", end=str())' " +
+                   name);
+    EXPECT_EQ(grant(executable), 0);
+    EXPECT_EQ(talk(start(executable).takeDescriptor()), "refused");
 }
 
 TEST_F(LauncherTest, BadGrantsAreRefused) {
