@@ -170,13 +170,13 @@ TEST_F(AnnotationStoreTest, AFailedSaveKeepsTheChangeForTheNextOne) {
 
 TEST_F(AnnotationStoreTest, WhatHostsStoreLeavesRoomForElections) {
     open();
-    const auto fits = [&](std::size_t megabytes) {
-        // Each character takes five in the file.
-        const std::string text((megabytes << 20) / 5, '&');
-        return store_->hasRoomFor(Dictionary{{"extension", Dictionary{{"k", text}}}}, *plugIn("a"));
+    const Array text{std::string(16u << 20, 'x')};
+    const auto fits = [&](std::size_t texts) {
+        const Dictionary data{{"k", Array(std::vector<Value>(texts, text))}};
+        return store_->hasRoomFor(Dictionary{{"extension", data}}, *plugIn("a"));
     };
-    EXPECT_TRUE(fits(191));
-    EXPECT_FALSE(fits(193));
+    EXPECT_TRUE(fits(11));
+    EXPECT_FALSE(fits(13));
 }
 
 TEST_F(AnnotationStoreTest, TheDefaultPlaceIsMadePrivateAndItsLackStopsTheDaemon) {
