@@ -25,6 +25,7 @@ TEST_F(LauncherTest, APlugInTalksToItsHostAndSeesNothingElse) {
                    "\n"
                    "touch $HOME/mine && echo wrote\n"
                    "touch ${0%/*}/mine || touch /mine || echo may not\n"
+                   "(: >>/proc/sys/kernel/core_pattern) && echo may set the kernel\n"
                    "echo $XDG_RUNTIME_DIR/zorvan/services/*\n"
                    "for n in 4 5 6 7 8 9; do test -e /proc/$$/fd/$n && echo leak $n; done\n"
                    "ls /root /home /run/user\n"
