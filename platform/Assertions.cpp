@@ -37,14 +37,17 @@ bool isLocked(int file) {
     return ::fcntl(file, F_OFD_GETLK, &lock) == 0 && lock.l_type != F_UNLCK;
 }
 
-Dictionary reportIn(int folder, const char* name) {
-    const Result<std::string> bytes = readFileAt(folder, name, kMaxReport);
-    if (!bytes) return {};
-    const Result<Value> report = parsePropertyList(*bytes);
+/// Of the file that was looked at: by its name, its writer might have exchanged it meanwhile.
+Dictionary reportIn(int file) {
+    std::string bytes(kMaxReport + 1, '\0');
+    const ssize_t count = ::pread(file, bytes.data(), bytes.size(), 0);
+    if (count <= 0 || count > static_cast<ssize_t>(kMaxReport)) return {};
+    bytes.resize(static_cast<std::size_t>(count));
+    const Result<Value> report = parsePropertyList(bytes);
     return report && report->dictionary() ? *report->dictionary() : Dictionary();
 }
 
-/// Calls `visit(folder, name, isLocked)` for the files of a folder.
+/// Calls `visit(folder, name, file)` for the files of a folder.
 template <class Visit>
 void forEachFile(const std::string& path, Visit visit) {
     const std::unique_ptr<DIR, int (*)(DIR*)> folder(::opendir(path.c_str()), &::closedir);
@@ -58,7 +61,7 @@ void forEachFile(const std::string& path, Visit visit) {
             ::openat(fd, entry->d_name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
         struct stat status;
         if (file && ::fstat(file.get(), &status) == 0 && S_ISREG(status.st_mode))
-            visit(fd, entry->d_name, isLocked(file.get()));
+            visit(fd, entry->d_name, file.get());
     }
 }
 
@@ -71,10 +74,9 @@ class FileAssertions final : public Assertions {
         std::vector<Dictionary> reports;
         for (const std::string& identifier : bundleIdentifiers) {
             if (!isSafeName(identifier)) continue;
-            forEachFile(folderOf(directories_, identifier),
-                        [&](int folder, const char* name, bool locked) {
-                            if (locked) reports.push_back(reportIn(folder, name));
-                        });
+            forEachFile(folderOf(directories_, identifier), [&](int, const char*, int file) {
+                if (isLocked(file)) reports.push_back(reportIn(file));
+            });
         }
         return reports;
     }
@@ -95,8 +97,8 @@ Result<BusyAssertion> BusyAssertion::take(const Directories& directories,
     const std::string folder = folderOf(directories, bundleIdentifier);
     if (auto error = makeDirectories(folder, 0700)) return *error;
     // What crashed instances left. Files get their names with their locks.
-    forEachFile(folder, [](int fd, const char* name, bool locked) {
-        if (!locked) ::unlinkat(fd, name, 0);
+    forEachFile(folder, [](int fd, const char* name, int file) {
+        if (!isLocked(file)) ::unlinkat(fd, name, 0);
     });
     const Result<std::string> report =
         writeXmlPropertyList(Dictionary{{kAssertionBundleIdentifier, bundleIdentifier}});

@@ -1,5 +1,7 @@
 // The requests "annotate" and "bulk-annotate".
 
+#include <unordered_set>
+
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
 #include "platform/Value.h"
@@ -51,7 +53,10 @@ void Transaction::annotatePlugIns() {
     }
     if (change.empty()) return done();
 
+    // A plug-in named again has the change already. Everybody waits for each change to be stored.
+    std::unordered_set<platform::Uuid> changed;
     bool completed = processUuidList([&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
+        if (!changed.insert(plugIn->uuid()).second) return Walk::Continue;
         if (!hasRoomFor(change, *plugIn)) {
             fail(kZRErrorInvalidRequest, "invalid request format (annotation extension)");
             return Walk::Stop;

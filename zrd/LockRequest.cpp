@@ -54,6 +54,11 @@ void Transaction::releaseHolds(const Array& tokens) {
 
 bool Transaction::collectPlugInsToHold(ZRDPlugInList& plugIns) {
     const std::uint64_t flags = unsignedUnder(message::kFlags);
+    // A path named again adds nothing: what is collected does not grow with the request's repeats.
+    ZRDPlugInHold::PlugIns known;
+    const auto add = [&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
+        if (known.insert(plugIn).second) plugIns.push_back(plugIn);
+    };
     return marshalPaths([&](const std::string& path, bool resolved) {
         if (!resolved) {
             fail(kZRErrorPath, fmt::format("invalid path: {}", path));
@@ -65,10 +70,10 @@ bool Transaction::collectPlugInsToHold(ZRDPlugInList& plugIns) {
                 fail(kZRErrorPath, fmt::format("no plug-in at path:{}", path));
                 return Walk::Stop;
             }
-            plugIns.push_back(std::move(plugIn));
+            add(plugIn);
         } else if (flags == ZRHoldApplications) {
-            auto inside = server().plugInsWithinApplication(path).value_or(ZRDPlugInList());
-            std::ranges::move(inside, std::back_inserter(plugIns));
+            const auto inside = server().plugInsWithinApplication(path);
+            if (inside) std::ranges::for_each(*inside, add);
         } else {
             fail(kZRErrorInvalidRequest, "invalid request format (unsupported hold flags)");
             return Walk::Stop;

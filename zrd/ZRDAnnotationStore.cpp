@@ -136,7 +136,9 @@ bool ZRDAnnotationStore::hasRoomFor(const Dictionary& annotation, const ZRDPlugI
     platform::PropertyListCost after = cost_;
     after += costOf(key, merged(annotation, key));
     if (const Value* current = annotations_.find(key)) after -= costOf(key, *current);
-    return after.fits(AnnotationText::kMaxSize);
+    const bool isNoMore =
+        after.objects <= cost_.objects && after.bytes <= cost_.bytes && after.work <= cost_.work;
+    return isNoMore || after.fits(AnnotationText::kMaxSize - kReservedForElections);
 }
 
 void ZRDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,

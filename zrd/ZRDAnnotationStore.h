@@ -36,8 +36,12 @@ class ZRDAnnotationStore {
     const platform::Dictionary* annotationForIdentifier(std::string_view key) const;
     const platform::Dictionary* annotationForPlugIn(const ZRDPlugIn& plugIn) const;
 
-    /// Whether the file, which has a largest size, could hold a change as well. One that is made
-    /// all the same would keep every later one from being saved.
+    /// Of the file's largest size, what hosts' data leaves for the user's elections.
+    static constexpr std::size_t kReservedForElections = 64u << 20;
+
+    /// Whether the file, which has a largest size, could hold a host's data as well and still have
+    /// room for elections, or holds no more than before. A change that is made all the same might
+    /// keep every later one from being saved.
     bool hasRoomFor(const platform::Dictionary& annotation, const ZRDPlugIn& plugIn) const;
 
     /// Merges the entries of `annotation` into the plug-in's annotation, or removes that when there

@@ -146,7 +146,7 @@ std::optional<Dictionary> ZRDPlugIn::form(std::optional<ZRError>& error) const {
     }
     auto made = exportForm(error);
     if (!made) return std::nullopt;
-    // Tokens that could not be issued now may be another time.
+    // Tokens that could not be issued now may be another time, and others may go stale.
     if (!augmentForm(*made)) return made;
     platform::keepCborEncoded(*made);
     std::lock_guard lock(mutex_);

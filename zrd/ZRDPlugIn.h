@@ -45,9 +45,9 @@ class ZRDPlugIn final : public ZRPlugInCore {
     /// around what is not part of the system.
     std::optional<ZRError> diagnose() const override;
 
-    /// The record's form as `exportForm` makes it and `augmentForm` completes it, made and encoded
-    /// at the first call and shared from then on; setting a name makes it afresh. An error: there
-    /// is none, as with `exportForm`.
+    /// The record's form as `exportForm` makes it and `augmentForm` completes it. Unless its tokens
+    /// may go stale, it is made and encoded at the first call and shared from then on; setting a
+    /// name makes it afresh. An error: there is none, as with `exportForm`.
     std::optional<platform::Dictionary> form(std::optional<ZRError>& error) const;
 
     /// The plug-in's value for an entitlement, or null.
@@ -79,7 +79,8 @@ class ZRDPlugIn final : public ZRPlugInCore {
     /// A token for each named resource of the bundle ("." is the bundle), under its name; those for
     /// which there is none are left out, with a log line. `resources` is a text or a list.
     platform::Dictionary issueResourceExtensions(const platform::Value& resources) const;
-    /// Adds the tokens for what the plug-in shares with hosts. Whether there is one for everything.
+    /// Adds the tokens for what the plug-in shares with hosts. Whether they are good for as long as
+    /// this record.
     bool augmentForm(platform::Dictionary& form) const;
     /// What a busy running instance says of itself, or none.
     std::optional<platform::Dictionary> checkBusy() const;

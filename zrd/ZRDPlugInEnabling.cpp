@@ -149,11 +149,9 @@ bool ZRDPlugIn::augmentForm(Dictionary& form) const {
     if (!resources) return true;
     const Dictionary extensions = issueResourceExtensions(*resources);
     form.set(form::kExtensions, extensions);
-    const auto isThere = [&](const Value& name) {
-        return !name.string() || extensions.contains(*name.string());
-    };
-    return resources->array() ? std::ranges::all_of(*resources->array(), isThere)
-                              : isThere(*resources);
+    // Another bundle is another record. What lies in it may be exchanged without that, and then a
+    // token for what was there grants nothing any more.
+    return resources == &bundleItself && !extensions.empty();
 }
 
 }  // namespace zorvan

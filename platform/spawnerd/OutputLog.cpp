@@ -39,7 +39,7 @@ bool OutputLog::readOn() {
 }
 
 void OutputLog::take(const char* bytes, std::size_t count) {
-    for (std::size_t i = 0; i < count && logged_ < kMaxLogged; ++i) {
+    for (std::size_t i = 0; i < count && logged_ < kMaxLogged && lines_ < kMaxLines; ++i) {
         ++logged_;
         if (bytes[i] != '\n') line_.push_back(bytes[i]);
         if (bytes[i] == '\n' || line_.size() == kMaxLine || logged_ == kMaxLogged) endLine();
@@ -47,7 +47,9 @@ void OutputLog::take(const char* bytes, std::size_t count) {
 }
 
 void OutputLog::endLine() {
-    if (!line_.empty()) EVLOG_INFO(ops(), "plug-in {} writes: {}", pub(name_), line_);
+    if (line_.empty()) return;
+    EVLOG_INFO(ops(), "plug-in {} writes: {}", pub(name_), line_);
+    ++lines_;
     line_.clear();
 }
 

@@ -10,12 +10,13 @@
 namespace platform::spawnerd {
 
 /// Logs what a plug-in, or bubblewrap on its behalf, writes to its standard output and error, a
-/// line at a time, at info level. After so many bytes it reads on but logs no more. On the loop's
-/// thread.
+/// line at a time, at info level. After so many bytes or lines it reads on but logs no more. On the
+/// loop's thread.
 class OutputLog {
   public:
     static constexpr std::size_t kMaxLogged = 64u << 10;
     static constexpr std::size_t kMaxLine = 1024;
+    static constexpr std::size_t kMaxLines = 1024;
 
     /// `pipe` is non-blocking.
     OutputLog(RunLoop& loop, UniqueFd pipe, std::string name);
@@ -34,7 +35,7 @@ class OutputLog {
     const UniqueFd pipe_;
     const std::string name_;
     std::string line_;
-    std::size_t logged_ = 0;
+    std::size_t logged_ = 0, lines_ = 0;
     std::optional<RunLoop::Watch> watch_;  // until the end of the output
 };
 

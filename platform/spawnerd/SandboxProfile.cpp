@@ -64,7 +64,9 @@ void bindSystem(Arguments& arguments, const SandboxProfile& profile) {
     }
     for (const char* path : kSystemFiles) append(arguments, {"--ro-bind-try", path, path});
     for (const char* path : profile.files) append(arguments, {"--ro-bind-try", path, path});
-    append(arguments, {"--proc", "/proc", "--dev", "/dev", "--tmpfs", "/tmp"});
+    // Root owns the kernel's settings below /proc, also without any privileges.
+    append(arguments, {"--proc", "/proc", "--remount-ro", "/proc"});
+    append(arguments, {"--dev", "/dev", "--tmpfs", "/tmp"});
 }
 
 /// The sockets themselves: their directory holds locks, too, which would be anybody's to take.

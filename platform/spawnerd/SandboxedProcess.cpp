@@ -2,7 +2,6 @@
 
 #include <fcntl.h>
 #include <signal.h>
-#include <spawn.h>
 #include <sys/mman.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
@@ -12,6 +11,7 @@
 #include <iterator>
 #include <string_view>
 
+#include "platform/spawnerd/ChildProcess.h"
 #include "platform/spawnerd/Protocol.h"
 
 namespace platform::spawnerd {
@@ -23,12 +23,6 @@ namespace {
 constexpr int kArgumentsFd = kConnectionDescriptor + 1;
 constexpr int kInfoFd = kArgumentsFd + 1;
 constexpr int kGateFd = kInfoFd + 1;
-
-/// A duplicate with a number that is none of the child's: giving the child one of its descriptors
-/// then never closes the source of another.
-UniqueFd outOfTheWay(int fd) {
-    return UniqueFd(::fcntl(fd, F_DUPFD_CLOEXEC, kGateFd + 1));
-}
 
 struct Pipe {
     UniqueFd readEnd, writeEnd;
@@ -63,45 +57,6 @@ UniqueFd fileOf(const std::vector<std::string>& arguments) {
     return file;
 }
 
-/// How the child begins: with these descriptors and no others, and with the signals as they are by
-/// default, whatever this process ignores.
-class SpawnPlan {
-  public:
-    SpawnPlan() {
-        ::posix_spawn_file_actions_init(&files_);
-        ::posix_spawnattr_init(&attributes_);
-        sigset_t signals;
-        ::sigemptyset(&signals);
-        ::posix_spawnattr_setsigmask(&attributes_, &signals);
-        ::sigfillset(&signals);
-        ::posix_spawnattr_setsigdefault(&attributes_, &signals);
-        ::posix_spawnattr_setflags(&attributes_, POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSIGDEF);
-    }
-    SpawnPlan(const SpawnPlan&) = delete;
-    ~SpawnPlan() {
-        ::posix_spawn_file_actions_destroy(&files_);
-        ::posix_spawnattr_destroy(&attributes_);
-    }
-
-    /// Duplicates `source` for the child; false when there are no descriptors left.
-    bool give(int source, int target) {
-        sources_.push_back(outOfTheWay(source));
-        return sources_.back() &&
-               ::posix_spawn_file_actions_adddup2(&files_, sources_.back().get(), target) == 0;
-    }
-    int run(const char* program, char* const argv[], pid_t& pid) {
-        static char path[] = "PATH=/usr/bin:/bin";
-        static char* const environment[] = {path, nullptr};
-        ::posix_spawn_file_actions_addclosefrom_np(&files_, kGateFd + 1);
-        return ::posix_spawn(&pid, program, &files_, &attributes_, argv, environment);
-    }
-
-  private:
-    posix_spawn_file_actions_t files_;
-    posix_spawnattr_t attributes_;
-    std::vector<UniqueFd> sources_;
-};
-
 }  // namespace
 
 Result<SandboxedProcess> SandboxedProcess::spawn(const std::string& program,
@@ -126,18 +81,22 @@ Result<SandboxedProcess> SandboxedProcess::spawn(const std::string& program,
     Pipe info, gate, output;
     const UniqueFd file = fileOf(arguments);
     const UniqueFd null(::open("/dev/null", O_RDONLY | O_CLOEXEC));
-    SpawnPlan plan;
+    ChildProcess child(kGateFd);
     const bool ready =
         file && null && info.open() && gate.open() && output.open() &&
-        plan.give(null.get(), STDIN_FILENO) && plan.give(output.writeEnd.get(), STDOUT_FILENO) &&
-        plan.give(output.writeEnd.get(), STDERR_FILENO) &&
-        plan.give(connection.get(), kConnectionDescriptor) && plan.give(file.get(), kArgumentsFd) &&
-        plan.give(info.writeEnd.get(), kInfoFd) && plan.give(gate.readEnd.get(), kGateFd);
+        child.give(null.get(), STDIN_FILENO) && child.give(output.writeEnd.get(), STDOUT_FILENO) &&
+        child.give(output.writeEnd.get(), STDERR_FILENO) &&
+        child.give(connection.get(), kConnectionDescriptor) &&
+        child.give(file.get(), kArgumentsFd) && child.give(info.writeEnd.get(), kInfoFd) &&
+        child.give(gate.readEnd.get(), kGateFd);
     if (!ready) return Error::posix(errno, "cannot start " + program);
 
     SandboxedProcess process;
-    if (const int failure = plan.run(program.c_str(), argv.data(), process.pid))
-        return Error::posix(failure, "cannot start " + program);
+    static char path[] = "PATH=/usr/bin:/bin";
+    static char* const environment[] = {path, nullptr};
+    const Result<pid_t> pid = child.run(program.c_str(), argv.data(), environment);
+    if (!pid) return Error::posix(pid.error().code, "cannot start " + program);
+    process.pid = *pid;
     process.pidFd.reset(static_cast<int>(::syscall(SYS_pidfd_open, process.pid, 0)));
     if (!process.pidFd) {
         const int failure = errno;

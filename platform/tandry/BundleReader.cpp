@@ -309,7 +309,8 @@ std::optional<Error> BundleReader::describePlugIn(const BundleFolder& folder,
 
     TDPlugInProxy& record = *entry.record;
     record.bundlePath = folder.path;
-    if (bundle) record.bundleIdentifier = *bundle;
+    // Never empty: it tells the launcher whose instances a removal ends.
+    record.bundleIdentifier = bundle ? *bundle : *identifier;
     record.plugInIdentifier = *identifier;
     record.originalIdentifier = *original;
     const std::string* version = stringAt(info, "QFBundleVersion");

@@ -27,7 +27,7 @@ struct TDPlugInProxy {
 
     Uuid plugInUuid;
     std::optional<std::string> bundlePath;  // canonical path of the bundle directory
-    std::string bundleIdentifier;           // "QFBundleIdentifier"; may be empty
+    std::string bundleIdentifier;           // "QFBundleIdentifier", else the identifier
     std::optional<std::string> plugInIdentifier;
     std::optional<std::string> originalIdentifier;
     std::string bundleVersion;  // may be empty

@@ -177,6 +177,10 @@ TEST(Enabling, OnlyWhatLiesInTheBundleIsShared) {
     EXPECT_THAT(log.take(),
                 Contains("ops I: failed to make extension for " + *proxy->bundlePath +
                          "/../out in plug-in at " + *proxy->bundlePath + ": Permission denied"));
+    auto single = makeProxy("com.a", {}, {{"Shared", "in"}, {"VXExtensionProtocol", "P"}});
+    single->bundlePath = proxy->bundlePath;
+    EXPECT_FALSE(world.record(single)->augmentForm(form)) << "another file may take its place";
+    EXPECT_TRUE(form.find("extensions")->dictionary()->contains("in"));
     auto unshared = makeProxy("com.b", {}, {{"VXExtensionProtocol", "P"}});
     unshared->bundlePath = "/Apps/Host.app/PlugIns/b.plugin";
     Dictionary untouched;

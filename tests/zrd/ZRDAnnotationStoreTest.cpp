@@ -168,6 +168,17 @@ TEST_F(AnnotationStoreTest, AFailedSaveKeepsTheChangeForTheNextOne) {
     EXPECT_TRUE(root().find("data")->dictionary()->contains("a"));
 }
 
+TEST_F(AnnotationStoreTest, WhatHostsStoreLeavesRoomForElections) {
+    open();
+    const Array text{std::string(16u << 20, 'x')};
+    const auto fits = [&](std::size_t texts) {
+        const Dictionary data{{"k", Array(std::vector<Value>(texts, text))}};
+        return store_->hasRoomFor(Dictionary{{"extension", data}}, *plugIn("a"));
+    };
+    EXPECT_TRUE(fits(11));
+    EXPECT_FALSE(fits(13));
+}
+
 TEST_F(AnnotationStoreTest, TheDefaultPlaceIsMadePrivateAndItsLackStopsTheDaemon) {
     platform::Directories directories;
     directories.stateHome = directory_.path("deep/state");

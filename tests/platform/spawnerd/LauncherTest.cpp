@@ -1,3 +1,9 @@
+#include <sys/socket.h>
+#include <sys/syscall.h>
+#include <sys/un.h>
+
+#include <cstddef>
+
 #include "platform/Files.h"
 #include "tests/platform/spawnerd/LauncherFixture.h"
 
@@ -19,6 +25,7 @@ TEST_F(LauncherTest, APlugInTalksToItsHostAndSeesNothingElse) {
                    "\n"
                    "touch $HOME/mine && echo wrote\n"
                    "touch ${0%/*}/mine || touch /mine || echo may not\n"
+                   "(: >>/proc/sys/kernel/core_pattern) && echo may set the kernel\n"
                    "echo $XDG_RUNTIME_DIR/zorvan/services/*\n"
                    "for n in 4 5 6 7 8 9; do test -e /proc/$$/fd/$n && echo leak $n; done\n"
                    "ls /root /home /run/user\n"
@@ -51,6 +58,24 @@ TEST_F(LauncherTest, OnlyPlugInsThatMayUseItHaveTheNetwork) {
         EXPECT_TRUE(seen.starts_with("net:")) << profile;
         EXPECT_EQ(seen == ours, profile == "plugin") << profile;
     }
+}
+
+TEST_F(LauncherTest, NamesOutsideTheFilesAreOutOfReach) {
+    const std::string name = "zorvan-test-" + std::to_string(::getpid());
+    const UniqueFd socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    sockaddr_un address{AF_UNIX, {}};
+    std::ranges::copy(name, address.sun_path + 1);
+    const auto size = static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + 1 + name.size());
+    ASSERT_EQ(::bind(socket.get(), reinterpret_cast<sockaddr*>(&address), size), 0);
+    ASSERT_EQ(::listen(socket.get(), 1), 0);
+    if (::syscall(444, nullptr, 0, 1) < 6) GTEST_SKIP() << "this kernel cannot keep them apart";
+    const std::string executable =
+        plugIn("one",
+               "exec perl -MSocket -e 'socket(S, AF_UNIX, SOCK_STREAM, 0);"
+               "print connect(S, pack(\"S a*\", AF_UNIX, \"\\0" +
+                   name + "\")) ? \"in\" : \"$!\"'");
+    EXPECT_EQ(grant(executable), 0);
+    EXPECT_EQ(talk(start(executable).takeDescriptor()), "Operation not permitted");
 }
 
 TEST_F(LauncherTest, BadGrantsAreRefused) {

@@ -60,6 +60,8 @@ TEST_F(RegistryTest, CompletesTheDictionaries) {
               {{"QFBundleVersion", "7"}, {"QFBundleShortVersionString", "2"}});
     addPlugIn(apps + "A.app/PlugIns/C.appex", "c", {{"VXExtensionPointIdentifier", "org.point"}});
     addPlugIn(apps + "A.app/PlugIns/D.appex", "d");
+    writePlist(apps + "A.app/PlugIns/F.appex/Info.plist",
+               {{"VXExtension", Dictionary{{"VXExtensionIdentifier", "f"}}}});
     // Reading this file fails with EIO.
     std::filesystem::create_symlink("/proc/self/mem", files.path("home/zorvan/SDKs/org.bad.plist"));
     addPlugIn(apps + "A.app/PlugIns/E.appex", "e", {{"VXExtensionPointIdentifier", "org.bad"}});
@@ -86,6 +88,7 @@ TEST_F(RegistryTest, CompletesTheDictionaries) {
     EXPECT_EQ(*b->lookup("VXExtensionPointIdentifier", Scope::Attributes), Value("other"));
     EXPECT_EQ(plugIn("c")->attributes(), nullptr);
     EXPECT_EQ(*plugIn("d")->attributes(), (Dictionary{{"VXExtensionVersion", "1"}}));
+    EXPECT_EQ(plugIn("f")->bundleIdentifier, "f") << "its instances are known by it";
 }
 
 TEST_F(RegistryTest, NamesFollowTheUsersLanguage) {
