@@ -204,7 +204,7 @@ holder=$!
 soon 0 test -s "$home/hold"
 cat "$home/hold"
 show "Its plug-ins have vanished ..." \
-    text-tool
+    zrctl match VXExtensionPointIdentifier=com.example.text-transform
 show "... and are not started, even for somebody who remembers the UUID of one (Word Count):" \
     sh -c "zrctl run $words 2>&1 < README.md || true"
 show "Whoever has the token gives the hold back:" \
@@ -213,7 +213,7 @@ kill "$holder"
 wait "$holder"
 holder=
 show "All is as before:" \
-    text-tool
+    zrctl match VXExtensionPointIdentifier=com.example.text-transform
 say "Two bundles were refused; the log says which and why:"
 sed -n -e 's/.*\(leaving out a plug-in.*\)/\1/p' -e 's/.*\(ignoring mis-configured.*\)/\1/p' "$home/log" |
     sort -u
