@@ -23,7 +23,7 @@ library=$(dirname "$(find "$root" -name libzorvan.so)")
 
 # The examples, as somebody who has nothing but the installation would build them.
 cp -R examples "$root/examples"
-cmake -S "$root/examples" -B "$root/examples-build" -DCMAKE_PREFIX_PATH="$root" > /dev/null
+cmake -G Ninja -S "$root/examples" -B "$root/examples-build" -DCMAKE_PREFIX_PATH="$root" > /dev/null
 cmake --build "$root/examples-build" > /dev/null
 # It finds its library beside it, and is no plug-in of a host here.
 status=0
