@@ -146,7 +146,8 @@ void addAnnotate(CLI::App& app, Options& options) {
 }
 
 void addWatch(CLI::App& app, Options& options) {
-    app.add_subcommand("watch", "Write a line whenever choices have changed, until interrupted")
+    app.add_subcommand("watch",
+                       "Write a line whenever choices or holds have changed, until interrupted")
         ->callback([&options] { options.command = Options::Command::Watch; });
 }
 
