@@ -146,7 +146,8 @@ void addAnnotate(CLI::App& app, Options& options) {
 }
 
 void addWatch(CLI::App& app, Options& options) {
-    app.add_subcommand("watch", "Write a line whenever choices have changed, until interrupted")
+    app.add_subcommand("watch",
+                       "Write a line whenever choices or holds have changed, until interrupted")
         ->callback([&options] { options.command = Options::Command::Watch; });
 }
 
@@ -164,10 +165,10 @@ void addRun(CLI::App& app, Options& options) {
     CLI::App* run = app.add_subcommand(
         "run", "Run a plug-in in its sandbox, connected with standard input and output");
     run->footer(kRunFooter);
-    run->add_option("plugin", options.plugIns, "The plug-in")
+    const auto name = [&options](const std::string& plugIn) { options.plugIns = {plugIn}; };
+    run->add_option_function<std::string>("plugin", name, "The plug-in")
         ->type_name("PLUGIN")
-        ->required()
-        ->expected(1);
+        ->required();
     run->add_option("argument", options.arguments, "What it is given on its command line")
         ->type_name("-- ARGS");
     run->callback([&options] { options.command = Options::Command::Run; });

@@ -31,11 +31,11 @@ void Relay::Stream::read() {
         atEnd = true;
 }
 
-bool Relay::Stream::write() {
+int Relay::Stream::write() {
     const ssize_t count = ::write(to, pending.data(), pending.size());
-    if (count < 0) return isToBeRepeated(errno);
+    if (count < 0) return isToBeRepeated(errno) ? 0 : errno;
     pending.erase(0, static_cast<std::size_t>(count));
-    return true;
+    return 0;
 }
 
 Relay::Relay(platform::UniqueFd connection)
@@ -50,16 +50,19 @@ Relay::Relay(platform::UniqueFd connection)
 void Relay::moveInput(bool readable, bool writable) {
     if (input_.isDone()) return;
     if (readable) input_.read();
-    if (writable && !input_.write()) input_ = {input_.from, input_.to, {}, true};
+    if (writable && input_.write() != 0) input_ = {input_.from, input_.to, {}, true};
     if (input_.isDone()) ::shutdown(connection_.get(), SHUT_WR);
 }
 
-void Relay::moveOutput(bool readable, bool writable) {
+std::optional<Error> Relay::moveOutput(bool readable, bool writable) {
     if (readable) output_.read();
-    if (!writable || output_.write()) return;
-    // The plug-in learns of it when it writes on.
+    const int failure = writable ? output_.write() : 0;
+    if (failure == 0) return std::nullopt;
+    if (failure != EPIPE) return Error::posix(failure, "cannot write");
+    // Nobody reads any more. The plug-in learns of it when it writes on.
     output_ = {output_.from, output_.to, {}, true};
     ::shutdown(connection_.get(), SHUT_RD);
+    return std::nullopt;
 }
 
 Result<bool> Relay::run(int ended, int stop) {
@@ -84,7 +87,8 @@ Result<bool> Relay::run(int ended, int stop) {
         constexpr short kBroken = POLLHUP | POLLERR | POLLNVAL;
         const short peer = waited[3].revents;
         moveInput(waited[2].revents, sends && (peer & (POLLOUT | kBroken)));
-        moveOutput(receives && (peer & (POLLIN | kBroken)), waited[4].revents);
+        auto failure = moveOutput(receives && (peer & (POLLIN | kBroken)), waited[4].revents);
+        if (failure) return *std::move(failure);
     }
     return true;
 }

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <optional>
 #include <string>
 
 #include "platform/Error.h"
@@ -29,12 +30,12 @@ class Relay {
         bool reads() const { return !atEnd && pending.empty(); }
         bool isDone() const { return atEnd && pending.empty(); }
         void read();
-        /// False when nobody takes it any more.
-        bool write();
+        /// Answers 0, or why nothing more can be written.
+        int write();
     };
 
     void moveInput(bool readable, bool writable);
-    void moveOutput(bool readable, bool writable);
+    std::optional<platform::Error> moveOutput(bool readable, bool writable);
 
     platform::UniqueFd connection_;
     Stream input_, output_;

@@ -4,6 +4,7 @@
 #include <cstdio>
 #include <cstdlib>
 
+#include "platform/Process.h"
 #include "tools/zrctl/AnnotationCommands.h"
 #include "tools/zrctl/ExcludeCommand.h"
 #include "tools/zrctl/HoldCommands.h"
@@ -62,6 +63,7 @@ int finish(zrctl::Outcome outcome) {
 }  // namespace
 
 int main(int argc, char** argv) {
+    platform::openStandardDescriptors();
     std::signal(SIGPIPE, SIG_IGN);
     zrctl::terminal::useUtf8();
     // The library's lines about connections would say again what the commands say themselves.
