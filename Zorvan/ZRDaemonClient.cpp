@@ -37,13 +37,24 @@ ZRDaemonClient::ZRDaemonClient(const char* serviceName)
           platform::Directories::fromEnvironment(), serviceName ? serviceName : kDefaultServiceName,
           replyQueue_)),
       protocolVersion_(kProtocolVersion) {
-    zrd_->setEventHandler([](const ConnectionError& event) {
+    zrd_->setEventHandler([this](const ConnectionError& event) {
         EVLOG_ERROR(ops(), "Communications error: {}", pub(event));
+        hasEnded_ = true;
+        if (auto handler = std::exchange(endHandler_, nullptr)) handler();
     });
     zrd_->resume();
 }
 
 ZRDaemonClient::~ZRDaemonClient() = default;
+
+void ZRDaemonClient::setEndHandler(std::function<void()> handler) {
+    replyQueue_.async([this, handler = std::move(handler)]() mutable {
+        if (!hasEnded_)
+            endHandler_ = std::move(handler);
+        else if (handler)
+            handler();
+    });
+}
 
 namespace {
 

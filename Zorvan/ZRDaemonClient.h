@@ -54,6 +54,11 @@ class ZRDaemonClient {
     platform::ClientConnection& zrd() { return *zrd_; }
     platform::SerialQueue& replyQueue() { return replyQueue_; }
 
+    /// Replaces what is called, once, when the connection has ended, and with it this client's
+    /// holds: on the queue, after the connection's error event was logged. Soon when it has ended
+    /// already.
+    void setEndHandler(std::function<void()> handler);
+
     /// A request with its type and version, and with its "paths".
     platform::Message request(const char* type) const;
     platform::Message request(const char* type, const std::vector<std::string>& paths) const;
@@ -102,7 +107,10 @@ class ZRDaemonClient {
     ~ZRDaemonClient();
     static void destroy(ZRDaemonClient* client);
 
-    // The connection goes before the queue that it delivers on.
+    // The queue's.
+    std::function<void()> endHandler_;
+    bool hasEnded_ = false;
+    // The connection goes before the queue that it delivers on, and that before what is used there.
     platform::SerialQueue replyQueue_;
     std::unique_ptr<platform::ClientConnection> zrd_;
     std::atomic<std::int64_t> protocolVersion_;

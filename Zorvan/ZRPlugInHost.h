@@ -32,9 +32,8 @@ class ZRPlugInHost {
     /// The service name of the daemon, for a `ZRDaemonClient`.
     const std::string& serviceName() const { return serviceName_; }
 
-    /// States that this plug-in is busy, as long as the assertion lives: nobody can take the
-    /// plug-in, or its application, out of service meanwhile. Errors: the system's, in the domain
-    /// "POSIX".
+    /// States that this plug-in is busy, as long as the assertion lives: nobody can take its
+    /// application out of service meanwhile. Errors: the system's, in the domain "POSIX".
     platform::Result<platform::BusyAssertion> beginBusy() const;
 
   private:

@@ -34,6 +34,9 @@ class Launcher {
     /// From any thread.
     virtual int addExternalService(const AuditToken& host, const std::string& executable,
                                    const Dictionary& overlay) = 0;
+    /// Takes back what lets hosts start the executables of a bundle, by its canonical path. From
+    /// then on none is started unless it is added anew; instances that run go on. From any thread.
+    virtual void removeExternalServices(const std::string& bundlePath) = 0;
 
     /// Marks work that is not done as long as the marker lives; the daemon is not to be stopped for
     /// idleness meanwhile. From any thread.

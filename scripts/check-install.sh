@@ -20,3 +20,12 @@ library=$(dirname "$(find "$root" -name libzorvan.so)")
     -L "$library" -Wl,-rpath,"$library" -lzorvan -lfmt -o "$root/host"
 "$root/host"
 "$root/bin/zrctl" --version
+
+# The examples, as somebody who has nothing but the installation would build them.
+cp -R examples "$root/examples"
+cmake -G Ninja -S "$root/examples" -B "$root/examples-build" -DCMAKE_PREFIX_PATH="$root" > /dev/null
+cmake --build "$root/examples-build" > /dev/null
+# It finds its library beside it, and is no plug-in of a host here.
+status=0
+"$root/examples-build/Applications/Scribe.app/PlugIns/TitleCase.appex/title-case" 2> /dev/null || status=$?
+[ "$status" = 2 ]

@@ -1,6 +1,6 @@
 #!/usr/bin/env bash
 # Builds zrd, starts it in a directory of its own with the example applications, and shows what zrctl
-# finds. Nothing outside that directory and build/ is touched; everything started here ends here.
+# finds and how plug-ins are used. Nothing outside that directory and build/ is touched; everything started here ends here.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
@@ -9,15 +9,17 @@ say() { printf '\n\033[1m%s\033[0m\n' "$*"; }
 scripts/deps.sh
 say "Building (the first time takes a few minutes)"
 cmake --preset release > /dev/null
-cmake --build --preset release --target zrd zrctl
-PATH=$PWD/build/release/zrd:$PWD/build/release/tools/zrctl:$PATH
+cmake --build --preset release --target zrd zrctl examples
+PATH=$PWD/build/release/zrd:$PWD/build/release/tools/zrctl:$PWD/build/release/examples:$PATH
 
 home=$(mktemp -d /tmp/zrd-demo.XXXXXX)
 daemon=
 watcher=
+host=
+holder=
 finish() {
     local process
-    for process in $daemon $watcher; do
+    for process in $host $holder $watcher $daemon; do
         kill "$process" 2> /dev/null || true
         wait "$process" 2> /dev/null || true
     done
@@ -29,10 +31,10 @@ trap 'exit 143' TERM
 
 # A home of its own; of the system only the data that is shared by all users, such as the MIME types.
 export XDG_RUNTIME_DIR=$home/run XDG_DATA_HOME=$home/data XDG_CONFIG_HOME=$home/config
-export XDG_STATE_HOME=$home/state XDG_DATA_DIRS=/usr/local/share:/usr/share
+export XDG_STATE_HOME=$home/state XDG_DATA_DIRS=/usr/local/share:/usr/share HOME=$home
 mkdir -m 700 "$XDG_RUNTIME_DIR"
 mkdir -p "$XDG_DATA_HOME/zorvan" "$XDG_CONFIG_HOME/zorvan/ByHost"
-cp -R examples/Applications examples/SDKs "$XDG_DATA_HOME/zorvan/"
+cp -R build/release/examples/Applications examples/SDKs "$XDG_DATA_HOME/zorvan/"
 machine=$(cat /etc/machine-id 2> /dev/null || true)
 cp examples/exclusions.plist \
     "$XDG_CONFIG_HOME/zorvan/ByHost/com.orbel.zorvan.userprefs.${machine:-local}.plist"
@@ -156,6 +158,62 @@ cp -R "$home/Paintbox.app" "$applications/"
 soon 0 zrctl match VXExtensionIdentifier=com.example.paintbox.frames
 show "Nobody had to tell zrd:" \
     zrctl match
+say "Plug-ins are there to be used. Here is an application that does, the text tool of examples/."
+show "It asks for the plug-ins that transform text:" \
+    text-tool
+if problem=$(bwrap --unshare-user --disable-userns --unshare-pid --unshare-ipc --unshare-uts \
+    --unshare-cgroup --ro-bind / / --proc /proc --dev /dev true 2>&1); then
+    show "It has one made ready and started, in a sandbox, and gets a connection to it. This is a shell script:" \
+        sh -c 'echo "the quick fox, and a lazy dog." | text-tool com.example.shout'
+    show "This one is a program in C++:" \
+        sh -c 'echo "the quick fox, and a lazy dog." | text-tool com.example.scribe.title-case'
+    show "Two, of two applications, one after the other:" \
+        sh -c 'echo "the quick fox" | text-tool com.example.courier.reverse | text-tool com.example.shout'
+    show "zrctl runs plug-ins, too:" \
+        sh -c 'zrctl run com.example.scribe.word-count < README.md'
+    echo "Nobody but me may read this." > "$home/letter"
+    say "The plug-in Quote Files puts a file in the place of each line \"@file\". The user has a letter:"
+    ls -l "$home/letter"
+    show "But in its sandbox a plug-in sees the system and its own data, and nothing of the user's home:" \
+        sh -c 'printf "Dear all,\n@$HOME/letter\n" | text-tool com.example.courier.quote'
+
+    say "Who replaces an application takes it out of service first. Title Case is in the middle of a text:"
+    mkfifo "$home/text"
+    text-tool com.example.scribe.title-case < "$home/text" > "$home/answer" &
+    host=$!
+    exec 4> "$home/text"
+    echo "to be continued" >&4
+    soon 0 test -s "$home/answer"
+    cat "$home/answer"
+    show "So its application cannot be held now, and who is busy is named:" \
+        sh -c 'zrctl hold --app "$XDG_DATA_HOME/zorvan/Applications/Scribe.app" 2>&1 || true'
+    exec 4>&-
+    wait "$host"
+    host=
+    say "The text has ended."
+else
+    say "No plug-in is started here: bubblewrap can make no sandbox on this machine, and nothing runs
+without one. ($problem)"
+fi
+words=$(zrctl match --json VXExtensionIdentifier=com.example.scribe.word-count |
+    sed -n 's/.*"uuid": "\([^"]*\)".*/\1/p')
+say "Scribe is held, until this is interrupted; it writes a token:"
+echo '$ zrctl hold --app Scribe.app'
+zrctl hold --app "$applications/Scribe.app" > "$home/hold" &
+holder=$!
+soon 0 test -s "$home/hold"
+cat "$home/hold"
+show "Its plug-ins have vanished ..." \
+    zrctl match VXExtensionPointIdentifier=com.example.text-transform
+show "... and are not started, even for somebody who remembers the UUID of one (Word Count):" \
+    sh -c "zrctl run $words 2>&1 < README.md || true"
+show "Whoever has the token gives the hold back:" \
+    zrctl release "$(cat "$home/hold")"
+kill "$holder"
+wait "$holder"
+holder=
+show "All is as before:" \
+    zrctl match VXExtensionPointIdentifier=com.example.text-transform
 say "Two bundles were refused; the log says which and why:"
 sed -n -e 's/.*\(leaving out a plug-in.*\)/\1/p' -e 's/.*\(ignoring mis-configured.*\)/\1/p' "$home/log" |
     sort -u

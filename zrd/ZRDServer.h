@@ -46,8 +46,9 @@ class ZRDServer final : public ZRDatabase, public ZRDatabaseDelegate {
     /// Whether any hold, of whichever client, has the plug-in.
     bool holdOnPlugIn(const ZRDPlugIn& plugIn);
     std::vector<std::shared_ptr<ZRDPlugInHold>> holds();
-    /// Adds a hold and, like the two that release holds, posts the change notification.
-    void addHold(std::shared_ptr<ZRDPlugInHold> hold);
+    /// Adds a hold, which also takes its plug-ins back from the hosts that they were made ready
+    /// for, and, like the two that release holds, posts the change notification.
+    void addHold(const std::shared_ptr<ZRDPlugInHold>& hold);
     /// Releases the hold with a token; an unknown one is ignored.
     void unholdToken(const platform::Uuid& token);
     /// Releases every hold of this very client.

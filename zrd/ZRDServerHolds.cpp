@@ -17,11 +17,14 @@ std::vector<std::shared_ptr<ZRDPlugInHold>> ZRDServer::holds() {
     return syncQueue_.sync([&] { return holds_; });
 }
 
-void ZRDServer::addHold(std::shared_ptr<ZRDPlugInHold> hold) {
+void ZRDServer::addHold(const std::shared_ptr<ZRDPlugInHold>& hold) {
     syncQueue_.sync([&] {
         for (const auto& plugIn : hold->blocked()) ++heldPlugIns_[plugIn->uuid()];
-        holds_.push_back(std::move(hold));
+        holds_.push_back(hold);
     });
+    // Once the hold is there, "ready" refuses; what it granted before must not outlast that.
+    for (const auto& plugIn : hold->blocked())
+        services().launcher->removeExternalServices(plugIn->path());
     notifyAnnotationChange();
 }
 

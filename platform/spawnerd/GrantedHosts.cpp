@@ -51,13 +51,10 @@ int GrantedHosts::add(const AuditToken& token, Grant grant) {
     return 0;
 }
 
-void GrantedHosts::takeBack(const std::string& bundleIdentifier, const std::string& bundleVersion) {
+void GrantedHosts::takeBack(const std::function<bool(const Grant&)>& which) {
     const std::lock_guard lock(mutex_);
     for (auto& [pid, host] : hosts_)
-        std::erase_if(host->grants, [&](const auto& entry) {
-            return entry.second->bundleIdentifier == bundleIdentifier &&
-                   entry.second->bundleVersion == bundleVersion;
-        });
+        std::erase_if(host->grants, [&](const auto& entry) { return which(*entry.second); });
 }
 
 GrantedHosts::Host GrantedHosts::find(const AuditToken& token) const {

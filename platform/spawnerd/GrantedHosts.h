@@ -46,8 +46,8 @@ class GrantedHosts : public std::enable_shared_from_this<GrantedHosts> {
 
     /// Answers 0, ESRCH for a process that has ended, or ENOSPC. From any thread.
     int add(const AuditToken& token, Grant grant);
-    /// Takes back the grants for a plug-in. From any thread.
-    void takeBack(const std::string& bundleIdentifier, const std::string& bundleVersion);
+    /// Takes back, from every host, the grants for which `which` holds. From any thread.
+    void takeBack(const std::function<bool(const Grant&)>& which);
 
     /// The host that a process is; null when nothing was ever granted to it, or it has ended. From
     /// any thread.

@@ -38,6 +38,10 @@ int ProcessLauncher::addExternalService(const AuditToken& host, const std::strin
     return service_->grant(host, executable, overlay);
 }
 
+void ProcessLauncher::removeExternalServices(const std::string& bundlePath) {
+    service_->takeBack(bundlePath);
+}
+
 std::unique_ptr<Launcher::WorkMarker> ProcessLauncher::beginOutstandingWork() {
     return std::make_unique<CountedMarker>(outstanding_);
 }

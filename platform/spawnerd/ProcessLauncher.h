@@ -18,6 +18,7 @@ class ProcessLauncher final : public Launcher {
 
     int addExternalService(const AuditToken& host, const std::string& executable,
                            const Dictionary& overlay) override;
+    void removeExternalServices(const std::string& bundlePath) override;
     std::unique_ptr<WorkMarker> beginOutstandingWork() override;
     void terminatePlugInInstances(const std::string& bundleIdentifier,
                                   const std::string& bundleVersion, SerialQueue& queue,

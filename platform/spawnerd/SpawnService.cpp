@@ -108,6 +108,10 @@ int SpawnService::grant(const AuditToken& host, const std::string& executable,
     return grant.error().code;
 }
 
+void SpawnService::takeBack(const std::string& bundlePath) {
+    hosts_->takeBack([&](const Grant& grant) { return grant.bundle == bundlePath; });
+}
+
 void SpawnService::accept(std::shared_ptr<Connection> connection) {
     // The connection holds the handler, so the handler must not hold it.
     connection->setEventHandler(
@@ -237,17 +241,17 @@ void SpawnService::hostDied(const Host& host) {
 
 void SpawnService::terminate(const std::string& bundleIdentifier, const std::string& bundleVersion,
                              std::function<void(bool)> completion) {
+    const auto isOfPlugIn = [bundleIdentifier, bundleVersion](const Grant& grant) {
+        return grant.bundleIdentifier == bundleIdentifier && grant.bundleVersion == bundleVersion;
+    };
     // At once: the same plug-in may be granted anew before the loop has its turn.
-    hosts_->takeBack(bundleIdentifier, bundleVersion);
-    queue_.async([weak = weak_from_this(), bundleIdentifier, bundleVersion,
-                  completion = std::move(completion)] {
+    hosts_->takeBack(isOfPlugIn);
+    queue_.async([weak = weak_from_this(), isOfPlugIn, completion = std::move(completion)] {
         auto self = weak.lock();
         if (!self) return;
         auto left = std::make_shared<std::size_t>(0);
         for (auto& [id, running] : self->instances_) {
-            const Grant& grant = *running.grant;
-            if (grant.bundleIdentifier != bundleIdentifier || grant.bundleVersion != bundleVersion)
-                continue;
+            if (!isOfPlugIn(*running.grant)) continue;
             ++*left;
             running.waiters.push_back([left, completion](int) {
                 if (--*left == 0) completion(true);

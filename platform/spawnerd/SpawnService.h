@@ -36,6 +36,8 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
 
     /// As `Launcher::addExternalService`. From any thread.
     int grant(const AuditToken& host, const std::string& executable, const Dictionary& overlay);
+    /// As `Launcher::removeExternalServices`. From any thread.
+    void takeBack(const std::string& bundlePath);
     /// As `Launcher::terminatePlugInInstances`, with a completion that is told whether there were
     /// any, on the loop. From any thread.
     void terminate(const std::string& bundleIdentifier, const std::string& bundleVersion,

@@ -104,6 +104,10 @@ struct FakeLauncher final : platform::Launcher {
         granted.emplace_back(executable, overlay);
         return refused.contains(executable) ? EACCES : 0;
     }
+    void removeExternalServices(const std::string& bundlePath) override {
+        takenBack.insert(bundlePath);
+    }
+    std::set<std::string> takenBack;
     std::unique_ptr<WorkMarker> beginOutstandingWork() override {
         struct Marker final : WorkMarker {
             explicit Marker(int& value) : count(value) { ++count; }

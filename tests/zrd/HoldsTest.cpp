@@ -51,6 +51,7 @@ TEST_F(HoldsTest, WhatIsHeldIsNeitherFoundNorMadeReady) {
     EXPECT_THAT(log.take(), Contains("ops D: hold request granted uuid:" + token.string()));
     EXPECT_EQ(posts(), 1u);
     EXPECT_EQ(launcher_->markers, 1);
+    EXPECT_THAT(launcher_->takenBack, ElementsAre(a_, b_));
     EXPECT_THAT(match({}), IsEmpty());
     codeSigning_->entitlements = {{entitlement::kManager, true}};
     EXPECT_THAT(match({{"flags", ZRDiscoverAll}}), ElementsAre("com.a", "com.b"));

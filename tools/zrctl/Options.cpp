@@ -31,6 +31,32 @@ to the first that the daemon does not know.
 
 Exit status: 0 done; 1 no such plug-in; 2 wrong usage; 3 failure.)";
 
+constexpr const char* kNamesFooter =
+    R"(PLUGIN is the UUID of a plug-in, or its identifier, when just one plug-in has that.
+
+Exit status: 0 done; 1 no such plug-in; 2 wrong usage; 3 failure.)";
+
+constexpr const char* kRunFooter =
+    R"(PLUGIN is the UUID of a plug-in, or its identifier, when just one plug-in has that. What comes from
+standard input goes to the plug-in over its connection, what it answers to standard output. SIGINT and
+SIGTERM end it.
+
+Exit status: the plug-in's, or 128 and the number of the signal that ended it; 1 no such plug-in; 2 wrong
+usage; 3 failure, with a line on standard error.)";
+
+constexpr const char* kHoldFooter =
+    R"(No plug-in of a hold is found by hosts, made ready or started; those that run go on. The token of the
+hold is written at once; the hold is given back when SIGINT or SIGTERM comes, when the process ends in
+any other way, or with "zrctl release TOKEN". The paths are taken together: all are held, or none.
+
+Exit status: 0 held until interrupted; 2 wrong usage; 3 failure, or refused because plug-ins are busy,
+which standard error names.)";
+
+constexpr const char* kReleaseFooter =
+    R"(A token of no hold (any more) is no failure.
+
+Exit status: 0 done; 2 wrong usage; 3 failure.)";
+
 constexpr const char* kAnnotateFooter =
     R"(An argument with "=" is a pair, every other one names a plug-in. VALUE is "true" or "false", which
 become booleans, or a text; the same KEY given again makes a list. Other keys that the plug-ins have
@@ -120,8 +146,57 @@ void addAnnotate(CLI::App& app, Options& options) {
 }
 
 void addWatch(CLI::App& app, Options& options) {
-    app.add_subcommand("watch", "Write a line whenever choices have changed, until interrupted")
+    app.add_subcommand("watch",
+                       "Write a line whenever choices or holds have changed, until interrupted")
         ->callback([&options] { options.command = Options::Command::Watch; });
+}
+
+void addReady(CLI::App& app, Options& options, Options::Command command, const char* name,
+              const char* help) {
+    CLI::App* subcommand = app.add_subcommand(name, help);
+    subcommand->footer(kNamesFooter);
+    subcommand->add_option("plugin", options.plugIns, "The plug-ins")
+        ->type_name("PLUGIN")
+        ->required();
+    subcommand->callback([&options, command] { options.command = command; });
+}
+
+void addRun(CLI::App& app, Options& options) {
+    CLI::App* run = app.add_subcommand(
+        "run", "Run a plug-in in its sandbox, connected with standard input and output");
+    run->footer(kRunFooter);
+    const auto name = [&options](const std::string& plugIn) { options.plugIns = {plugIn}; };
+    run->add_option_function<std::string>("plugin", name, "The plug-in")
+        ->type_name("PLUGIN")
+        ->required();
+    run->add_option("argument", options.arguments, "What it is given on its command line")
+        ->type_name("-- ARGS");
+    run->callback([&options] { options.command = Options::Command::Run; });
+}
+
+void addHold(CLI::App& app, Options& options) {
+    CLI::App* hold = app.add_subcommand("hold", "Take plug-ins out of service, until interrupted");
+    hold->footer(kHoldFooter);
+    CLI::Option_group* kind = hold->add_option_group("kind");
+    const auto flag = [&](const char* name, unsigned long value, const char* help) {
+        kind->add_flag_callback(
+            name, [&options, value] { options.flags = value; }, help);
+    };
+    flag("--app", zorvan::ZRHoldApplications,
+         "The paths are applications, with all their plug-ins; refused while one is busy");
+    flag("--plugin", zorvan::ZRHoldPlugIns, "The paths are plug-in bundles; busy or not");
+    kind->require_option(1);
+    hold->add_option("path", options.paths, "Applications, or plug-in bundles")
+        ->type_name("PATH")
+        ->required();
+    hold->callback([&options] { options.command = Options::Command::Hold; });
+
+    CLI::App* release = app.add_subcommand("release", "Give holds back");
+    release->footer(kReleaseFooter);
+    release->add_option("token", options.tokens, "What \"hold\" wrote")
+        ->type_name("TOKEN")
+        ->required();
+    release->callback([&options] { options.command = Options::Command::Release; });
 }
 
 void addExclude(CLI::App& app, Options& options) {
@@ -166,6 +241,12 @@ std::variant<Options, int> Options::parse(int argc, const char* const* argv) {
     addElect(app, options);
     addAnnotate(app, options);
     addWatch(app, options);
+    addReady(app, options, Command::Ready, "ready",
+             "Tell whether plug-ins can be made ready for this process");
+    addReady(app, options, Command::Access, "access",
+             "Write a token for read access to each plug-in's bundle");
+    addRun(app, options);
+    addHold(app, options);
     addExclude(app, options);
 
     try {

@@ -20,6 +20,11 @@ struct Options {
         Elect,
         Annotate,
         Watch,
+        Ready,
+        Access,
+        Run,
+        Hold,
+        Release,
         ExcludeList,
         ExcludeAdd,
         ExcludeRemove
@@ -31,18 +36,25 @@ struct Options {
     // match, exclude
     std::vector<std::string> rules;  // KEY=PATTERN, as given
 
+    // match, hold
+    std::uint64_t flags = 0;
+
     // match
     std::optional<std::string> rulesFile;
-    std::uint64_t flags = 0;
     Format format = Format::Table;
 
-    // add, remove
+    // add, remove, hold
     std::vector<std::string> paths;  // as given
 
-    // elect, annotate
+    // elect, annotate, ready, access, run
     std::vector<std::string> plugIns;  // as given; for annotate, with its KEY=VALUE among them
+
+    // elect, annotate
     int election = 0;
     bool replace = false;
+
+    std::vector<std::string> arguments;  // run
+    std::vector<std::string> tokens;     // release
 
     /// Reads the command line; or, when there is nothing (more) to do, the exit status: the help,
     /// the version or the complaint has been written then.

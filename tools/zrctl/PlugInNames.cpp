@@ -2,8 +2,11 @@
 
 #include <fmt/core.h>
 
+#include <map>
+
 #include "Zorvan/Keys.h"
 #include "Zorvan/ZRError.h"
+#include "platform/Utf8.h"
 #include "tools/zrctl/Listing.h"
 
 using platform::Array;
@@ -47,6 +50,46 @@ Outcome ambiguous(const std::string& name, const std::vector<Dictionary>& candid
 
 Outcome noSuchPlugIn(const std::string& name) {
     return {kNothingFound, {}, "no such plug-in: " + name};
+}
+
+Outcome failureWith(const std::vector<Uuid>& uuids, const platform::Error& error,
+                    const char* remark) {
+    const bool unknown = error.domain == zorvan::kZRErrorDomain &&
+                         error.code == zorvan::kZRErrorInvalidRequest &&
+                         error.text.starts_with("no such plugin");
+    if (!unknown) return Outcome::failure(error.text);
+    std::string names;
+    for (const Uuid& uuid : uuids) names += (names.empty() ? "" : ", ") + uuid.string();
+    return noSuchPlugIn(uuids.size() == 1 ? names : "one of " + names + remark);
+}
+
+Outcome withPlugIns(const std::string& service, const std::vector<std::string>& names,
+                    const std::function<Outcome(Session&, const std::vector<Uuid>&)>& work) {
+    for (const std::string& name : names)
+        if (!platform::isValidUtf8(name)) return Outcome::usage(name + ": not UTF-8 text");
+    Session session(service);
+    const auto uuids = plugInsNamed(session, names);
+    if (const auto* outcome = std::get_if<Outcome>(&uuids)) return *outcome;
+    return work(session, std::get<std::vector<Uuid>>(uuids));
+}
+
+std::variant<std::vector<Dictionary>, Outcome> formsOf(Session& session,
+                                                       const std::vector<Uuid>& uuids) {
+    Array patterns;
+    for (const Uuid& uuid : uuids) patterns.append("=" + uuid.string());
+    const Result<Array> forms = visiblePlugIns(session, {{zorvan::rule::kUuid, patterns}});
+    if (!forms) return Outcome::failure(forms.error().text);
+    std::map<std::string, Dictionary> known;
+    for (const Value& form : *forms)
+        if (form.dictionary())
+            known.emplace(fact(*form.dictionary(), zorvan::form::kUuid), *form.dictionary());
+    std::vector<Dictionary> found;
+    for (const Uuid& uuid : uuids) {
+        const auto form = known.find(uuid.string());
+        if (form == known.end()) return noSuchPlugIn(uuid.string() + " (or it is excluded)");
+        found.push_back(form->second);
+    }
+    return found;
 }
 
 Result<Array> visiblePlugIns(Session& session, const Dictionary& rules) {

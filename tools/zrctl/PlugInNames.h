@@ -1,5 +1,6 @@
 #pragma once
 
+#include <functional>
 #include <string>
 #include <variant>
 #include <vector>
@@ -25,5 +26,19 @@ platform::Result<platform::Array> visiblePlugIns(Session& session,
 
 /// The outcome for plug-ins that do not exist.
 Outcome noSuchPlugIn(const std::string& name);
+
+/// Calls `work` with a session and the plug-ins that names stand for.
+Outcome withPlugIns(
+    const std::string& service, const std::vector<std::string>& names,
+    const std::function<Outcome(Session&, const std::vector<platform::Uuid>&)>& work);
+
+/// The form of each of these plug-ins, in their order; or the outcome when one cannot be seen.
+std::variant<std::vector<platform::Dictionary>, Outcome> formsOf(
+    Session& session, const std::vector<platform::Uuid>& uuids);
+
+/// The outcome of a request about these plug-ins that failed. The daemon does not say which UUID it
+/// does not know; `remark` goes with that when it may be one of several.
+Outcome failureWith(const std::vector<platform::Uuid>& uuids, const platform::Error& error,
+                    const char* remark = "");
 
 }  // namespace zrctl

@@ -22,18 +22,26 @@ Result<std::string> absolutePath(const std::string& path, std::string_view direc
     return absolute;
 }
 
-Outcome runRegistration(const Options& options) {
+std::variant<std::vector<std::string>, Outcome> absolutePaths(
+    const std::vector<std::string>& paths) {
     std::error_code noDirectory;
     const std::string directory = std::filesystem::current_path(noDirectory).string();
     if (noDirectory)
         return Outcome::failure(
             fmt::format("cannot tell the current directory: {}", noDirectory.message()));
-    std::vector<std::string> paths;
-    for (const std::string& path : options.paths) {
+    std::vector<std::string> found;
+    for (const std::string& path : paths) {
         const Result<std::string> absolute = absolutePath(path, directory);
         if (!absolute) return Outcome::usage(absolute.error().text);
-        paths.push_back(*absolute);
+        found.push_back(*absolute);
     }
+    return found;
+}
+
+Outcome runRegistration(const Options& options) {
+    const auto absolute = absolutePaths(options.paths);
+    if (const auto* outcome = std::get_if<Outcome>(&absolute)) return *outcome;
+    const auto& paths = std::get<std::vector<std::string>>(absolute);
 
     Session session(options.service);
     const auto reply = session.ask([&](auto& client, const auto& callback) {

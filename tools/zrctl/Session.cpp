@@ -25,13 +25,19 @@ Error whyNoAnswer(const ConnectionError& error) {
 Session::Session(const std::string& service)
     : client_(ZRDaemonClient::initWithServiceName(service.c_str())) {}
 
-platform::Result<platform::Message> Session::ask(const Question& question) {
+ZRDaemonClient::Reply Session::replyTo(const Question& question) {
     // Shared with the callback: the reply queue may still be leaving it when this returns.
     auto promise = std::make_shared<std::promise<ZRDaemonClient::Reply>>();
     question(*client_,
              [promise](const ZRDaemonClient::Reply& reply) { promise->set_value(reply); });
-    const ZRDaemonClient::Reply reply = promise->get_future().get();
+    return promise->get_future().get();
+}
 
+platform::Result<platform::Message> Session::ask(const Question& question) {
+    return contentsOf(replyTo(question));
+}
+
+platform::Result<platform::Message> Session::contentsOf(const ZRDaemonClient::Reply& reply) {
     if (const auto* broken = std::get_if<ConnectionError>(&reply)) return whyNoAnswer(*broken);
     if (const auto refused = ZRDaemonClient::errorInReply(reply))
         return Error{refused->domain, refused->code, describe(*refused)};

@@ -22,6 +22,13 @@ class Session {
     /// Puts a question and waits for its reply. The error is for people: what the daemon answered,
     /// or why there was no answer.
     platform::Result<platform::Message> ask(const Question& question);
+    /// The same in two steps, for who wants to see more of a refusal than its text.
+    zorvan::ZRDaemonClient::Reply replyTo(const Question& question);
+    static platform::Result<platform::Message> contentsOf(
+        const zorvan::ZRDaemonClient::Reply& reply);
+
+    /// Calls `handler`, on a thread of its own, when the daemon has gone away.
+    void onEnd(std::function<void()> handler) { client_->setEndHandler(std::move(handler)); }
 
     /// The forms of the plug-ins that fit the rules; `flags`: ZRDiscover… in Zorvan/Keys.h.
     platform::Result<platform::Array> match(const platform::Dictionary& rules, std::uint64_t flags);

@@ -2,16 +2,15 @@
 
 #include <fmt/core.h>
 #include <poll.h>
-#include <sys/signalfd.h>
 #include <time.h>
 
 #include <cerrno>
-#include <csignal>
 #include <cstdint>
 
 #include "Zorvan/Keys.h"
 #include "platform/Directories.h"
 #include "platform/NotificationListener.h"
+#include "tools/zrctl/Interruption.h"
 #include "tools/zrctl/Json.h"
 
 using platform::Error;
@@ -22,16 +21,6 @@ using platform::UniqueFd;
 namespace zrctl {
 
 namespace {
-
-/// Readable when a signal asks for the end.
-UniqueFd endOfWatching() {
-    sigset_t signals;
-    sigemptyset(&signals);
-    sigaddset(&signals, SIGINT);
-    sigaddset(&signals, SIGTERM);
-    sigprocmask(SIG_BLOCK, &signals, nullptr);
-    return UniqueFd(::signalfd(-1, &signals, SFD_CLOEXEC));
-}
 
 std::string lines(std::uint64_t count) {
     const std::string line =
@@ -45,14 +34,14 @@ std::string lines(std::uint64_t count) {
 }  // namespace
 
 Outcome runWatch() {
-    const UniqueFd end = endOfWatching();
+    const Result<UniqueFd> end = interruption();
     Result<NotificationListener> listener = NotificationListener::make(
         platform::Directories::fromEnvironment(), zorvan::kAnnotationChangeNotification);
     if (!listener) return Outcome::failure(listener.error().text);
-    if (!end) return Outcome::failure(Error::posix(errno, "signalfd").text);
+    if (!end) return Outcome::failure(end.error().text);
 
     // Of the output only its end is waited for: a pipe that nobody reads any more.
-    pollfd waited[] = {{listener->descriptor(), POLLIN, 0}, {end.get(), POLLIN, 0}, {1, 0, 0}};
+    pollfd waited[] = {{listener->descriptor(), POLLIN, 0}, {end->get(), POLLIN, 0}, {1, 0, 0}};
     for (;;) {
         if (::poll(waited, 3, -1) < 0 && errno != EINTR)
             return Outcome::failure(Error::posix(errno, "poll").text);

@@ -4,12 +4,16 @@
 #include <cstdio>
 #include <cstdlib>
 
+#include "platform/Process.h"
 #include "tools/zrctl/AnnotationCommands.h"
 #include "tools/zrctl/ExcludeCommand.h"
+#include "tools/zrctl/HoldCommands.h"
 #include "tools/zrctl/MatchCommand.h"
 #include "tools/zrctl/Options.h"
 #include "tools/zrctl/Outcome.h"
+#include "tools/zrctl/ReadyCommands.h"
 #include "tools/zrctl/RegistrationCommands.h"
+#include "tools/zrctl/RunCommand.h"
 #include "tools/zrctl/Terminal.h"
 #include "tools/zrctl/WatchCommand.h"
 
@@ -29,6 +33,16 @@ zrctl::Outcome run(const zrctl::Options& options) {
             return zrctl::runAnnotate(options);
         case Command::Watch:
             return zrctl::runWatch();
+        case Command::Ready:
+            return zrctl::runReady(options);
+        case Command::Access:
+            return zrctl::runAccess(options);
+        case Command::Run:
+            return zrctl::runPlugIn(options);
+        case Command::Hold:
+            return zrctl::runHold(options);
+        case Command::Release:
+            return zrctl::runRelease(options);
         case Command::ExcludeList:
         case Command::ExcludeAdd:
         case Command::ExcludeRemove:
@@ -49,6 +63,7 @@ int finish(zrctl::Outcome outcome) {
 }  // namespace
 
 int main(int argc, char** argv) {
+    platform::openStandardDescriptors();
     std::signal(SIGPIPE, SIG_IGN);
     zrctl::terminal::useUtf8();
     // The library's lines about connections would say again what the commands say themselves.

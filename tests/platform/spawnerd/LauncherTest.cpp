@@ -195,6 +195,19 @@ TEST_F(LauncherTest, RemovalEndsInstancesOfThatVersionAndTakesTheirGrantsBack) {
     EXPECT_EQ(talk(other.takeDescriptor(), "still here"), "still here");
 }
 
+TEST_F(LauncherTest, WhatIsTakenBackIsNotStartedAgainButGoesOn) {
+    const std::string one = plugIn("one", "cat"), two = plugIn("two", "cat");
+    EXPECT_EQ(grant(one), 0);
+    EXPECT_EQ(grant(two), 0);
+    const Message running = start(one);
+    launcher->removeExternalServices(home.path("one.appex"));
+    EXPECT_EQ(number(start(one), kErrorCode), EPERM);
+    EXPECT_EQ(talk(running.takeDescriptor(), "still here"), "still here");
+    EXPECT_EQ(talk(start(two).takeDescriptor(), "two"), "two");
+    EXPECT_EQ(grant(one), 0);
+    EXPECT_EQ(talk(start(one).takeDescriptor(), "again"), "again");
+}
+
 TEST_F(LauncherTest, CountsWorkThatIsNotDone) {
     auto first = launcher->beginOutstandingWork(), second = launcher->beginOutstandingWork();
     EXPECT_EQ(launcher->outstandingWork(), 2);
