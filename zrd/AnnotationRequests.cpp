@@ -1,5 +1,6 @@
 // The requests "annotate" and "bulk-annotate".
 
+#include <unordered_map>
 #include <unordered_set>
 
 #include "Zorvan/Keys.h"
@@ -79,6 +80,12 @@ void Transaction::bulkAnnotatePlugIns() {
     const Dictionary* annotations = requestedAnnotations();
     if (!annotations) return;
     EVLOG_DEBUG(ops(), "bulk change requested for {} plug-ins", annotations->size());
+    // A UUID can be spelt in many ways, and each change is a sync of the disk: of the entries for
+    // one plug-in only the last is applied, which would replace what those before it had set.
+    std::unordered_map<platform::Uuid, const Value*> lastOf;
+    for (const auto& [key, value] : *annotations) {
+        if (auto uuid = platform::Uuid::parse(key)) lastOf[*uuid] = &value;
+    }
     for (const auto& [key, value] : *annotations) {
         if (!value.dictionary()) {
             return fail(kZRErrorAnnotation, "annotations values must be dictionaries");
@@ -87,6 +94,7 @@ void Transaction::bulkAnnotatePlugIns() {
         if (!uuid) return fail(kZRErrorAnnotation, "invalid plug-in UUID value");
         auto plugIn = server().findPlugIn(*uuid);
         if (!plugIn) return fail(kZRErrorRegistration, "no plug-in with the requested uuid");
+        if (lastOf[*uuid] != &value) continue;
         const Dictionary change{{annotation::kExtension, value}};
         if (!hasRoomFor(change, *plugIn)) {
             return fail(kZRErrorAnnotation, "annotations values must be dictionaries");

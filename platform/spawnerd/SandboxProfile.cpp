@@ -47,6 +47,9 @@ constexpr const char* kConfinement[] = {
     "--hostname",       "plugin",
 };
 
+/// Bytes that a plug-in may put into memory as files.
+constexpr const char* kMostTemporary = "67108864";
+
 using Arguments = std::vector<std::string>;
 
 void append(Arguments& arguments, std::initializer_list<std::string_view> more) {
@@ -66,7 +69,7 @@ void bindSystem(Arguments& arguments, const SandboxProfile& profile) {
     for (const char* path : profile.files) append(arguments, {"--ro-bind-try", path, path});
     // Root owns the kernel's settings below /proc, also without any privileges.
     append(arguments, {"--proc", "/proc", "--remount-ro", "/proc"});
-    append(arguments, {"--dev", "/dev", "--tmpfs", "/tmp"});
+    append(arguments, {"--dev", "/dev", "--size", kMostTemporary, "--tmpfs", "/tmp"});
 }
 
 /// The sockets themselves: their directory holds locks, too, which would be anybody's to take.

@@ -140,6 +140,11 @@ TEST_F(AnnotationRequestsTest, BulkChangesGiveEachPlugInItsOwnExtension) {
     EXPECT_EQ(bulkAnnotate(Dictionary()), Dictionary());
     EXPECT_EQ(posts(), 1u);
 
+    // Two spellings of one UUID, of which the later one in the order of keys counts.
+    EXPECT_EQ(bulkAnnotate(Dictionary{{uuid(1).string(), first}, {lower, second}}), Dictionary());
+    EXPECT_EQ(*stored()[1].dictionary()->find("extension"), Value(second));
+    EXPECT_EQ(posts(), 1u);
+
     const std::string known = uuid(0).string();
     EXPECT_EQ(bulkAnnotate("x"), error(4, "invalid request format (bad annotations dictionary)"));
     EXPECT_EQ(bulkAnnotate(Dictionary{{known, 1}}),
