@@ -69,12 +69,12 @@ ProtocolRef ZRProtocolNamed(ObjectRuntime& runtime, const std::string& name,
     return nullptr;
 }
 
-ProtocolRef ZRCompoundProtocol(ObjectRuntime& runtime, const platform::Value& specification,
+ProtocolRef ZRCompoundProtocol(ObjectRuntime& runtime, const platform::Value& names,
                                std::optional<ZRError>* error) {
-    if (specification.string()) return ZRProtocolNamed(runtime, *specification.string(), error);
-    if (!specification.array()) return nullptr;
+    if (names.string()) return ZRProtocolNamed(runtime, *names.string(), error);
+    if (!names.array()) return nullptr;
     std::string name = "__XX_COMPOUND";
-    for (const platform::Value& member : *specification.array()) {
+    for (const platform::Value& member : *names.array()) {
         if (!member.string()) return nullptr;
         name += "__" + *member.string();
     }
@@ -84,7 +84,7 @@ ProtocolRef ZRCompoundProtocol(ObjectRuntime& runtime, const platform::Value& sp
         if (!existing) report(error, "unable to create compound protocol");
         return existing;
     }
-    for (const platform::Value& member : *specification.array()) {
+    for (const platform::Value& member : *names.array()) {
         auto protocol = ZRProtocolNamed(runtime, *member.string(), error);
         if (!protocol) return nullptr;
         compound->incorporated.push_back(std::move(protocol));

@@ -18,9 +18,9 @@ platform::ProtocolRef ZRProtocolNamed(platform::ObjectRuntime& runtime, const st
 
 /// The protocol of a name, or, for a list of names, the one that incorporates all of these, which
 /// is made at its first use. Null, with an error (code 12), when one of them is unknown or it
-/// cannot be made; without an error for any other specification.
+/// cannot be made; without an error for what is neither.
 platform::ProtocolRef ZRCompoundProtocol(platform::ObjectRuntime& runtime,
-                                         const platform::Value& specification,
+                                         const platform::Value& names,
                                          std::optional<ZRError>* error = nullptr);
 
 /// Applies a description to the arguments of an operation. It is a list, separated by ",", of

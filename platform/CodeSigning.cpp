@@ -10,8 +10,8 @@
 #include <string_view>
 
 #include "platform/Files.h"
-#include "platform/Log.h"
 #include "platform/Namespaces.h"
+#include "platform/OpsLog.h"
 #include "platform/PinnedDirectory.h"
 #include "platform/PropertyList.h"
 #include "platform/Sandbox.h"
@@ -19,11 +19,6 @@
 namespace platform {
 
 namespace {
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 constexpr std::string_view kRestriction = "com.orbel.developer.zorvan.allowedplugins";
 constexpr std::string_view kPrivatePrefix = "com.orbel.private.";

@@ -4,17 +4,12 @@
 
 #include "platform/Directories.h"
 #include "platform/Files.h"
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 #include "platform/PropertyList.h"
 
 namespace platform {
 
 namespace {
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 class FileConsent : public Consent {
   public:

@@ -2,19 +2,10 @@
 
 #include <fmt/format.h>
 
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 #include "platform/PropertyList.h"
 
 namespace platform {
-
-namespace {
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
-
-}  // namespace
 
 Result<Dictionary> readDictionaryFile(const std::string& path) {
     const Result<Value> value = readPropertyListFile(path);

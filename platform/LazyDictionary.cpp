@@ -1,18 +1,9 @@
 #include "platform/LazyDictionary.h"
 
 #include "platform/Cbor.h"
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 
 namespace platform {
-
-namespace {
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
-
-}  // namespace
 
 LazyDictionary::LazyDictionary(Dictionary dictionary) : state_(std::make_shared<State>()) {
     state_->dictionary = std::move(dictionary);

@@ -11,17 +11,12 @@
 
 #include "platform/Directories.h"
 #include "platform/Files.h"
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 #include "platform/UniqueFd.h"
 
 namespace platform {
 
 namespace {
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 /// Replaces a file by rename, like `writeFileAtomically`, but without the syncs: counts live in
 /// memory-backed runtime state and mean nothing after a crash.

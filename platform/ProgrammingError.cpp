@@ -2,13 +2,13 @@
 
 #include <cstdlib>
 
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 
 namespace platform {
 
 void programmingError(const std::string& text, CodePlace place) {
-    EVLOG_ERROR(Log::make("com.orbel.Zorvan", "ops"), "programming error in {} ({}:{}): {}",
-                pub(place.method), pub(place.file), place.line, pub(text));
+    EVLOG_ERROR(ops(), "programming error in {} ({}:{}): {}", pub(place.method), pub(place.file),
+                place.line, pub(text));
     std::abort();
 }
 

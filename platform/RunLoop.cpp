@@ -8,7 +8,7 @@
 #include <cstdint>
 #include <utility>
 
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 
 namespace platform {
 
@@ -69,8 +69,7 @@ RunLoop::Watch::Watch(RunLoop& loop, int fd)
     asio::error_code failure;
     state_->descriptor.assign(fd, failure);
     if (failure) {
-        EVLOG_ERROR(Log::make("com.orbel.Zorvan", "ops"), "cannot watch descriptor {}: {}", fd,
-                    pub(failure.message()));
+        EVLOG_ERROR(ops(), "cannot watch descriptor {}: {}", fd, pub(failure.message()));
     }
 }
 

@@ -9,8 +9,8 @@
 #include <string_view>
 
 #include "platform/Files.h"
-#include "platform/Log.h"
 #include "platform/Namespaces.h"
+#include "platform/OpsLog.h"
 #include "platform/SandboxBroker.h"
 #include "platform/SandboxTokens.h"
 #include "platform/UniqueFd.h"
@@ -63,8 +63,7 @@ class KernelSandbox : public Sandbox {
         : tokens_(SandboxTokens::make(serviceName)),
           broker_(makeBroker(directories, serviceName, tokens_, loop)) {
         if (!broker_)
-            EVLOG_ERROR(Log::make("com.orbel.Zorvan", "ops"), "cannot issue sandbox extensions: {}",
-                        pub(broker_.error()));
+            EVLOG_ERROR(ops(), "cannot issue sandbox extensions: {}", pub(broker_.error()));
     }
 
     bool isSandboxed(const AuditToken& token) override { return platform::isSandboxed(token); }

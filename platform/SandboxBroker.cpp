@@ -11,8 +11,8 @@
 #include <utility>
 
 #include "platform/Directories.h"
-#include "platform/Log.h"
 #include "platform/MountChild.h"
+#include "platform/OpsLog.h"
 #include "platform/RunLoop.h"
 #include "platform/UniqueFd.h"
 #include "platform/lum/ServiceSocket.h"
@@ -29,11 +29,6 @@ constexpr std::chrono::seconds kPatience{5};
 // For a peer to say its token when others wait to be let in.
 constexpr std::chrono::milliseconds kPatienceWhenFull{50};
 constexpr std::chrono::milliseconds kPauseAfterFailure{100};
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 using Clock = std::chrono::steady_clock;
 

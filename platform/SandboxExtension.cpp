@@ -12,8 +12,8 @@
 #include <system_error>
 
 #include "platform/Directories.h"
-#include "platform/Log.h"
 #include "platform/MountChild.h"
+#include "platform/OpsLog.h"
 #include "platform/SandboxTokens.h"
 #include "platform/UniqueFd.h"
 #include "platform/lum/Listener.h"
@@ -27,11 +27,6 @@ constexpr timeval kPatience{15, 0};
 // Below lie the standard streams, which a caller may have closed and want back, and 0, which is no
 // handle.
 constexpr int kLeastHandle = 3;
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 UniqueFd connectTo(const std::string& path) {
     UniqueFd socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));

@@ -13,16 +13,11 @@
 
 #include "platform/Directories.h"
 #include "platform/Files.h"
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 
 namespace platform {
 
 namespace {
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 /// The real files hold some tens of kilobytes.
 constexpr std::size_t kMaxMimeFile = 4u << 20;

@@ -14,7 +14,7 @@
 #include <string_view>
 #include <utility>
 
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 #include "platform/RunLoop.h"
 #include "platform/UniqueFd.h"
 #include "platform/lum/Frame.h"
@@ -25,11 +25,6 @@
 namespace platform {
 
 namespace {
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 Result<UniqueFd> connectTo(const std::string& path) {
     UniqueFd socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));

@@ -13,7 +13,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 #include "platform/RunLoop.h"
 #include "platform/UniqueFd.h"
 #include "platform/lum/Limits.h"
@@ -29,11 +29,6 @@ namespace {
 constexpr std::chrono::milliseconds kPauseAfterFailure{100};
 // Accepted at once; then the loop's other work has its turn.
 constexpr int kMostAcceptedAtOnce = 32;
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 bool isExhaustion(int errnum) {
     return errnum == EMFILE || errnum == ENFILE || errnum == ENOBUFS || errnum == ENOMEM;

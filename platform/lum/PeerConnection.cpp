@@ -5,19 +5,10 @@
 #include <algorithm>
 #include <utility>
 
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 #include "platform/lum/Limits.h"
 
 namespace platform::lum {
-
-namespace {
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
-
-}  // namespace
 
 /// What a delivered request carries: its connection's turn and its place in the budgets, given back
 /// on whichever thread drops the request's last copy.

@@ -18,7 +18,7 @@
 
 #include "platform/Directories.h"
 #include "platform/Files.h"
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 #include "platform/lum/Listener.h"
 
 namespace platform::lum {
@@ -149,8 +149,7 @@ std::optional<pid_t> admittedPeer(int connected) {
     socklen_t size = sizeof peer;
     if (getsockopt(connected, SOL_SOCKET, SO_PEERCRED, &peer, &size) != 0) return std::nullopt;
     if (peer.uid == geteuid() || peer.uid == 0) return peer.pid;
-    EVLOG_ERROR(Log::make("com.orbel.Zorvan", "ops"), "client {} of user {} is not let in",
-                peer.pid, peer.uid);
+    EVLOG_ERROR(ops(), "client {} of user {} is not let in", peer.pid, peer.uid);
     return std::nullopt;
 }
 

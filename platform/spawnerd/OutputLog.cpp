@@ -5,18 +5,9 @@
 #include <cerrno>
 #include <utility>
 
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 
 namespace platform::spawnerd {
-
-namespace {
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
-
-}  // namespace
 
 OutputLog::OutputLog(RunLoop& loop, UniqueFd pipe, std::string name)
     : pipe_(std::move(pipe)), name_(std::move(name)) {

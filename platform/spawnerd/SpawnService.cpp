@@ -6,18 +6,13 @@
 #include <cerrno>
 #include <utility>
 
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 #include "platform/spawnerd/Protocol.h"
 #include "platform/spawnerd/SandboxProfile.h"
 
 namespace platform::spawnerd {
 
 namespace {
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 const std::string* textAt(const Message& message, const char* key) {
     const Value* value = message.find(key);

@@ -8,7 +8,7 @@
 #include <filesystem>
 
 #include "platform/Files.h"
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 #include "platform/tandry/FolderEntries.h"
 
 namespace platform::tandry {
@@ -17,11 +17,6 @@ namespace {
 
 constexpr std::string_view kApplicationSuffix = ".app";
 constexpr std::string_view kPlugIns = "PlugIns";
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 Date now() {
     using Seconds = std::chrono::duration<double>;

@@ -7,7 +7,7 @@
 
 #include "platform/Cbor.h"
 #include "platform/Files.h"
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 #include "platform/PropertyList.h"
 #include "platform/tandry/FileStamps.h"
 #include "platform/tandry/LocalizedNames.h"
@@ -33,11 +33,6 @@ constexpr const char* kShortVersion = "QFBundleShortVersionString";
 constexpr const char* kExecutable = "QFBundleExecutable";
 constexpr const char* kIdentifier = "VXExtensionIdentifier";
 constexpr const char* kOriginalIdentifier = "VXOriginalIdentifier";
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 /// Whether a reply can carry the value: hosts refuse a whole reply for one value that is no
 /// property list.

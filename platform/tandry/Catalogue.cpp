@@ -11,7 +11,7 @@
 #include <cstdio>
 
 #include "platform/Files.h"
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 #include "platform/tandry/CatalogueTables.h"
 
 namespace platform::tandry {
@@ -19,11 +19,6 @@ namespace platform::tandry {
 namespace {
 
 constexpr int kMostSetAside = 100;
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 /// Whether what lies there could never be opened as a database, whoever tries.
 bool isNoReadableFile(const std::string& path) {

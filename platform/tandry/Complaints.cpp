@@ -1,13 +1,13 @@
 #include "platform/tandry/Complaints.h"
 
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 #include "platform/tandry/RegistryState.h"
 
 namespace platform::tandry {
 
 void Complaints::add(const std::string& path, const std::string& text) {
     Complaint& complaint = complaints_[path];
-    if (complaint.text != text) EVLOG_ERROR(Log::make("com.orbel.Zorvan", "ops"), "{}", pub(text));
+    if (complaint.text != text) EVLOG_ERROR(ops(), "{}", pub(text));
     complaint = {text, walk_};
 }
 

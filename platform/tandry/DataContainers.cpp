@@ -9,18 +9,13 @@
 
 #include "platform/Error.h"
 #include "platform/Files.h"
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 
 namespace platform::tandry {
 
 namespace {
 
 constexpr mode_t kPrivate = 0700;
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 }  // namespace
 

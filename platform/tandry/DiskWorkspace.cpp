@@ -10,7 +10,7 @@
 
 #include "platform/Directories.h"
 #include "platform/Files.h"
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 #include "platform/ProgrammingError.h"
 #include "platform/SdkDictionaries.h"
 #include "platform/SerialQueue.h"
@@ -23,11 +23,6 @@
 namespace platform::tandry {
 
 namespace {
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 ApplicationScanner::Folders scannedFolders(const Directories& directories) {
     ApplicationScanner::Folders folders;
@@ -159,9 +154,9 @@ void DiskWorkspace::firstScan() {
     state_ = catalogue_->load();
     // Marking every directory takes time, and lookups wait: it is left to a second walk, which
     // finds what has changed since the first.
-    watch_.postpone(true);
+    watch_.setPostponed(true);
     RegistryChanges changes = scanner_.scanAll();
-    watch_.postpone(false);
+    watch_.setPostponed(false);
     EVLOG_INFO(ops(), "{} plug-ins in {} applications, {} new, {} gone", state_.plugIns.size(),
                state_.applications.size(), changes.installed.size(), changes.uninstalled.size());
     if (!changes.records()) publish(changes);

@@ -12,7 +12,7 @@
 
 #include "platform/Error.h"
 #include "platform/Files.h"
-#include "platform/Log.h"
+#include "platform/OpsLog.h"
 #include "platform/tandry/RegistryState.h"
 
 namespace platform::tandry {
@@ -27,11 +27,6 @@ constexpr std::size_t kBufferSize = 64u << 10;
 /// Buffers that one call reads at most, so that a flood does not hold up the thread.
 constexpr int kMostBuffers = 32;
 constexpr int kMostLinks = 40;
-
-const Log& ops() {
-    static const Log& handle = Log::make("com.orbel.Zorvan", "ops");
-    return handle;
-}
 
 bool isShortage(int errnum) {
     return errnum == ENOSPC || errnum == ENOMEM || errnum == EMFILE || errnum == ENFILE;

@@ -30,8 +30,8 @@ class FolderWatch {
     explicit FolderWatch(std::size_t mostWatches = std::numeric_limits<std::size_t>::max())
         : mostWatches_(mostWatches) {}
 
-    /// Walks mark nothing until this is called with false.
-    void postpone(bool isPostponed) { isPostponed_ = isPostponed; }
+    /// While it is postponed, walks mark nothing.
+    void setPostponed(bool isPostponed) { isPostponed_ = isPostponed; }
 
     /// Begins a walk. `overEverything` says that it will mark all that still matters.
     void beginWalk(bool overEverything);
