@@ -3,8 +3,9 @@
 #include <optional>
 #include <string_view>
 #include <utility>
+#include <vector>
 
-#include "platform/Value.h"
+#include "platform/values/Value.h"
 
 namespace zorvan {
 
@@ -12,12 +13,12 @@ namespace zorvan {
 /// `transform` takes an element and answers std::optional<platform::Value>.
 template <class Collection, class Transform>
 platform::Array arrayWithValues(const Collection& collection, Transform&& transform) {
-    platform::Array result;
+    std::vector<platform::Value> values;
     for (const auto& element : collection) {
         if (std::optional<platform::Value> value = transform(element))
-            result.append(*std::move(value));
+            values.push_back(*std::move(value));
     }
-    return result;
+    return platform::Array(std::move(values));
 }
 
 /// A copy of `dictionary` with `value` under `key`, or without that key when there is no value.

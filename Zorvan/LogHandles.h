@@ -1,6 +1,6 @@
 #pragma once
 
-#include "platform/Log.h"
+#include "platform/log/Log.h"
 
 namespace zorvan {
 

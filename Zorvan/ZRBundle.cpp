@@ -2,7 +2,7 @@
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
-#include "platform/Files.h"
+#include "platform/system/Files.h"
 
 namespace zorvan {
 

@@ -5,8 +5,8 @@
 #include <optional>
 #include <string>
 
-#include "platform/Value.h"
 #include "platform/lum/LumBundle.h"
+#include "platform/values/Value.h"
 
 namespace zorvan {
 

@@ -5,8 +5,8 @@
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
-#include "platform/Cbor.h"
-#include "platform/Directories.h"
+#include "platform/system/Directories.h"
+#include "platform/values/Cbor.h"
 
 namespace zorvan {
 

@@ -9,11 +9,11 @@
 #include <vector>
 
 #include "Zorvan/ZRError.h"
-#include "platform/SerialQueue.h"
-#include "platform/Uuid.h"
-#include "platform/Value.h"
 #include "platform/lum/ClientConnection.h"
 #include "platform/lum/Message.h"
+#include "platform/threads/SerialQueue.h"
+#include "platform/values/Uuid.h"
+#include "platform/values/Value.h"
 
 namespace zorvan {
 

@@ -7,8 +7,8 @@
 #include <string>
 
 #include "Zorvan/ZRError.h"
-#include "platform/Uuid.h"
-#include "platform/Value.h"
+#include "platform/values/Uuid.h"
+#include "platform/values/Value.h"
 
 namespace platform {
 class SdkDictionaries;

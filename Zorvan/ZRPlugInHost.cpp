@@ -5,8 +5,8 @@
 #include <charconv>
 #include <cstdlib>
 
-#include "platform/Directories.h"
 #include "platform/spawnerd/Protocol.h"
+#include "platform/system/Directories.h"
 
 namespace zorvan {
 

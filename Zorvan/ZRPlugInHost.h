@@ -4,8 +4,8 @@
 #include <string>
 #include <utility>
 
-#include "platform/Assertions.h"
-#include "platform/UniqueFd.h"
+#include "platform/services/Assertions.h"
+#include "platform/system/UniqueFd.h"
 
 namespace zorvan {
 
@@ -29,7 +29,8 @@ class ZRPlugInHost {
     platform::UniqueFd takeConnection() { return std::move(connection_); }
 
     const std::string& bundleIdentifier() const { return bundleIdentifier_; }
-    /// The service name of the daemon, for a `ZRDaemonClient`.
+    /// The service name of the daemon that issues the tokens which a `ZRSandboxExtension` takes.
+    /// The daemon itself cannot be reached from a plug-in's sandbox.
     const std::string& serviceName() const { return serviceName_; }
 
     /// States that this plug-in is busy, as long as the assertion lives: nobody can take its

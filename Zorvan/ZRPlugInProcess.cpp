@@ -11,11 +11,11 @@
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/ZRPlugInCore.h"
-#include "platform/Directories.h"
-#include "platform/Files.h"
-#include "platform/SerialQueue.h"
 #include "platform/lum/ClientConnection.h"
 #include "platform/spawnerd/Protocol.h"
+#include "platform/system/Directories.h"
+#include "platform/system/Files.h"
+#include "platform/threads/SerialQueue.h"
 
 namespace zorvan {
 

@@ -7,7 +7,7 @@
 #include <vector>
 
 #include "Zorvan/ZRError.h"
-#include "platform/UniqueFd.h"
+#include "platform/system/UniqueFd.h"
 
 namespace zorvan {
 

@@ -4,7 +4,7 @@
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
 #include "Zorvan/ZRPlugInCore.h"
-#include "platform/SdkDictionaries.h"
+#include "platform/services/SdkDictionaries.h"
 
 namespace zorvan {
 

@@ -4,8 +4,8 @@
 #include <string>
 
 #include "Zorvan/ZRError.h"
-#include "platform/ObjectRuntime.h"
-#include "platform/Value.h"
+#include "platform/services/ObjectRuntime.h"
+#include "platform/values/Value.h"
 
 namespace zorvan {
 

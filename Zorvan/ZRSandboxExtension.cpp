@@ -1,6 +1,6 @@
 #include "Zorvan/ZRSandboxExtension.h"
 
-#include "platform/SandboxExtension.h"
+#include "platform/sandbox/SandboxExtension.h"
 
 namespace zorvan {
 

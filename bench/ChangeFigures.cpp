@@ -15,8 +15,8 @@
 #include "bench/Interrupt.h"
 #include "bench/Measure.h"
 #include "bench/Questions.h"
-#include "platform/Files.h"
-#include "platform/PropertyList.h"
+#include "platform/plist/PropertyList.h"
+#include "platform/system/Files.h"
 
 namespace bench {
 

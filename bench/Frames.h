@@ -6,7 +6,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/UniqueFd.h"
+#include "platform/system/UniqueFd.h"
 
 namespace bench {
 

@@ -6,7 +6,7 @@
 #include "bench/Failure.h"
 #include "bench/Frames.h"
 #include "bench/World.h"
-#include "platform/Cbor.h"
+#include "platform/values/Cbor.h"
 
 namespace bench {
 

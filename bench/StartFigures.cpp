@@ -9,7 +9,7 @@
 #include "bench/Interrupt.h"
 #include "bench/Measure.h"
 #include "bench/Questions.h"
-#include "platform/PropertyList.h"
+#include "platform/plist/PropertyList.h"
 
 namespace bench {
 

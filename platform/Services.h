@@ -2,17 +2,17 @@
 
 #include <memory>
 
-#include "platform/Assertions.h"
-#include "platform/CodeSigning.h"
-#include "platform/Consent.h"
-#include "platform/Directories.h"
-#include "platform/Launcher.h"
-#include "platform/Notifications.h"
-#include "platform/RunLoop.h"
-#include "platform/Sandbox.h"
-#include "platform/SdkDictionaries.h"
-#include "platform/Types.h"
+#include "platform/sandbox/Sandbox.h"
+#include "platform/services/Assertions.h"
+#include "platform/services/CodeSigning.h"
+#include "platform/services/Consent.h"
+#include "platform/services/Notifications.h"
+#include "platform/services/SdkDictionaries.h"
+#include "platform/services/Types.h"
+#include "platform/spawnerd/Launcher.h"
+#include "platform/system/Directories.h"
 #include "platform/tandry/Workspace.h"
+#include "platform/threads/RunLoop.h"
 
 namespace platform {
 

@@ -10,9 +10,12 @@ scripts/deps.sh
 say "Building (the first time takes a few minutes)"
 cmake --preset release > /dev/null
 cmake --build --preset release --target zrd zrctl examples
-PATH=$PWD/build/release/zrd:$PWD/build/release/tools/zrctl:$PWD/build/release/examples:$PATH
 
+# Rights of programs count only where nobody else may write: installed here, that is so.
+umask 022
 home=$(mktemp -d /tmp/zrd-demo.XXXXXX)
+cmake --install build/release --prefix "$home/installed" > /dev/null
+PATH=$home/installed/bin:$PWD/build/release/examples:$PATH
 daemon=
 watcher=
 host=
@@ -176,6 +179,15 @@ if problem=$(bwrap --unshare-user --disable-userns --unshare-pid --unshare-ipc -
     ls -l "$home/letter"
     show "But in its sandbox a plug-in sees the system and its own data, and nothing of the user's home:" \
         sh -c 'printf "Dear all,\n@$HOME/letter\n" | text-tool com.example.courier.quote'
+    bundle=$applications/Courier.app/PlugIns/Quote.appex
+    quote=$(zrctl match --json VXExtensionIdentifier=com.example.courier.quote |
+        sed -n 's/.*"uuid": "\([^"]*\)".*/\1/p')
+    show "An attack. Once a host has found the plug-in, its bundle is exchanged for a link to the user's home.
+Whoever asks for read access now gets none, since another directory lies there than the one that was read:" \
+        sh -c "mv $bundle $home/Quote && ln -s $home $bundle && zrctl access $quote 2>&1 || true"
+    rm "$bundle"
+    mv "$home/Quote" "$bundle"
+    soon 0 zrctl match VXExtensionIdentifier=com.example.courier.quote
 
     say "Who replaces an application takes it out of service first. Title Case is in the middle of a text:"
     mkfifo "$home/text"

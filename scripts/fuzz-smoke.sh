@@ -14,7 +14,7 @@ case $seconds in
 esac
 
 fuzzers=()
-for source in fuzz/Fuzz*.cpp; do
+for source in fuzz/*/Fuzz*.cpp; do
     name=$(basename "$source" .cpp)
     name=${name#Fuzz}
     fuzzers+=("fuzz_${name,,}")

@@ -5,7 +5,7 @@
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
-#include "platform/Value.h"
+#include "platform/values/Value.h"
 #include "zrd/Transaction.h"
 #include "zrd/ZRDLumClient.h"
 #include "zrd/ZRDPlugIn.h"

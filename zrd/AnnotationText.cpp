@@ -3,6 +3,8 @@
 #include <algorithm>
 #include <numeric>
 
+#include "platform/plist/PropertyList.h"
+
 namespace zorvan {
 
 using platform::Dictionary;

@@ -6,9 +6,9 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/Error.h"
-#include "platform/PropertyList.h"
-#include "platform/Value.h"
+#include "platform/plist/PropertyListCost.h"
+#include "platform/system/Error.h"
+#include "platform/values/Value.h"
 
 namespace zorvan {
 

@@ -7,8 +7,8 @@
 #include <string>
 
 #include "Zorvan/ZRBundle.h"
-#include "platform/Value.h"
 #include "platform/lum/AuditToken.h"
+#include "platform/values/Value.h"
 
 namespace zorvan {
 

@@ -15,13 +15,9 @@
 namespace zorvan {
 
 using platform::Array;
-using platform::Dictionary;
 using platform::Value;
 
 namespace {
-
-/// A client may hold this much at once: what a hold costs is the daemon's.
-constexpr std::ptrdiff_t kMaxHoldsOfClient = 4096;
 
 /// Plug-ins for a log line.
 std::string describePlugIns(const ZRDPlugInList& plugIns) {
@@ -99,11 +95,13 @@ bool Transaction::areIdle(const ZRDPlugInList& plugIns) {
 }
 
 void Transaction::takeHold(const ZRDPlugInList& plugIns) {
-    const auto held = server().holds();
-    const auto mine =
-        std::ranges::count_if(held, [this](const auto& hold) { return hold->client() == client_; });
-    if (mine >= kMaxHoldsOfClient) return fail(kZRErrorDenied, "too many holds");
-    auto hold = std::make_shared<ZRDPlugInHold>(plugIns, client_, *server().services().launcher);
+    // What a hold costs is the daemon's.
+    const auto token = client_->auditToken();
+    auto share =
+        server().holdPool().draw(token ? platform::Origin::of(*token) : platform::Origin());
+    if (!share) return fail(kZRErrorDenied, "too many holds");
+    auto hold = std::make_shared<ZRDPlugInHold>(plugIns, client_, *std::move(share),
+                                                *server().services().launcher);
     server().addHold(hold);
     // The client may have died meanwhile, and its holds been looked for before this one was there.
     if (!client_->acceptWork()) server().unholdClient(*client_);

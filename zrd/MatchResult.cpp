@@ -43,10 +43,8 @@ bool MatchResult::admit(const ZRDPlugIn& plugIn) {
     // Where the one that is admitted is put.
     place_ = &byIdentifier_[plugIn.identifier()];
     if ((flags_ & kKeepAll) == kKeepAll) return true;
-    std::size_t next = kNone;
-    for (std::size_t i = place_->first; i != kNone; i = next) {
-        Accepted& rival = accepted_[i];
-        next = rival.nextOfIdentifier;
+    for (std::size_t index : *place_) {
+        Accepted& rival = accepted_[index];
         if (rival.displaced) continue;
         int order = compareVersions(plugIn.version(), rival.form.find(form::kVersion));
         if ((flags_ & ZRDiscoverVersions) && order != 0) continue;
@@ -58,8 +56,7 @@ bool MatchResult::admit(const ZRDPlugIn& plugIn) {
 
 void MatchResult::append(std::shared_ptr<ZRDPlugIn> plugIn, Dictionary form) {
     std::size_t index = accepted_.size();
-    (place_->first == kNone ? place_->first : accepted_[place_->last].nextOfIdentifier) = index;
-    place_->last = index;
+    place_->push_back(index);
     const Value* replaced = plugIn->replaced();
     accepted_.push_back({std::move(plugIn), std::move(form)});
     if (!replaced) return;
@@ -89,12 +86,10 @@ std::size_t MatchResult::size() const {
 }
 
 platform::Array MatchResult::forms() const {
-    std::vector<Value> forms;
-    forms.reserve(accepted_.size());
-    for (const Accepted& accepted : accepted_) {
-        if (!accepted.displaced) forms.emplace_back(accepted.form);
-    }
-    return platform::Array(std::move(forms));
+    return arrayWithValues(accepted_, [](const Accepted& accepted) -> std::optional<Value> {
+        if (accepted.displaced) return std::nullopt;
+        return accepted.form;
+    });
 }
 
 }  // namespace zorvan

@@ -8,7 +8,7 @@
 #include <unordered_map>
 #include <vector>
 
-#include "platform/Value.h"
+#include "platform/values/Value.h"
 
 namespace zorvan {
 
@@ -36,28 +36,21 @@ class MatchResult {
     platform::Array forms() const;
 
   private:
-    static constexpr std::size_t kNone = SIZE_MAX;
-
     /// Stays where it is, so that its index stays good, also when it is displaced.
     struct Accepted {
         std::shared_ptr<ZRDPlugIn> plugIn;
         platform::Dictionary form;
-        std::size_t nextOfIdentifier = kNone;
         bool displaced = false;
     };
-    struct SameIdentifier {
-        std::size_t first = kNone;
-        std::size_t last = kNone;
-    };
+    using Indexes = std::vector<std::size_t>;  // of `accepted_`
 
     bool wins(const ZRDPlugIn& plugIn, const platform::Dictionary& accepted,
               int versionOrder) const;
 
     std::uint64_t flags_;
     std::vector<Accepted> accepted_;
-    std::unordered_map<std::string_view, SameIdentifier>
-        byIdentifier_;                 // keys of accepted plug-ins
-    SameIdentifier* place_ = nullptr;  // of the plug-in that was admitted last
+    std::unordered_map<std::string_view, Indexes> byIdentifier_;  // keys of accepted plug-ins
+    Indexes* place_ = nullptr;  // of the plug-in that was admitted last
     /// Who replaces an identifier. It stays so when it is displaced itself.
     std::unordered_map<std::string, std::size_t> replacers_;
 };

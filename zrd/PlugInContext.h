@@ -3,7 +3,7 @@
 #include <memory>
 #include <optional>
 
-#include "platform/Value.h"
+#include "platform/values/Value.h"
 
 namespace platform {
 class Assertions;

@@ -3,7 +3,7 @@
 #if __has_include(<sys/sdt.h>)
 
 // With semaphores, every probe of a source file needs one: tracers raise it while they listen.
-#define _SDT_HAS_SEMAPHORES 1
+#define _SDT_HAS_SEMAPHORES 1  // NOLINT(bugprone-reserved-identifier)
 #include <sys/sdt.h>
 
 #define ZRD_PROBE_SEMAPHORE(name) \

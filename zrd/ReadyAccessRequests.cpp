@@ -6,7 +6,7 @@
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
-#include "platform/Sandbox.h"
+#include "platform/sandbox/Sandbox.h"
 #include "zrd/Probes.h"
 #include "zrd/Transaction.h"
 #include "zrd/ZRDLumClient.h"
@@ -55,7 +55,8 @@ void Transaction::readyPlugIns() {
 void Transaction::accessPlugIns() {
     Array tokens;
     bool completed = processUuidList([&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
-        auto token = server().services().sandbox->issueReadExtension(plugIn->path());
+        auto token =
+            server().services().sandbox->issueReadExtension(plugIn->bundleDirectory(), ".");
         if (!token) {
             fail(kZRErrorInvalidRequest, fmt::format("cannot create extension to {}: {}",
                                                      plugIn->path(), token.error().code));

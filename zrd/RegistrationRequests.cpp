@@ -11,6 +11,14 @@
 
 namespace zorvan {
 
+namespace {
+
+platform::Requester requesterOf(const ZRDLumClient& client) {
+    return client.isConfined() ? platform::Requester::Confined : platform::Requester::Unconfined;
+}
+
+}  // namespace
+
 void Transaction::addPlugIns() {
     processPaths([this](const std::string& path, bool resolved) {
         if (!resolved) {
@@ -18,7 +26,7 @@ void Transaction::addPlugIns() {
             return Walk::Stop;
         }
         probes::pluginAdd(path.c_str());
-        if (server().addPlugIn(path)) {
+        if (server().addPlugIn(path, requesterOf(*client_))) {
             EVLOG_DEFAULT(ops(), "failed to register plug-in at {}", path);
             fail(kZRErrorRegistration, fmt::format("unable to register plug-in at {}", path));
             return Walk::Stop;
@@ -38,7 +46,7 @@ void Transaction::removePlugIns() {
             fail(kZRErrorDenied, "caller lacks entitlement for this operation");
             return Walk::Stop;
         }
-        if (server().removePlugIn(path)) {
+        if (server().removePlugIn(path, requesterOf(*client_))) {
             fail(kZRErrorPath, fmt::format("no plugin at {}", path));
             return Walk::Stop;
         }

@@ -4,9 +4,9 @@
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
-#include "platform/Files.h"
-#include "platform/Utf8.h"
-#include "platform/Value.h"
+#include "platform/system/Files.h"
+#include "platform/values/Utf8.h"
+#include "platform/values/Value.h"
 #include "zrd/Probes.h"
 #include "zrd/ZRDLumClient.h"
 #include "zrd/ZRDPlugIn.h"
@@ -14,7 +14,6 @@
 
 namespace zorvan {
 
-using platform::Array;
 using platform::Dictionary;
 using platform::Value;
 
@@ -134,14 +133,9 @@ bool Transaction::processUuidList(
 }
 
 void Transaction::addAnnotationForPlugIn(const ZRDPlugIn& plugIn, Dictionary& in) const {
-    auto annotation = server().annotationForPlugIn(plugIn);
-    if (annotation) {
+    // A form has an empty annotation from its record: left as it is, it keeps its encoded bytes.
+    if (auto annotation = server().annotationForPlugIn(plugIn))
         in.set(form::kAnnotations, *std::move(annotation));
-    } else if (!in.encoded()) {
-        // A form that comes straight from its record has an empty annotation and its encoded bytes:
-        // it is left as it is, and so keeps them.
-        in.set(form::kAnnotations, Dictionary());
-    }
 }
 
 void Transaction::done() {

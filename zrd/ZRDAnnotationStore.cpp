@@ -6,9 +6,10 @@
 
 #include "Zorvan/Helpers.h"
 #include "Zorvan/LogHandles.h"
-#include "platform/Directories.h"
-#include "platform/Files.h"
-#include "platform/PropertyList.h"
+#include "platform/plist/PropertyList.h"
+#include "platform/plist/PropertyListCost.h"
+#include "platform/system/Directories.h"
+#include "platform/system/Files.h"
 #include "zrd/Probes.h"
 #include "zrd/ZRDPlugIn.h"
 

@@ -5,7 +5,7 @@
 #include <string>
 
 #include "Zorvan/ZRError.h"
-#include "platform/Value.h"
+#include "platform/values/Value.h"
 #include "zrd/AnnotationText.h"
 
 namespace platform {

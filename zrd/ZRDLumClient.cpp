@@ -3,7 +3,7 @@
 #include <fmt/format.h>
 
 #include "Zorvan/LogHandles.h"
-#include "platform/Sandbox.h"
+#include "platform/sandbox/Sandbox.h"
 #include "zrd/Probes.h"
 #include "zrd/Transaction.h"
 #include "zrd/ZRDServer.h"
@@ -118,6 +118,11 @@ bool ZRDLumClient::hasEntitlement(const std::string& name) const {
 bool ZRDLumClient::isSandboxed() const {
     auto connection = connection_.lock();
     return !connection || server_->services().sandbox->isSandboxed(connection->auditToken());
+}
+
+bool ZRDLumClient::isConfined() const {
+    auto connection = connection_.lock();
+    return !connection || server_->services().sandbox->isConfined(connection->auditToken());
 }
 
 std::string ZRDLumClient::description() const {

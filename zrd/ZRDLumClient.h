@@ -6,8 +6,8 @@
 #include <optional>
 #include <string>
 
-#include "platform/CodeSigning.h"
 #include "platform/lum/Connection.h"
+#include "platform/services/CodeSigning.h"
 #include "zrd/HostProcess.h"
 
 namespace zorvan {
@@ -35,6 +35,8 @@ class ZRDLumClient final : public HostProcess, public std::enable_shared_from_th
     /// Whether the process runs in a sandbox. A process whose connection is gone counts as
     /// sandboxed.
     bool isSandboxed() const;
+    /// Whether it is confined in any way that shows; likewise.
+    bool isConfined() const;
 
     /// False once the connection has died: requests still queued are dropped. From any thread.
     bool acceptWork() const { return acceptWork_; }

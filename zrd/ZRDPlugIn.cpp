@@ -5,7 +5,7 @@
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
-#include "platform/Cbor.h"
+#include "platform/values/Cbor.h"
 #include "zrd/PlugInContext.h"
 
 namespace zorvan {
@@ -137,13 +137,24 @@ void ZRDPlugIn::setLocalizedContainingName(std::optional<std::string> value) {
     setName(localizedContainingName_, std::move(value));
 }
 
-std::optional<Dictionary> ZRDPlugIn::form(std::optional<ZRError>& error) const {
-    std::uint64_t namesAtStart = 0;
+/// The form that was made before, if it still holds. `nameChanges` becomes the number of changes
+/// that it, or one that is made from now on, takes in.
+std::optional<Dictionary> ZRDPlugIn::sharedForm(std::uint64_t& nameChanges) const {
+    std::optional<Dictionary> form;
     {
         std::lock_guard lock(mutex_);
-        if (form_) return form_;
-        namesAtStart = nameChanges_;
+        form = form_;
+        nameChanges = nameChanges_;
     }
+    // The only token of a form that is kept is that for the bundle itself.
+    if (form && isAppExtension() && !platform::isInPlace(path(), tdproxy_->bundleIdentity))
+        return std::nullopt;
+    return form;
+}
+
+std::optional<Dictionary> ZRDPlugIn::form(std::optional<ZRError>& error) const {
+    std::uint64_t namesAtStart = 0;
+    if (auto shared = sharedForm(namesAtStart)) return shared;
     auto made = exportForm(error);
     if (!made) return std::nullopt;
     // Tokens that could not be issued now may be another time, and others may go stale.

@@ -8,6 +8,7 @@
 #include <string>
 
 #include "Zorvan/ZRPlugInCore.h"
+#include "platform/system/KnownDirectory.h"
 #include "platform/tandry/TDPlugInProxy.h"
 
 namespace zorvan {
@@ -27,6 +28,8 @@ class ZRDPlugIn final : public ZRPlugInCore {
                                                      std::shared_ptr<const PlugInContext> context);
 
     const platform::TDPlugInProxyRef& tdproxy() const { return tdproxy_; }
+    /// The bundle's directory as the registry read it.
+    platform::KnownDirectory bundleDirectory() const { return {path(), tdproxy_->bundleIdentity}; }
 
     // The registry's view of the bundle.
     const platform::Dictionary* bundleInfoDictionary() const override;
@@ -46,8 +49,9 @@ class ZRDPlugIn final : public ZRPlugInCore {
     std::optional<ZRError> diagnose() const override;
 
     /// The record's form as `exportForm` makes it and `augmentForm` completes it. Unless its tokens
-    /// may go stale, it is made and encoded at the first call and shared from then on; setting a
-    /// name makes it afresh. An error: there is none, as with `exportForm`.
+    /// may go stale, it is made and encoded at the first call and shared from then on, as long as
+    /// the bundle that it has a token for is in its place; setting a name makes it afresh. An
+    /// error: there is none, as with `exportForm`.
     std::optional<platform::Dictionary> form(std::optional<ZRError>& error) const;
 
     /// The plug-in's value for an entitlement, or null.
@@ -80,7 +84,7 @@ class ZRDPlugIn final : public ZRPlugInCore {
     /// which there is none are left out, with a log line. `resources` is a text or a list.
     platform::Dictionary issueResourceExtensions(const platform::Value& resources) const;
     /// Adds the tokens for what the plug-in shares with hosts. Whether they are good for as long as
-    /// this record.
+    /// this record, and its bundle in its place.
     bool augmentForm(platform::Dictionary& form) const;
     /// What a busy running instance says of itself, or none.
     std::optional<platform::Dictionary> checkBusy() const;
@@ -91,6 +95,7 @@ class ZRDPlugIn final : public ZRPlugInCore {
   private:
     ZRDPlugIn(platform::TDPlugInProxyRef proxy, std::shared_ptr<const PlugInContext> context);
     bool fillFromProxy();
+    std::optional<platform::Dictionary> sharedForm(std::uint64_t& nameChanges) const;
     std::uint32_t declaredHubProtocolVersion() const;
 
     /// The value that a rule's key stands for: borrowed from the registry's record, or made for the

@@ -4,7 +4,7 @@
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
-#include "platform/Consent.h"
+#include "platform/services/Consent.h"
 #include "zrd/HostProcess.h"
 #include "zrd/PlugInContext.h"
 #include "zrd/ZRDPlugIn.h"

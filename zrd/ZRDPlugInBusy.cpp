@@ -2,7 +2,7 @@
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
-#include "platform/Assertions.h"
+#include "platform/services/Assertions.h"
 #include "zrd/PlugInContext.h"
 #include "zrd/ZRDPlugIn.h"
 

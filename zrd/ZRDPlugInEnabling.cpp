@@ -9,10 +9,10 @@
 #include "Zorvan/LogHandles.h"
 #include "Zorvan/ZRBundle.h"
 #include "Zorvan/ZRError.h"
-#include "platform/Consent.h"
-#include "platform/Files.h"
-#include "platform/Launcher.h"
-#include "platform/Sandbox.h"
+#include "platform/sandbox/Sandbox.h"
+#include "platform/services/Consent.h"
+#include "platform/spawnerd/Launcher.h"
+#include "platform/system/Files.h"
 #include "zrd/HostProcess.h"
 #include "zrd/PlugInContext.h"
 #include "zrd/ZRDPlugIn.h"
@@ -31,12 +31,6 @@ constexpr std::string_view kPreviewService = "com.orbel.glimse.extension.preview
 
 bool isText(const Value* value, std::string_view text) {
     return value && value->string() && *value->string() == text;
-}
-
-/// Whether a canonical path is the canonical directory or lies inside it.
-bool isInside(std::string_view path, std::string_view directory) {
-    return path.starts_with(directory) &&
-           (path.size() == directory.size() || path[directory.size()] == '/');
 }
 
 }  // namespace
@@ -108,9 +102,10 @@ std::optional<ZRError> ZRDPlugIn::enableForClient(const HostProcess& host) const
                                  uuid().string());
     }
     EVLOG_DEBUG(ops(), "activation overlay={}", overlay);
+    const platform::ExternalService service{*executable, bundleDirectory(),
+                                            tdproxy_->dataContainerPath.value_or("")};
     const auto token = host.auditToken();
-    int failure =
-        token ? context_->launcher->addExternalService(*token, *executable, overlay) : ESRCH;
+    int failure = token ? context_->launcher->addExternalService(*token, service, overlay) : ESRCH;
     if (failure == 0) return std::nullopt;
     EVLOG_ERROR(ops(),
                 "spawnerd error {} trying to allow {} {} to use plug-in {}({}) uuid={} at {}",
@@ -122,20 +117,16 @@ std::optional<ZRError> ZRDPlugIn::enableForClient(const HostProcess& host) const
 Dictionary ZRDPlugIn::issueResourceExtensions(const Value& resources) const {
     const Value* begin = resources.array() ? resources.array()->begin() : &resources;
     const Value* end = resources.array() ? resources.array()->end() : &resources + 1;
+    const platform::KnownDirectory bundle = bundleDirectory();
     Dictionary extensions;
     for (const Value* element = begin; element != end; ++element) {
         const std::string* name = element->string();
         if (!name) continue;
-        const std::string location = *name == "." ? path() : platform::joinPath(path(), *name);
-        // What leads out of the bundle is not the plug-in's to share.
-        const auto canonical = platform::canonicalPath(location);
-        platform::Result<std::string> token =
-            canonical && !isInside(*canonical, path())
-                ? platform::Result<std::string>(platform::Error::posix(EACCES, location))
-                : context_->sandbox->issueReadExtension(location);
+        auto token = context_->sandbox->issueReadExtension(bundle, *name);
         if (token) {
             extensions.set(*name, *std::move(token));
         } else {
+            const std::string location = *name == "." ? path() : platform::joinPath(path(), *name);
             EVLOG_INFO(ops(), "failed to make extension for {} in plug-in at {}: {}", location,
                        path(), pub(std::strerror(token.error().code)));
         }
@@ -149,8 +140,9 @@ bool ZRDPlugIn::augmentForm(Dictionary& form) const {
     if (!resources) return true;
     const Dictionary extensions = issueResourceExtensions(*resources);
     form.set(form::kExtensions, extensions);
-    // Another bundle is another record. What lies in it may be exchanged without that, and then a
-    // token for what was there grants nothing any more.
+    // Another bundle is another record, and whether it is in its place is asked before the form is
+    // used again. What lies in it may be exchanged without that, and then a token for what was
+    // there grants nothing any more.
     return resources == &bundleItself && !extensions.empty();
 }
 

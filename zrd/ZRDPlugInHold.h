@@ -6,8 +6,9 @@
 #include <unordered_set>
 #include <vector>
 
-#include "platform/Launcher.h"
-#include "platform/Uuid.h"
+#include "platform/lum/Pool.h"
+#include "platform/spawnerd/Launcher.h"
+#include "platform/values/Uuid.h"
 
 namespace zorvan {
 
@@ -27,7 +28,8 @@ class ZRDPlugInHold {
   public:
     /// A hold with a fresh token, made now.
     ZRDPlugInHold(const std::vector<std::shared_ptr<ZRDPlugIn>>& plugIns,
-                  std::weak_ptr<ZRDLumClient> client, platform::Launcher& launcher);
+                  std::weak_ptr<ZRDLumClient> client, platform::Pool::Share share,
+                  platform::Launcher& launcher);
 
     /// The token: whoever presents it may release the hold.
     const platform::Uuid& uuid() const { return uuid_; }
@@ -45,6 +47,7 @@ class ZRDPlugInHold {
     const PlugIns blocked_;
     const std::weak_ptr<ZRDLumClient> client_;
     const std::chrono::system_clock::time_point created_ = std::chrono::system_clock::now();
+    const platform::Pool::Share share_;  // of the holds that there may be
     const std::unique_ptr<platform::Launcher::WorkMarker> workMarker_;
 };
 

@@ -7,7 +7,7 @@
 #include "Zorvan/Helpers.h"
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
-#include "platform/Types.h"
+#include "platform/services/Types.h"
 #include "zrd/PlugInContext.h"
 #include "zrd/ZRDPlugIn.h"
 

@@ -2,7 +2,7 @@
 
 #include <openssl/sha.h>
 
-#include "platform/Uuid.h"
+#include "platform/values/Uuid.h"
 
 namespace zorvan {
 

@@ -2,7 +2,7 @@
 
 #include <string>
 
-#include "platform/Value.h"
+#include "platform/values/Value.h"
 
 namespace zorvan {
 

@@ -3,7 +3,7 @@
 #include <mutex>
 
 #include "Zorvan/LogHandles.h"
-#include "platform/RunLoop.h"
+#include "platform/threads/RunLoop.h"
 #include "zrd/ZRDLumClient.h"
 
 namespace zorvan {
@@ -30,15 +30,15 @@ void reportTermination(platform::Launcher::Status status) {
 
 }  // namespace
 
-ZRDServer::ZRDServer(platform::Services services)
+ZRDServer::ZRDServer(const platform::Services& services)
     : ZRDatabase(services), lumQueue_("lum", *services.mainLoop), mainQueue_("service") {}
 
 ZRDServer::~ZRDServer() = default;
 
 std::shared_ptr<ZRDServer> ZRDServer::initForService(const std::string& serviceName,
                                                      const std::optional<std::string>& databasePath,
-                                                     platform::Services services) {
-    std::shared_ptr<ZRDServer> server(new ZRDServer(std::move(services)));
+                                                     const platform::Services& services) {
+    std::shared_ptr<ZRDServer> server(new ZRDServer(services));
     if (!server->initWithDatabase(databasePath, server)) return nullptr;
     if (!server->listen(serviceName)) return nullptr;
     {
@@ -47,7 +47,7 @@ std::shared_ptr<ZRDServer> ZRDServer::initForService(const std::string& serviceN
     }
     server->setDelegate(server);
     server->service_->setEventHandler(
-        [weak = std::weak_ptr(server)](std::shared_ptr<platform::Connection> connection) {
+        [weak = std::weak_ptr(server)](const std::shared_ptr<platform::Connection>& connection) {
             if (auto self = weak.lock()) ZRDLumClient::initWithConnection(connection, self);
         });
     server->userPrefs_ = std::make_unique<ZRDUserPrefs>(server->services().directories);

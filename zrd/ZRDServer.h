@@ -8,8 +8,8 @@
 #include <unordered_map>
 #include <vector>
 
-#include "platform/SerialQueue.h"
 #include "platform/lum/Listener.h"
+#include "platform/threads/SerialQueue.h"
 #include "zrd/ZRDPlugInHold.h"
 #include "zrd/ZRDUserPrefs.h"
 #include "zrd/ZRDatabase.h"
@@ -28,7 +28,7 @@ class ZRDServer final : public ZRDatabase, public ZRDatabaseDelegate {
     /// cannot be had, which is logged.
     static std::shared_ptr<ZRDServer> initForService(const std::string& serviceName,
                                                      const std::optional<std::string>& databasePath,
-                                                     platform::Services services);
+                                                     const platform::Services& services);
     ~ZRDServer() override;
 
     /// The process's server; null before there is one.
@@ -64,17 +64,22 @@ class ZRDServer final : public ZRDatabase, public ZRDatabaseDelegate {
     platform::Listener& service() { return *service_; }
     ZRDUserPrefs& userPrefs() { return *userPrefs_; }
 
+    /// What clients draw their holds from. From any thread.
+    platform::Pool& holdPool() { return holdPool_; }
+
     using ZRDatabase::services;
 
   private:
+    static constexpr std::size_t kMaxHolds = 16384;
     using HoldList = std::vector<std::shared_ptr<ZRDPlugInHold>>;
 
-    explicit ZRDServer(platform::Services services);
+    explicit ZRDServer(const platform::Services& services);
     bool listen(const std::string& serviceName);
     HoldList::iterator releaseHold(HoldList::iterator hold);
 
     std::atomic<std::uint32_t> verbose_{0};
     platform::SerialQueue lumQueue_;
+    platform::Pool holdPool_{kMaxHolds};
     platform::SyncQueue syncQueue_{"serverSync"};
     HoldList holds_;                                               // guarded by syncQueue_
     std::unordered_map<platform::Uuid, std::size_t> heldPlugIns_;  // by how many holds; likewise

@@ -2,8 +2,8 @@
 
 #include <optional>
 
-#include "platform/Preferences.h"
-#include "platform/Value.h"
+#include "platform/services/Preferences.h"
+#include "platform/values/Value.h"
 
 namespace zorvan {
 

@@ -87,16 +87,18 @@ std::optional<ZRDPlugInList> ZRDatabase::plugInsWithinApplication(const std::str
     return plugIns;
 }
 
-std::optional<ZRError> ZRDatabase::addPlugIn(const std::string& bundlePath) {
-    if (auto error = workspace().registerPlugIn(bundlePath)) {
+std::optional<ZRError> ZRDatabase::addPlugIn(const std::string& bundlePath,
+                                             platform::Requester requester) {
+    if (auto error = workspace().registerPlugIn(bundlePath, requester)) {
         EVLOG_INFO(ops(), "Tandry refused to register {}: {}", bundlePath, *error);
         return ZRErrorWithCode(kZRErrorRegistration, "Tandry failed to register the plug-in");
     }
     return std::nullopt;
 }
 
-std::optional<ZRError> ZRDatabase::removePlugIn(const std::string& bundlePath) {
-    if (auto error = workspace().unregisterPlugIn(bundlePath)) {
+std::optional<ZRError> ZRDatabase::removePlugIn(const std::string& bundlePath,
+                                                platform::Requester requester) {
+    if (auto error = workspace().unregisterPlugIn(bundlePath, requester)) {
         EVLOG_INFO(ops(), "Tandry refused to unregister {}: {}", bundlePath, *error);
         return ZRErrorWithCode(kZRErrorRegistration, "Tandry failed to deregister the plug-in");
     }

@@ -10,8 +10,8 @@
 
 #include "Zorvan/ZRError.h"
 #include "platform/Services.h"
-#include "platform/SyncQueue.h"
 #include "platform/tandry/Workspace.h"
+#include "platform/threads/SyncQueue.h"
 #include "zrd/PlugInContext.h"
 
 namespace zorvan {
@@ -68,9 +68,11 @@ class ZRDatabase : public AnnotationReader, public platform::WorkspaceObserver {
     /// registry selects and the user's election admits. None when the registry's query fails.
     std::optional<ZRDPlugInList> findPlugIns(const platform::Dictionary* query);
 
-    /// Registers, or unregisters, the bundle at a path with the registry. None on success.
-    std::optional<ZRError> addPlugIn(const std::string& bundlePath);
-    std::optional<ZRError> removePlugIn(const std::string& bundlePath);
+    /// Registers, or unregisters, the bundle at a path with the registry, which judges whether the
+    /// requester may. None on success.
+    std::optional<ZRError> addPlugIn(const std::string& bundlePath, platform::Requester requester);
+    std::optional<ZRError> removePlugIn(const std::string& bundlePath,
+                                        platform::Requester requester);
 
     std::optional<platform::Dictionary> annotationForPlugIn(const ZRDPlugIn& plugIn) override;
     /// Whether a change of the plug-in's annotation could be stored together with all others.

@@ -1,10 +1,10 @@
 // The candidates of a discovery query. The rules themselves are judged later, by matching.
 
 #include <algorithm>
-#include <bit>
 #include <cctype>
 #include <cwctype>
 #include <string>
+#include <unordered_set>
 #include <vector>
 
 #include "Zorvan/Keys.h"
@@ -48,27 +48,6 @@ bool isUsable(const platform::TDPlugInProxyRef& proxy) {
     return true;
 }
 
-/// A set of at most `most` UUIDs in one piece of memory.
-class SeenUuids {
-  public:
-    explicit SeenUuids(std::size_t most) : slots_(std::bit_ceil(2 * most + 1)) {}
-
-    /// Whether the UUID is new.
-    bool insert(const platform::Uuid& uuid) {
-        std::size_t slot = std::hash<platform::Uuid>()(uuid);
-        for (;; ++slot) {
-            auto& held = slots_[slot & (slots_.size() - 1)];
-            if (held == uuid) return false;
-            if (held) continue;
-            held = uuid;
-            return true;
-        }
-    }
-
-  private:
-    std::vector<std::optional<platform::Uuid>> slots_;
-};
-
 /// The first character of valid UTF-8 text that is not empty.
 char32_t firstCharacter(std::string_view text) {
     auto lead = static_cast<unsigned char>(text[0]);
@@ -88,7 +67,8 @@ std::optional<std::string> electionPattern(const Value& pattern) {
     // Letters and digits in the sense of Unicode, whatever the process's locale is.
     static const locale_t unicode = newlocale(LC_CTYPE_MASK, "C.UTF-8", nullptr);
     auto first = static_cast<wint_t>(firstCharacter(*text));
-    bool usable = unicode ? iswalnum_l(first, unicode) : first < 0x80 && std::isalnum(first);
+    bool usable = unicode ? iswalnum_l(first, unicode) != 0
+                          : first < 0x80 && std::isalnum(static_cast<int>(first)) != 0;
     return usable ? std::optional(*text) : std::nullopt;
 }
 
@@ -157,13 +137,14 @@ std::optional<ZRDPlugInList> ZRDatabase::findPlugIns(const Dictionary* query) {
     if (!proxies) return std::nullopt;
     ZRDPlugInList plugIns;
     plugIns.reserve(proxies->size());
-    SeenUuids seen(proxies->size());
+    std::unordered_set<platform::Uuid> seen(proxies->size());
     // Entered once for all: thousands pass through here at a request.
     sync_.sync([&] {
         for (const auto& proxy : *proxies) {
             if (!isUsable(proxy)) continue;
             auto plugIn = recordForProxy(proxy);
-            if (plugIn && seen.insert(proxy->plugInUuid)) plugIns.push_back(std::move(plugIn));
+            if (plugIn && seen.insert(proxy->plugInUuid).second)
+                plugIns.push_back(std::move(plugIn));
         }
     });
     EVLOG_DEBUG(ops(), "TD reported {} plug-ins (cache {}/{})", plugIns.size(), cachedBefore,

@@ -1,18 +1,24 @@
+#include <cstdlib>
+#include <utility>
+
 #include "Zorvan/LogHandles.h"
 #include "Zorvan/ZRPlugInCore.h"
-#include "platform/Process.h"
 #include "platform/Services.h"
+#include "platform/lum/ServiceSocket.h"
+#include "platform/system/Process.h"
 #include "platform/tandry/DiskWorkspace.h"
+#include "platform/threads/TerminationWatch.h"
 #include "zrd/CommandLine.h"
 #include "zrd/ZRDServer.h"
 
 namespace {
 
 /// The services of this machine. Without a registry the server cannot be constructed.
-platform::Services diskServices(const std::string& serviceName) {
+platform::Services diskServices(const std::string& serviceName,
+                                std::shared_ptr<platform::RunLoop> mainLoop) {
     platform::Services services;
     services.directories = platform::Directories::fromEnvironment();
-    services.mainLoop = std::make_shared<platform::RunLoop>();
+    services.mainLoop = std::move(mainLoop);
     services.codeSigning = platform::makeFileCodeSigning();
     services.sandbox =
         platform::makeKernelSandbox(services.directories, serviceName, *services.mainLoop);
@@ -42,7 +48,12 @@ int main(int argc, char* argv[]) {
     auto options = zorvan::CommandLine::parse(argc, argv);
     if (!options) return 2;
     platform::prepareDaemonProcess();
-    platform::Services services = diskServices(options->serviceName);
+    const auto mainLoop = std::make_shared<platform::RunLoop>();
+    platform::Services services;
+    // Before there are other threads; heard once the loop runs.
+    const platform::TerminationWatch termination(
+        *mainLoop, [&] { services.launcher->shutDown([&] { mainLoop->stop(); }); });
+    services = diskServices(options->serviceName, mainLoop);
     auto server =
         zorvan::ZRDServer::initForService(options->serviceName, options->databasePath, services);
     if (!server) {
@@ -51,7 +62,10 @@ int main(int argc, char* argv[]) {
     }
     server->setVerbose(options->verbose);
     server->setCacheLimit(options->cacheLimit);
-    services.mainLoop->post(platform::notifyServiceManagerReady);
+    mainLoop->post(platform::notifyServiceManagerReady);
     server->run();
-    return 0;
+    platform::lum::removeServiceSockets();
+    // What is on disk is whole at any moment. A request that a slow disk holds up must not hold up
+    // the end as well, so nothing is waited for.
+    std::_Exit(EXIT_SUCCESS);
 }

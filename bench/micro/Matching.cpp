@@ -4,7 +4,7 @@
 
 #include "Zorvan/Keys.h"
 #include "bench/InfoPlist.h"
-#include "platform/PropertyList.h"
+#include "platform/plist/PropertyList.h"
 #include "zrd/PlugInContext.h"
 #include "zrd/ZRDPlugIn.h"
 

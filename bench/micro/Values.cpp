@@ -4,8 +4,8 @@
 #include <string>
 
 #include "bench/InfoPlist.h"
-#include "platform/Cbor.h"
-#include "platform/PropertyList.h"
+#include "platform/plist/PropertyList.h"
+#include "platform/values/Cbor.h"
 
 namespace {
 

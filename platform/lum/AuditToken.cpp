@@ -16,7 +16,7 @@
 #include <string_view>
 #include <utility>
 
-#include "platform/UniqueFd.h"
+#include "platform/system/UniqueFd.h"
 
 namespace platform {
 

@@ -10,8 +10,8 @@
 #include <string>
 #include <unordered_set>
 
-#include "platform/RunLoop.h"
 #include "platform/lum/StallClock.h"
+#include "platform/threads/RunLoop.h"
 
 namespace platform::lum {
 

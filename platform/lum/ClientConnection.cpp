@@ -14,13 +14,13 @@
 #include <string_view>
 #include <utility>
 
-#include "platform/OpsLog.h"
-#include "platform/RunLoop.h"
-#include "platform/UniqueFd.h"
+#include "platform/log/OpsLog.h"
 #include "platform/lum/Frame.h"
 #include "platform/lum/FrameSocket.h"
 #include "platform/lum/Limits.h"
 #include "platform/lum/Listener.h"
+#include "platform/system/UniqueFd.h"
+#include "platform/threads/RunLoop.h"
 
 namespace platform {
 
@@ -199,7 +199,7 @@ void ClientConnection::State::answerLater(ReplyHandler reply, ConnectionError er
     });
 }
 
-ClientConnection::ClientConnection(const Directories& directories, std::string serviceName,
+ClientConnection::ClientConnection(const Directories& directories, const std::string& serviceName,
                                    SerialQueue& queue)
     : state_(std::make_shared<State>(directories, serviceName, queue)) {}
 

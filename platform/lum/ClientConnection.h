@@ -5,9 +5,9 @@
 #include <string>
 #include <variant>
 
-#include "platform/SerialQueue.h"
 #include "platform/lum/Connection.h"
 #include "platform/lum/Message.h"
+#include "platform/threads/SerialQueue.h"
 
 namespace platform {
 
@@ -22,7 +22,8 @@ class ClientConnection {
     using ReplyHandler = std::function<void(const Reply&)>;
 
     /// `queue` must outlive the connection.
-    ClientConnection(const Directories& directories, std::string serviceName, SerialQueue& queue);
+    ClientConnection(const Directories& directories, const std::string& serviceName,
+                     SerialQueue& queue);
     ClientConnection(const ClientConnection&) = delete;
     /// Closes. Replies that have not arrived are not reported any more. Not from inside a callback,
     /// unless nothing else uses the connection.

@@ -5,8 +5,8 @@
 #include <algorithm>
 #include <utility>
 
-#include "platform/Cbor.h"
 #include "platform/lum/Limits.h"
+#include "platform/values/Cbor.h"
 
 namespace platform::lum {
 

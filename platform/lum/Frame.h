@@ -8,10 +8,10 @@
 #include <string_view>
 #include <variant>
 
-#include "platform/Error.h"
-#include "platform/SliceList.h"
 #include "platform/lum/Connection.h"
 #include "platform/lum/Message.h"
+#include "platform/system/Error.h"
+#include "platform/values/SliceList.h"
 
 namespace platform::lum {
 

@@ -8,8 +8,8 @@
 #include <mutex>
 #include <optional>
 
-#include "platform/SliceList.h"
-#include "platform/UniqueFd.h"
+#include "platform/system/UniqueFd.h"
+#include "platform/values/SliceList.h"
 
 namespace platform::lum {
 

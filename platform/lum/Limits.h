@@ -36,6 +36,11 @@ inline constexpr std::size_t kFreeReceived = 64u << 10;
 inline constexpr std::chrono::milliseconds kPatience{5000};
 inline constexpr std::size_t kLeastProgress = 1u << 20;
 
+/// Connections at the most, and how many descriptors each of them takes: with fewer descriptors
+/// there are fewer connections. One origin has a quarter of them at the most.
+inline constexpr std::size_t kMaxConnections = 65536;
+inline constexpr std::size_t kDescriptorsOfConnection = 3;
+
 /// No connection is accepted while fewer than this many file descriptors are left to the process:
 /// what clients cannot use up is there for the work itself.
 inline constexpr int kReservedDescriptors = 64;

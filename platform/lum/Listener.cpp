@@ -9,18 +9,20 @@
 #include <chrono>
 #include <climits>
 #include <optional>
+#include <set>
 #include <system_error>
 #include <utility>
 #include <vector>
 
-#include "platform/OpsLog.h"
-#include "platform/RunLoop.h"
-#include "platform/UniqueFd.h"
+#include "platform/log/OpsLog.h"
 #include "platform/lum/Limits.h"
 #include "platform/lum/PeerConnection.h"
+#include "platform/lum/Pool.h"
 #include "platform/lum/ReceiveBudget.h"
 #include "platform/lum/ReplyBudget.h"
 #include "platform/lum/ServiceSocket.h"
+#include "platform/system/UniqueFd.h"
+#include "platform/threads/RunLoop.h"
 
 namespace platform {
 
@@ -29,6 +31,7 @@ namespace {
 constexpr std::chrono::milliseconds kPauseAfterFailure{100};
 // Accepted at once; then the loop's other work has its turn.
 constexpr int kMostAcceptedAtOnce = 32;
+constexpr std::size_t kMostRefused = 1024;
 
 bool isExhaustion(int errnum) {
     return errnum == EMFILE || errnum == ENFILE || errnum == ENOBUFS || errnum == ENOMEM;
@@ -46,6 +49,15 @@ bool hasFreeDescriptors(int count) {
     return count == 0;
 }
 
+std::size_t mostConnections() {
+    rlimit limit{};
+    if (getrlimit(RLIMIT_NOFILE, &limit) != 0) return lum::kMaxConnections;
+    const auto descriptors = std::max<rlim_t>(limit.rlim_cur, lum::kReservedDescriptors);
+    return std::min<rlim_t>(
+        (descriptors - lum::kReservedDescriptors) / lum::kDescriptorsOfConnection,
+        lum::kMaxConnections);
+}
+
 }  // namespace
 
 struct Listener::State : std::enable_shared_from_this<Listener::State> {
@@ -61,6 +73,8 @@ struct Listener::State : std::enable_shared_from_this<Listener::State> {
     bool failing = false;  // accepting has failed, and hosts have waited since then
     bool closed = false;
     UniqueFd undecided;  // accepted when no descriptors were left to look at its peer
+    Pool pool{mostConnections()};
+    std::set<Origin> refused;  // and told so in the log, until one of theirs is let in again
 
     State(SerialQueue& eventQueue, lum::ServiceSocket serviceSocket)
         : queue(eventQueue),
@@ -76,6 +90,7 @@ struct Listener::State : std::enable_shared_from_this<Listener::State> {
     void acceptSome();
     void acceptFailed(int errnum);
     void admit(UniqueFd connected);
+    std::optional<Pool::Share> drawFor(const AuditToken& token);
     void remember(const std::shared_ptr<lum::PeerConnection>& connection);
     void close();
 };
@@ -123,10 +138,31 @@ void Listener::State::admit(UniqueFd connected) {
         EVLOG_ERROR(ops(), "client {} is not let in: it cannot be told who it is", *peer);
         return;
     }
-    auto connection = std::make_shared<lum::PeerConnection>(std::move(connected), std::move(*token),
-                                                            queue, replyBudget, receiveBudget);
+    auto share = drawFor(*token);
+    if (!share) return;
+    auto connection =
+        std::make_shared<lum::PeerConnection>(std::move(connected), std::move(*token),
+                                              std::move(*share), queue, replyBudget, receiveBudget);
     remember(connection);
     handler(std::move(connection));
+}
+
+/// None, with a line the first time, when those of the peer's origin have their part already.
+std::optional<Pool::Share> Listener::State::drawFor(const AuditToken& token) {
+    const Origin origin = Origin::of(token);
+    auto share = pool.draw(origin);
+    if (share) {
+        refused.erase(origin);
+    } else {
+        // Who comes from ever new origins shall not make this grow.
+        if (refused.size() >= kMostRefused) refused.clear();
+        if (!refused.insert(origin).second) return share;
+        EVLOG_ERROR(ops(),
+                    "client {} is not let in: there are too many connections, or it and those it "
+                    "belongs with have too many, {} are the most",
+                    token.pid(), pool.quarter());
+    }
+    return share;
 }
 
 void Listener::State::remember(const std::shared_ptr<lum::PeerConnection>& connection) {

@@ -4,9 +4,9 @@
 #include <memory>
 #include <string>
 
-#include "platform/Error.h"
-#include "platform/SerialQueue.h"
 #include "platform/lum/Connection.h"
+#include "platform/system/Error.h"
+#include "platform/threads/SerialQueue.h"
 
 namespace platform {
 

@@ -4,8 +4,8 @@
 
 #include <mutex>
 
-#include "platform/Files.h"
-#include "platform/PropertyList.h"
+#include "platform/plist/PropertyList.h"
+#include "platform/system/Files.h"
 
 namespace platform {
 

@@ -4,7 +4,7 @@
 #include <optional>
 #include <string>
 
-#include "platform/Value.h"
+#include "platform/values/Value.h"
 
 namespace platform {
 

@@ -6,8 +6,8 @@
 #include <string_view>
 #include <utility>
 
-#include "platform/UniqueFd.h"
-#include "platform/Value.h"
+#include "platform/system/UniqueFd.h"
+#include "platform/values/Value.h"
 
 namespace platform {
 

@@ -5,7 +5,7 @@
 #include <algorithm>
 #include <utility>
 
-#include "platform/OpsLog.h"
+#include "platform/log/OpsLog.h"
 #include "platform/lum/Limits.h"
 
 namespace platform::lum {
@@ -35,12 +35,13 @@ class PeerConnection::Turn {
     std::size_t counted_ = 0;
 };
 
-PeerConnection::PeerConnection(UniqueFd socket, AuditToken token, SerialQueue& queue,
-                               std::shared_ptr<ReplyBudget> replyBudget,
+PeerConnection::PeerConnection(UniqueFd socket, AuditToken token, Pool::Share share,
+                               SerialQueue& queue, std::shared_ptr<ReplyBudget> replyBudget,
                                std::shared_ptr<ReceiveBudget> receiveBudget)
     : queue_(queue),
       loop_(queue.runLoop()),
       token_(std::move(token)),
+      share_(std::move(share)),
       replyBudget_(std::move(replyBudget)),
       receiveBudget_(std::move(receiveBudget)),
       replies_(replyBudget_->open()),

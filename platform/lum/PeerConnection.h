@@ -8,15 +8,16 @@
 #include <string>
 #include <string_view>
 
-#include "platform/RunLoop.h"
-#include "platform/SerialQueue.h"
-#include "platform/UniqueFd.h"
 #include "platform/lum/Connection.h"
 #include "platform/lum/Frame.h"
 #include "platform/lum/FrameSocket.h"
+#include "platform/lum/Pool.h"
 #include "platform/lum/ReceiveBudget.h"
 #include "platform/lum/ReplyBudget.h"
 #include "platform/lum/StallClock.h"
+#include "platform/system/UniqueFd.h"
+#include "platform/threads/RunLoop.h"
+#include "platform/threads/SerialQueue.h"
 
 namespace platform::lum {
 
@@ -29,7 +30,7 @@ class PeerConnection final : public Connection,
                              public Budget::Holder,
                              public std::enable_shared_from_this<PeerConnection> {
   public:
-    PeerConnection(UniqueFd socket, AuditToken token, SerialQueue& queue,
+    PeerConnection(UniqueFd socket, AuditToken token, Pool::Share share, SerialQueue& queue,
                    std::shared_ptr<ReplyBudget> replyBudget,
                    std::shared_ptr<ReceiveBudget> receiveBudget);
 
@@ -88,6 +89,7 @@ class PeerConnection final : public Connection,
     SerialQueue& queue_;
     RunLoop& loop_;
     const AuditToken token_;
+    const Pool::Share share_;  // of the connections that there may be
     const std::shared_ptr<ReplyBudget> replyBudget_;
     const std::shared_ptr<ReceiveBudget> receiveBudget_;
     const std::shared_ptr<Budget::Share> replies_;

@@ -13,17 +13,29 @@
 #include <cstring>
 #include <mutex>
 #include <optional>
+#include <set>
 #include <utility>
 #include <vector>
 
-#include "platform/Directories.h"
-#include "platform/Files.h"
-#include "platform/OpsLog.h"
+#include "platform/log/OpsLog.h"
 #include "platform/lum/Listener.h"
+#include "platform/system/Directories.h"
+#include "platform/system/Files.h"
 
 namespace platform::lum {
 
 namespace {
+
+/// The paths of the sockets that were made here and are still there.
+struct OwnPaths {
+    std::mutex mutex;  // guards `paths`
+    std::set<std::string> paths;
+};
+
+OwnPaths& ownPaths() {
+    static auto* const own = new OwnPaths;  // never destroyed: sockets may end with the process
+    return *own;
+}
 
 /// Opens a directory of ours below `parent`, made when it is missing. What somebody else has put in
 /// its place, also a symbolic link, is refused.
@@ -137,11 +149,22 @@ Result<ServiceSocket> ServiceSocket::make(const Directories& directories,
     if (auto error = removeStale(directory->get(), serviceName, *path)) return *error;
     auto socket = bindSocket(*path);
     if (!socket) return socket.error();
+    {
+        const std::lock_guard guard(ownPaths().mutex);
+        ownPaths().paths.insert(*path);
+    }
     return ServiceSocket(std::move(*lock), std::move(*socket), std::move(*path));
 }
 
 ServiceSocket::~ServiceSocket() {
-    if (socket_ && !ownPath_.empty()) unlink(ownPath_.c_str());
+    if (!socket_ || ownPath_.empty()) return;
+    const std::lock_guard guard(ownPaths().mutex);
+    if (ownPaths().paths.erase(ownPath_) != 0) unlink(ownPath_.c_str());
+}
+
+void removeServiceSockets() {
+    const std::lock_guard guard(ownPaths().mutex);
+    for (const std::string& path : std::exchange(ownPaths().paths, {})) unlink(path.c_str());
 }
 
 std::optional<pid_t> admittedPeer(int connected) {

@@ -5,8 +5,8 @@
 #include <optional>
 #include <string>
 
-#include "platform/Error.h"
-#include "platform/UniqueFd.h"
+#include "platform/system/Error.h"
+#include "platform/system/UniqueFd.h"
 
 namespace platform {
 
@@ -37,6 +37,10 @@ class ServiceSocket {
     UniqueFd socket_;
     std::string ownPath_;  // empty for a socket that was passed to this process
 };
+
+/// Removes every socket that this process has made for a service from its directory: for a process
+/// that ends without waiting for their owners to be destroyed. From any thread.
+void removeServiceSockets();
 
 /// The process that connected to a service, if it may speak to it: processes of this user and of
 /// root may, others get a log line. The id may have come to mean another process already.

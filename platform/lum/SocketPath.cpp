@@ -2,9 +2,9 @@
 
 #include <cerrno>
 
-#include "platform/Directories.h"
-#include "platform/Files.h"
 #include "platform/lum/Listener.h"
+#include "platform/system/Directories.h"
+#include "platform/system/Files.h"
 
 namespace platform::lum {
 

@@ -5,15 +5,16 @@
 #include <utility>
 #include <vector>
 
-#include "platform/Error.h"
-#include "platform/UniqueFd.h"
+#include "platform/system/Error.h"
+#include "platform/system/UniqueFd.h"
 
 namespace platform::spawnerd {
 
 /// How a child process of a program with threads begins: with the descriptors that it is given and
-/// no others, with the signals as they are by default, and without the names that namespaces do not
-/// take away: it possesses no key of the user's session, and where the kernel can do that
-/// (Landlock) it reaches no abstract socket that was not made by itself or its children.
+/// no others, with the signals as they are by default, as the first to go when memory runs out, and
+/// without the names that namespaces do not take away: it possesses no key of the user's session,
+/// and where the kernel can do that (Landlock) it reaches no abstract socket that was not made by
+/// itself or its children.
 class ChildProcess {
   public:
     /// The child's descriptors have numbers up to `lastDescriptor`.

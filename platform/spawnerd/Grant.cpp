@@ -1,5 +1,6 @@
 #include "platform/spawnerd/Grant.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -7,24 +8,41 @@
 #include <optional>
 #include <string_view>
 
-#include "platform/Directories.h"
-#include "platform/Files.h"
-#include "platform/lum/LumBundle.h"
+#include "platform/plist/PropertyList.h"
+#include "platform/spawnerd/Launcher.h"
 #include "platform/spawnerd/Protocol.h"
 #include "platform/spawnerd/SandboxProfile.h"
+#include "platform/system/Directories.h"
+#include "platform/system/Files.h"
+#include "platform/system/OpenBeneath.h"
 
 namespace platform::spawnerd {
 
 namespace {
 
-std::optional<Error> checkExecutable(const std::string& path) {
-    struct stat status;
-    if (path.empty() || path.front() != '/' || path.find('\0') != std::string::npos)
-        return Error::posix(EINVAL, path);
-    if (::stat(path.c_str(), &status) != 0) return Error::posix(errno, path);
+/// What lies behind a directory in the path of something in it; empty when that lies elsewhere.
+std::string pathWithin(const std::string& directory, const std::string& path) {
+    if (directory.empty() || !path.starts_with(directory + '/')) return {};
+    return path.substr(directory.size() + 1);
+}
+
+std::optional<Error> checkExecutable(int bundle, const std::string& name, const std::string& path) {
+    const Result<UniqueFd> file = openBeneath(bundle, name, O_PATH);
+    if (!file) return Error::posix(file.error().code, path);
+    struct stat status {};
+    if (::fstat(file->get(), &status) != 0) return Error::posix(errno, path);
     if (!S_ISREG(status.st_mode)) return Error::posix(EACCES, path);
-    if (::access(path.c_str(), X_OK) != 0) return Error::posix(errno, path);
+    const std::string opened = "/proc/self/fd/" + std::to_string(file->get());
+    if (::access(opened.c_str(), X_OK) != 0) return Error::posix(errno, path);
     return std::nullopt;
+}
+
+/// The Info.plist of an open bundle; none when it has none that can be used.
+std::optional<Dictionary> readInfo(int bundle) {
+    const Result<std::string> bytes = readFileBeneath(bundle, "Info.plist", kMaxPropertyListFile);
+    const Result<Value> value = bytes ? parsePropertyList(*bytes) : bytes.error();
+    const Dictionary* dictionary = value ? value->dictionary() : nullptr;
+    return dictionary ? std::optional(*dictionary) : std::nullopt;
 }
 
 /// The text of the first of the keys that is there.
@@ -36,13 +54,12 @@ std::string textAt(const Dictionary& info, std::initializer_list<const char*> ke
     return {};
 }
 
-std::string plugInIdentifier(const Dictionary& info, const std::string& bundleIdentifier) {
+std::string plugInIdentifier(const Dictionary& info) {
     constexpr const char* kIdentifier = "VXExtensionIdentifier";
     const Value* extension = info.find("VXExtension");
     const Dictionary* plugIn = extension ? extension->dictionary() : nullptr;
-    std::string identifier = plugIn ? textAt(*plugIn, {kIdentifier}) : std::string();
-    if (identifier.empty()) identifier = textAt(info, {kIdentifier});
-    return identifier.empty() ? bundleIdentifier : identifier;
+    const std::string identifier = plugIn ? textAt(*plugIn, {kIdentifier}) : std::string();
+    return identifier.empty() ? textAt(info, {kIdentifier}) : identifier;
 }
 
 bool isVariableName(std::string_view name) {
@@ -81,35 +98,45 @@ std::optional<Error> readOverlay(const Dictionary& overlay, Grant& grant) {
 
 }  // namespace
 
-std::optional<Error> checkOwnDirectory(const std::string& path) {
-    struct stat status;
-    if (::lstat(path.c_str(), &status) != 0)
-        return errno == ENOENT ? std::nullopt : std::optional(Error::posix(errno, path));
-    if (!S_ISDIR(status.st_mode)) return Error::posix(ENOTDIR, path);
+Result<UniqueFd> openContainer(const Directories& directories, const std::string& path) {
+    const std::string root = joinPath(directories.zorvanData(), "Containers");
+    const std::string name = pathWithin(root, path);
+    if (name.empty()) return Error::posix(EINVAL, path);
+    const UniqueFd containers(::open(root.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    if (!containers) return Error::posix(errno, root);
+    auto container = openWithoutLinks(containers.get(), name, O_PATH | O_DIRECTORY | O_NOFOLLOW);
+    if (!container) return Error::posix(container.error().code, path);
+    struct stat status {};
+    if (::fstat(container->get(), &status) != 0) return Error::posix(errno, path);
     if (status.st_uid != ::geteuid()) return Error::posix(EPERM, path);
-    return std::nullopt;
+    return container;
 }
 
-Result<Grant> Grant::make(const Directories& directories, const std::string& executable,
+Result<Grant> Grant::make(const Directories& directories, const ExternalService& service,
                           const Dictionary& overlay) {
-    if (auto error = checkExecutable(executable)) return *error;
-    Grant grant;
-    grant.executable = executable;
-    const auto bundle = LumBundle::make(executable, LumBundle::Executable);
-    const auto path = bundle->property(LumBundle::BundlePath);
-    const auto info = bundle->infoDictionary();
-    if (!path || !info) return Error::posix(EINVAL, "no bundle around " + executable);
-    grant.bundle = *path;
-    grant.bundleIdentifier = textAt(*info, {"QFBundleIdentifier"});
-    grant.bundleVersion = textAt(*info, {"QFBundleVersion", "QFBundleShortVersionString"});
-    const std::string identifier = plugInIdentifier(*info, grant.bundleIdentifier);
-    if (grant.bundleIdentifier.empty()) grant.bundleIdentifier = identifier;
-    if (!isSafeName(grant.bundleIdentifier) || !isSafeName(identifier))
-        return Error::posix(EINVAL, "the bundle's identifier, " + grant.bundle);
+    const Result<UniqueFd> bundle = service.bundle.open();
+    if (!bundle) return bundle.error();
+    const std::string name = pathWithin(service.bundle.path, service.executable);
+    if (name.empty()) return Error::posix(EINVAL, service.executable + " is not in its bundle");
+    if (auto error = checkExecutable(bundle->get(), name, service.executable)) return *error;
+    const auto info = readInfo(bundle->get());
+    if (!info) return Error::posix(EINVAL, "the Info.plist of " + service.bundle.path);
 
-    const std::string container = joinPath(directories.zorvanData() + "/Containers", identifier);
-    if (auto error = checkOwnDirectory(container)) return *error;
-    if (::access(container.c_str(), F_OK) == 0) grant.container = container;
+    Grant grant;
+    grant.executable = service.executable;
+    grant.bundle = service.bundle;
+    grant.bundleIdentifier = textAt(*info, {"QFBundleIdentifier"});
+    if (grant.bundleIdentifier.empty()) grant.bundleIdentifier = plugInIdentifier(*info);
+    grant.bundleVersion = textAt(*info, {"QFBundleVersion", "QFBundleShortVersionString"});
+    if (!isSafeName(grant.bundleIdentifier))
+        return Error::posix(EINVAL, "the bundle's identifier, " + grant.bundle.path);
+    if (!service.container.empty()) {
+        const Result<UniqueFd> container = openContainer(directories, service.container);
+        if (container)
+            grant.container = service.container;
+        else if (!isMissingFile(container.error()))
+            return container.error();
+    }
     if (auto error = readOverlay(overlay, grant)) return *error;
     return grant;
 }

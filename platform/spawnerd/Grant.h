@@ -5,12 +5,15 @@
 #include <utility>
 #include <vector>
 
-#include "platform/Error.h"
-#include "platform/Value.h"
+#include "platform/system/Error.h"
+#include "platform/system/KnownDirectory.h"
+#include "platform/system/UniqueFd.h"
+#include "platform/values/Value.h"
 
 namespace platform {
 
 struct Directories;
+struct ExternalService;
 
 namespace spawnerd {
 
@@ -20,24 +23,26 @@ struct SandboxProfile;
 /// overlay say about it. A plain value.
 struct Grant {
     std::string executable;
-    std::string bundle;  // the directory around the executable
+    KnownDirectory bundle;
     std::string bundleIdentifier;
     std::string bundleVersion;  // empty when the bundle has none
     std::string container;      // the plug-in's data container; empty when it has none
     std::vector<std::pair<std::string, std::string>> environment;
     const SandboxProfile* profile = nullptr;
 
-    /// Reads the bundle and judges the overlay. Errors, all "POSIX": the executable does not exist
-    /// or cannot be run (ENOENT, EACCES, ...); the bundle has no identifier that can name a
-    /// directory, or the overlay is no good (EINVAL, or E2BIG for too large an environment); the
-    /// data container is not what it has to be (see `checkOwnDirectory`).
-    static Result<Grant> make(const Directories& directories, const std::string& executable,
+    /// Reads the bundle and judges the overlay. Errors, all "POSIX": the bundle is not in its place
+    /// (see `KnownDirectory::open`); the executable does not exist, cannot be run or lies outside
+    /// (ENOENT, EACCES, EXDEV, ...); the bundle has no identifier that can name a directory, or the
+    /// overlay is no good (EINVAL, or E2BIG for too large an environment); the data container is
+    /// not what it has to be (see `openContainer`).
+    static Result<Grant> make(const Directories& directories, const ExternalService& service,
                               const Dictionary& overlay);
 };
 
-/// Whether what is at the path, if anything is, is a directory of this user's own and no symbolic
-/// link. None when it is, or nothing is there; else ENOTDIR or EPERM.
-std::optional<Error> checkOwnDirectory(const std::string& path);
+/// Opens (O_PATH) a data container. Errors: the system's; EINVAL when the path is not one below
+/// this user's containers; EXDEV when it leads out of them, ELOOP or ENOTDIR for a symbolic link
+/// there, EPERM for a directory of somebody else.
+Result<UniqueFd> openContainer(const Directories& directories, const std::string& path);
 
 }  // namespace spawnerd
 }  // namespace platform

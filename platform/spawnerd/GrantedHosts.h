@@ -10,11 +10,11 @@
 #include <string>
 #include <utility>
 
-#include "platform/RunLoop.h"
-#include "platform/SerialQueue.h"
-#include "platform/UniqueFd.h"
 #include "platform/lum/AuditToken.h"
 #include "platform/spawnerd/Grant.h"
+#include "platform/system/UniqueFd.h"
+#include "platform/threads/RunLoop.h"
+#include "platform/threads/SerialQueue.h"
 
 namespace platform::spawnerd {
 

@@ -12,12 +12,15 @@
 #include <string_view>
 #include <utility>
 
+#include "platform/log/OpsLog.h"
+
 namespace platform::spawnerd {
 
 namespace {
 
 constexpr std::size_t kMaxInfo = 4096;
 constexpr int kPatience = 1000;  // milliseconds
+constexpr std::string_view kFirstProcess = "\"child-pid\":";
 
 void sendKill(const UniqueFd& pidFd) {
     if (pidFd) ::syscall(SYS_pidfd_send_signal, pidFd.get(), SIGKILL, nullptr, 0);
@@ -33,7 +36,7 @@ unsigned long numberIn(const std::string& info, std::string_view key) {
 /// The pidfd of the sandbox's first process; none when that is gone. Its number is only a number:
 /// the process must be in the sandbox's pid namespace, which does not outlive the first process.
 UniqueFd firstProcessOf(const std::string& info) {
-    const unsigned long pid = numberIn(info, "\"child-pid\":");
+    const unsigned long pid = numberIn(info, kFirstProcess);
     UniqueFd first(static_cast<int>(::syscall(SYS_pidfd_open, static_cast<pid_t>(pid), 0)));
     struct stat status;
     const std::string path = "/proc/" + std::to_string(pid) + "/ns/pid";
@@ -46,12 +49,16 @@ UniqueFd firstProcessOf(const std::string& info) {
 }  // namespace
 
 Instance::Instance(RunLoop& loop, SandboxedProcess process, std::string name,
-                   std::function<void()> runs, std::function<void(int)> ended)
+                   const InstanceLimits& limits, InstanceGroup group, std::function<void()> runs,
+                   std::function<void(int)> ended)
     : loop_(loop),
       process_(std::move(process)),
+      name_(std::move(name)),
+      limits_(limits),
+      group_(std::move(group)),
       runs_(std::move(runs)),
       ended_(std::move(ended)),
-      output_(loop, std::move(process_.output), std::move(name)) {
+      output_(loop, std::move(process_.output), name_) {
     childWatch_.emplace(loop_, process_.pidFd.get());
     childWatch_->awaitReadable([this] { reap(); });
     infoWatch_.emplace(loop_, process_.info.get());
@@ -75,6 +82,7 @@ Instance::~Instance() {
 void Instance::kill() {
     isDoomed_ = true;
     if (!first_ && process_.info) return;
+    group_.kill();
     sendKill(first_);
     if (!status_) sendKill(process_.pidFd);
 }
@@ -103,11 +111,19 @@ void Instance::takeInfoNow() {
 void Instance::awaitInfo() {
     if (!readInfo()) return infoWatch_->awaitReadable([this] { awaitInfo(); });
     if (first_) watchFirst();
-    if (isDoomed_ || !first_) return kill();
+    if (isDoomed_ || !first_ || !limit()) return kill();
     const bool passed = ::write(process_.gate.get(), "", 1) == 1;
     process_.gate.reset();
     if (!passed) return kill();
     runs_();
+}
+
+bool Instance::limit() const {
+    const auto first = static_cast<pid_t>(numberIn(infoText_, kFirstProcess));
+    if (setProcessLimits(first, limits_) && group_.add(process_.pid) && group_.add(first))
+        return true;
+    EVLOG_ERROR(ops(), "cannot limit a plug-in: {}", pub(Error::posix(errno, name_)));
+    return false;
 }
 
 void Instance::watchFirst() {

@@ -5,10 +5,12 @@
 #include <optional>
 #include <string>
 
-#include "platform/RunLoop.h"
-#include "platform/UniqueFd.h"
+#include "platform/spawnerd/InstanceGroups.h"
+#include "platform/spawnerd/InstanceLimits.h"
 #include "platform/spawnerd/OutputLog.h"
 #include "platform/spawnerd/SandboxedProcess.h"
+#include "platform/system/UniqueFd.h"
+#include "platform/threads/RunLoop.h"
 
 namespace platform::spawnerd {
 
@@ -17,10 +19,12 @@ namespace platform::spawnerd {
 /// whatever the plug-in forked. On the loop's thread.
 class Instance {
   public:
+    /// `limits` are in force before the plug-in runs, and those of `group`, if it is one, too.
     /// `runs` is called once the sandbox is there; `ended`, once, when no process of it is left,
     /// with the plug-in's exit status, or 128 and the number of the signal that ended it. The
     /// instance may be destroyed in `ended`.
-    Instance(RunLoop& loop, SandboxedProcess process, std::string name, std::function<void()> runs,
+    Instance(RunLoop& loop, SandboxedProcess process, std::string name,
+             const InstanceLimits& limits, InstanceGroup group, std::function<void()> runs,
              std::function<void(int status)> ended);
     Instance(const Instance&) = delete;
     /// Ends it, if it has not ended.
@@ -35,12 +39,18 @@ class Instance {
     bool readInfo();
     void takeInfoNow();
     void awaitInfo();
+    /// Sets the limits on the sandbox's first process, which waits at the gate; false, with an
+    /// error line, when that cannot be done.
+    bool limit() const;
     void watchFirst();
     void reap();
     void endedPartly();
 
     RunLoop& loop_;
     SandboxedProcess process_;
+    const std::string name_;
+    const InstanceLimits limits_;
+    const InstanceGroup group_;
     const std::function<void()> runs_;
     const std::function<void(int)> ended_;
     OutputLog output_;

@@ -5,7 +5,7 @@
 #include <cerrno>
 #include <utility>
 
-#include "platform/OpsLog.h"
+#include "platform/log/OpsLog.h"
 
 namespace platform::spawnerd {
 
@@ -19,6 +19,7 @@ void OutputLog::await() {
     watch_->awaitReadable([this] {
         if (readOn()) return await();
         watch_.reset();
+        pipe_.reset();
     });
 }
 
@@ -26,11 +27,13 @@ bool OutputLog::readOn() {
     char buffer[4096];
     const ssize_t count = ::read(pipe_.get(), buffer, sizeof buffer);
     if (count > 0) take(buffer, static_cast<std::size_t>(count));
-    return count > 0 || (count < 0 && (errno == EAGAIN || errno == EINTR));
+    if (count < 0) return errno == EAGAIN || errno == EINTR;
+    if (isFull()) EVLOG_INFO(ops(), "plug-in {} writes more than is logged", pub(name_));
+    return count > 0 && !isFull();
 }
 
 void OutputLog::take(const char* bytes, std::size_t count) {
-    for (std::size_t i = 0; i < count && logged_ < kMaxLogged && lines_ < kMaxLines; ++i) {
+    for (std::size_t i = 0; i < count && !isFull(); ++i) {
         ++logged_;
         if (bytes[i] != '\n') line_.push_back(bytes[i]);
         if (bytes[i] == '\n' || line_.size() == kMaxLine || logged_ == kMaxLogged) endLine();
@@ -45,12 +48,14 @@ void OutputLog::endLine() {
 }
 
 void OutputLog::finish() {
+    if (!pipe_) return;
     char buffer[4096];
     ssize_t count = 0;
     for (int i = 0; i < 16 && (count = ::read(pipe_.get(), buffer, sizeof buffer)) > 0; ++i)
         take(buffer, static_cast<std::size_t>(count));
     endLine();
     watch_.reset();
+    pipe_.reset();
 }
 
 }  // namespace platform::spawnerd

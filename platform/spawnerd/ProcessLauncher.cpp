@@ -2,7 +2,7 @@
 
 #include <utility>
 
-#include "platform/SerialQueue.h"
+#include "platform/threads/SerialQueue.h"
 
 namespace platform {
 
@@ -33,9 +33,9 @@ ProcessLauncher::ProcessLauncher(const Directories& directories, const std::stri
     });
 }
 
-int ProcessLauncher::addExternalService(const AuditToken& host, const std::string& executable,
+int ProcessLauncher::addExternalService(const AuditToken& host, const ExternalService& service,
                                         const Dictionary& overlay) {
-    return service_->grant(host, executable, overlay);
+    return service_->grant(host, service, overlay);
 }
 
 void ProcessLauncher::removeExternalServices(const std::string& bundlePath) {
@@ -53,6 +53,12 @@ void ProcessLauncher::terminatePlugInInstances(const std::string& bundleIdentifi
         bundleIdentifier, bundleVersion, [&queue, completion = std::move(completion)](bool found) {
             queue.async([completion, found] { completion(found ? kDone : kNoneOnRecord); });
         });
+}
+
+void ProcessLauncher::shutDown(std::function<void()> completion) {
+    service_->queue().async([service = service_, completion = std::move(completion)]() mutable {
+        service->shutDown(std::move(completion));
+    });
 }
 
 }  // namespace spawnerd

@@ -4,7 +4,7 @@
 #include <memory>
 #include <string>
 
-#include "platform/Launcher.h"
+#include "platform/spawnerd/Launcher.h"
 #include "platform/spawnerd/SandboxedProcess.h"
 #include "platform/spawnerd/SpawnService.h"
 
@@ -16,13 +16,14 @@ class ProcessLauncher final : public Launcher {
     ProcessLauncher(const Directories& directories, const std::string& daemonService,
                     std::shared_ptr<RunLoop> loop, const std::string& program = kBubblewrap);
 
-    int addExternalService(const AuditToken& host, const std::string& executable,
+    int addExternalService(const AuditToken& host, const ExternalService& service,
                            const Dictionary& overlay) override;
     void removeExternalServices(const std::string& bundlePath) override;
     std::unique_ptr<WorkMarker> beginOutstandingWork() override;
     void terminatePlugInInstances(const std::string& bundleIdentifier,
                                   const std::string& bundleVersion, SerialQueue& queue,
                                   Completion completion) override;
+    void shutDown(std::function<void()> completion) override;
 
     /// How many work markers live. From any thread.
     int outstandingWork() const { return *outstanding_; }

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <cstddef>
 #include <string>
 
@@ -36,6 +37,8 @@ inline constexpr int kConnectionDescriptor = 3;
 inline constexpr std::size_t kMaxInstancesPerHost = 32;
 inline constexpr std::size_t kMaxInstances = 256;
 inline constexpr std::size_t kMaxGrantsPerHost = 1024;
+/// How long a shut-down waits for instances to be gone.
+inline constexpr std::chrono::seconds kShutDownPatience{2};
 /// Requests that wait for the end of one instance.
 inline constexpr std::size_t kMaxWaitersPerInstance = 16;
 /// Ended instances of a host whose status it can still ask for.

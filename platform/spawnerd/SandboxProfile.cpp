@@ -9,12 +9,16 @@
 #include <cstdlib>
 #include <initializer_list>
 #include <iterator>
+#include <utility>
 
-#include "platform/Directories.h"
-#include "platform/Files.h"
 #include "platform/lum/Listener.h"
+#include "platform/sandbox/BusyFolder.h"
+#include "platform/sandbox/SandboxTokens.h"
 #include "platform/spawnerd/Grant.h"
 #include "platform/spawnerd/Protocol.h"
+#include "platform/spawnerd/SandboxedProcess.h"
+#include "platform/system/Directories.h"
+#include "platform/system/Files.h"
 
 namespace platform::spawnerd {
 
@@ -29,10 +33,10 @@ constexpr const char* kFonts[] = {"/etc/fonts"};
 /// What a keyboard sees is typed, what a filter or a preview sees is the user's data: nothing of it
 /// may leave the machine.
 constexpr SandboxProfile kProfiles[] = {
-    {.name = "plugin", .network = true, .files = kNetworkFiles},
-    {.name = "keyboard", .network = false, .files = {}},
-    {.name = "network-filter", .network = false, .files = {}},
-    {.name = "glimsed", .network = false, .files = kFonts},
+    {.name = "plugin", .network = true, .files = kNetworkFiles, .limits = kWorkLimits},
+    {.name = "keyboard", .network = false, .files = {}, .limits = kSmallLimits},
+    {.name = "network-filter", .network = false, .files = {}, .limits = kSmallLimits},
+    {.name = "glimsed", .network = false, .files = kFonts, .limits = kWorkLimits},
 };
 
 /// The system, read-only: programs and libraries, and the few settings that the loader and the
@@ -46,9 +50,6 @@ constexpr const char* kConfinement[] = {
     "--unshare-cgroup", "--new-session",    "--die-with-parent", "--cap-drop",    "ALL",
     "--hostname",       "plugin",
 };
-
-/// Bytes that a plug-in may put into memory as files.
-constexpr const char* kMostTemporary = "67108864";
 
 using Arguments = std::vector<std::string>;
 
@@ -69,28 +70,27 @@ void bindSystem(Arguments& arguments, const SandboxProfile& profile) {
     for (const char* path : profile.files) append(arguments, {"--ro-bind-try", path, path});
     // Root owns the kernel's settings below /proc, also without any privileges.
     append(arguments, {"--proc", "/proc", "--remount-ro", "/proc"});
-    append(arguments, {"--dev", "/dev", "--size", kMostTemporary, "--tmpfs", "/tmp"});
+    // Everything in /dev that can be written to lies in memory.
+    append(arguments, {"--dev", "/dev", "--size", std::to_string(profile.limits.sharedMemory),
+                       "--tmpfs", "/dev/shm", "--remount-ro", "/dev"});
+    append(arguments, {"--size", std::to_string(profile.limits.temporary), "--tmpfs", "/tmp"});
 }
 
-/// The sockets themselves: their directory holds locks, too, which would be anybody's to take.
-std::optional<Error> bindServices(Arguments& arguments, const Directories& directories,
-                                  const std::string& daemonService) {
-    for (const char* suffix : {"", ".sandbox", ".spawnerd"}) {
-        const auto path = lum::socketPath(directories, daemonService + suffix);
-        if (!path) return path.error();
-        append(arguments, {"--ro-bind-try", *path, *path});
-    }
+/// Where tokens are traded for access. The daemon itself and its launcher serve hosts, which a
+/// plug-in is not. The socket alone: its directory holds locks, which would be anybody's to take.
+std::optional<Error> bindTokenBroker(Arguments& arguments, const Directories& directories,
+                                     const std::string& daemonService) {
+    const auto path = lum::socketPath(directories, sandboxServiceName(daemonService));
+    if (!path) return path.error();
+    append(arguments, {"--ro-bind-try", *path, *path});
     return std::nullopt;
 }
 
-/// Where the plug-in states that it is busy.
-std::optional<Error> bindAssertions(Arguments& arguments, const Directories& directories,
-                                    const std::string& bundleIdentifier) {
-    const std::string path = joinPath(directories.zorvanRuntime() + "/tenurd", bundleIdentifier);
-    if (auto error = makeDirectories(path, 0700)) return error;
-    if (auto error = checkOwnDirectory(path)) return error;
-    append(arguments, {"--bind", path, path});
-    return std::nullopt;
+void bindDirectory(SandboxSetup& setup, std::string_view how, UniqueFd directory,
+                   std::string_view place) {
+    const auto number = static_cast<int>(setup.directories.size()) + kFirstDirectoryDescriptor;
+    append(setup.arguments, {how, std::to_string(number), place});
+    setup.directories.push_back(std::move(directory));
 }
 
 /// The plug-in's own variables may replace the first ones, not the last.
@@ -117,24 +117,31 @@ const SandboxProfile* findSandboxProfile(std::string_view name) {
     return found == std::end(kProfiles) ? nullptr : &*found;
 }
 
-Result<std::vector<std::string>> sandboxArguments(const Grant& grant,
-                                                  const Directories& directories,
-                                                  const std::string& daemonService) {
-    Arguments arguments(std::begin(kConfinement), std::end(kConfinement));
-    if (!grant.profile->network) append(arguments, {"--unshare-net"});
+Result<SandboxSetup> sandboxSetup(const Grant& grant, const Directories& directories,
+                                  const std::string& daemonService,
+                                  const Surroundings& surroundings) {
+    SandboxSetup setup;
+    Arguments& arguments = setup.arguments;
+    arguments.assign(std::begin(kConfinement), std::end(kConfinement));
+    if (!grant.profile->network || !surroundings.hostHasNetwork)
+        append(arguments, {"--unshare-net"});
     bindSystem(arguments, *grant.profile);
-    if (auto error = bindServices(arguments, directories, daemonService)) return *error;
-    if (auto error = bindAssertions(arguments, directories, grant.bundleIdentifier)) return *error;
+    if (auto error = bindTokenBroker(arguments, directories, daemonService)) return *error;
+    append(arguments, {"--ro-bind", surroundings.busyFolder,
+                       BusyFolder::ofBundle(directories, grant.bundleIdentifier)});
+    // Both were checked when the grant was made, and may have been exchanged since.
     if (!grant.container.empty()) {
-        // It was checked when the grant was made. Whoever is confined cannot exchange it: of a
-        // container's place a plug-in sees nothing but what is inside.
-        if (auto error = checkOwnDirectory(grant.container)) return *error;
-        append(arguments, {"--bind", grant.container, grant.container});
+        auto container = openContainer(directories, grant.container);
+        if (!container) return container.error();
+        bindDirectory(setup, "--bind-fd", std::move(*container), grant.container);
     }
-    append(arguments, {"--ro-bind", grant.bundle, grant.bundle, "--remount-ro", "/"});
+    auto bundle = grant.bundle.open();
+    if (!bundle) return bundle.error();
+    bindDirectory(setup, "--ro-bind-fd", std::move(*bundle), grant.bundle.path);
+    append(arguments, {"--remount-ro", "/"});
     append(arguments, {"--chdir", grant.container.empty() ? "/" : grant.container});
     setEnvironment(arguments, grant, directories, daemonService);
-    return arguments;
+    return setup;
 }
 
 }  // namespace platform::spawnerd

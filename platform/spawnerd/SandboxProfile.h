@@ -5,7 +5,9 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/Error.h"
+#include "platform/spawnerd/InstanceLimits.h"
+#include "platform/system/Error.h"
+#include "platform/system/UniqueFd.h"
 
 namespace platform {
 
@@ -18,22 +20,39 @@ struct Grant;
 /// A kind of sandbox that plug-ins run in.
 struct SandboxProfile {
     const char* name;
-    /// Shares the machine's network; otherwise there is none.
+    /// Shares the machine's network, for a host that has it; otherwise there is none.
     bool network;
     /// Files below /etc that it sees besides those that every plug-in sees.
     std::span<const char* const> files;
+    InstanceLimits limits;
 };
 
 /// Null for an unknown name.
 const SandboxProfile* findSandboxProfile(std::string_view name);
 
-/// bubblewrap's arguments, up to the command, for a granted plug-in of the daemon of a service
-/// name. Everything that confines it is decided here; docs/bundles.md tells authors what they see.
-/// Makes the directory of the plug-in's busy assertions when it is missing. Errors: the data
-/// container, or that directory, is not a directory of this user's own any more.
-Result<std::vector<std::string>> sandboxArguments(const Grant& grant,
-                                                  const Directories& directories,
-                                                  const std::string& daemonService);
+/// What an instance finds for itself, beside what its profile and its grant say.
+struct Surroundings {
+    /// Nothing is wider than the host that it is started for.
+    bool hostHasNetwork;
+    /// A directory, which it sees, read-only, as the place where it states that it is busy.
+    std::string busyFolder;
+};
+
+/// What bubblewrap is started with.
+struct SandboxSetup {
+    std::vector<std::string> arguments;  // up to the command
+    /// What the arguments bind by descriptor, so that it is what was looked at, whatever happens to
+    /// its name; numbered from `kFirstDirectoryDescriptor` on.
+    std::vector<UniqueFd> directories;
+};
+
+/// The setup for a granted plug-in of the daemon of a service name. Everything that confines it is
+/// decided here; docs/bundles.md tells authors what they see. Errors: the bundle is not in its
+/// place any more (see `KnownDirectory::open`); the data container is not a directory of this
+/// user's own any more.
+Result<SandboxSetup> sandboxSetup(const Grant& grant, const Directories& directories,
+                                  const std::string& daemonService,
+                                  const Surroundings& surroundings);
 
 }  // namespace spawnerd
 }  // namespace platform

@@ -6,7 +6,9 @@
 #include <cerrno>
 #include <utility>
 
-#include "platform/OpsLog.h"
+#include "platform/log/OpsLog.h"
+#include "platform/sandbox/Namespaces.h"
+#include "platform/spawnerd/Launcher.h"
 #include "platform/spawnerd/Protocol.h"
 #include "platform/spawnerd/SandboxProfile.h"
 
@@ -77,7 +79,9 @@ SpawnService::SpawnService(Directories directories, std::string daemonService,
       daemonService_(std::move(daemonService)),
       loop_(std::move(loop)),
       program_(std::move(program)),
-      queue_("spawnerd", *loop_) {}
+      queue_("spawnerd", *loop_),
+      pool_(kMaxInstances),
+      shutDownTimer_(*loop_) {}
 
 SpawnService::~SpawnService() = default;
 
@@ -89,25 +93,35 @@ void SpawnService::listen() {
         return;
     }
     listener_ = std::move(*listener);
-    listener_->setEventHandler([weak = weak_from_this()](std::shared_ptr<Connection> connection) {
-        if (auto self = weak.lock()) self->accept(std::move(connection));
-    });
+    listener_->setEventHandler(
+        [weak = weak_from_this()](const std::shared_ptr<Connection>& connection) {
+            if (auto self = weak.lock()) self->accept(connection);
+        });
     listener_->resume();
+    BusyFolder::sweep(directories_);
+    groups_ = InstanceGroups::find();
+    if (groups_.areThere())
+        EVLOG_DEFAULT(ops(), "plug-ins are limited by groups of their own");
+    else
+        EVLOG_DEFAULT(ops(),
+                      "plug-ins are limited by process, without a limit of memory{}: no group"
+                      " of processes is delegated to this daemon",
+                      pub(::geteuid() == 0 ? " or processes" : ""));
 }
 
-int SpawnService::grant(const AuditToken& host, const std::string& executable,
+int SpawnService::grant(const AuditToken& host, const ExternalService& service,
                         const Dictionary& overlay) {
-    auto grant = Grant::make(directories_, executable, overlay);
+    auto grant = Grant::make(directories_, service, overlay);
     if (grant) return hosts_->add(host, std::move(*grant));
-    EVLOG_INFO(ops(), "{} cannot be started as a plug-in: {}", executable, grant.error());
+    EVLOG_INFO(ops(), "{} cannot be started as a plug-in: {}", service.executable, grant.error());
     return grant.error().code;
 }
 
 void SpawnService::takeBack(const std::string& bundlePath) {
-    hosts_->takeBack([&](const Grant& grant) { return grant.bundle == bundlePath; });
+    hosts_->takeBack([&](const Grant& grant) { return grant.bundle.path == bundlePath; });
 }
 
-void SpawnService::accept(std::shared_ptr<Connection> connection) {
+void SpawnService::accept(const std::shared_ptr<Connection>& connection) {
     // The connection holds the handler, so the handler must not hold it.
     connection->setEventHandler(
         [weak = weak_from_this(), peer = std::weak_ptr(connection)](const ConnectionEvent& event) {
@@ -120,26 +134,29 @@ void SpawnService::accept(std::shared_ptr<Connection> connection) {
     connection->resume();
 }
 
-void SpawnService::serve(const Host& host, Asked asked) {
+void SpawnService::serve(const Host& host, const Asked& asked) {
     const std::string* request = textAt(asked.message, kRequest);
     if (!request) return refuse(asked, Error::posix(EINVAL, "\"request\" is missing"));
-    if (*request == kStart) return start(host, std::move(asked));
+    if (*request == kStart) return start(host, asked);
     if (*request == kWait) return awaitEnd(host, asked, false);
     if (*request == kTerminate) return awaitEnd(host, asked, true);
     refuse(asked, Error::posix(ENOSYS, "unrecognized request"));
 }
 
-std::optional<Error> SpawnService::checkRoom(const Host& host) const {
+Result<Pool::Share> SpawnService::drawFor(const Host& host) {
     const auto own = std::ranges::count_if(
         instances_, [&](const auto& entry) { return entry.second.host == host; });
     if (static_cast<std::size_t>(own) >= kMaxInstancesPerHost)
         return Error::posix(EAGAIN, "this process has started too many plug-ins");
     if (instances_.size() >= kMaxInstances)
         return Error::posix(EAGAIN, "too many plug-ins are running");
-    return std::nullopt;
+    auto share = pool_.draw(Origin::of(host->token));
+    if (!share)
+        return Error::posix(EAGAIN, "those that this process belongs with run too many plug-ins");
+    return std::move(*share);
 }
 
-void SpawnService::start(const Host& host, Asked asked) {
+void SpawnService::start(const Host& host, const Asked& asked) {
     const std::string* executable = textAt(asked.message, kExecutable);
     if (!executable) return refuse(asked, Error::posix(EINVAL, "\"executable\" is missing"));
     const auto arguments = argumentsIn(asked.message);
@@ -149,8 +166,10 @@ void SpawnService::start(const Host& host, Asked asked) {
         EVLOG_INFO(ops(), "refusing to start {}: it was not made ready for its host", *executable);
         return refuse(asked, Error::posix(EPERM, "this process may not start " + *executable));
     }
-    if (auto error = checkRoom(host)) return refuse(asked, *error);
+    auto share = drawFor(host);
+    if (!share) return refuse(asked, share.error());
     Running running;
+    running.share = std::move(*share);
     running.host = host;
     running.grant = std::move(grant);
     running.starting = asked;
@@ -163,8 +182,16 @@ void SpawnService::start(const Host& host, Asked asked) {
 std::optional<Error> SpawnService::spawn(std::uint64_t id, Running running,
                                          const std::vector<std::string>& plugInArguments) {
     const Grant& grant = *running.grant;
-    const auto arguments = sandboxArguments(grant, directories_, daemonService_);
-    if (!arguments) return arguments.error();
+    auto busyFolder = BusyFolder::make(directories_, grant.bundleIdentifier);
+    if (!busyFolder) return busyFolder.error();
+    const Surroundings surroundings{
+        .hostHasNetwork = sharesNamespace(running.host->token, NamespaceKind::Network),
+        .busyFolder = busyFolder->path()};
+    running.busyFolder.emplace(std::move(*busyFolder));
+    auto group = groups_.make(id, grant.profile->limits);
+    if (!group) return group.error();
+    const auto setup = sandboxSetup(grant, directories_, daemonService_, surroundings);
+    if (!setup) return setup.error();
     int ends[2];
     if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) != 0)
         return Error::posix(errno, "no connection");
@@ -173,11 +200,11 @@ std::optional<Error> SpawnService::spawn(std::uint64_t id, Running running,
 
     std::vector<std::string> command{grant.executable};
     command.insert(command.end(), plugInArguments.begin(), plugInArguments.end());
-    auto process = SandboxedProcess::spawn(program_, *arguments, command, plugInEnd);
+    auto process = SandboxedProcess::spawn(program_, *setup, command, plugInEnd);
     if (!process) return process.error();
     running.instance = std::make_unique<Instance>(
-        *loop_, std::move(*process), grant.bundleIdentifier, [this, id] { runs(id); },
-        [this, id](int status) { ended(id, status); });
+        *loop_, std::move(*process), grant.bundleIdentifier, grant.profile->limits,
+        std::move(*group), [this, id] { runs(id); }, [this, id](int status) { ended(id, status); });
     instances_.emplace(id, std::move(running));
     return std::nullopt;
 }
@@ -221,12 +248,14 @@ void SpawnService::ended(std::uint64_t id, int status) {
     Running& running = node.mapped();
     EVLOG_INFO(ops(), "instance {} of plug-in {} has ended with status {}", id,
                running.grant->bundleIdentifier, status);
+    running.busyFolder.reset();
     if (running.starting)
         refuse(*running.starting, Error::posix(EIO, "the sandbox of " + running.grant->executable));
     auto& last = running.host->ended;
     last.emplace_back(id, status);
     if (last.size() > kMaxEndedPerHost) last.pop_front();
     for (const Waiter& waiter : running.waiters) waiter(status);
+    if (shutDownDone_ && instances_.empty()) finishShutDown();
 }
 
 void SpawnService::hostDied(const Host& host) {
@@ -255,6 +284,20 @@ void SpawnService::terminate(const std::string& bundleIdentifier, const std::str
         }
         if (*left == 0) completion(false);
     });
+}
+
+void SpawnService::shutDown(std::function<void()> completion) {
+    queue_.assertCurrent();
+    listener_.reset();
+    shutDownDone_ = std::move(completion);
+    for (auto& [id, running] : instances_) running.instance->kill();
+    if (instances_.empty()) return finishShutDown();
+    shutDownTimer_.start(kShutDownPatience, [this] { finishShutDown(); });
+}
+
+void SpawnService::finishShutDown() {
+    shutDownTimer_.cancel();
+    if (const auto completion = std::exchange(shutDownDone_, nullptr)) completion();
 }
 
 }  // namespace platform::spawnerd

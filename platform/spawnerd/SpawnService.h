@@ -8,12 +8,15 @@
 #include <string>
 #include <vector>
 
-#include "platform/Directories.h"
-#include "platform/SerialQueue.h"
-#include "platform/UniqueFd.h"
 #include "platform/lum/Listener.h"
+#include "platform/lum/Pool.h"
+#include "platform/sandbox/BusyFolder.h"
 #include "platform/spawnerd/GrantedHosts.h"
 #include "platform/spawnerd/Instance.h"
+#include "platform/spawnerd/InstanceGroups.h"
+#include "platform/system/Directories.h"
+#include "platform/system/UniqueFd.h"
+#include "platform/threads/SerialQueue.h"
 
 namespace platform::spawnerd {
 
@@ -35,13 +38,16 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     void listen();
 
     /// As `Launcher::addExternalService`. From any thread.
-    int grant(const AuditToken& host, const std::string& executable, const Dictionary& overlay);
+    int grant(const AuditToken& host, const ExternalService& service, const Dictionary& overlay);
     /// As `Launcher::removeExternalServices`. From any thread.
     void takeBack(const std::string& bundlePath);
     /// As `Launcher::terminatePlugInInstances`, with a completion that is told whether there were
     /// any, on the loop. From any thread.
     void terminate(const std::string& bundleIdentifier, const std::string& bundleVersion,
                    std::function<void(bool found)> completion);
+
+    /// As `Launcher::shutDown`. On the queue.
+    void shutDown(std::function<void()> completion);
 
     /// From any thread.
     SerialQueue& queue() { return queue_; }
@@ -57,8 +63,10 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     struct Running {
         Host host;
         std::shared_ptr<const Grant> grant;
-        std::optional<Asked> starting;  // until it is answered
-        UniqueFd connection;            // the host's end, until then
+        std::optional<Pool::Share> share;      // of the instances that there may be
+        std::optional<BusyFolder> busyFolder;  // from its start on
+        std::optional<Asked> starting;         // until it is answered
+        UniqueFd connection;                   // the host's end, until then
         std::unique_ptr<Instance> instance;
         std::vector<Waiter> waiters;
     };
@@ -66,16 +74,18 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     SpawnService(Directories directories, std::string daemonService, std::shared_ptr<RunLoop> loop,
                  std::string program);
 
-    void accept(std::shared_ptr<Connection> connection);
-    void serve(const Host& host, Asked asked);
-    void start(const Host& host, Asked asked);
+    void accept(const std::shared_ptr<Connection>& connection);
+    void serve(const Host& host, const Asked& asked);
+    void start(const Host& host, const Asked& asked);
     std::optional<Error> spawn(std::uint64_t id, Running running,
                                const std::vector<std::string>& plugInArguments);
     void runs(std::uint64_t id);
     void awaitEnd(const Host& host, const Asked& asked, bool kill);
     void ended(std::uint64_t id, int status);
     void hostDied(const Host& host);
-    std::optional<Error> checkRoom(const Host& host) const;
+    /// Draws from the instances that there may be; the error says that there are too many.
+    Result<Pool::Share> drawFor(const Host& host);
+    void finishShutDown();
 
     const Directories directories_;
     const std::string daemonService_;
@@ -84,8 +94,12 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     SerialQueue queue_;
     std::shared_ptr<GrantedHosts> hosts_;  // set once, before this object is shared
     std::unique_ptr<Listener> listener_;
+    InstanceGroups groups_;
     std::uint64_t lastId_ = 0;
+    Pool pool_;
     std::map<std::uint64_t, Running> instances_;
+    std::function<void()> shutDownDone_;  // while a shut-down waits for the instances
+    RunLoop::Timer shutDownTimer_;
 };
 
 }  // namespace platform::spawnerd

@@ -7,8 +7,8 @@
 #include <chrono>
 #include <filesystem>
 
-#include "platform/Files.h"
-#include "platform/OpsLog.h"
+#include "platform/log/OpsLog.h"
+#include "platform/system/Files.h"
 #include "platform/tandry/FolderEntries.h"
 
 namespace platform::tandry {
@@ -31,11 +31,12 @@ bool isMissing(const Error& error) {
 
 ApplicationScanner::ApplicationScanner(RegistryState& state, BundleReader& reader,
                                        DataContainers& containers, FolderWatch& watch,
-                                       Folders folders)
+                                       UntrustedPlaces& untrusted, Folders folders)
     : state_(state),
       reader_(reader),
       containers_(containers),
       watch_(watch),
+      untrusted_(untrusted),
       folders_(std::move(folders)) {}
 
 bool ApplicationScanner::isApplication(std::string_view path) {
@@ -69,6 +70,7 @@ void ApplicationScanner::begin(bool overEverything) {
     unreachable_.clear();
     reader_.beginPass();
     watch_.beginWalk(overEverything);
+    untrusted_.beginWalk();
     complaints_.beginWalk();
     if (overEverything) links_.clear();
 }
@@ -161,6 +163,7 @@ void ApplicationScanner::visitRegistration(const std::string& path) {
 }
 
 void ApplicationScanner::visitFolder(const std::string& folder) {
+    if (isUntrusted(folder, "applications")) return;
     watch_.markEntries(folder, kApplicationSuffix);
     Result<FolderEntries> found = FolderEntries::read(folder, watch_, complaints_);
     if (!found) {
@@ -201,6 +204,7 @@ void ApplicationScanner::visitApplication(const std::string& path) {
     // Two links may lead to one application.
     auto known = state_.applications.find(path);
     if (known != state_.applications.end() && known->second.plugInsPass == pass_) return;
+    if (isUntrusted(path, "an application")) return;
     watch_.markContents(path, path);
     std::string folder = joinPath(path, kPlugIns);
     std::error_code ignored;
@@ -209,6 +213,7 @@ void ApplicationScanner::visitApplication(const std::string& path) {
         std::string target = canonicalPath(folder).value_or(folder);
         noteLink(folder, target);
         folder = std::move(target);
+        if (isUntrusted(folder, "plug-ins")) return;
     }
     visitPlugIns(path, folder);
 }
@@ -269,6 +274,21 @@ TDApplicationProxyRef ApplicationScanner::applicationOf(const std::string& plugI
     return path.empty() ? nullptr : applicationAt(path);
 }
 
+/// Whether a bundle lies where none is taken from. What an earlier walk took from there goes at
+/// once, also when this one turns out to be incomplete.
+bool ApplicationScanner::isUntrusted(const std::string& path, const char* kind) {
+    const char* place = untrusted_.around(path);
+    if (!place) return false;
+    const std::string reason = fmt::format("{}: it lies in {}", path, place);
+    complaints_.add(path, fmt::format("leaving out {}: {}", kind, reason));
+    if (changes_.refusal.empty()) changes_.refusal = reason;
+    forEachWithin(state_.plugIns, path, [this](auto entry) {
+        changes_.uninstalled.push_back(entry->second.record);
+        state_.plugIns.erase(entry);
+    });
+    return true;
+}
+
 bool ApplicationScanner::isForgotten(const BundleFolder& folder) {
     auto found = state_.forgotten.find(folder.path);
     if (found == state_.forgotten.end() || !reader_.isUnchanged(folder, found->second.print))
@@ -294,9 +314,19 @@ bool ApplicationScanner::isRefused(const BundleFolder& folder) {
     return true;
 }
 
+/// Whether a record that did not change has its container: one from the catalogue is given it. A
+/// published one has lost it when its application was away and another one took its place.
+bool ApplicationScanner::keepsContainer(PlugInEntry& entry) {
+    if (!entry.needsContainer) return true;
+    TDPlugInProxy& record = *entry.record;
+    if (entry.pass == 0) record.dataContainerPath = containers_.locate(record, true);
+    return !record.dataContainerPath || containers_.isOwn(record);
+}
+
 void ApplicationScanner::visitPlugIn(const BundleFolder& folder,
                                      const TDApplicationProxyRef& application,
                                      const std::string& scope) {
+    if (isUntrusted(folder.path, "a plug-in")) return;
     watch_.markContents(folder.path, scope);
     auto found = state_.plugIns.find(folder.path);
     if (found != state_.plugIns.end()) {
@@ -306,10 +336,7 @@ void ApplicationScanner::visitPlugIn(const BundleFolder& folder,
             return;
         }
         if (entry.record->containingApplication == application &&
-            reader_.isUnchanged(folder, entry.print)) {
-            if (entry.pass == 0 && entry.needsContainer)
-                entry.record->dataContainerPath =
-                    containers_.locate(*entry.record->plugInIdentifier);
+            reader_.isUnchanged(folder, entry.print) && keepsContainer(entry)) {
             entry.pass = pass_;
             ++metPlugIns_;
             return;
@@ -347,12 +374,13 @@ void ApplicationScanner::install(const BundleFolder& folder, PlugInEntry entry,
     record.plugInUuid = Uuid::random();
     record.registrationDate = now();
     record.containingApplication = application;
-    if (entry.needsContainer)
-        record.dataContainerPath = containers_.locate(*record.plugInIdentifier);
+    auto [place, isNew] = state_.plugIns.try_emplace(folder.path);
+    const bool isRemembered =
+        !isNew && place->second.record->plugInIdentifier == record.plugInIdentifier;
+    if (entry.needsContainer) record.dataContainerPath = containers_.locate(record, isRemembered);
     entry.pass = pass_;
     ++metPlugIns_;
     changes_.installed.push_back(entry.record);
-    auto [place, isNew] = state_.plugIns.try_emplace(folder.path);
     if (!isNew) changes_.uninstalled.push_back(place->second.record);
     place->second = std::move(entry);
 }
@@ -397,6 +425,7 @@ RegistryChanges ApplicationScanner::finish(const Scopes& scopes) {
     if (!isIncomplete_)
         for (const std::string& scope : scopes) dropUnmet(scope);
     watch_.endWalk();
+    containers_.saveOwners();
     return std::exchange(changes_, {});
 }
 

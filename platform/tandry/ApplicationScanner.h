@@ -8,6 +8,7 @@
 #include "platform/tandry/DataContainers.h"
 #include "platform/tandry/FolderWatch.h"
 #include "platform/tandry/RegistryState.h"
+#include "platform/tandry/UntrustedPlaces.h"
 
 namespace platform::tandry {
 
@@ -21,10 +22,10 @@ class ApplicationScanner {
         std::vector<std::string> dictionaries;  // hold what the reader merges into bundles
     };
 
-    /// Every directory that a walk looks into is marked in `watch`. All references must outlive
-    /// this.
+    /// Every directory that a walk looks into is marked in `watch`; bundles in untrusted places are
+    /// left out. All references must outlive this.
     ApplicationScanner(RegistryState& state, BundleReader& reader, DataContainers& containers,
-                       FolderWatch& watch, Folders folders);
+                       FolderWatch& watch, UntrustedPlaces& untrusted, Folders folders);
 
     /// Walks every application folder and everything that was registered by path.
     RegistryChanges scanAll();
@@ -57,12 +58,14 @@ class ApplicationScanner {
     void visitPlugIns(const std::string& application, const std::string& folder);
     void visitPlugIn(const BundleFolder& folder, const TDApplicationProxyRef& application,
                      const std::string& scope);
+    bool isUntrusted(const std::string& path, const char* kind);
     void refuse(const BundleFolder& folder, BundleReader::Reading reading);
     bool noteTransient(const Error& error);
     void install(const BundleFolder& folder, PlugInEntry entry,
                  const TDApplicationProxyRef& application);
     TDApplicationProxyRef applicationAt(const std::string& path);
     TDApplicationProxyRef applicationOf(const std::string& plugInPath);
+    bool keepsContainer(PlugInEntry& entry);
     bool isForgotten(const BundleFolder& folder);
     bool isRefused(const BundleFolder& folder);
     bool isAllMet(const std::string& scope);
@@ -77,6 +80,7 @@ class ApplicationScanner {
     BundleReader& reader_;
     DataContainers& containers_;
     FolderWatch& watch_;
+    UntrustedPlaces& untrusted_;
     Folders folders_;
     Complaints complaints_;
     std::set<std::string> links_;  // links to bundles since the last walk over everything, and

@@ -5,12 +5,13 @@
 
 #include <cerrno>
 
-#include "platform/Cbor.h"
-#include "platform/Files.h"
-#include "platform/OpsLog.h"
-#include "platform/PropertyList.h"
-#include "platform/tandry/FileStamps.h"
+#include "platform/log/OpsLog.h"
+#include "platform/plist/PropertyList.h"
+#include "platform/system/FileStamp.h"
+#include "platform/system/Files.h"
+#include "platform/system/OpenBeneath.h"
 #include "platform/tandry/LocalizedNames.h"
+#include "platform/values/Cbor.h"
 
 namespace platform::tandry {
 
@@ -54,15 +55,22 @@ std::optional<Error> excess(const std::string& file, const Dictionary& dictionar
     return std::nullopt;
 }
 
-/// The dictionary in a bundle's file. Error ENOENT when there is none.
+/// The directory of a bundle, which is no symbolic link.
+Result<UniqueFd> openDirectory(const BundleFolder& place) {
+    Result<UniqueFd> directory =
+        openWithoutLinks(place.dirfd, place.name, O_PATH | O_DIRECTORY | O_NOFOLLOW);
+    if (!directory) return Error::posix(directory.error().code, place.path);
+    return directory;
+}
+
+/// The dictionary in a file of a bundle that is reached by its own directory. Error ENOENT when
+/// there is none.
 Result<Dictionary> readDictionary(const BundleFolder& folder, const char* name) {
     std::string file = joinPath(folder.path, name);
-    Result<std::string> bytes =
-        readFileAt(folder.dirfd, joinPath(folder.name, name), kMaxBundleFile);
-    if (!bytes) {
-        if (bytes.error().domain != "POSIX") return bytes.error();
-        return Error::posix(bytes.error().code, file);
-    }
+    Result<std::string> bytes = readFileBeneath(folder.dirfd, name, kMaxBundleFile);
+    if (!bytes && leadsOutside(bytes.error()))
+        return malformed(file, "a symbolic link that leads out of the bundle");
+    if (!bytes) return Error::posix(bytes.error().code, file);
     Result<Value> value = parsePropertyList(*bytes);
     if (!value) return malformed(file, value.error().text);
     const Dictionary* dictionary = value->dictionary();
@@ -135,12 +143,16 @@ std::string pointsOf(const Dictionary& info, const Dictionary* attributes) {
     return points;
 }
 
+void reportDamage(std::string_view reason) {
+    EVLOG_ERROR(ops(), "unreadable encoded dictionary: {}", reason);
+}
+
 }  // namespace
 
 void PlugInEntry::attachDictionaries() {
     std::string_view all = *dictionaries;
-    record->infoPlist = LazyDictionary(EncodedBytes{dictionaries, all.substr(0, infoPlistSize)});
-    record->entitlements = LazyDictionary(EncodedBytes{dictionaries, all.substr(infoPlistSize)});
+    record->infoPlist = LazyDictionary({dictionaries, all.substr(0, infoPlistSize)}, reportDamage);
+    record->entitlements = LazyDictionary({dictionaries, all.substr(infoPlistSize)}, reportDamage);
 }
 
 BundleFolder::BundleFolder(std::string canonical)
@@ -148,6 +160,13 @@ BundleFolder::BundleFolder(std::string canonical)
 
 BundleFolder::BundleFolder(int directory, const std::string& parent, std::string entry)
     : dirfd(directory), name(std::move(entry)), path(joinPath(parent, name)) {}
+
+BundleFolder BundleFolder::reachedBy(int directory) const {
+    BundleFolder folder(*this);
+    folder.dirfd = directory;
+    folder.name.assign(1, '.');
+    return folder;
+}
 
 BundleReader::BundleReader(SdkDictionaries& sdks, SdkMerge merge,
                            std::vector<std::string> languages)
@@ -160,7 +179,9 @@ void BundleReader::beginPass() {
 bool BundleReader::appendStamp(const BundleFolder& folder, std::string_view file,
                                std::string& stamps) {
     scratch_.assign(folder.name).append("/").append(file);
-    return appendFileStamp(folder.dirfd, scratch_.c_str(), stamps);
+    const FileStamp stamp = FileStamp::of(folder.dirfd, scratch_.c_str());
+    stamp.appendTo(stamps);
+    return stamp.exists();
 }
 
 /// Names from the file depend on the user's languages as well.
@@ -170,6 +191,7 @@ void BundleReader::appendLocalizedStamp(const BundleFolder& folder, std::string&
 }
 
 void BundleReader::appendFixedStamps(const BundleFolder& folder, std::string& stamps) {
+    FileIdentity::at(folder.dirfd, folder.name.c_str()).appendTo(stamps);
     appendStamp(folder, kInfoPlist, stamps);
     appendStamp(folder, kEntitlements, stamps);
     appendLocalizedStamp(folder, stamps);
@@ -179,7 +201,7 @@ const std::string& BundleReader::sdkStamps(const std::string& sdk) {
     auto [entry, isNew] = sdkStamps_.try_emplace(sdk);
     if (isNew)
         for (const std::string& file : sdks_.candidateFiles(sdk))
-            appendFileStamp(AT_FDCWD, file.c_str(), entry->second);
+            FileStamp::of(file).appendTo(entry->second);
     return entry->second;
 }
 
@@ -200,9 +222,15 @@ Fingerprint BundleReader::refreshed(const BundleFolder& folder, Fingerprint prin
     return print;
 }
 
-BundleReader::Reading BundleReader::readPlugIn(const BundleFolder& folder) {
+BundleReader::Reading BundleReader::readPlugIn(const BundleFolder& place) {
     Reading reading;
     reading.entry.record = std::make_shared<TDPlugInProxy>();
+    const Result<UniqueFd> directory = openDirectory(place);
+    if (!directory) {
+        reading.refusal = directory.error();
+        return reading;
+    }
+    const BundleFolder folder = place.reachedBy(directory->get());
     // Stamps are older than what is read, so a change in between is seen by the next walk.
     appendFixedStamps(folder, reading.entry.print.stamps);
     reading.refusal = fill(folder, reading.entry);
@@ -304,6 +332,7 @@ std::optional<Error> BundleReader::describePlugIn(const BundleFolder& folder,
 
     TDPlugInProxy& record = *entry.record;
     record.bundlePath = folder.path;
+    record.bundleIdentity = entry.print.directory();
     // Never empty: it tells the launcher whose instances a removal ends.
     record.bundleIdentifier = bundle ? *bundle : *identifier;
     record.plugInIdentifier = *identifier;
@@ -333,17 +362,19 @@ std::string BundleReader::applicationStamps(const BundleFolder& folder) {
     return stamps;
 }
 
-BundleReader::ApplicationReading BundleReader::readApplication(const BundleFolder& folder) {
+BundleReader::ApplicationReading BundleReader::readApplication(const BundleFolder& place) {
     ApplicationReading reading;
+    const Result<UniqueFd> directory = openDirectory(place);
+    const BundleFolder folder = directory ? place.reachedBy(directory->get()) : place;
     reading.stamps = applicationStamps(folder);
     auto record = std::make_shared<TDApplicationProxy>();
     record->bundlePath = folder.path;
     std::string ignored;
-    scratch_ = joinPath(folder.name, kPlaceholder);
-    record->isPlaceholder = appendFileStamp(folder.dirfd, scratch_.c_str(), ignored);
+    record->isPlaceholder = appendStamp(folder, kPlaceholder, ignored);
 
     const std::string file = joinPath(folder.path, kInfoPlist);
-    const Result<Dictionary> info = readDictionary(folder, kInfoPlist);
+    const Result<Dictionary> info =
+        directory ? readDictionary(folder, kInfoPlist) : Result<Dictionary>(directory.error());
     const Result<Dictionary> localized = info ? localizations(folder) : Dictionary();
     if (info) {
         const std::string* identifier = stringAt(*info, kBundleIdentifier);

@@ -5,7 +5,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/SdkDictionaries.h"
+#include "platform/services/SdkDictionaries.h"
 #include "platform/tandry/DiskWorkspace.h"
 #include "platform/tandry/RegistryState.h"
 
@@ -24,13 +24,16 @@ struct BundleFolder {
     explicit BundleFolder(std::string canonical);
     /// The folder `entry` of the open directory `directory` (borrowed) at `parent`.
     BundleFolder(int directory, const std::string& parent, std::string entry);
+    /// The same bundle, reached by its own open directory (borrowed).
+    BundleFolder reachedBy(int directory) const;
 
     int dirfd;
     std::string name;  // relative to `dirfd`
     std::string path;
 };
 
-/// Reads the bundles' files. Belongs to the registry's thread.
+/// Reads the bundles' files, and nothing that lies outside: a bundle's directory is opened once,
+/// and its files beneath it. Belongs to the registry's thread.
 class BundleReader {
   public:
     /// What reading a plug-in bundle gave.
@@ -53,7 +56,7 @@ class BundleReader {
     Fingerprint refreshed(const BundleFolder& folder, Fingerprint print);
 
     /// Reads a plug-in bundle: an Info.plist with a "VXExtension" dictionary and an identifier.
-    Reading readPlugIn(const BundleFolder& folder);
+    Reading readPlugIn(const BundleFolder& place);
 
     /// The stamps of the files that go into an application's record.
     std::string applicationStamps(const BundleFolder& folder);
@@ -65,7 +68,7 @@ class BundleReader {
     /// Reads an application. One without a readable Info.plist has no identifier and no name, and
     /// one whose names in the user's languages cannot be read just now no name; the failure says
     /// why.
-    ApplicationReading readApplication(const BundleFolder& folder);
+    ApplicationReading readApplication(const BundleFolder& place);
 
   private:
     bool appendStamp(const BundleFolder& folder, std::string_view file, std::string& stamps);

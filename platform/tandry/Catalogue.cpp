@@ -10,15 +10,13 @@
 #include <cerrno>
 #include <cstdio>
 
-#include "platform/Files.h"
-#include "platform/OpsLog.h"
+#include "platform/log/OpsLog.h"
+#include "platform/system/Files.h"
 #include "platform/tandry/CatalogueTables.h"
 
 namespace platform::tandry {
 
 namespace {
-
-constexpr int kMostSetAside = 100;
 
 /// Whether what lies there could never be opened as a database, whoever tries.
 bool isNoReadableFile(const std::string& path) {
@@ -38,6 +36,22 @@ RegistryChanges everythingOf(const RegistryState& state) {
     add(state.forgotten, changes.forgotten);
     add(state.refusals, changes.refusals);
     return changes;
+}
+
+/// Gives a state without identities of directories those that lie there now: the stamps of their
+/// files say whether they still hold what they did.
+void addDirectories(RegistryState& state) {
+    const auto add = [](const std::string& path, Fingerprint& print) {
+        std::string stamps;
+        FileIdentity::at(AT_FDCWD, path.c_str()).appendTo(stamps);
+        print.stamps.insert(0, stamps);
+    };
+    for (auto& [path, entry] : state.plugIns) {
+        add(path, entry.print);
+        entry.record->bundleIdentity = entry.print.directory();
+    }
+    for (auto& [path, forgotten] : state.forgotten) add(path, forgotten.print);
+    for (auto& [path, refusal] : state.refusals) add(path, refusal.print);
 }
 
 }  // namespace
@@ -77,7 +91,13 @@ RegistryState Catalogue::load() {
         state = {};
         error = openDatabase();
     }
-    if (!error) return state;
+    if (!error) {
+        if (version_ == CatalogueTables::kVersionWithoutDirectories) {
+            addDirectories(state);
+            isStale_ = true;
+        }
+        return state;
+    }
     EVLOG_ERROR(ops(), "working without the catalogue {}: {}", pub(path_), pub(*error));
     database_.close();
     isStale_ = hasUnreadLists_ = true;
@@ -101,7 +121,9 @@ std::optional<Error> Catalogue::prepareDatabase() {
     Result<std::int64_t> tables = database_.integer("SELECT count(*) FROM sqlite_master");
     if (!tables) return tables.error();
     const bool isNew = *version == 0 && *tables == 0;
-    if (!isNew && *version != CatalogueTables::kVersion)
+    version_ = isNew ? CatalogueTables::kVersion : *version;
+    if (version_ != CatalogueTables::kVersion &&
+        version_ != CatalogueTables::kVersionWithoutDirectories)
         return Error{"SQLite", SQLITE_CORRUPT,
                      fmt::format("version {} instead of {}", *version, CatalogueTables::kVersion)};
     // Rows of a few KiB waste little of pages of this size. What was confirmed must be there after
@@ -113,8 +135,13 @@ std::optional<Error> Catalogue::prepareDatabase() {
     if (!isNew) return std::nullopt;
     if (auto error = database_.run("BEGIN")) return error;
     if (auto error = CatalogueTables(database_).create()) return error;
+    if (auto error = writeVersion()) return error;
+    return database_.run("COMMIT");
+}
+
+std::optional<Error> Catalogue::writeVersion() {
     return database_.run(
-        fmt::format("PRAGMA user_version = {}; COMMIT", CatalogueTables::kVersion).c_str());
+        fmt::format("PRAGMA user_version = {}", CatalogueTables::kVersion).c_str());
 }
 
 /// Whether an error is the file's own, so that another file would do better. Anything else may
@@ -138,21 +165,17 @@ bool Catalogue::isDamage(const Error& error) const {
 /// one's.
 bool Catalogue::setAside(const Error& reason) {
     database_.close();
-    for (int number = 1; number <= kMostSetAside; ++number) {
-        const std::string aside = fmt::format("{}.damaged-{}", path_, number);
-        struct stat status;
-        if (::lstat(aside.c_str(), &status) == 0) continue;
-        for (const char* suffix : {"-wal", "-shm", ""})
-            if (std::rename((path_ + suffix).c_str(), (aside + suffix).c_str()) != 0 &&
-                errno != ENOENT)
-                return false;
-        EVLOG_ERROR(ops(), "the catalogue {} cannot be used and is now {}: {}", pub(path_),
-                    pub(aside), pub(reason));
-        isStale_ = true;
-        hasUnreadLists_ = false;
-        return true;
-    }
-    return false;
+    const std::optional<std::string> aside = unusedDamagedName(path_);
+    if (!aside) return false;
+    for (const char* suffix : {"-wal", "-shm", ""})
+        if (std::rename((path_ + suffix).c_str(), (*aside + suffix).c_str()) != 0 &&
+            errno != ENOENT)
+            return false;
+    EVLOG_ERROR(ops(), "the catalogue {} cannot be used and is now {}: {}", pub(path_), pub(*aside),
+                pub(reason));
+    isStale_ = true;
+    hasUnreadLists_ = false;
+    return true;
 }
 
 std::optional<Error> Catalogue::save(const RegistryState& state, const RegistryChanges& changes) {
@@ -170,7 +193,11 @@ std::optional<Error> Catalogue::store(const RegistryState& state, const Registry
     if (!error) error = database_.run("BEGIN IMMEDIATE");
     if (error) return error;
     error = isStale_ ? writeAll(state) : CatalogueTables(database_).write(state, changes);
+    // Lists that could not be read yet are as they were.
+    const bool isUpgraded = version_ != CatalogueTables::kVersion && !hasUnreadLists_;
+    if (!error && isUpgraded) error = writeVersion();
     if (!error) error = database_.run("COMMIT");
+    if (!error && isUpgraded) version_ = CatalogueTables::kVersion;
     // The second failure would only repeat the first.
     if (error) static_cast<void>(database_.run("ROLLBACK"));
     return error;

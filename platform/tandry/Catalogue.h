@@ -4,8 +4,8 @@
 #include <optional>
 #include <string>
 
-#include "platform/Error.h"
-#include "platform/UniqueFd.h"
+#include "platform/system/Error.h"
+#include "platform/system/UniqueFd.h"
 #include "platform/tandry/RegistryState.h"
 #include "platform/tandry/Sqlite.h"
 
@@ -22,9 +22,9 @@ class Catalogue {
     /// nothing is read yet. Error: another process holds the lock (EADDRINUSE).
     static Result<std::unique_ptr<Catalogue>> open(std::string directory);
 
-    /// What is stored. A catalogue that is damaged or has another version is set aside under
-    /// another name, with an error line, and an empty one takes its place. One that cannot be read
-    /// for any other reason stays as it is, and nothing counts as stored.
+    /// What is stored. A catalogue that is damaged or has a version that is not known is set aside
+    /// under another name, with an error line, and an empty one takes its place. One that cannot be
+    /// read for any other reason stays as it is, and nothing counts as stored.
     RegistryState load();
 
     /// Stores, in one transaction that outlives a power failure, what `changes` says has changed of
@@ -37,6 +37,7 @@ class Catalogue {
     std::optional<Error> takeLock();
     std::optional<Error> openDatabase();
     std::optional<Error> prepareDatabase();
+    std::optional<Error> writeVersion();
     std::optional<Error> store(const RegistryState& state, const RegistryChanges& changes);
     std::optional<Error> writeAll(const RegistryState& state);
     bool isDamage(const Error& error) const;
@@ -45,6 +46,7 @@ class Catalogue {
     std::string directory_;
     std::string path_;
     UniqueFd lock_;                // none when it could not be made
+    std::int64_t version_ = 0;     // of the file's tables
     SqliteDatabase database_;      // none while the registry works in memory alone
     bool isStale_ = false;         // the file differs from the state by more than the next changes
     bool hasUnreadLists_ = false;  // the file may hold registrations that the state lacks

@@ -55,6 +55,7 @@ std::optional<PlugInEntry> plugInOf(const SqliteStatement& row, const RegistrySt
     record->localizedShortName = row.optionalText(9);
     record->onSystemPartition = isOnSystemPartition(*record->bundlePath);
     entry.print = {row.text(10), row.text(11), row.text(14)};
+    record->bundleIdentity = entry.print.directory();
     entry.points = row.text(12);
     entry.needsContainer = row.integer(13) != 0;
     entry.infoPlistSize = static_cast<std::size_t>(row.integer(15));

@@ -2,7 +2,7 @@
 
 #include <optional>
 
-#include "platform/Error.h"
+#include "platform/system/Error.h"
 #include "platform/tandry/RegistryState.h"
 #include "platform/tandry/Sqlite.h"
 
@@ -12,7 +12,9 @@ namespace platform::tandry {
 /// Errors are the database's; SQLITE_CORRUPT also for a row whose digest does not fit.
 class CatalogueTables {
   public:
-    static constexpr int kVersion = 1;
+    static constexpr int kVersion = 2;
+    /// The same tables, but for the identities of directories, which fingerprints lack.
+    static constexpr int kVersionWithoutDirectories = 1;
 
     explicit CatalogueTables(SqliteDatabase& database) : database_(database) {}
 

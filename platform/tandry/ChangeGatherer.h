@@ -5,8 +5,8 @@
 #include <memory>
 #include <optional>
 
-#include "platform/RunLoop.h"
 #include "platform/tandry/FolderWatch.h"
+#include "platform/threads/RunLoop.h"
 
 namespace platform::tandry {
 

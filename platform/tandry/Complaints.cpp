@@ -1,6 +1,6 @@
 #include "platform/tandry/Complaints.h"
 
-#include "platform/OpsLog.h"
+#include "platform/log/OpsLog.h"
 #include "platform/tandry/RegistryState.h"
 
 namespace platform::tandry {

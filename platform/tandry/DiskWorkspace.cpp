@@ -8,17 +8,17 @@
 #include <cerrno>
 #include <future>
 
-#include "platform/Directories.h"
-#include "platform/Files.h"
-#include "platform/OpsLog.h"
-#include "platform/ProgrammingError.h"
-#include "platform/SdkDictionaries.h"
-#include "platform/SerialQueue.h"
+#include "platform/log/OpsLog.h"
+#include "platform/services/SdkDictionaries.h"
+#include "platform/system/Directories.h"
+#include "platform/system/Files.h"
 #include "platform/tandry/ApplicationScanner.h"
 #include "platform/tandry/Catalogue.h"
 #include "platform/tandry/CurrentSnapshot.h"
 #include "platform/tandry/FolderEntries.h"
 #include "platform/tandry/LocalizedNames.h"
+#include "platform/threads/ProgrammingError.h"
+#include "platform/threads/SerialQueue.h"
 
 namespace platform::tandry {
 
@@ -35,6 +35,14 @@ ApplicationScanner::Folders scannedFolders(const Directories& directories) {
     return folders;
 }
 
+/// Tells of a change that is refused, and why.
+Error refused(const char* change, const std::string& path, const std::string& reason) {
+    EVLOG_ERROR(ops(), "refusing to {} {}: {}", change, pub(path), pub(reason));
+    return {"Registry", 0, fmt::format("{}: {}", path, reason)};
+}
+
+constexpr const char* kConfined = "a confined process asks";
+
 /// The registry's thread owns the state, everything that reads and writes it, and the observers.
 /// Lookups run on their callers' threads, on the current snapshot alone.
 class DiskWorkspace final : public Workspace {
@@ -48,14 +56,15 @@ class DiskWorkspace final : public Workspace {
 
     TDPlugInProxyRef plugInWithUuid(const Uuid& uuid) override;
     TDPlugInProxyRef plugInAtPath(const std::string& bundlePath) override;
-    TDApplicationProxyRef applicationAtPath(const std::string& bundlePath) override;
     TDPlugInProxyList plugInsOfApplication(const std::string& bundlePath) override;
     TDPlugInProxyList installedPlugIns() override;
     std::optional<TDPlugInProxyList> plugInsMatching(const Dictionary& query,
                                                      const Filter& filter) override;
 
-    std::optional<Error> registerPlugIn(const std::string& bundlePath) override;
-    std::optional<Error> unregisterPlugIn(const std::string& bundlePath) override;
+    std::optional<Error> registerPlugIn(const std::string& bundlePath,
+                                        Requester requester) override;
+    std::optional<Error> unregisterPlugIn(const std::string& bundlePath,
+                                          Requester requester) override;
     void clearSchemaCaches() override { sdks_.clear(); }
 
   private:
@@ -69,7 +78,7 @@ class DiskWorkspace final : public Workspace {
     void rescan(const Scopes& touched);
     void publish(RegistryChanges& changes);
     void publishSnapshot(const RegistryChanges& changes);
-    void withdrawContainers(const std::set<std::string>& identifiers, RegistryChanges& changes);
+    void withdrawContainers(const std::set<std::string>& paths, RegistryChanges& changes);
     std::optional<Error> registerOnQueue(const std::string& bundlePath);
     std::optional<Error> unregisterOnQueue(const std::string& bundlePath);
     void dropApplications(const std::string& path, RegistryChanges& changes);
@@ -89,6 +98,7 @@ class DiskWorkspace final : public Workspace {
     RegistryState state_;
     std::shared_ptr<const Snapshot> published_;
     FolderWatch watch_;
+    UntrustedPlaces untrusted_;
     ApplicationScanner scanner_;
     const WatchSettings settings_;
     std::unique_ptr<ChangeGatherer> gatherer_;  // from the first scan until the end
@@ -116,9 +126,10 @@ DiskWorkspace::DiskWorkspace(const Directories& directories, SdkDictionaries& sd
     : sdks_(sdks),
       catalogue_(std::move(catalogue)),
       reader_(sdks, std::move(merge), userLanguages()),
-      containers_(joinPath(directories.zorvanData(), "Containers")),
+      containers_(directories.zorvanData()),
       watch_(settings.mostWatches),
-      scanner_(state_, reader_, containers_, watch_, scannedFolders(directories)),
+      untrusted_(directories),
+      scanner_(state_, reader_, containers_, watch_, untrusted_, scannedFolders(directories)),
       settings_(settings),
       queue_("tandry") {}
 
@@ -190,12 +201,11 @@ void DiskWorkspace::publishSnapshot(const RegistryChanges& changes) {
 }
 
 /// Records that were published are what they are: others take their places.
-void DiskWorkspace::withdrawContainers(const std::set<std::string>& identifiers,
+void DiskWorkspace::withdrawContainers(const std::set<std::string>& paths,
                                        RegistryChanges& changes) {
     for (auto& [path, entry] : state_.plugIns) {
         const TDPlugInProxyRef before = entry.record;
-        if (!before->dataContainerPath || !identifiers.contains(*before->plugInIdentifier))
-            continue;
+        if (!before->dataContainerPath || !paths.contains(*before->dataContainerPath)) continue;
         entry.record = std::make_shared<TDPlugInProxy>(*before);
         entry.record->plugInUuid = Uuid::random();
         entry.record->dataContainerPath.reset();
@@ -230,11 +240,6 @@ TDPlugInProxyRef DiskWorkspace::plugInAtPath(const std::string& bundlePath) {
     return snapshot ? snapshot->plugInAtPath(bundlePath) : nullptr;
 }
 
-TDApplicationProxyRef DiskWorkspace::applicationAtPath(const std::string& bundlePath) {
-    auto snapshot = current_.get();
-    return snapshot ? snapshot->applicationAtPath(bundlePath) : nullptr;
-}
-
 TDPlugInProxyList DiskWorkspace::plugInsOfApplication(const std::string& bundlePath) {
     auto snapshot = current_.get();
     return snapshot ? snapshot->plugInsOfApplication(bundlePath) : TDPlugInProxyList();
@@ -263,11 +268,15 @@ std::optional<Error> DiskWorkspace::afterFirstScan(
     return onQueue(work);
 }
 
-std::optional<Error> DiskWorkspace::registerPlugIn(const std::string& bundlePath) {
+std::optional<Error> DiskWorkspace::registerPlugIn(const std::string& bundlePath,
+                                                   Requester requester) {
+    if (requester == Requester::Confined) return refused("register", bundlePath, kConfined);
     return afterFirstScan([&] { return registerOnQueue(bundlePath); });
 }
 
-std::optional<Error> DiskWorkspace::unregisterPlugIn(const std::string& bundlePath) {
+std::optional<Error> DiskWorkspace::unregisterPlugIn(const std::string& bundlePath,
+                                                     Requester requester) {
+    if (requester == Requester::Confined) return refused("unregister", bundlePath, kConfined);
     return afterFirstScan([&] { return unregisterOnQueue(bundlePath); });
 }
 
@@ -280,6 +289,9 @@ std::optional<Error> DiskWorkspace::registerOnQueue(const std::string& bundlePat
     if (!isUsablePath(*canonical)) return Error::posix(EILSEQ, bundlePath);
 
     const std::string& path = *canonical;
+    untrusted_.beginWalk();
+    if (const char* place = untrusted_.around(path))
+        return refused("register", path, fmt::format("it lies in {}", place));
     const bool isNew = !scanner_.isHeld(path) && state_.registrations.insert(path).second;
     std::map<std::string, Forgotten> forgotten;
     forEachWithin(state_.forgotten, path,

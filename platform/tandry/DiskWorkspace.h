@@ -3,7 +3,7 @@
 #include <functional>
 #include <memory>
 
-#include "platform/Error.h"
+#include "platform/system/Error.h"
 #include "platform/tandry/ChangeGatherer.h"
 #include "platform/tandry/Workspace.h"
 

@@ -9,9 +9,9 @@
 #include <filesystem>
 #include <optional>
 
-#include "platform/Files.h"
-#include "platform/Utf8.h"
-#include "platform/Value.h"
+#include "platform/system/Files.h"
+#include "platform/values/Utf8.h"
+#include "platform/values/Value.h"
 
 namespace platform::tandry {
 

@@ -6,7 +6,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/Error.h"
+#include "platform/system/Error.h"
 #include "platform/tandry/Complaints.h"
 #include "platform/tandry/FolderWatch.h"
 

@@ -10,9 +10,9 @@
 #include <filesystem>
 #include <utility>
 
-#include "platform/Error.h"
-#include "platform/Files.h"
-#include "platform/OpsLog.h"
+#include "platform/log/OpsLog.h"
+#include "platform/system/Error.h"
+#include "platform/system/Files.h"
 #include "platform/tandry/RegistryState.h"
 
 namespace platform::tandry {
@@ -95,7 +95,7 @@ void FolderWatch::markWay(const std::string& path) {
         std::error_code failure;
         const std::filesystem::path target = std::filesystem::read_symlink(next, failure);
         if (failure || ++links > kMostLinks) return;
-        if (target.is_absolute()) way = "/";
+        if (target.is_absolute()) way.assign(1, '/');
         rest.insert(0, '/' + target.string());
     }
 }

@@ -11,7 +11,7 @@
 #include <string_view>
 #include <unordered_map>
 
-#include "platform/UniqueFd.h"
+#include "platform/system/UniqueFd.h"
 
 namespace platform::tandry {
 
@@ -66,7 +66,7 @@ class FolderWatch {
         Kind kind;
         std::string name;   // the name, or the suffix of names, that matters
         std::string scope;  // for `Entries` the directory
-        auto operator<=>(const Reason&) const = default;
+        auto operator<=>(const Reason&) const = default;  // NOLINT(modernize-use-nullptr)
     };
     struct Watched {
         std::string path;

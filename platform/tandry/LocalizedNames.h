@@ -4,7 +4,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/Value.h"
+#include "platform/values/Value.h"
 
 namespace platform::tandry {
 

@@ -15,12 +15,14 @@ namespace platform::tandry {
 /// Number of a walk over the disk; 0 stands for "not met by any yet".
 using Pass = std::uint32_t;
 
-/// What tells whether a plug-in bundle has changed: the stamps of every file that goes into its
-/// record, and the two names from its Info.plist that say which files those are.
+/// What tells whether a plug-in bundle has changed: which directory it is, the stamps of every file
+/// that goes into its record, and the two names from its Info.plist that say which files those are.
 struct Fingerprint {
     std::string executable;  // "QFBundleExecutable"; empty when there is none
     std::string sdk;         // its extension point, when SDK dictionaries are looked up for it
-    std::string stamps;
+    std::string stamps;      // the directory's identity first
+
+    FileIdentity directory() const { return FileIdentity::from(stamps); }
 };
 
 /// One registered plug-in.

@@ -70,16 +70,6 @@ std::string_view pathOf(const TDPlugInProxyRef& plugIn) {
     return *plugIn->bundlePath;
 }
 
-std::string_view pathOf(const TDApplicationProxyRef& application) {
-    return application->bundlePath;
-}
-
-template <class List>
-auto findPath(const List& list, std::string_view path) {
-    auto place = std::ranges::lower_bound(list, path, {}, [](const auto& e) { return pathOf(e); });
-    return place != list.end() && pathOf(*place) == path ? *place : nullptr;
-}
-
 }  // namespace
 
 std::uint64_t comparisonKey(std::string_view text) {
@@ -98,7 +88,6 @@ Snapshot::Snapshot(const RegistryState& state) {
     uuids_.reserve(state.plugIns.size());
     for (const auto& [path, entry] : state.plugIns) append(entry);
     sort();
-    copyApplications(state);
 }
 
 Snapshot::Snapshot(const Snapshot& before, const RegistryState& state,
@@ -116,8 +105,7 @@ Snapshot::Snapshot(const Snapshot& before, const RegistryState& state,
         while (next < end) moved[next++] = position++;
     };
     for (std::string_view path : changed) {
-        auto place = std::ranges::lower_bound(before.plugIns_, path, {},
-                                              [](const auto& plugIn) { return pathOf(plugIn); });
+        auto place = std::ranges::lower_bound(before.plugIns_, path, {}, pathOf);
         copyUntil(static_cast<Position>(place - before.plugIns_.begin()));
         if (place != before.plugIns_.end() && pathOf(*place) == path) ++next;
         auto found = state.plugIns.find(std::string(path));
@@ -128,7 +116,6 @@ Snapshot::Snapshot(const Snapshot& before, const RegistryState& state,
     mergeMoved(before.uuids_, moved, uuids_);
     mergeMoved(before.points_, moved, points_);
     mergeMoved(before.identifiers_, moved, identifiers_);
-    copyApplications(state);
 }
 
 /// Adds a plug-in, and its entries at the ends of the indexes.
@@ -151,29 +138,20 @@ void Snapshot::sort() {
     sortUnique(identifiers_);
 }
 
-void Snapshot::copyApplications(const RegistryState& state) {
-    applications_.reserve(state.applications.size());
-    for (const auto& [path, entry] : state.applications) applications_.push_back(entry.record);
-}
-
 TDPlugInProxyRef Snapshot::plugInWithUuid(const Uuid& uuid) const {
     auto place = std::ranges::lower_bound(uuids_, uuid, {}, &std::pair<Uuid, Position>::first);
     return place != uuids_.end() && place->first == uuid ? plugIns_[place->second] : nullptr;
 }
 
 TDPlugInProxyRef Snapshot::plugInAtPath(std::string_view path) const {
-    return findPath(plugIns_, path);
-}
-
-TDApplicationProxyRef Snapshot::applicationAtPath(std::string_view path) const {
-    return findPath(applications_, path);
+    auto place = std::ranges::lower_bound(plugIns_, path, {}, pathOf);
+    return place != plugIns_.end() && pathOf(*place) == path ? *place : nullptr;
 }
 
 TDPlugInProxyList Snapshot::plugInsOfApplication(const std::string& path) const {
     TDPlugInProxyList list;
     const std::string inside = path + "/";
-    auto place = std::ranges::lower_bound(plugIns_, std::string_view(inside), {},
-                                          [](const auto& plugIn) { return pathOf(plugIn); });
+    auto place = std::ranges::lower_bound(plugIns_, std::string_view(inside), {}, pathOf);
     for (; place != plugIns_.end() && pathOf(*place).starts_with(inside); ++place) {
         const TDApplicationProxyRef& application = (*place)->containingApplication;
         if (application && application->bundlePath == path) list.push_back(*place);

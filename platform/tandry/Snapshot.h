@@ -28,7 +28,6 @@ class Snapshot {
     const TDPlugInProxyList& plugIns() const { return plugIns_; }
     TDPlugInProxyRef plugInWithUuid(const Uuid& uuid) const;
     TDPlugInProxyRef plugInAtPath(std::string_view path) const;
-    TDApplicationProxyRef applicationAtPath(std::string_view path) const;
     TDPlugInProxyList plugInsOfApplication(const std::string& path) const;
 
     /// The plug-ins that `query` may match, in the order of their paths: see
@@ -44,11 +43,9 @@ class Snapshot {
     std::optional<Positions> find(const Index& index, const Value* pattern) const;
     void append(const PlugInEntry& entry);
     void sort();
-    void copyApplications(const RegistryState& state);
 
     TDPlugInProxyList plugIns_;
-    std::vector<TDApplicationProxyRef> applications_;  // in the order of their paths
-    std::vector<std::pair<Uuid, Position>> uuids_;     // sorted
+    std::vector<std::pair<Uuid, Position>> uuids_;  // sorted
     Index points_;
     Index identifiers_;
 };

@@ -7,7 +7,7 @@
 
 #include <cerrno>
 
-#include "platform/UniqueFd.h"
+#include "platform/system/UniqueFd.h"
 
 namespace platform::tandry {
 

@@ -7,7 +7,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/Error.h"
+#include "platform/system/Error.h"
 
 struct sqlite3;
 struct sqlite3_stmt;

@@ -22,13 +22,6 @@ const Dictionary* TDPlugInProxy::attributes() const {
     return plugIn ? dictionaryAt(*plugIn, "VXExtensionAttributes") : nullptr;
 }
 
-const Value* TDPlugInProxy::lookup(std::string_view key, Scope scope) const {
-    const Dictionary* dictionary = scope == Scope::Attributes         ? attributes()
-                                   : scope == Scope::PlugInDictionary ? plugInDictionary()
-                                                                      : &infoPlist.get();
-    return dictionary ? dictionary->find(key) : nullptr;
-}
-
 std::string describe(const TDPlugInProxy& proxy) {
     return fmt::format("{} {} at {}", proxy.plugInUuid.string(),
                        proxy.plugInIdentifier.value_or("(no identifier)"),

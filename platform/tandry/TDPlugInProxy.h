@@ -6,10 +6,11 @@
 #include <string>
 #include <string_view>
 
-#include "platform/LazyDictionary.h"
-#include "platform/Uuid.h"
-#include "platform/Value.h"
+#include "platform/system/FileIdentity.h"
 #include "platform/tandry/TDApplicationProxy.h"
+#include "platform/values/LazyDictionary.h"
+#include "platform/values/Uuid.h"
+#include "platform/values/Value.h"
 
 namespace platform {
 
@@ -18,15 +19,9 @@ namespace platform {
 /// Its dictionaries are the bundle's, completed (see tandry/Workspace.h). Values of unexpected
 /// types are passed on as they are.
 struct TDPlugInProxy {
-    /// Which dictionary `lookup` reads.
-    enum class Scope {
-        Attributes = 0,        // "VXExtensionAttributes" of the plug-in dictionary
-        PlugInDictionary = 1,  // "VXExtension" of the Info.plist
-        InfoPlist = 2,         // the top level of the Info.plist
-    };
-
     Uuid plugInUuid;
     std::optional<std::string> bundlePath;  // canonical path of the bundle directory
+    FileIdentity bundleIdentity;            // which directory lay there when it was read
     std::string bundleIdentifier;           // "QFBundleIdentifier", else the identifier
     std::optional<std::string> plugInIdentifier;
     std::optional<std::string> originalIdentifier;
@@ -40,8 +35,6 @@ struct TDPlugInProxy {
     std::optional<std::string> localizedShortName;
     std::optional<std::string> dataContainerPath;
 
-    /// The value of a key in one of the three dictionaries, or null. Good as long as the record.
-    const Value* lookup(std::string_view key, Scope scope) const;
     /// "VXExtension" of the Info.plist when that is a dictionary, else null; likewise its
     /// attributes.
     const Dictionary* plugInDictionary() const;

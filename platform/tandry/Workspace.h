@@ -6,7 +6,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/Error.h"
+#include "platform/system/Error.h"
 #include "platform/tandry/TDPlugInProxy.h"
 
 namespace platform {
@@ -24,6 +24,10 @@ class WorkspaceObserver {
   protected:
     ~WorkspaceObserver() = default;
 };
+
+/// On whose behalf the registry is asked to change. What a confined process asks for is refused:
+/// what it can write would come to run with rights that it was not given.
+enum class Requester { Unconfined, Confined };
 
 /// The application registry: the source of truth for which plug-ins are installed. Operations may
 /// be called from any thread but the registry's own observer callbacks' (which may only look up).
@@ -51,7 +55,6 @@ class Workspace {
 
     virtual TDPlugInProxyRef plugInWithUuid(const Uuid& uuid) = 0;
     virtual TDPlugInProxyRef plugInAtPath(const std::string& bundlePath) = 0;
-    virtual TDApplicationProxyRef applicationAtPath(const std::string& bundlePath) = 0;
     /// The plug-ins inside the application at a path, in the order of their paths; empty when there
     /// are none or no such application.
     virtual TDPlugInProxyList plugInsOfApplication(const std::string& bundlePath) = 0;
@@ -67,12 +70,16 @@ class Workspace {
     /// Registers the plug-in bundle at a path, or the application there with all its plug-ins.
     /// Returns when the catalogue has changed. The error says why the bundle was refused, or why
     /// nothing was stored: the registration then holds until the registry is closed, and is stored
-    /// with the next change that can be. Registering once more tries that at once.
-    virtual std::optional<Error> registerPlugIn(const std::string& bundlePath) = 0;
+    /// with the next change that can be. Registering once more tries that at once. An error line
+    /// tells of what is refused for its requester, or because confined processes write where it
+    /// lies: in data containers, assertion folders and the runtime directory.
+    virtual std::optional<Error> registerPlugIn(const std::string& bundlePath,
+                                                Requester requester) = 0;
     /// Forgets what is registered at a path: a plug-in, or an application's plug-ins. A bundle that
     /// an application directory holds stays forgotten until it is registered again or changes.
-    /// Error: nothing is registered there, or nothing was stored (as above).
-    virtual std::optional<Error> unregisterPlugIn(const std::string& bundlePath) = 0;
+    /// Error: nothing is registered there, nothing was stored, or the requester may not (as above).
+    virtual std::optional<Error> unregisterPlugIn(const std::string& bundlePath,
+                                                  Requester requester) = 0;
 
     /// Drops what the registry caches of SDK dictionaries.
     virtual void clearSchemaCaches() = 0;

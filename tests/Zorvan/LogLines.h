@@ -5,7 +5,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/Log.h"
+#include "platform/log/Log.h"
 
 namespace zorvan {
 

@@ -3,7 +3,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include "platform/PropertyList.h"
+#include "platform/plist/PropertyList.h"
 #include "tests/Zorvan/LogLines.h"
 #include "tests/support/TemporaryDirectory.h"
 

@@ -7,8 +7,8 @@
 #include <future>
 
 #include "Zorvan/Keys.h"
-#include "platform/Directories.h"
 #include "platform/lum/Listener.h"
+#include "platform/system/Directories.h"
 #include "tests/Zorvan/LogLines.h"
 #include "tests/support/TemporaryDirectory.h"
 

@@ -9,10 +9,11 @@
 
 #include "Zorvan/ZRPlugInCore.h"
 #include "Zorvan/ZRPlugInHost.h"
-#include "platform/Directories.h"
-#include "platform/PropertyList.h"
-#include "platform/RunLoop.h"
+#include "platform/plist/PropertyList.h"
 #include "platform/spawnerd/ProcessLauncher.h"
+#include "platform/system/Directories.h"
+#include "platform/threads/RunLoop.h"
+#include "tests/support/KnownDirectory.h"
 #include "tests/support/TemporaryDirectory.h"
 
 namespace zorvan {
@@ -53,7 +54,9 @@ class PlugInProcess : public testing::Test {
         const Dictionary overlay{{"LUMService", Dictionary{{"_SandboxProfile", "plugin"}}},
                                  {"QFBundlePackageType", "LUM!"}};
         const auto self = *platform::AuditToken::ofSelf();
-        EXPECT_EQ(launcher_->addExternalService(self, executable_, overlay), 0);
+        const platform::ExternalService service{executable_, test::known(home_.path("upper.appex")),
+                                                ""};
+        EXPECT_EQ(launcher_->addExternalService(self, service, overlay), 0);
     }
     std::unique_ptr<ZRPlugInProcess> start() {
         std::optional<ZRError> error;

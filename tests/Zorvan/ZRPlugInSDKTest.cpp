@@ -2,9 +2,9 @@
 #include <gtest/gtest.h>
 
 #include "Zorvan/ZRPlugInCore.h"
-#include "platform/Directories.h"
-#include "platform/PropertyList.h"
-#include "platform/SdkDictionaries.h"
+#include "platform/plist/PropertyList.h"
+#include "platform/services/SdkDictionaries.h"
+#include "platform/system/Directories.h"
 #include "tests/Zorvan/LogLines.h"
 #include "tests/support/TemporaryDirectory.h"
 

@@ -6,10 +6,11 @@
 #include <cstdlib>
 #include <thread>
 
-#include "platform/Directories.h"
-#include "platform/RunLoop.h"
-#include "platform/Sandbox.h"
-#include "platform/UniqueFd.h"
+#include "platform/sandbox/Sandbox.h"
+#include "platform/system/Directories.h"
+#include "platform/system/UniqueFd.h"
+#include "platform/threads/RunLoop.h"
+#include "tests/support/KnownDirectory.h"
 #include "tests/support/TemporaryDirectory.h"
 
 namespace zorvan {
@@ -22,7 +23,7 @@ TEST(ZRSandboxExtension, ConsumesOnceUntilExpelled) {
     platform::RunLoop loop;
     const auto sandbox =
         platform::makeKernelSandbox(platform::Directories::fromEnvironment(), "test", loop);
-    const std::string token = *sandbox->issueReadExtension(home.path("bundle"));
+    const std::string token = *sandbox->issueReadExtension(test::known(home.path("bundle")), ".");
     std::thread thread([&] { loop.run(); });
 
     auto extension = ZRSandboxExtension::initWithExtension(token);

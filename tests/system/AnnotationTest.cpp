@@ -6,8 +6,8 @@
 #include <csignal>
 #include <filesystem>
 
-#include "platform/Files.h"
-#include "platform/PropertyList.h"
+#include "platform/plist/PropertyList.h"
+#include "platform/system/Files.h"
 #include "tests/system/SystemTest.h"
 
 namespace test {
@@ -96,7 +96,8 @@ TEST_F(Annotations, SurviveBeingKilledAtAnyMoment) {
         const std::vector<Uuid> a{uuidOf("a")};
         const std::int64_t before = sent;
         for (int i = 0; i < kChanges; ++i) {
-            client_->setPluginAnnotations(a, {{"election", ++sent}}, [&, now = sent](auto& reply) {
+            const std::int64_t now = ++sent;
+            client_->setPluginAnnotations(a, {{"election", now}}, [&, now](auto& reply) {
                 if (errorOf(reply).empty()) answered = now;
             });
         }

@@ -3,9 +3,9 @@
 #include <filesystem>
 
 #include "Zorvan/ZRPlugInCore.h"
-#include "platform/Directories.h"
-#include "platform/Preferences.h"
-#include "platform/PropertyList.h"
+#include "platform/plist/PropertyList.h"
+#include "platform/services/Preferences.h"
+#include "platform/system/Directories.h"
 #include "tests/system/SystemTest.h"
 
 namespace test {
@@ -30,6 +30,24 @@ class Discovery : public SystemTest {
                     info("two", "3", {{"VXExtensionAttributes", Dictionary{{"Loud", true}}}}));
     }
 };
+
+TEST_F(Discovery, APropertyListThatLiesOutsideItsBundleIsNotRead) {
+    writeApplication();
+    const std::string secret = writePlist("private.plist", Dictionary{{"secret", "treasure"}});
+    const std::string link = home_.path(plugInPath("A", "two") + "/Entitlements.plist");
+    std::filesystem::remove(link);
+    std::filesystem::create_symlink(secret, link);
+    start();
+    EXPECT_THAT(match(kPoint), ElementsAre("one 1.10"));
+    EXPECT_EQ(zrd_->errLines(link + ": a symbolic link that leads out of the bundle"), 1u);
+    EXPECT_THAT(add({home_.path(plugInPath("A", "two"))}), testing::StartsWith("2 "));
+    EXPECT_THAT(match(), ElementsAre("one 1.10"));
+    // One that is exchanged for such a link later goes.
+    std::filesystem::remove(link);
+    EXPECT_TRUE(waitUntil([&] { return match().size() == 2; }));
+    std::filesystem::create_symlink(secret, link);
+    EXPECT_TRUE(waitUntil([&] { return match().size() == 1; }));
+}
 
 TEST_F(Discovery, AHostAndTheCommandLineSeeTheSamePlugIns) {
     writeApplication();

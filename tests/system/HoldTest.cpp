@@ -19,7 +19,7 @@ class Hold : public PlugInTest {
   protected:
     /// `zrctl hold`, once it has written its token.
     std::unique_ptr<Process> holder(const char* kind, const std::string& path) {
-        auto process = spawn(ZRCTL_PROGRAM, {"hold", kind, home_.path(path)});
+        auto process = spawn(zrctlProgram_.c_str(), {"hold", kind, home_.path(path)});
         EXPECT_TRUE(waitUntil([&] { return !process->isRunning() || !process->out().empty(); }));
         return process;
     }
@@ -85,6 +85,22 @@ TEST_F(Hold, BusyPlugInsKeepTheirApplicationInServiceUntilTheyCrash) {
     running->terminate();
     running->wait();
     EXPECT_EQ(errorOf(hold(kApplication, home_.path(application_))), "");
+}
+
+TEST_F(Hold, TheEndOfTheDaemonIsTheEndOfAllThatItStarted) {
+    NEEDS_BUBBLEWRAP();
+    for (const int signal : {SIGTERM, SIGINT, SIGKILL}) {
+        if (!zrd_) start();
+        EXPECT_EQ(ready(uuidOf("com.test.upper")), "");
+        const auto running = startPlugIn();
+        ASSERT_TRUE(running) << zrd_->err();
+        EXPECT_EQ(talk(*running, "work"), "WORK");
+        stop(signal);
+        char byte;
+        EXPECT_EQ(::recv(running->connection(), &byte, 1, 0), 0) << "nobody holds the other end";
+        for (const char* suffix : {"", ".sandbox", ".spawnerd"})
+            EXPECT_EQ(std::filesystem::exists(socket_ + suffix), signal == SIGKILL) << suffix;
+    }
 }
 
 }  // namespace

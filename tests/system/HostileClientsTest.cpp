@@ -4,6 +4,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <csignal>
 #include <filesystem>
 #include <fstream>
 #include <list>
@@ -138,6 +140,30 @@ TEST_F(HostileClients, AnotherUserIsNotLetIn) {
     EXPECT_EQ(connectsAsNobody(), 1);  // and without them the daemon
     EXPECT_EQ(zrd_->errLines("of user 65534 is not let in"), 1u);
     expectService();
+}
+
+TEST_F(HostileClients, IdleConnectionsOfSomeKeepNobodyElseOut) {
+    stop(SIGTERM);
+    zrd_ = spawn("/bin/sh", {"-c", "ulimit -n 400; exec " ZRD_PROGRAM});
+    ASSERT_TRUE(waitUntil([&] { return RawClient(socket_).isConnected(); }));
+    client_ = ZRDaemonClient::initWithServiceName(nullptr);
+    expectService();
+    // A quarter of (400 - 64) / 3, less the one above and any that has not gone yet.
+    std::list<RawClient> idle;
+    for (int i = 0; i < 120; ++i) idle.emplace_back(socket_).send(bulk_);
+    const auto served = std::count_if(idle.begin(), idle.end(),
+                                      [](const RawClient& client) { return !client.isClosed(); });
+    EXPECT_THAT(served, testing::AllOf(testing::Ge(20), testing::Le(27)));
+    EXPECT_EQ(zrd_->errLines("have too many, 28 are the most"), 1u);
+    expectService();
+    const auto other = spawn("/usr/bin/setsid", {"--wait", zrctlProgram_, "match"});
+    EXPECT_EQ(other->wait(), 0) << other->err();
+    idle.clear();
+    EXPECT_TRUE(waitUntil([&] {
+        RawClient again(socket_);
+        again.send(bulk_);
+        return !again.isClosed();
+    }));
 }
 
 }  // namespace

@@ -8,7 +8,7 @@
 #include <filesystem>
 
 #include "Zorvan/ZRPlugInProcess.h"
-#include "platform/UniqueFd.h"
+#include "platform/system/UniqueFd.h"
 #include "tests/system/SystemTest.h"
 
 namespace test {

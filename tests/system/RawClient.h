@@ -3,8 +3,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/UniqueFd.h"
-#include "platform/Value.h"
+#include "platform/system/UniqueFd.h"
+#include "platform/values/Value.h"
 
 namespace test {
 

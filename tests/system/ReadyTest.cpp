@@ -6,9 +6,10 @@
 #include <algorithm>
 #include <cerrno>
 #include <csignal>
+#include <cstdio>
 
 #include "Zorvan/ZRSandboxExtension.h"
-#include "platform/Files.h"
+#include "platform/system/Files.h"
 #include "tests/system/PlugInTest.h"
 
 namespace test {
@@ -47,6 +48,8 @@ TEST_F(Ready, APlugInRunsUntilItIsRemoved) {
     stop(SIGTERM);
     start();
     ::unsetenv("ZR_LOG");
+    // Another one, when the daemon ended before it had written its catalogue.
+    uuid_ = uuidOf("com.test.upper");
     EXPECT_EQ(ready(uuid_), "");
     const auto process = startPlugIn();
     ASSERT_TRUE(process) << zrd_->err();
@@ -69,7 +72,8 @@ TEST_F(Ready, APlugInRunsUntilItIsRemoved) {
 
 TEST_F(Ready, WhatAHostWasGrantedIsItsOwn) {
     NEEDS_BUBBLEWRAP();
-    auto other = spawn("/bin/sh", {"-c", "echo data | exec " ZRCTL_PROGRAM " run com.test.upper"});
+    auto other =
+        spawn("/bin/sh", {"-c", "echo data | exec " + zrctlProgram_ + " run com.test.upper"});
     EXPECT_EQ(other->wait(), 5) << other->err();
     EXPECT_EQ(other->out(), "DATA\n");
     EXPECT_FALSE(startPlugIn());
@@ -78,7 +82,7 @@ TEST_F(Ready, WhatAHostWasGrantedIsItsOwn) {
     const std::string input = home_.path("input");
     ASSERT_EQ(::mkfifo(input.c_str(), 0600), 0);
     const platform::UniqueFd typing(::open(input.c_str(), O_RDWR | O_CLOEXEC));
-    other = spawn("/bin/sh", {"-c", "exec " ZRCTL_PROGRAM " run com.test.upper <" + input});
+    other = spawn("/bin/sh", {"-c", "exec " + zrctlProgram_ + " run com.test.upper <" + input});
     EXPECT_EQ(::write(typing.get(), "more\n", 5), 5);
     EXPECT_TRUE(waitUntil([&] { return other->out() == "MORE\n"; })) << other->err();
     EXPECT_FALSE(startPlugIn());
@@ -110,6 +114,43 @@ TEST_F(Ready, BadPlugInsAreRefused) {
     EXPECT_EQ(ready(uuidOf("linked")), refusal("linked"));
     EXPECT_TRUE(std::filesystem::is_empty(home_.path("elsewhere")));
     EXPECT_EQ(zrd_->errLines("spawnerd error"), 3u) << zrd_->err();
+}
+
+TEST_F(Ready, ABundleThatIsExchangedAfterItWasFoundGivesNothing) {
+    NEEDS_BUBBLEWRAP();
+    const std::string application = home_.path("Own.app"), bundle = "Own.app/PlugIns/own.appex",
+                      path = home_.path(bundle);
+    Dictionary own = info("com.test.own");
+    own.set("QFBundleExecutable", "run");
+    writePlugIn(bundle, own);
+    std::filesystem::copy_file(TEST_PLUGIN, path + "/run");
+    EXPECT_EQ(add({application}), "");
+    const platform::Uuid uuid = uuidOf("com.test.own");
+    EXPECT_EQ(ready(uuid), "");
+    const std::string token = access(uuid).at(0);
+    EXPECT_GT(readable(token), 0u);
+
+    // Like the bundle in all but what it is.
+    const std::string link = home_.path("link");
+    home_.makeDirectory("private");
+    std::filesystem::copy(path, home_.path("private"));
+    std::filesystem::create_directory_symlink(home_.path("private"), link);
+    ASSERT_EQ(::renameat2(AT_FDCWD, link.c_str(), AT_FDCWD, path.c_str(), RENAME_EXCHANGE), 0);
+    const auto reply =
+        ask([&](auto& client, auto& callback) { client.accessPlugIns({uuid}, 0, callback); });
+    // The registry may have noticed by now.
+    const std::string gone = "4 no such plugin (uuid not found)";
+    EXPECT_THAT(errorOf(reply),
+                testing::AnyOf("4 cannot create extension to " + path + ": 40", gone));
+    std::optional<zorvan::ZRError> error;
+    EXPECT_FALSE(zorvan::ZRPlugInProcess::start(nullptr, path + "/run", {}, error));
+    EXPECT_THAT(error ? error->code : 0, testing::AnyOf(ELOOP, EPERM));
+    EXPECT_THAT(
+        ready(uuid),
+        testing::AnyOf("4 unable to enable plug-in com.test.own(" + uuid.string() + ")", gone));
+    EXPECT_EQ(readable(token), 0u);
+    for (const Dictionary& form : forms({{"VXExtensionIdentifier", "com.test.own"}}))
+        EXPECT_FALSE(form.find("extensions")->dictionary()->contains("."));
 }
 
 TEST_F(Ready, TokensGiveAccessToTheBundleAndNothingElseDoes) {

@@ -3,7 +3,7 @@
 #include <csignal>
 #include <filesystem>
 
-#include "platform/PropertyList.h"
+#include "platform/plist/PropertyList.h"
 #include "tests/system/SystemTest.h"
 
 namespace test {

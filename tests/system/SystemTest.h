@@ -62,6 +62,7 @@ class SystemTest : public testing::Test {
     std::vector<std::string> match(const Dictionary& rules = {}, std::uint64_t flags = 0);
 
     TemporaryDirectory home_;
+    const std::string zrctlProgram_ = home_.path("bin/zrctl");  // with its rights
     const std::string socket_ = home_.path("run/zorvan/services/com.orbel.zorvan.zrd");
     std::unique_ptr<Process> zrd_;
     std::shared_ptr<ZRDaemonClient> client_;

@@ -2,7 +2,7 @@
 
 #include <csignal>
 
-#include "platform/PropertyList.h"
+#include "platform/plist/PropertyList.h"
 #include "tests/system/SystemTest.h"
 
 namespace test {
@@ -75,7 +75,7 @@ TEST_F(Zrctl, AnnotationsJoinThoseThatAreThereOrReplaceThem) {
 TEST_F(Zrctl, WatchingTellsOfEachChangeUntilItIsInterrupted) {
     start();
     for (const int signal : {SIGINT, SIGTERM}) {
-        const auto watch = spawn(ZRCTL_PROGRAM, {"watch"});
+        const auto watch = spawn(zrctlProgram_.c_str(), {"watch"});
         ASSERT_TRUE(waitUntil([&] {
             EXPECT_EQ(run({"elect", "use", "one"}), "0 ");
             return !watch->out().empty();

@@ -9,9 +9,9 @@
 #include <utility>
 #include <vector>
 
-#include "platform/SerialQueue.h"
 #include "platform/Services.h"
 #include "platform/lum/Connection.h"
+#include "platform/threads/SerialQueue.h"
 #include "zrd/HostProcess.h"
 #include "zrd/PlugInContext.h"
 #include "zrd/ZRDPlugIn.h"
@@ -88,7 +88,10 @@ inline std::shared_ptr<platform::TDPlugInProxy> makeProxy(const std::string& ide
 
 struct FakeSandbox final : platform::Sandbox {
     bool isSandboxed(const platform::AuditToken&) override { return sandboxed; }
-    platform::Result<std::string> issueReadExtension(const std::string& path) override {
+    bool isConfined(const platform::AuditToken&) override { return sandboxed; }
+    platform::Result<std::string> issueReadExtension(const platform::KnownDirectory& bundle,
+                                                     const std::string& resource) override {
+        const std::string path = resource == "." ? bundle.path : bundle.path + "/" + resource;
         if (unreadable.contains(path)) return platform::Error::posix(EACCES, path);
         return "token " + std::to_string(++issued) + " " + path;
     }
@@ -99,10 +102,11 @@ struct FakeSandbox final : platform::Sandbox {
 
 /// Knows no instances, until told what to answer; keeps what it was asked for.
 struct FakeLauncher final : platform::Launcher {
-    int addExternalService(const platform::AuditToken&, const std::string& executable,
+    int addExternalService(const platform::AuditToken&, const platform::ExternalService& service,
                            const Dictionary& overlay) override {
-        granted.emplace_back(executable, overlay);
-        return refused.contains(executable) ? EACCES : 0;
+        granted.emplace_back(service.executable, overlay);
+        services.push_back(service);
+        return refused.contains(service.executable) ? EACCES : 0;
     }
     void removeExternalServices(const std::string& bundlePath) override {
         takenBack.insert(bundlePath);
@@ -117,6 +121,7 @@ struct FakeLauncher final : platform::Launcher {
         return std::make_unique<Marker>(markers);
     }
     std::vector<std::pair<std::string, Dictionary>> granted;
+    std::vector<platform::ExternalService> services;
     std::set<std::string> refused;
     int markers = 0;
     void terminatePlugInInstances(const std::string& identifier, const std::string& version,
@@ -126,6 +131,7 @@ struct FakeLauncher final : platform::Launcher {
         if (!statuses.empty()) statuses.erase(statuses.begin());
         queue.async([completion = std::move(completion), status] { completion(status); });
     }
+    void shutDown(std::function<void()> completion) override { completion(); }
     std::vector<std::string> terminated;
     std::vector<Status> statuses;
 };
@@ -165,7 +171,8 @@ struct FakeWorld {
                                                       .types = std::make_shared<FakeTypes>()});
 };
 
-/// A registry in memory. Its query keeps whatever the filter keeps, or fails.
+/// A registry in memory, which refuses what confined processes ask for. Its query keeps whatever
+/// the filter keeps, or fails.
 struct FakeWorkspace final : platform::Workspace {
     using List = platform::TDPlugInProxyList;
     using Ref = platform::TDPlugInProxyRef;
@@ -181,7 +188,6 @@ struct FakeWorkspace final : platform::Workspace {
     Ref plugInAtPath(const std::string& path) override {
         return first([&](const Ref& proxy) { return proxy->bundlePath == path; });
     }
-    platform::TDApplicationProxyRef applicationAtPath(const std::string&) override { return {}; }
     List plugInsOfApplication(const std::string& path) override {
         List found;
         for (const auto& proxy : installed) {
@@ -201,11 +207,13 @@ struct FakeWorkspace final : platform::Workspace {
         }
         return found;
     }
-    std::optional<platform::Error> registerPlugIn(const std::string& path) override {
-        return change("add ", path);
+    std::optional<platform::Error> registerPlugIn(const std::string& path,
+                                                  platform::Requester requester) override {
+        return change("add ", path, requester);
     }
-    std::optional<platform::Error> unregisterPlugIn(const std::string& path) override {
-        return change("remove ", path);
+    std::optional<platform::Error> unregisterPlugIn(const std::string& path,
+                                                    platform::Requester requester) override {
+        return change("remove ", path, requester);
     }
     void clearSchemaCaches() override { ++schemaClears; }
 
@@ -222,9 +230,11 @@ struct FakeWorkspace final : platform::Workspace {
         auto found = std::ranges::find_if(installed, matches);
         return found == installed.end() ? nullptr : *found;
     }
-    std::optional<platform::Error> change(const char* verb, const std::string& path) {
+    std::optional<platform::Error> change(const char* verb, const std::string& path,
+                                          platform::Requester requester) {
         changes.push_back(verb + path);
-        if (refused.contains(path)) return platform::Error{"test", 1, "refused"};
+        if (requester == platform::Requester::Confined || refused.contains(path))
+            return platform::Error{"test", 1, "refused"};
         return std::nullopt;
     }
 };

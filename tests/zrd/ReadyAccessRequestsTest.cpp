@@ -2,6 +2,7 @@
 #include <filesystem>
 
 #include "Zorvan/Keys.h"
+#include "tests/support/KnownDirectory.h"
 #include "tests/zrd/TransactionTest.h"
 #include "zrd/ZRDPlugInSignature.h"
 
@@ -157,26 +158,21 @@ TEST(Enabling, TheProfileFollowsTheExtensionPointAndTheUsersConsent) {
     EXPECT_EQ(profile(keyboard, {}), "keyboard");
 }
 
-TEST(Enabling, OnlyWhatLiesInTheBundleIsShared) {
-    ::test::TemporaryDirectory directory;
+TEST(Enabling, OnlyWhatHasATokenIsShared) {
     FakeWorld world;
     auto proxy = makeProxy(
-        "com.a", {},
-        {{"Shared", Array{"in", 7, "../out", "none", "link"}}, {"VXExtensionProtocol", "P"}});
-    proxy->bundlePath = directory.makeDirectory("Plug.plugin");
-    directory.write("Plug.plugin/in", "x");
-    directory.write("out", "x");
-    std::filesystem::create_symlink("../out", directory.path("Plug.plugin/link"));
-    world.sandbox->unreadable = {*proxy->bundlePath + "/none"};
+        "com.a", {}, {{"Shared", Array{"in", 7, "../out", "none"}}, {"VXExtensionProtocol", "P"}});
+    proxy->bundlePath = "/Apps/Host.app/PlugIns/a.plugin";
+    const std::string path = *proxy->bundlePath;
+    world.sandbox->unreadable = {path + "/none", path + "/../out"};
     LogLines log;
     Dictionary form;
     EXPECT_FALSE(world.record(proxy)->augmentForm(form));
     const Dictionary& extensions = *form.find("extensions")->dictionary();
     EXPECT_EQ(extensions.size(), 1u);
     EXPECT_TRUE(extensions.contains("in"));
-    EXPECT_THAT(log.take(),
-                Contains("ops I: failed to make extension for " + *proxy->bundlePath +
-                         "/../out in plug-in at " + *proxy->bundlePath + ": Permission denied"));
+    EXPECT_THAT(log.take(), Contains("ops I: failed to make extension for " + path +
+                                     "/../out in plug-in at " + path + ": Permission denied"));
     auto single = makeProxy("com.a", {}, {{"Shared", "in"}, {"VXExtensionProtocol", "P"}});
     single->bundlePath = proxy->bundlePath;
     EXPECT_FALSE(world.record(single)->augmentForm(form)) << "another file may take its place";
@@ -186,6 +182,45 @@ TEST(Enabling, OnlyWhatLiesInTheBundleIsShared) {
     Dictionary untouched;
     EXPECT_TRUE(world.record(unshared)->augmentForm(untouched));
     EXPECT_EQ(untouched, Dictionary());
+}
+
+TEST(Enabling, AFormsTokenIsUsedAgainOnlyWhileTheBundleIsInItsPlace) {
+    ::test::TemporaryDirectory directory;
+    FakeWorld world;
+    const auto proxy = makeProxy("com.a");
+    const std::string path = directory.makeDirectory("PlugIns/a.appex");
+    proxy->bundlePath = path;
+    proxy->bundleIdentity = ::test::known(path).identity;
+    const auto record = world.record(proxy);
+    const auto token = [&] {
+        std::optional<ZRError> error;
+        const auto form = record->form(error);
+        const Value* found = form->find("extensions")->dictionary()->find(".");
+        return found ? *found->string() : std::string("none");
+    };
+    const std::string first = token();
+    EXPECT_EQ(token(), first);
+    std::filesystem::rename(path, directory.path("moved"));
+    std::filesystem::create_directory_symlink(directory.path("moved"), path);
+    world.sandbox->unreadable = {path};
+    EXPECT_EQ(token(), "none");
+    std::filesystem::remove(path);
+    directory.makeDirectory("PlugIns/a.appex");
+    EXPECT_EQ(token(), "none");
+    std::filesystem::remove(path);
+    std::filesystem::rename(directory.path("moved"), path);
+    EXPECT_EQ(token(), first);
+}
+
+TEST(Enabling, TheLauncherIsToldOfTheVeryBundle) {
+    FakeWorld world;
+    const auto proxy = makeProxy("com.a");
+    proxy->bundleIdentity = {7, 11};
+    EXPECT_EQ(world.record(proxy)->enableForClient(FakeHost()), std::nullopt);
+    const platform::ExternalService& service = world.launcher->services.at(0);
+    EXPECT_EQ(service.bundle.path, *proxy->bundlePath);
+    EXPECT_EQ(service.bundle.identity, proxy->bundleIdentity);
+    EXPECT_EQ(service.container, *proxy->dataContainerPath);
 }
 
 TEST(Signature, StandsForNoRealOne) {

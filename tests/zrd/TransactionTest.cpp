@@ -75,6 +75,22 @@ TEST_F(TransactionTest, PathsAreWalkedUpToTheFirstFailure) {
     EXPECT_EQ(ask({{"request", "add"}}), format);
 }
 
+TEST_F(TransactionTest, TheRegistryLearnsThatAConfinedHostAsks) {
+    const std::string path = directory_.makeDirectory("plug-in");
+    const Dictionary add{{"request", "add"}, {"paths", Array{path}}};
+    const Dictionary remove{{"request", "remove"}, {"paths", Array{path}}};
+    sandbox_->sandboxed = true;
+    LogLines log;
+    EXPECT_EQ(ask(add), error(2, "unable to register plug-in at " + path));
+    EXPECT_THAT(log.take(), Contains("ops -: failed to register plug-in at " + path));
+    EXPECT_EQ(ask(remove), error(11, "caller lacks entitlement for this operation"));
+    codeSigning_->entitlements = {{entitlement::kManager, true}};
+    EXPECT_EQ(ask(remove), error(9, "no plugin at " + path));
+    sandbox_->sandboxed = false;
+    EXPECT_EQ(ask(add), Dictionary());
+    EXPECT_EQ(ask(remove), Dictionary());
+}
+
 TEST_F(TransactionTest, RemovingNeedsTheManagersEntitlement) {
     const Dictionary request{{"request", "remove"}, {"paths", Array{"/x"}}};
     for (Dictionary held : {Dictionary(), Dictionary{{entitlement::kManager, 0}}}) {

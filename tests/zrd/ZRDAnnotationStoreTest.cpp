@@ -6,9 +6,9 @@
 
 #include <filesystem>
 
-#include "platform/Directories.h"
-#include "platform/Files.h"
-#include "platform/PropertyList.h"
+#include "platform/plist/PropertyList.h"
+#include "platform/system/Directories.h"
+#include "platform/system/Files.h"
 #include "tests/Zorvan/LogLines.h"
 #include "tests/support/TemporaryDirectory.h"
 #include "tests/zrd/Fakes.h"

@@ -121,10 +121,11 @@ TEST_F(ZRDatabaseTest, LooksUpByPathAndByApplication) {
 
 TEST_F(ZRDatabaseTest, RegistrationFailuresAreErrors) {
     workspace_->refused = {"/x"};
-    EXPECT_FALSE(database_->addPlugIn("/y") || database_->removePlugIn("/y"));
-    EXPECT_EQ(database_->addPlugIn("/x"),
+    constexpr auto kHost = platform::Requester::Unconfined;
+    EXPECT_FALSE(database_->addPlugIn("/y", kHost) || database_->removePlugIn("/y", kHost));
+    EXPECT_EQ(database_->addPlugIn("/x", kHost),
               ZRErrorWithCode(2, "Tandry failed to register the plug-in"));
-    EXPECT_EQ(database_->removePlugIn("/x"),
+    EXPECT_EQ(database_->removePlugIn("/x", kHost),
               ZRErrorWithCode(2, "Tandry failed to deregister the plug-in"));
     database_->notifyAnnotationChange();
     EXPECT_THAT(notifications_->posted, ElementsAre("com.orbel.zorvan.annotation-change"));

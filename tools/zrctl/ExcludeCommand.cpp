@@ -4,8 +4,8 @@
 #include <functional>
 
 #include "Zorvan/Keys.h"
-#include "platform/Directories.h"
-#include "platform/Preferences.h"
+#include "platform/services/Preferences.h"
+#include "platform/system/Directories.h"
 #include "tools/zrctl/Rules.h"
 #include "tools/zrctl/ShellWord.h"
 
@@ -41,7 +41,7 @@ Outcome notAList() {
 std::string line(const Dictionary& rule) {
     std::string text;
     for (const std::string& argument : ruleTexts(rule))
-        text += (text.empty() ? "" : " ") + shellWord(argument);
+        text.append(text.empty() ? "" : " ").append(shellWord(argument));
     return text + '\n';
 }
 
@@ -99,7 +99,7 @@ Outcome add(const std::vector<std::string>& texts) {
 
 Outcome remove(const std::vector<std::string>& texts) {
     bool found = false;
-    const Outcome outcome = edit([&](Array& exclusions) {
+    Outcome outcome = edit([&](Array& exclusions) {
         const std::size_t place = find(exclusions, texts);
         found = place < exclusions.size();
         if (found) exclusions.remove(place);

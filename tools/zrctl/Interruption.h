@@ -2,8 +2,8 @@
 
 #include <memory>
 
-#include "platform/Error.h"
-#include "platform/UniqueFd.h"
+#include "platform/system/Error.h"
+#include "platform/system/UniqueFd.h"
 
 namespace zrctl {
 

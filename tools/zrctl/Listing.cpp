@@ -7,7 +7,7 @@
 
 #include "Zorvan/Helpers.h"
 #include "Zorvan/Keys.h"
-#include "platform/Files.h"
+#include "platform/system/Files.h"
 #include "tools/zrctl/Json.h"
 #include "tools/zrctl/Table.h"
 #include "tools/zrctl/Terminal.h"

@@ -1,7 +1,7 @@
 #include "tools/zrctl/MatchCommand.h"
 
-#include "platform/DictionaryFile.h"
-#include "platform/PropertyList.h"
+#include "platform/plist/DictionaryFile.h"
+#include "platform/plist/PropertyList.h"
 #include "tools/zrctl/Json.h"
 #include "tools/zrctl/Listing.h"
 #include "tools/zrctl/Rules.h"

@@ -4,9 +4,10 @@
 
 #include <map>
 
+#include "Zorvan/Helpers.h"
 #include "Zorvan/Keys.h"
 #include "Zorvan/ZRError.h"
-#include "platform/Utf8.h"
+#include "platform/values/Utf8.h"
 #include "tools/zrctl/Listing.h"
 
 using platform::Array;
@@ -59,7 +60,7 @@ Outcome failureWith(const std::vector<Uuid>& uuids, const platform::Error& error
                          error.text.starts_with("no such plugin");
     if (!unknown) return Outcome::failure(error.text);
     std::string names;
-    for (const Uuid& uuid : uuids) names += (names.empty() ? "" : ", ") + uuid.string();
+    for (const Uuid& uuid : uuids) names.append(names.empty() ? "" : ", ").append(uuid.string());
     return noSuchPlugIn(uuids.size() == 1 ? names : "one of " + names + remark);
 }
 
@@ -75,8 +76,9 @@ Outcome withPlugIns(const std::string& service, const std::vector<std::string>& 
 
 std::variant<std::vector<Dictionary>, Outcome> formsOf(Session& session,
                                                        const std::vector<Uuid>& uuids) {
-    Array patterns;
-    for (const Uuid& uuid : uuids) patterns.append("=" + uuid.string());
+    const Array patterns = zorvan::arrayWithValues(uuids, [](const Uuid& uuid) {
+        return std::optional<Value>(fmt::format("={}", uuid.string()));
+    });
     const Result<Array> forms = visiblePlugIns(session, {{zorvan::rule::kUuid, patterns}});
     if (!forms) return Outcome::failure(forms.error().text);
     std::map<std::string, Dictionary> known;
@@ -102,9 +104,11 @@ Result<Array> visiblePlugIns(Session& session, const Dictionary& rules) {
 
 std::variant<std::vector<Uuid>, Outcome> plugInsNamed(Session& session,
                                                       const std::vector<std::string>& names) {
-    Array patterns;
-    for (const std::string& name : names)
-        if (!Uuid::parse(name)) patterns.append("=" + name);
+    const Array patterns =
+        zorvan::arrayWithValues(names, [](const std::string& name) -> std::optional<Value> {
+            if (Uuid::parse(name)) return std::nullopt;
+            return fmt::format("={}", name);
+        });
     Array forms;
     if (!patterns.empty()) {
         const Result<Array> found =

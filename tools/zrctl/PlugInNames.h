@@ -5,9 +5,9 @@
 #include <variant>
 #include <vector>
 
-#include "platform/Error.h"
-#include "platform/Uuid.h"
-#include "platform/Value.h"
+#include "platform/system/Error.h"
+#include "platform/values/Uuid.h"
+#include "platform/values/Value.h"
 #include "tools/zrctl/Outcome.h"
 #include "tools/zrctl/Session.h"
 

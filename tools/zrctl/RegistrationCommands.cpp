@@ -5,8 +5,8 @@
 #include <filesystem>
 #include <vector>
 
-#include "platform/Files.h"
-#include "platform/Utf8.h"
+#include "platform/system/Files.h"
+#include "platform/values/Utf8.h"
 #include "tools/zrctl/Session.h"
 
 using platform::Error;

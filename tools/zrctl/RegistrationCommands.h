@@ -5,7 +5,7 @@
 #include <variant>
 #include <vector>
 
-#include "platform/Error.h"
+#include "platform/system/Error.h"
 #include "tools/zrctl/Options.h"
 #include "tools/zrctl/Outcome.h"
 

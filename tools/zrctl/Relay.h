@@ -3,8 +3,8 @@
 #include <optional>
 #include <string>
 
-#include "platform/Error.h"
-#include "platform/UniqueFd.h"
+#include "platform/system/Error.h"
+#include "platform/system/UniqueFd.h"
 
 namespace zrctl {
 

@@ -5,8 +5,8 @@
 #include <optional>
 #include <string_view>
 
-#include "platform/Utf8.h"
-#include "platform/Value.h"
+#include "platform/values/Utf8.h"
+#include "platform/values/Value.h"
 
 using platform::Array;
 using platform::Dictionary;

@@ -3,8 +3,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/Error.h"
-#include "platform/Value.h"
+#include "platform/system/Error.h"
+#include "platform/values/Value.h"
 
 namespace zrctl {
 

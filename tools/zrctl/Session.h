@@ -6,8 +6,8 @@
 #include <string>
 
 #include "Zorvan/ZRDaemonClient.h"
-#include "platform/Error.h"
-#include "platform/Value.h"
+#include "platform/system/Error.h"
+#include "platform/values/Value.h"
 
 namespace zrctl {
 

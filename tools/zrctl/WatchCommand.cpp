@@ -8,8 +8,8 @@
 #include <cstdint>
 
 #include "Zorvan/Keys.h"
-#include "platform/Directories.h"
-#include "platform/NotificationListener.h"
+#include "platform/services/NotificationListener.h"
+#include "platform/system/Directories.h"
 #include "tools/zrctl/Interruption.h"
 #include "tools/zrctl/Json.h"
 

@@ -4,7 +4,7 @@
 #include <cstdio>
 #include <cstdlib>
 
-#include "platform/Process.h"
+#include "platform/system/Process.h"
 #include "tools/zrctl/AnnotationCommands.h"
 #include "tools/zrctl/ExcludeCommand.h"
 #include "tools/zrctl/HoldCommands.h"

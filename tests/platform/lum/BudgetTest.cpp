@@ -3,8 +3,8 @@
 
 #include <functional>
 
-#include "platform/Cbor.h"
 #include "platform/lum/PeerConnection.h"
+#include "platform/values/Cbor.h"
 #include "tests/platform/lum/LumFixture.h"
 
 namespace platform::lum {
@@ -160,8 +160,8 @@ class SharedBudgetsTest : public LumTest {
         int ends[2];
         if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) != 0) return {};
         auto peer = std::make_unique<RawPeer>(UniqueFd(ends[1]));
-        auto connection = std::make_shared<PeerConnection>(UniqueFd(ends[0]), *AuditToken::ofSelf(),
-                                                           queue, replies, requests);
+        auto connection = std::make_shared<PeerConnection>(
+            UniqueFd(ends[0]), *AuditToken::ofSelf(), *Pool(4).draw({}), queue, replies, requests);
         connection->setEventHandler(
             [this, weak = std::weak_ptr(connection)](const ConnectionEvent& event) {
                 auto self = weak.lock();
@@ -254,6 +254,24 @@ TEST_F(SharedBudgetsTest, ARequestCountsUntilItIsServedToItsEnd) {
     EXPECT_TRUE(isAnswered(next, std::string_view(large).substr(written)));
     for (auto& [connection, peer] : busy) connection->abandon();
     next.connection->abandon();
+}
+
+TEST(Pool, OneOriginHasAQuarterAtTheMost) {
+    std::optional<Pool> pool(std::in_place, 8);
+    const Origin mine = Origin::of(*AuditToken::ofSelf()), other{0, 0, 7}, sandbox{1, 1, 0};
+    EXPECT_EQ(mine, (Origin{0, 0, ::getsid(0)}));
+    auto first = pool->draw(mine);
+    auto second = pool->draw(mine);
+    ASSERT_TRUE(first && second);
+    EXPECT_FALSE(pool->draw(mine));
+    EXPECT_TRUE(pool->draw(other));
+    EXPECT_TRUE(pool->draw(sandbox));
+    first.reset();
+    auto again = pool->draw(mine);
+    EXPECT_TRUE(again);
+    EXPECT_FALSE(pool->draw(mine));
+    pool.reset();
+    again.reset();  // outlives what it was drawn from
 }
 
 }  // namespace

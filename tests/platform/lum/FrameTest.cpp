@@ -6,8 +6,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/Cbor.h"
 #include "platform/lum/Limits.h"
+#include "platform/values/Cbor.h"
 
 namespace platform::lum {
 namespace {

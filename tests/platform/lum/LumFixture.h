@@ -14,14 +14,14 @@
 #include <thread>
 #include <vector>
 
-#include "platform/Directories.h"
-#include "platform/Log.h"
-#include "platform/RunLoop.h"
-#include "platform/SerialQueue.h"
-#include "platform/UniqueFd.h"
+#include "platform/log/Log.h"
 #include "platform/lum/Frame.h"
 #include "platform/lum/Limits.h"
 #include "platform/lum/Listener.h"
+#include "platform/system/Directories.h"
+#include "platform/system/UniqueFd.h"
+#include "platform/threads/RunLoop.h"
+#include "platform/threads/SerialQueue.h"
 
 namespace platform::lum {
 

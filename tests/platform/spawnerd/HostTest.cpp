@@ -3,7 +3,7 @@
 #include <linux/sched.h>
 #include <sys/syscall.h>
 
-#include "platform/Files.h"
+#include "platform/system/Files.h"
 #include "tests/platform/spawnerd/LauncherFixture.h"
 
 namespace platform::spawnerd {
@@ -78,7 +78,7 @@ TEST_F(HostTest, APlugInEndsWithItsHostHoweverItHasForked) {
     childsRequest = lum::requestFrame(1, {{"request", "start"}, {"executable", executable}});
     Child host(meeting_, 0, startPlugIn);
     const AuditToken token = meet();
-    EXPECT_EQ(launcher->addExternalService(token, executable, overlay()), 0);
+    EXPECT_EQ(launcher->addExternalService(token, service(executable), overlay()), 0);
     // Somebody else has not been granted anything by that.
     EXPECT_EQ(number(start(executable), kErrorCode), EPERM);
     goOn();
@@ -93,7 +93,7 @@ TEST_F(HostTest, APlugInEndsWithItsHostHoweverItHasForked) {
     EXPECT_EQ(number(ask({{"request", "terminate"}, {"instance", 1}}), kErrorCode), ESRCH);
     host.end();
     EXPECT_TRUE(stepUntil([&] { return processesWith(home.path()).empty(); }));
-    EXPECT_EQ(launcher->addExternalService(token, executable, overlay()), ESRCH);
+    EXPECT_EQ(launcher->addExternalService(token, service(executable), overlay()), ESRCH);
 }
 
 TEST_F(HostTest, AnotherProcessWithTheNumberOfADeadHostIsAnother) {

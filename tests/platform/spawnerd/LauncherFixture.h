@@ -8,11 +8,13 @@
 #include <string>
 #include <vector>
 
-#include "platform/PropertyList.h"
 #include "platform/lum/ClientConnection.h"
+#include "platform/plist/PropertyList.h"
 #include "platform/spawnerd/ProcessLauncher.h"
 #include "platform/spawnerd/Protocol.h"
+#include "platform/system/Files.h"
 #include "tests/platform/lum/LumFixture.h"
+#include "tests/support/KnownDirectory.h"
 #include "tests/support/TemporaryDirectory.h"
 
 namespace platform::spawnerd {
@@ -55,7 +57,13 @@ class LauncherTest : public lum::LumTest {
         return {{"LUMService", service}, {"QFBundlePackageType", "LUM!"}};
     }
     int grant(const std::string& executable, const Dictionary& settings = overlay()) {
-        return launcher->addExternalService(*AuditToken::ofSelf(), executable, settings);
+        return launcher->addExternalService(*AuditToken::ofSelf(), service(executable), settings);
+    }
+    /// The executable with its bundle, and the container of the bundle's name.
+    ExternalService service(const std::string& executable) const {
+        const std::filesystem::path bundle(parentPath(executable));
+        return {executable, test::known(bundle),
+                home.path("data/zorvan/Containers/" + bundle.stem().string())};
     }
 
     /// A request, and its reply; empty when there was none.

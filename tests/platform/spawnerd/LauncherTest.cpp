@@ -3,8 +3,9 @@
 #include <sys/un.h>
 
 #include <cstddef>
+#include <fstream>
 
-#include "platform/Files.h"
+#include "platform/system/Files.h"
 #include "tests/platform/spawnerd/LauncherFixture.h"
 
 namespace platform::spawnerd {
@@ -16,20 +17,21 @@ using namespace std::string_literals;
 TEST_F(LauncherTest, APlugInTalksToItsHostAndSeesNothingElse) {
     const std::string secret = home.write("secret.txt", "secret");
     const std::string place = container("one");
-    const std::string executable =
-        plugIn("one",
-               "read -r word\n"
-               "echo $word-$1-$GREETING-$ZORVAN_BUNDLE_IDENTIFIER\n"
-               "cat " +
-                   secret +
-                   "\n"
-                   "touch $HOME/mine && echo wrote\n"
-                   "touch ${0%/*}/mine || touch /mine || echo may not\n"
-                   "(: >>/proc/sys/kernel/core_pattern) && echo may set the kernel\n"
-                   "echo $XDG_RUNTIME_DIR/zorvan/services/*\n"
-                   "for n in 4 5 6 7 8 9; do test -e /proc/$$/fd/$n && echo leak $n; done\n"
-                   "ls /root /home /run/user\n"
-                   "tr '\\0' '\\n' < /proc/1/environ | grep GREETING");
+    std::ofstream(path("test.sandbox")) << "the token broker's socket";
+    const std::string executable = plugIn(
+        "one",
+        "read -r word\n"
+        "echo $word-$1-$GREETING-$ZORVAN_BUNDLE_IDENTIFIER\n"
+        "cat " +
+            secret +
+            "\n"
+            "touch $HOME/mine && echo wrote\n"
+            "touch ${0%/*}/mine || touch /mine || echo may not\n"
+            "(: >>/proc/sys/kernel/core_pattern) && echo may set the kernel\n"
+            "echo $XDG_RUNTIME_DIR/zorvan/services/*\n"
+            "for n in 4 5 6 7 8 9 11 12 13; do test -e /proc/$$/fd/$n && echo leak $n; done\n"
+            "ls /root /home /run/user\n"
+            "tr '\\0' '\\n' < /proc/1/environ | grep GREETING");
     EXPECT_EQ(grant(executable, overlay(Dictionary{{"GREETING", "hi there"}, {"HOME", place}})), 0);
     const Message reply = start(executable, Array{"argument"});
     const UniqueFd plugIn = reply.takeDescriptor();
@@ -44,7 +46,7 @@ TEST_F(LauncherTest, APlugInTalksToItsHostAndSeesNothingElse) {
         EXPECT_TRUE(!isBubblewrap || *environment == "PATH=/usr/bin:/bin\0"s) << process;
     }
     EXPECT_EQ(talk(plugIn, "word\n"),
-              "word-argument-hi there-one\nwrote\nmay not\n" + path("test.spawnerd") + "\n");
+              "word-argument-hi there-one\nwrote\nmay not\n" + path("test.sandbox") + "\n");
     EXPECT_TRUE(std::filesystem::exists(place + "/mine"));
     EXPECT_EQ(number(askAbout(kWait, reply), kStatus), 1);
 }
@@ -112,6 +114,56 @@ TEST_F(LauncherTest, AContainerThatLeadsElsewhereIsRefusedAlsoLater) {
     std::filesystem::create_directories(busy);
     std::filesystem::create_directory_symlink(home.path(), busy + "/one");
     EXPECT_EQ(number(start(executable), kErrorCode), ENOTDIR);
+}
+
+TEST_F(LauncherTest, OnlyTheVeryBundleInItsPlaceIsGrantedAndStarted) {
+    const std::string executable = plugIn("one", "echo fine");
+    const ExternalService good = service(executable);
+    const auto add = [&](const ExternalService& service) {
+        return launcher->addExternalService(*AuditToken::ofSelf(), service, overlay());
+    };
+    EXPECT_EQ(add(good), 0);
+    EXPECT_EQ(talk(start(executable).takeDescriptor()), "fine\n");
+    const std::string moved = home.path("moved.appex");
+    std::filesystem::rename(good.bundle.path, moved);
+    EXPECT_EQ(number(start(executable), kErrorCode), ENOENT);
+    std::filesystem::create_directory_symlink(moved, good.bundle.path);
+    EXPECT_EQ(number(start(executable), kErrorCode), ELOOP) << "the same, through a link";
+    EXPECT_EQ(add(good), ELOOP);
+    std::filesystem::remove(good.bundle.path);
+    plugIn("one", "echo another");
+    EXPECT_EQ(number(start(executable), kErrorCode), ESTALE);
+    EXPECT_EQ(add(good), ESTALE);
+    std::filesystem::remove_all(good.bundle.path);
+    std::filesystem::rename(moved, good.bundle.path);
+    EXPECT_EQ(talk(start(executable).takeDescriptor()), "fine\n");
+}
+
+TEST_F(LauncherTest, WhatABundleLinksToOutsideIsNotUsed) {
+    const std::string inside = plugIn("one", "echo fine"), outside = plugIn("two", "echo other");
+    std::filesystem::create_symlink("run", home.path("one.appex/link"));
+    EXPECT_EQ(grant(home.path("one.appex/link")), 0);
+    EXPECT_EQ(talk(start(home.path("one.appex/link")).takeDescriptor()), "fine\n");
+    for (const std::string& target : {outside, std::string("../two.appex/run")}) {
+        std::filesystem::remove(home.path("one.appex/link"));
+        std::filesystem::create_symlink(target, home.path("one.appex/link"));
+        EXPECT_EQ(grant(home.path("one.appex/link")), EXDEV);
+    }
+    ExternalService stranger = service(inside);
+    stranger.executable = outside;
+    const AuditToken self = *AuditToken::ofSelf();
+    EXPECT_EQ(launcher->addExternalService(self, stranger, overlay()), EINVAL);
+    ExternalService elsewhere = service(inside);
+    for (const std::string& place :
+         {home.makeDirectory("private"), home.path("data/zorvan/Containers/../../../private")}) {
+        container("any");
+        elsewhere.container = place;
+        EXPECT_NE(launcher->addExternalService(self, elsewhere, overlay()), 0) << place;
+    }
+    std::filesystem::remove(home.path("one.appex/Info.plist"));
+    std::filesystem::create_symlink(home.path("two.appex/Info.plist"),
+                                    home.path("one.appex/Info.plist"));
+    EXPECT_EQ(grant(inside), EINVAL);
 }
 
 TEST_F(LauncherTest, BadRequestsAreAnsweredAndTheConnectionGoesOn) {

@@ -1,8 +1,10 @@
+#include <fcntl.h>
 #include <sqlite3.h>
 
 #include <cerrno>
 #include <filesystem>
 
+#include "platform/tandry/Sqlite.h"
 #include "tests/platform/tandry/RegistryFixture.h"
 
 namespace platform::tandry {
@@ -28,6 +30,10 @@ class CatalogueTest : public RegistryTest {
         for (const auto& plugIn : workspace->installedPlugIns())
             result[plugIn->plugInIdentifier.value_or("?")] = plugIn->plugInUuid;
         return result;
+    }
+
+    FileIdentity identity(const std::string& name) {
+        return FileIdentity::at(AT_FDCWD, files.path(folder + name).c_str());
     }
 
     void sql(const char* statement) {
@@ -57,6 +63,60 @@ TEST_F(CatalogueTest, ARestartReadsNothingAgain) {
     EXPECT_EQ(after->dataContainerPath, before->dataContainerPath);
     EXPECT_EQ(after->localizedName, before->localizedName);
     EXPECT_EQ(after->containingApplication->bundleIdentifier, "app");
+}
+
+TEST_F(CatalogueTest, AnExchangedDirectoryIsAnotherPlugIn) {
+    start();
+    const TDPlugInProxyRef before = plugIn("b");
+    EXPECT_EQ(before->bundleIdentity, identity("b"));
+    start();
+    EXPECT_EQ(plugIn("b")->bundleIdentity, before->bundleIdentity);
+    EXPECT_EQ(plugIn("b")->plugInUuid, before->plugInUuid);
+
+    // With the very files.
+    fs::rename(files.path(folder + "b"), files.path("old"));
+    fs::create_directory(files.path(folder + "b"));
+    fs::rename(files.path("old/Info.plist"), files.path(folder + "b/Info.plist"));
+    start();
+    EXPECT_EQ(plugIn("b")->bundleIdentity, identity("b"));
+    EXPECT_NE(plugIn("b")->bundleIdentity, before->bundleIdentity);
+    EXPECT_NE(plugIn("b")->plugInUuid, before->plugInUuid);
+
+    fs::rename(files.path(folder + "b"), files.path("new"));
+    fs::create_directory_symlink(files.path("new"), files.path(folder + "b"));
+    start();
+    EXPECT_EQ(plugIn("b")->bundlePath, files.path("new"));
+}
+
+TEST_F(CatalogueTest, OneWithoutTheIdentitiesOfDirectoriesIsTakenOver) {
+    start();
+    EXPECT_EQ(unregisterPlugIn(files.path(folder + "c")), std::nullopt);
+    const std::string own = addPlugIn("Own.app/PlugIns/own", "own");
+    EXPECT_EQ(registerPlugIn(own), std::nullopt);
+    const auto before = uuids();
+    stop();
+    recorder.take();
+    {
+        auto opened = SqliteDatabase::open(database);
+        ASSERT_TRUE(opened);
+        for (const char* statement :
+             {"UPDATE plugins SET stamps = substr(stamps, 17)",
+              "UPDATE forgotten SET stamps = substr(stamps, 17)",
+              "UPDATE plugins SET sum = checksum(path, uuid, application, bundle_identifier,"
+              " identifier, original_identifier, version, registered, name, short_name,"
+              " executable, sdk, points, container, stamps, info_plist_size, dictionaries)",
+              "PRAGMA user_version = 1"})
+            EXPECT_EQ(opened->run(statement), std::nullopt) << statement;
+    }
+    ErrorLines errors;
+    for (int run = 0; run < 2; ++run) {
+        start();
+        EXPECT_EQ(uuids(), before);
+        EXPECT_EQ(merges, 0) << "nothing is read again";
+        EXPECT_EQ(plugIn("b")->bundleIdentity, identity("b"));
+    }
+    EXPECT_THAT(recorder.take(), IsEmpty());
+    EXPECT_THAT(errors.lines, IsEmpty());
 }
 
 TEST_F(CatalogueTest, WhatChangedGetsANewUuid) {
@@ -167,7 +227,7 @@ TEST_F(CatalogueTest, WorksInMemoryAndKeepsTheFileWhenItCannotBeOpened) {
         EXPECT_THAT(errors.lines, ElementsAre(HasSubstr("working without the catalogue"),
                                               HasSubstr("cannot write the catalogue")));
         EXPECT_THAT(installed(), ElementsAre("a", "b", "c"));
-        EXPECT_TRUE(workspace->unregisterPlugIn(files.path(folder + "a")));
+        EXPECT_TRUE(unregisterPlugIn(files.path(folder + "a")));
         EXPECT_THAT(installed(), ElementsAre("b", "c"));
         stop();
         fs::remove(database + suffix);
@@ -179,18 +239,18 @@ TEST_F(CatalogueTest, WorksInMemoryAndKeepsTheFileWhenItCannotBeOpened) {
 TEST_F(CatalogueTest, StoresLaterWhatCouldNotBeStored) {
     const std::string loose = addPlugIn("opt/Loose.appex", "loose");
     start();
-    EXPECT_EQ(workspace->registerPlugIn(loose), std::nullopt);
-    EXPECT_EQ(workspace->unregisterPlugIn(files.path(folder + "a")), std::nullopt);
+    EXPECT_EQ(registerPlugIn(loose), std::nullopt);
+    EXPECT_EQ(unregisterPlugIn(files.path(folder + "a")), std::nullopt);
     sqlite3* other = nullptr;
     sqlite3_open(database.c_str(), &other);
     auto lock = [&](const char* how) { sqlite3_exec(other, how, nullptr, nullptr, nullptr); };
     lock("BEGIN IMMEDIATE");
     add("d");
     const std::string d = files.path(folder + "d");
-    EXPECT_THAT(workspace->registerPlugIn(d)->text, HasSubstr("locked"));
+    EXPECT_THAT(registerPlugIn(d)->text, HasSubstr("locked"));
     EXPECT_THAT(installed(), ElementsAre("b", "c", "d", "loose"));
     lock("COMMIT");
-    EXPECT_EQ(workspace->registerPlugIn(d), std::nullopt);
+    EXPECT_EQ(registerPlugIn(d), std::nullopt);
     const std::map<std::string, Uuid> before = uuids();
     start();
     EXPECT_EQ(merges, 0);
@@ -202,7 +262,7 @@ TEST_F(CatalogueTest, StoresLaterWhatCouldNotBeStored) {
     start();
     EXPECT_THAT(installed(), ElementsAre("a", "b", "c", "d"));
     sqlite3_close(other);
-    EXPECT_EQ(workspace->unregisterPlugIn(files.path(folder + "b")), std::nullopt);
+    EXPECT_EQ(unregisterPlugIn(files.path(folder + "b")), std::nullopt);
     start();
     EXPECT_THAT(installed(), ElementsAre("c", "d", "loose"));
 }

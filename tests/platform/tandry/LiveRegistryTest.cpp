@@ -1,6 +1,10 @@
+#include <fcntl.h>
+#include <sys/resource.h>
+
 #include <filesystem>
 #include <random>
 
+#include "platform/system/UniqueFd.h"
 #include "platform/tandry/ChangeGatherer.h"
 #include "tests/platform/tandry/RegistryFixture.h"
 
@@ -69,8 +73,7 @@ TEST_F(LiveRegistryTest, FollowsWhatWasRegisteredAndItsDictionary) {
     addApplication("opt/A.app");
     const std::string inside = addPlugIn("opt/A.app/Extras/E.appex", "extra");
     start();
-    for (const std::string& path : {loose, inside})
-        EXPECT_EQ(workspace->registerPlugIn(path), std::nullopt);
+    for (const std::string& path : {loose, inside}) EXPECT_EQ(registerPlugIn(path), std::nullopt);
     recorder.take();
     writePlist("home/zorvan/SDKs/org.point.plist", {{"FromSdk", true}});
     EXPECT_THAT(recorder.take(2), ElementsAre("-loose", "+loose"));
@@ -82,7 +85,7 @@ TEST_F(LiveRegistryTest, FollowsWhatWasRegisteredAndItsDictionary) {
     fs::rename(at("away"), at("opt"));
     EXPECT_THAT(recorder.take(2), ElementsAre("+extra", "+loose"));
     // An unregistered bundle stays out, whatever happens around it.
-    EXPECT_EQ(workspace->unregisterPlugIn(inside), std::nullopt);
+    EXPECT_EQ(unregisterPlugIn(inside), std::nullopt);
     recorder.take();
     files.write("opt/A.app/Extras/E.appex/new", "");
     fs::remove_all(loose);
@@ -123,31 +126,44 @@ TEST_F(LiveRegistryTest, WithoutEnoughWatchesItLooksFromTimeToTime) {
     EXPECT_THAT(errors.lines, testing::Contains(HasSubstr("cannot watch all")).Times(1));
 }
 
+/// While it lives, this process can open so many descriptors more.
+class FewDescriptors {
+  public:
+    explicit FewDescriptors(std::size_t count) {
+        ::getrlimit(RLIMIT_NOFILE, &before_);
+        std::vector<UniqueFd> free(count);
+        for (UniqueFd& fd : free) fd.reset(::open("/dev/null", O_RDONLY | O_CLOEXEC));
+        rlimit limit = before_;
+        limit.rlim_cur = static_cast<rlim_t>(free.back().get()) + 1;
+        ::setrlimit(RLIMIT_NOFILE, &limit);
+    }
+    ~FewDescriptors() { ::setrlimit(RLIMIT_NOFILE, &before_); }
+
+  private:
+    rlimit before_{};
+};
+
 TEST_F(LiveRegistryTest, WhatCannotBeReadJustNowStaysAndIsReadLater) {
     ::setenv("LC_ALL", "de", 1);
     // Nothing but the next try tells of an end of the shortage.
     watching.quiet = watching.longest = std::chrono::hours(1);
     watching.retry = std::chrono::milliseconds(20);
     addApplication(apps + "A.app", {{"QFBundleIdentifier", "app"}});
-    const std::string a = addPlugIn(apps + "A.app/PlugIns/A.appex", "a");
+    addPlugIn(apps + "A.app/PlugIns/A.appex", "a");
     addPlugIn(apps + "A.app/PlugIns/B.appex", "b");
     start();
     recorder.take();
     const Uuid uuid = plugIn("a")->plugInUuid;
-    // Reading this file fails with EIO.
-    const std::string names = "/Localized.plist";
-    for (const std::string& bundle : {a, files.path(apps + "A.app")})
-        fs::create_symlink("/proc/self/mem", bundle + names);
+    for (const std::string bundle : {"A.app/PlugIns/A.appex", "A.app"})
+        writePlist(apps + bundle + "/Localized.plist",
+                   {{"de", Dictionary{{"QFBundleDisplayName", "Anna"}}}});
     fs::remove_all(at(apps + "A.app/PlugIns/B.appex"));
-    static_cast<void>(workspace->registerPlugIn(files.path(apps + "A.app")));
-    EXPECT_THAT(recorder.take(), ElementsAre("-b"));
-    EXPECT_EQ(plugIn("a")->plugInUuid, uuid);
-    for (const std::string& bundle : {a, files.path(apps + "A.app")}) {
-        const Dictionary german{{"de", Dictionary{{"QFBundleDisplayName", "Anna"}}}};
-        auto xml = writeXmlPropertyList(german);
-        ASSERT_TRUE(xml);
-        files.write("names", *xml);
-        fs::rename(at("names"), bundle + names);
+    {
+        // A folder and a bundle in it, and no file.
+        const FewDescriptors few(2);
+        static_cast<void>(registerPlugIn(files.path(apps + "A.app")));
+        EXPECT_THAT(recorder.take(), ElementsAre("-b"));
+        EXPECT_EQ(plugIn("a")->plugInUuid, uuid);
     }
     ::unsetenv("LC_ALL");
     // The application's names may be read in one walk, the plug-in's in the next.
@@ -211,7 +227,7 @@ TEST_F(LiveRegistryTest, EndsWhereAFreshStartWouldBegin) {
     addApplication("opt/C.app");
     addPlugIn("opt/C.app/PlugIns/x", "x");
     start();
-    EXPECT_EQ(workspace->registerPlugIn(files.path("opt/C.app")), std::nullopt);
+    EXPECT_EQ(registerPlugIn(files.path("opt/C.app")), std::nullopt);
     for (int round = 0; round < 25; ++round) {
         for (std::size_t i = 0; i <= pick(6); ++i) try {
                 mutate();
@@ -224,7 +240,8 @@ TEST_F(LiveRegistryTest, EndsWhereAFreshStartWouldBegin) {
         ASSERT_TRUE(fresh);
         (*fresh)->activate();
         if (!fs::is_symlink(at("opt/C.app")))
-            static_cast<void>((*fresh)->registerPlugIn(files.path("opt/C.app")));
+            static_cast<void>(
+                (*fresh)->registerPlugIn(files.path("opt/C.app"), Requester::Unconfined));
         const std::vector<std::string> expected = state(**fresh);
         ASSERT_TRUE(recorder.waitUntil([&] { return state(*workspace) == expected; }))
             << "round " << round << ": " << testing::PrintToString(state(*workspace))

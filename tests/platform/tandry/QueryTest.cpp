@@ -91,8 +91,9 @@ bool accepts(const Value& pattern, const Value* value) {
 
 bool accepts(const TDPlugInProxy& plugIn, const Dictionary& query) {
     for (const auto& [key, pattern] : query) {
-        const Value* value = plugIn.lookup(key, TDPlugInProxy::Scope::Attributes);
-        if (!value) value = plugIn.lookup(key, TDPlugInProxy::Scope::InfoPlist);
+        const Dictionary* attributes = plugIn.attributes();
+        const Value* value = attributes ? attributes->find(key) : nullptr;
+        if (!value) value = plugIn.infoPlist.get().find(key);
         Value identifier(plugIn.plugInIdentifier.value_or(""));
         if (key == kIdentifier) value = &identifier;
         if (!accepts(pattern, value)) return false;
@@ -163,7 +164,7 @@ TEST(Snapshot, ASuccessorIsAsOneMadeAnew) {
     for (int round = 0; round < 200; ++round) {
         RegistryChanges changes;
         for (std::size_t i = 0; i < random() % 4; ++i) {
-            const std::string path = "/" + std::to_string(random() % 20);
+            const std::string path = fmt::format("/{}", random() % 20);
             if (auto found = state.plugIns.find(path); found != state.plugIns.end()) {
                 changes.uninstalled.push_back(found->second.record);
                 state.plugIns.erase(found);

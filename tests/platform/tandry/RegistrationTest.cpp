@@ -17,12 +17,12 @@ TEST_F(RegistryTest, RegistersByPathAcrossRestarts) {
     addPlugIn("opt/App.app/PlugIns/B.appex", "b");
     files.makeDirectory("opt/App.app/PlugIns/Broken.appex");
     start();
-    EXPECT_EQ(workspace->registerPlugIn(loose), std::nullopt);
-    EXPECT_EQ(workspace->registerPlugIn(inside), std::nullopt);
+    EXPECT_EQ(registerPlugIn(loose), std::nullopt);
+    EXPECT_EQ(registerPlugIn(inside), std::nullopt);
     EXPECT_THAT(recorder.take(), ElementsAre("+loose", "+a"));
-    EXPECT_EQ(plugIn("a")->containingApplication, workspace->applicationAtPath(app));
+    EXPECT_EQ(plugIn("a")->containingApplication->bundlePath, app);
     const Uuid uuid = plugIn("a")->plugInUuid;
-    EXPECT_EQ(workspace->registerPlugIn(app), std::nullopt);
+    EXPECT_EQ(registerPlugIn(app), std::nullopt);
     EXPECT_THAT(recorder.take(), ElementsAre("+b"));
     start();
     EXPECT_THAT(installed(), ElementsAre("a", "b", "loose"));
@@ -30,17 +30,16 @@ TEST_F(RegistryTest, RegistersByPathAcrossRestarts) {
     EXPECT_EQ(plugIn("a")->plugInUuid, uuid);
 
     addPlugIn("opt/App.app/PlugIns/B.appex", "b", {}, {{"changed", true}});
-    EXPECT_EQ(workspace->registerPlugIn(app), std::nullopt);
+    EXPECT_EQ(registerPlugIn(app), std::nullopt);
     EXPECT_THAT(recorder.take(), ElementsAre("-b", "+b"));
     EXPECT_EQ(plugIn("a")->plugInUuid, uuid);
 
-    EXPECT_TRUE(workspace->unregisterPlugIn(files.path("opt")));
-    EXPECT_EQ(workspace->unregisterPlugIn(app), std::nullopt);
+    EXPECT_TRUE(unregisterPlugIn(files.path("opt")));
+    EXPECT_EQ(unregisterPlugIn(app), std::nullopt);
     EXPECT_THAT(recorder.take(), ElementsAre("-a", "-b"));
-    EXPECT_EQ(workspace->applicationAtPath(app), nullptr);
-    EXPECT_TRUE(workspace->unregisterPlugIn(app));
+    EXPECT_TRUE(unregisterPlugIn(app));
     fs::remove_all(loose);
-    EXPECT_EQ(workspace->unregisterPlugIn(loose), std::nullopt);
+    EXPECT_EQ(unregisterPlugIn(loose), std::nullopt);
     start();
     EXPECT_THAT(installed(), IsEmpty());
     EXPECT_THAT(recorder.take(), ElementsAre("-loose"));
@@ -53,20 +52,94 @@ TEST_F(RegistryTest, RefusesWithTheReason) {
     addApplication("opt/Empty.app");
     for (const std::string& path : {broken, files.path("opt/Empty.app"), files.path("missing"),
                                     files.path("opt/Broken.appex/Info.plist")}) {
-        std::optional<Error> error = workspace->registerPlugIn(path);
+        std::optional<Error> error = registerPlugIn(path);
         ASSERT_TRUE(error) << path;
         EXPECT_THAT(error->text, HasSubstr(path));
-        EXPECT_TRUE(workspace->unregisterPlugIn(path)) << path;
+        EXPECT_TRUE(unregisterPlugIn(path)) << path;
     }
     addPlugIn("opt/Broken.appex", "mended");
-    EXPECT_EQ(workspace->registerPlugIn(broken), std::nullopt);
+    EXPECT_EQ(registerPlugIn(broken), std::nullopt);
     // A registered bundle that breaks goes; mended, it is back without another registration.
     files.write("opt/Broken.appex/Info.plist", "");
-    EXPECT_TRUE(workspace->registerPlugIn(broken));
+    EXPECT_TRUE(registerPlugIn(broken));
     EXPECT_THAT(recorder.take(), ElementsAre("+mended", "-mended"));
     addPlugIn("opt/Broken.appex", "mended");
     start();
     EXPECT_THAT(installed(), ElementsAre("mended"));
+}
+
+TEST_F(RegistryTest, DoesNothingForConfinedProcesses) {
+    const std::string loose = addPlugIn("opt/Loose.appex", "loose");
+    start();
+    ErrorLines errors;
+    EXPECT_THAT(workspace->registerPlugIn(loose, Requester::Confined)->text, HasSubstr(loose));
+    EXPECT_EQ(registerPlugIn(loose), std::nullopt);
+    EXPECT_TRUE(workspace->unregisterPlugIn(loose, Requester::Confined));
+    EXPECT_THAT(recorder.take(), ElementsAre("+loose"));
+    EXPECT_THAT(errors.lines,
+                ElementsAre("refusing to register " + loose + ": a confined process asks",
+                            "refusing to unregister " + loose + ": a confined process asks"));
+}
+
+TEST_F(RegistryTest, TakesNothingFromWhereConfinedProcessesWrite) {
+    // Names say nothing: the places themselves are reached through links.
+    const auto link = [this](const std::string& target, const std::string& name) {
+        fs::create_directories(fs::path(files.path(name)).parent_path());
+        fs::create_directory_symlink(files.path(target), files.path(name));
+    };
+    files.makeDirectory("disk/containers");
+    files.makeDirectory("disk/run/zorvan");
+    files.makeDirectory("disk/busy");
+    link("disk/containers", "home/zorvan/Containers");
+    link("disk/run", "run");
+    link("disk/busy", "disk/run/zorvan/tenurd");
+    const std::pair<const char*, const char*> places[] = {
+        {"disk/containers/x", "a data container"},
+        {"disk/busy/x", "an assertion folder"},
+        {"disk/run", "the runtime directory"},
+    };
+    start();
+    for (const auto& [place, name] : places) {
+        const std::string evil = addPlugIn(place + std::string("/Evil.appex"), "evil");
+        const std::string app = addApplication(place + std::string("/Evil.app"));
+        addPlugIn(place + std::string("/Evil.app/PlugIns/E.appex"), "evil");
+        fs::remove_all(files.path("opt"));
+        link(place + std::string("/Evil.appex"), "opt/Link.appex");
+        ErrorLines errors;
+        for (const std::string& path : {evil, app, files.path("opt/Link.appex")})
+            EXPECT_THAT(registerPlugIn(path)->text, HasSubstr(name)) << path;
+        EXPECT_THAT(errors.lines, testing::Each(AllOf(HasSubstr(place), HasSubstr(name))));
+        EXPECT_EQ(errors.lines.size(), 3u);
+
+        // What a good place leads to is not better for it.
+        fs::remove_all(files.path(apps));
+        const std::string mixed = addApplication("opt/Mixed.app");
+        addPlugIn("opt/Mixed.app/PlugIns/Good.appex", "good");
+        link(place + std::string("/Evil.appex"), "opt/Mixed.app/PlugIns/Evil.appex");
+        link(place + std::string("/Evil.app"), apps + "Linked.app");
+        addApplication(apps + "Half.app");
+        link(place + std::string("/Evil.app/PlugIns"), apps + "Half.app/PlugIns");
+        errors.lines.clear();
+        EXPECT_EQ(registerPlugIn(mixed), std::nullopt);
+        start();
+        EXPECT_THAT(installed(), ElementsAre("good"));
+        for (const char* what : {"/Evil.appex: ", "/Evil.app: ", "/Evil.app/PlugIns: "})
+            EXPECT_THAT(errors.lines, testing::Contains(AllOf(HasSubstr(what), HasSubstr(name))));
+        EXPECT_EQ(unregisterPlugIn(mixed), std::nullopt);
+    }
+}
+
+TEST_F(RegistryTest, DropsWhatItKnowsOnceConfinedProcessesWriteThere) {
+    const std::string loose = addPlugIn("opt/Loose.appex", "loose");
+    start();
+    EXPECT_EQ(registerPlugIn(loose), std::nullopt);
+    directories.runtime = files.path("opt");
+    ErrorLines errors;
+    start();
+    EXPECT_THAT(installed(), IsEmpty());
+    EXPECT_THAT(errors.lines, ElementsAre("leaving out a plug-in: " + loose +
+                                          ": it lies in the runtime directory"));
+    EXPECT_EQ(unregisterPlugIn(loose), std::nullopt);
 }
 
 TEST_F(RegistryTest, AnUnregisteredBundleStaysForgottenUntilItChanges) {
@@ -75,23 +148,22 @@ TEST_F(RegistryTest, AnUnregisteredBundleStaysForgottenUntilItChanges) {
     addPlugIn(apps + "A.app/PlugIns/B.appex", "b");
     const std::string app = files.path(apps + "A.app");
     start();
-    EXPECT_EQ(workspace->unregisterPlugIn(a), std::nullopt);
-    EXPECT_TRUE(workspace->unregisterPlugIn(a));
+    EXPECT_EQ(unregisterPlugIn(a), std::nullopt);
+    EXPECT_TRUE(unregisterPlugIn(a));
     start();
     EXPECT_THAT(installed(), ElementsAre("b"));
-    EXPECT_EQ(workspace->registerPlugIn(a), std::nullopt);
+    EXPECT_EQ(registerPlugIn(a), std::nullopt);
     EXPECT_THAT(installed(), ElementsAre("a", "b"));
 
     // Edited, and then removed without a scan in between.
     addPlugIn(apps + "A.app/PlugIns/A.appex", "a", {}, {{"edited", true}});
-    EXPECT_EQ(workspace->unregisterPlugIn(app), std::nullopt);
+    EXPECT_EQ(unregisterPlugIn(app), std::nullopt);
     start();
     EXPECT_THAT(installed(), IsEmpty());
-    EXPECT_TRUE(workspace->applicationAtPath(app));
     addPlugIn(apps + "A.app/PlugIns/A.appex", "a", {}, {{"edited", "again"}});
     start();
     EXPECT_THAT(installed(), ElementsAre("a"));
-    EXPECT_EQ(workspace->registerPlugIn(app), std::nullopt);
+    EXPECT_EQ(registerPlugIn(app), std::nullopt);
     EXPECT_THAT(installed(), ElementsAre("a", "b"));
 }
 
@@ -104,8 +176,8 @@ TEST_F(RegistryTest, RegisteringAnApplicationKeepsWhatOtherRoadsLeadTo) {
     files.makeDirectory(apps);
     fs::create_symlink(files.path("opt/A.app/Inner.app"), files.path(apps + "Inner.app"));
     start();
-    EXPECT_EQ(workspace->registerPlugIn(extra), std::nullopt);
-    EXPECT_EQ(workspace->registerPlugIn(app), std::nullopt);
+    EXPECT_EQ(registerPlugIn(extra), std::nullopt);
+    EXPECT_EQ(registerPlugIn(app), std::nullopt);
     EXPECT_THAT(recorder.take(), ElementsAre("+inner", "+extra", "+a"));
     EXPECT_THAT(installed(), UnorderedElementsAre("a", "extra", "inner"));
 }
@@ -135,12 +207,12 @@ TEST_F(RegistryTest, WhatIsForgottenStaysSoWhileItCannotBeRead) {
     const std::string a = addPlugIn("opt/A.app/PlugIns/A.appex", "a");
     addPlugIn("opt/A.app/PlugIns/B.appex", "b");
     start();
-    EXPECT_EQ(workspace->registerPlugIn(app), std::nullopt);
-    EXPECT_EQ(workspace->unregisterPlugIn(a), std::nullopt);
+    EXPECT_EQ(registerPlugIn(app), std::nullopt);
+    EXPECT_EQ(unregisterPlugIn(a), std::nullopt);
     {
         const NoDescriptors limit;
         for (const std::string& path : {a, app})
-            EXPECT_THAT(workspace->registerPlugIn(path)->text, HasSubstr("Too many open files"));
+            EXPECT_THAT(registerPlugIn(path)->text, HasSubstr("Too many open files"));
     }
     EXPECT_THAT(installed(), ElementsAre("b"));
     // As a volume that is not mounted, reached by registration or by a link.
@@ -155,8 +227,8 @@ TEST_F(RegistryTest, WhatIsForgottenStaysSoWhileItCannotBeRead) {
         if (i != 0) continue;
         fs::create_symlink("../../../opt/A.app", files.path(apps + "Link.app"));
         start();
-        EXPECT_EQ(workspace->unregisterPlugIn(app), std::nullopt);
-        EXPECT_EQ(workspace->registerPlugIn(files.path("opt/A.app/PlugIns/B.appex")), std::nullopt);
+        EXPECT_EQ(unregisterPlugIn(app), std::nullopt);
+        EXPECT_EQ(registerPlugIn(files.path("opt/A.app/PlugIns/B.appex")), std::nullopt);
     }
 }
 

@@ -11,10 +11,10 @@
 #include <string>
 #include <vector>
 
-#include "platform/Directories.h"
-#include "platform/Log.h"
-#include "platform/PropertyList.h"
-#include "platform/SdkDictionaries.h"
+#include "platform/log/Log.h"
+#include "platform/plist/PropertyList.h"
+#include "platform/services/SdkDictionaries.h"
+#include "platform/system/Directories.h"
 #include "platform/tandry/DiskWorkspace.h"
 #include "tests/support/TemporaryDirectory.h"
 
@@ -66,6 +66,7 @@ class Recorder : public WorkspaceObserver {
 class RegistryTest : public testing::Test {
   protected:
     RegistryTest() {
+        directories.runtime = files.path("run");
         directories.dataHome = files.path("home");
         directories.dataDirs = {files.path("share")};
     }
@@ -96,7 +97,13 @@ class RegistryTest : public testing::Test {
         settle();
     }
     /// Waits until the registry's thread has done what it was given.
-    void settle() { static_cast<void>(workspace->unregisterPlugIn("/nowhere")); }
+    void settle() { static_cast<void>(unregisterPlugIn("/nowhere")); }
+    std::optional<Error> registerPlugIn(const std::string& path) {
+        return workspace->registerPlugIn(path, Requester::Unconfined);
+    }
+    std::optional<Error> unregisterPlugIn(const std::string& path) {
+        return workspace->unregisterPlugIn(path, Requester::Unconfined);
+    }
     void stop() {
         observation.reset();
         workspace.reset();

@@ -10,7 +10,6 @@ namespace platform::tandry {
 namespace {
 
 namespace fs = std::filesystem;
-using Scope = TDPlugInProxy::Scope;
 
 TEST_F(RegistryTest, FindsTheBundlesOfEveryApplicationFolder) {
     const std::string app = addApplication(
@@ -32,14 +31,13 @@ TEST_F(RegistryTest, FindsTheBundlesOfEveryApplicationFolder) {
     TDPlugInProxyRef found = workspace->plugInAtPath(a);
     ASSERT_TRUE(found);
     EXPECT_EQ(workspace->plugInWithUuid(found->plugInUuid), found);
-    EXPECT_EQ(found->containingApplication, workspace->applicationAtPath(app));
+    EXPECT_EQ(found->containingApplication->bundlePath, app);
     EXPECT_EQ(found->containingApplication->bundleIdentifier, "org.mail");
     EXPECT_EQ(found->containingApplication->localizedName, "Mail");
     EXPECT_FALSE(found->containingApplication->isPlaceholder);
     EXPECT_TRUE(plugIn("org.map.c")->containingApplication->isPlaceholder);
     EXPECT_EQ(workspace->plugInsOfApplication(app).size(), 2u);
     EXPECT_FALSE(workspace->plugInAtPath(app));
-    EXPECT_FALSE(workspace->applicationAtPath(a));
 }
 
 TEST_F(RegistryTest, CompletesTheDictionaries) {
@@ -76,16 +74,16 @@ TEST_F(RegistryTest, CompletesTheDictionaries) {
     EXPECT_EQ(*a->attributes(), (Dictionary{{"Size", 3},
                                             {"VXExtensionVersion", "2.5"},
                                             {"VXExtensionPointIdentifier", "org.point"}}));
-    EXPECT_EQ(*a->lookup("FromSdk", Scope::InfoPlist), Value(true));
-    EXPECT_EQ(*a->lookup("CleanTimeout", Scope::PlugInDictionary), Value(7));
-    EXPECT_FALSE(a->lookup("FromSdk", Scope::PlugInDictionary));
+    EXPECT_EQ(*a->infoPlist.get().find("FromSdk"), Value(true));
+    EXPECT_EQ(*a->plugInDictionary()->find("CleanTimeout"), Value(7));
+    EXPECT_FALSE(a->plugInDictionary()->find("FromSdk"));
     EXPECT_EQ(a->entitlements.get(), (Dictionary{{"right", true}}));
 
     TDPlugInProxyRef b = plugIn("b");
     EXPECT_EQ(b->bundleVersion, "7");
     EXPECT_EQ(b->originalIdentifier, "b");
-    EXPECT_EQ(*b->lookup("VXExtensionVersion", Scope::Attributes), Value(9));
-    EXPECT_EQ(*b->lookup("VXExtensionPointIdentifier", Scope::Attributes), Value("other"));
+    EXPECT_EQ(*b->attributes()->find("VXExtensionVersion"), Value(9));
+    EXPECT_EQ(*b->attributes()->find("VXExtensionPointIdentifier"), Value("other"));
     EXPECT_EQ(plugIn("c")->attributes(), nullptr);
     EXPECT_EQ(*plugIn("d")->attributes(), (Dictionary{{"VXExtensionVersion", "1"}}));
     EXPECT_EQ(plugIn("f")->bundleIdentifier, "f") << "its instances are known by it";
@@ -209,6 +207,42 @@ TEST_F(RegistryTest, FollowsLinksAndSkipsWhatCannotBeNamed) {
                                      HasSubstr("Bad"), HasSubstr("Line"), HasSubstr("File.app")));
 }
 
+TEST_F(RegistryTest, ReadsNothingThatLiesOutsideABundle) {
+    addApplication(apps + "A.app");
+    const std::string folder = apps + "A.app/PlugIns/";
+    writePlist("private.plist", {{"secret", true}, {"VXExtension", Dictionary()}});
+    const std::string secret = files.path("private.plist");
+    for (const char* name : {"whole", "inside", "rights", "names"}) addPlugIn(folder + name, name);
+    files.makeDirectory(folder + "info");
+    fs::create_symlink(secret, files.path(folder + "info/Info.plist"));
+    fs::create_symlink("../../../../../../private.plist",
+                       files.path(folder + "rights/Entitlements.plist"));
+    fs::create_symlink(secret, files.path(folder + "names/Localized.plist"));
+    writePlist(folder + "inside/deep/rights.plist", {{"own", true}});
+    fs::create_symlink("deep/../deep/rights.plist",
+                       files.path(folder + "inside/Entitlements.plist"));
+    addApplication(apps + "B.app");
+    fs::remove(files.path(apps + "B.app/Info.plist"));
+    fs::create_symlink(secret, files.path(apps + "B.app/Info.plist"));
+    ::setenv("LANG", "de_DE.UTF-8", 1);
+    const char* text = "list: a symbolic link that leads out of the bundle";
+    for (int run = 0; run < 2; ++run) {
+        ErrorLines errors;
+        start();
+        EXPECT_THAT(installed(), ElementsAre("inside", "names", "whole"));
+        EXPECT_TRUE(plugIn("inside")->entitlements.get().contains("own"));
+        // What only lacks a name is not told of again as long as it does not change.
+        std::vector<std::string> told{"info/Info.p", "rights/Entitlements.p"};
+        if (run == 0) told.insert(told.end(), {"names/Localized.p", "B.app/Info.p"});
+        for (const std::string& file : told)
+            EXPECT_THAT(errors.lines, testing::Contains(AllOf(HasSubstr(file), HasSubstr(text))));
+    }
+    ::unsetenv("LANG");
+    fs::remove(files.path(folder + "rights/Entitlements.plist"));
+    start();
+    EXPECT_THAT(installed(), ElementsAre("inside", "names", "rights", "whole"));
+}
+
 TEST_F(RegistryTest, MakesDataContainersThatAreTheUsersOwn) {
     addApplication(apps + "A.app");
     const std::string folder = apps + "A.app/PlugIns/";
@@ -235,7 +269,7 @@ TEST_F(RegistryTest, MakesDataContainersThatAreTheUsersOwn) {
     start();
     EXPECT_TRUE(fs::exists(containers + "/a/tmp"));
     fs::remove_all(containers);
-    EXPECT_EQ(workspace->registerPlugIn(addPlugIn(folder + "E.appex", "e")), std::nullopt);
+    EXPECT_EQ(registerPlugIn(addPlugIn(folder + "E.appex", "e")), std::nullopt);
     EXPECT_TRUE(fs::exists(containers + "/e/tmp"));
     fs::remove_all(containers);
     files.write("home/zorvan/Containers", "a file");

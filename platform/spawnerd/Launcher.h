@@ -1,0 +1,80 @@
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <string>
+
+#include "platform/lum/AuditToken.h"
+#include "platform/system/KnownDirectory.h"
+#include "platform/values/Value.h"
+
+namespace platform {
+
+class RunLoop;
+class SerialQueue;
+struct Directories;
+
+/// What a plug-in's record says of what a host may start. A plain value.
+struct ExternalService {
+    std::string executable;  // the path of a file in the bundle
+    KnownDirectory bundle;
+    std::string container;  // the path of the plug-in's data container; empty when it has none
+};
+
+/// Starts plug-ins and knows the instances that run.
+class Launcher {
+  public:
+    /// How an order went: one of those below, or another number for a failure.
+    using Status = int;
+    static constexpr Status kDone = 0;
+    static constexpr Status kNoneOnRecord = 3;
+    using Completion = std::function<void(Status)>;
+
+    virtual ~Launcher() = default;
+
+    /// Lets a process start an executable as a service, under the settings of an activation
+    /// overlay: {"LUMService": {…}, "QFBundlePackageType": "LUM!"}. Holds for that very process and
+    /// as long as it lives, and for that very bundle: an instance is started only while the
+    /// bundle's path leads to it. The last overlay for an executable counts. Answers 0, or the
+    /// number of a system error: ESTALE, ELOOP, ENOTDIR, ... the bundle is not in its place;
+    /// ENOENT, EACCES, EXDEV, ... the executable does not exist, cannot be run or lies outside the
+    /// bundle; EINVAL the overlay is no good, or the bundle has no identifier; E2BIG its
+    /// environment is too large; ENOTDIR, EPERM or EINVAL the data container is no directory of
+    /// this user's own below the containers; ESRCH the process is gone; ENOSPC it has too many such
+    /// rights. From any thread.
+    virtual int addExternalService(const AuditToken& host, const ExternalService& service,
+                                   const Dictionary& overlay) = 0;
+    /// Takes back what lets hosts start the executables of a bundle, by its canonical path. From
+    /// then on none is started unless it is added anew; instances that run go on. From any thread.
+    virtual void removeExternalServices(const std::string& bundlePath) = 0;
+
+    /// Marks work that is not done as long as the marker lives; the daemon is not to be stopped for
+    /// idleness meanwhile. From any thread.
+    class WorkMarker {
+      public:
+        virtual ~WorkMarker() = default;
+    };
+    virtual std::unique_ptr<WorkMarker> beginOutstandingWork() = 0;
+    /// Ends the running instances of the plug-in with a bundle identifier and a bundle version, at
+    /// once and without asking them, takes back what lets hosts start it, and runs `completion` on
+    /// `queue`, which must live until then, once the instances are gone. Returns at once. From any
+    /// thread.
+    virtual void terminatePlugInInstances(const std::string& bundleIdentifier,
+                                          const std::string& bundleVersion, SerialQueue& queue,
+                                          Completion completion) = 0;
+    /// Ends all running instances, as above, and starts no more, for good. Runs `completion` on the
+    /// loop's thread once they are gone, or two seconds have passed. From any thread.
+    virtual void shutDown(std::function<void()> completion) = 0;
+};
+
+/// The launcher of the daemon of a service name: it starts plug-ins under bubblewrap, for the hosts
+/// that it was told of, which ask for it on a service of its own (docs/protocol.md). Made on the
+/// thread that runs `loop`, to which its instances are tied: they end with that thread. It listens
+/// from the loop's first turn; when it cannot, an error line says so and nothing is ever started.
+///
+/// It goes where `loop` runs or while it does not run, and takes its instances along.
+std::unique_ptr<Launcher> makeLauncher(const Directories& directories,
+                                       const std::string& daemonService,
+                                       std::shared_ptr<RunLoop> loop);
+
+}  // namespace platform

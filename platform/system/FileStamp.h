@@ -1,0 +1,38 @@
+#pragma once
+
+#include <array>
+#include <cstdint>
+#include <string>
+
+namespace platform {
+
+/// What tells one content of a file from another without reading it. Equal stamps: the file was
+/// neither replaced nor rewritten in between (but see `settled`).
+struct FileStamp {
+    /// Device, inode, size, times of modification and change (seconds and nanoseconds apart: files
+    /// may claim to be from any century). All 0 after an error.
+    std::array<std::int64_t, 7> facts{};
+    std::int64_t error = 0;  // why the file cannot be looked at; ENOENT when there is none
+    /// False for a file that was changed within the last clock ticks: it may be changed again
+    /// without another stamp. Such a stamp must not be remembered for what is read after it.
+    bool settled = true;
+
+    /// The stamp that a file has now; symbolic links are followed. A relative path starts at the
+    /// directory `dirfd` (borrowed, or AT_FDCWD).
+    static FileStamp of(int dirfd, const char* path);
+    static FileStamp of(const std::string& path);
+
+    bool exists() const { return error == 0; }
+    /// There is no such file. One that cannot be looked at is neither here nor missing: reading it
+    /// says why.
+    bool isMissing() const;
+
+    /// Appends the stamp as bytes, always as many, for storage: equal stamps have equal bytes.
+    void appendTo(std::string& bytes) const;
+
+    friend bool operator==(const FileStamp& a, const FileStamp& b) {
+        return a.error == b.error && a.facts == b.facts;
+    }
+};
+
+}  // namespace platform

@@ -1,0 +1,57 @@
+#pragma once
+
+#include <sys/stat.h>
+
+#include <cstddef>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "platform/system/Error.h"
+
+namespace platform {
+
+/// Reads a whole regular file of at most `limit` bytes. Errors: the system's; EFBIG for a larger
+/// file, EINVAL for what is not a regular file (nothing is read from a device or a pipe, and
+/// opening never blocks).
+Result<std::string> readFile(const std::string& path, std::size_t limit);
+/// The same, relative to the directory `dirfd` (borrowed).
+Result<std::string> readFileAt(int dirfd, const std::string& name, std::size_t limit);
+/// The same for a file that must lie beneath the directory `dirfd` (borrowed). Errors also: those
+/// of `openBeneath`.
+Result<std::string> readFileBeneath(int dirfd, const std::string& name, std::size_t limit);
+
+/// Replaces the file at `path` by one that holds `bytes`, in one rename, so that whoever opens the
+/// path sees either the old file or the new one, also after a crash: file and directory are synced.
+/// The new file lies in the same directory and has no name until it is whole (on file systems
+/// without such files a random one of its own, which a crash leaves behind); no other file is
+/// touched. A new file gets mode 0600; an existing one keeps its mode. A symbolic link stays, and
+/// the file that it leads to is replaced. None on success. Errors: the system's; EINVAL when
+/// something other than a regular file is there.
+std::optional<Error> writeFileAtomically(const std::string& path, std::string_view bytes);
+
+/// Makes the directory and its missing parents, each with `mode`. An existing directory is fine.
+std::optional<Error> makeDirectories(const std::string& path, mode_t mode);
+
+/// The canonical absolute path of something that exists (symbolic links, "." and ".." resolved).
+/// None when it cannot be resolved, or when the result has `limit` bytes or more.
+std::optional<std::string> canonicalPath(const std::string& path, std::size_t limit = 4096);
+
+/// Whether a name taken from a file may become one component of a path: not empty, no "/" and no
+/// NUL, no leading ".", at most 255 bytes.
+bool isSafeName(std::string_view name);
+
+/// A path beside `path` that nothing has, "<path>.damaged-<number>", to move a damaged file out of
+/// the way. None when there are too many already.
+std::optional<std::string> unusedDamagedName(const std::string& path);
+
+/// `directory` with `name` appended as a path component.
+std::string joinPath(std::string_view directory, std::string_view name);
+
+/// The part of a path after its last "/" (of "/a/b/" it is "b").
+std::string_view lastPathComponent(std::string_view path);
+/// The part of a path before its last component: "/" for one directly under the root, "." for a
+/// lone name.
+std::string_view parentPath(std::string_view path);
+
+}  // namespace platform

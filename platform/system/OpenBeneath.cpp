@@ -1,0 +1,97 @@
+#include "platform/system/OpenBeneath.h"
+
+#include <fcntl.h>
+#include <linux/openat2.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdint>
+#include <string_view>
+#include <utility>
+
+namespace platform {
+
+namespace {
+
+/// How often the kernel is asked again when something on the way was renamed meanwhile: somebody
+/// who does that all the time is answered in the end.
+constexpr int kMostAttempts = 64;
+
+int openResolving(int dirfd, const std::string& path, int flags, std::uint64_t resolve) {
+    open_how how{};
+    how.flags = static_cast<std::uint64_t>(flags | O_CLOEXEC);
+    how.resolve = resolve;
+    for (int attempt = 0;; ++attempt) {
+        const long fd = ::syscall(SYS_openat2, dirfd, path.c_str(), &how, sizeof how);
+        const bool isDisturbed = fd < 0 && (errno == EAGAIN || errno == EINTR);
+        if (!isDisturbed || attempt == kMostAttempts) return static_cast<int>(fd);
+    }
+}
+
+/// Takes the first component off a path.
+std::string nextComponent(std::string_view& rest) {
+    rest.remove_prefix(std::min(rest.find_first_not_of('/'), rest.size()));
+    std::string name(rest.substr(0, rest.find('/')));
+    rest.remove_prefix(name.size());
+    return name;
+}
+
+/// One component at a time, none of which may be a symbolic link or ".." (errno `linkError`). -1,
+/// with errno, on failure.
+int openByComponents(int start, std::string_view rest, int flags, int linkError) {
+    UniqueFd way;  // the directory that was reached, once it is not `start`
+    std::string name = nextComponent(rest);
+    if (name.empty()) name.assign(1, '.');
+    for (;;) {
+        const int directory = way ? way.get() : start;
+        struct stat status {};
+        if (::fstatat(directory, name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0) return -1;
+        if (S_ISLNK(status.st_mode) || name == "..") {
+            errno = linkError;
+            return -1;
+        }
+        std::string next = nextComponent(rest);
+        const int how = next.empty() ? flags : O_PATH | O_DIRECTORY;
+        const int fd = ::openat(directory, name.c_str(), how | O_NOFOLLOW | O_CLOEXEC);
+        if (fd < 0 || next.empty()) return fd;
+        way.reset(fd);
+        name = std::move(next);
+    }
+}
+
+Result<UniqueFd> opened(int fd, const std::string& path) {
+    if (fd < 0) return Error::posix(errno, path);
+    return UniqueFd(fd);
+}
+
+}  // namespace
+
+Result<UniqueFd> openBeneath(int dirfd, const std::string& path, int flags) {
+    if (path.find('\0') != std::string::npos) return Error::posix(EINVAL, path);
+    int fd = openResolving(dirfd, path, flags, RESOLVE_BENEATH | RESOLVE_NO_MAGICLINKS);
+    if (fd < 0 && errno == ENOSYS) {
+        if (path.starts_with('/')) return Error::posix(EXDEV, path);
+        fd = openByComponents(dirfd, path, flags, EXDEV);
+    }
+    return opened(fd, path);
+}
+
+Result<UniqueFd> openWithoutLinks(int dirfd, const std::string& path, int flags) {
+    if (path.find('\0') != std::string::npos) return Error::posix(EINVAL, path);
+    const bool isAbsolute = path.starts_with('/');
+    int fd =
+        openResolving(dirfd, path, flags, RESOLVE_NO_SYMLINKS | (isAbsolute ? 0 : RESOLVE_BENEATH));
+    if (fd < 0 && errno == ENOSYS) {
+        const UniqueFd root(isAbsolute ? ::open("/", O_PATH | O_CLOEXEC) : -1);
+        fd = openByComponents(root ? root.get() : dirfd, path, flags, ELOOP);
+    }
+    return opened(fd, path);
+}
+
+bool leadsOutside(const Error& error) {
+    return error.domain == "POSIX" && (error.code == EXDEV || error.code == ELOOP);
+}
+
+}  // namespace platform

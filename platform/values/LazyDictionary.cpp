@@ -1,0 +1,35 @@
+#include "platform/values/LazyDictionary.h"
+
+#include "platform/values/Cbor.h"
+
+namespace platform {
+
+LazyDictionary::LazyDictionary(Dictionary dictionary) : state_(std::make_shared<State>()) {
+    state_->dictionary = std::move(dictionary);
+}
+
+LazyDictionary::LazyDictionary(EncodedBytes bytes, FaultHandler onFault)
+    : state_(std::make_shared<State>()) {
+    state_->isEncoded = true;
+    state_->bytes = std::move(bytes);
+    state_->onFault = onFault;
+}
+
+const Dictionary& LazyDictionary::get() const {
+    // A finished flag costs a system call to set, which records without bytes need not pay.
+    if (!state_->isEncoded) return state_->dictionary;
+    std::call_once(state_->decoded, [&state = *state_] {
+        auto value = decodeCbor(state.bytes, CborOptions::KeepEncoded);
+        if (!value) {
+            state.onFault(describe(value.error()));
+        } else if (const Dictionary* dictionary = value->dictionary()) {
+            state.dictionary = *dictionary;
+        } else {
+            state.onFault("it holds another kind of value");
+        }
+        state.bytes = {};
+    });
+    return state_->dictionary;
+}
+
+}  // namespace platform
