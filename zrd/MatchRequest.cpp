@@ -58,6 +58,7 @@ void Transaction::matchPlugIns() {
     auto candidates = server().findPlugIns(query.rules).value_or(ZRDPlugInList());
     probes::discoverRaw(static_cast<unsigned int>(candidates.size()));
     MatchResult result(query.flags, candidates.size());
+    std::size_t leftOut = 0;
     for (const auto& plugIn : candidates) {
         if (firstClosedGate(*plugIn, query)) continue;
         std::optional<ZRError> error;
@@ -68,8 +69,10 @@ void Transaction::matchPlugIns() {
         }
         if (!form || !result.admit(*plugIn)) continue;
         addAnnotationForPlugIn(*plugIn, *form);
-        result.append(plugIn, *std::move(form));
+        if (!result.append(plugIn, *std::move(form))) ++leftOut;
     }
+    if (leftOut != 0)
+        EVLOG_ERROR(ops(), "leaving {} plug-ins out of a match that no reply can hold", leftOut);
     result.linkOverrides();
     EVLOG_INFO(ops(), "match returned {} plug-ins", result.size());
     if (auto matches =

@@ -5,6 +5,9 @@
 #include "Zorvan/Helpers.h"
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
+#include "platform/lum/Limits.h"
+#include "platform/values/Cbor.h"
+#include "platform/values/SliceList.h"
 #include "zrd/ZRDPlugIn.h"
 
 namespace zorvan {
@@ -13,6 +16,17 @@ using platform::Dictionary;
 using platform::Value;
 
 namespace {
+
+/// What "overrider" and "overriding" add to a form at the most, and what stands around all forms.
+constexpr std::size_t kMarks = 512;
+constexpr std::size_t kFrame = 4096;
+
+std::size_t encodedSize(const Dictionary& form) {
+    if (const platform::EncodedBytes* kept = form.encoded()) return kept->bytes.size();
+    platform::SliceList slices;
+    platform::encodeCbor(form, slices);
+    return slices.size();
+}
 
 /// How a candidate's version compares with an accepted form's. Versions that are no text count as
 /// missing: a candidate without one compares as equal, a form without one is older than any.
@@ -49,22 +63,27 @@ bool MatchResult::admit(const ZRDPlugIn& plugIn) {
         int order = compareVersions(plugIn.version(), rival.form.find(form::kVersion));
         if ((flags_ & ZRDiscoverVersions) && order != 0) continue;
         rival.displaced = wins(plugIn, rival.form, order);
+        if (rival.displaced) bytes_ -= rival.bytes;
         return rival.displaced;
     }
     return true;
 }
 
-void MatchResult::append(std::shared_ptr<ZRDPlugIn> plugIn, Dictionary form) {
+bool MatchResult::append(std::shared_ptr<ZRDPlugIn> plugIn, Dictionary form) {
+    const std::size_t bytes = encodedSize(form) + kMarks;
+    if (bytes_ + bytes > platform::lum::kMaxReplyPayload - kFrame) return false;
+    bytes_ += bytes;
     std::size_t index = accepted_.size();
     place_->push_back(index);
     const Value* replaced = plugIn->replaced();
-    accepted_.push_back({std::move(plugIn), std::move(form)});
-    if (!replaced) return;
+    accepted_.push_back({std::move(plugIn), std::move(form), bytes});
+    if (!replaced) return true;
     if (replaced->string()) replacers_[*replaced->string()] = index;
-    if (!replaced->array()) return;
+    if (!replaced->array()) return true;
     for (const Value& element : *replaced->array()) {
         if (element.string()) replacers_[*element.string()] = index;
     }
+    return true;
 }
 
 void MatchResult::linkOverrides() {

@@ -26,8 +26,9 @@ class MatchResult {
     /// Whether the plug-in wins against the accepted forms of its identifier; the form that it
     /// beats is taken out.
     bool admit(const ZRDPlugIn& plugIn);
-    /// Accepts the form of the plug-in that was admitted last.
-    void append(std::shared_ptr<ZRDPlugIn> plugIn, platform::Dictionary form);
+    /// Accepts the form of the plug-in that was admitted last, unless one reply cannot hold it with
+    /// the others: then the answer is false.
+    bool append(std::shared_ptr<ZRDPlugIn> plugIn, platform::Dictionary form);
     /// Sets "overrider" on the form of each replaced plug-in and "overriding" on its replacer's.
     void linkOverrides();
 
@@ -40,6 +41,7 @@ class MatchResult {
     struct Accepted {
         std::shared_ptr<ZRDPlugIn> plugIn;
         platform::Dictionary form;
+        std::size_t bytes = 0;  // that the form takes in a reply
         bool displaced = false;
     };
     using Indexes = std::vector<std::size_t>;  // of `accepted_`
@@ -49,6 +51,7 @@ class MatchResult {
 
     std::uint64_t flags_;
     std::vector<Accepted> accepted_;
+    std::size_t bytes_ = 0;  // of the accepted forms that were not displaced
     std::unordered_map<std::string_view, Indexes> byIdentifier_;  // keys of accepted plug-ins
     Indexes* place_ = nullptr;  // of the plug-in that was admitted last
     /// Who replaces an identifier. It stays so when it is displaced itself.

@@ -11,6 +11,7 @@ class Consent;
 class Launcher;
 class Sandbox;
 class Types;
+class Workspace;
 }  // namespace platform
 
 namespace zorvan {
@@ -34,6 +35,7 @@ struct PlugInContext {
     std::shared_ptr<platform::Sandbox> sandbox;
     std::shared_ptr<platform::Consent> consent;
     std::shared_ptr<platform::Types> types;
+    std::shared_ptr<platform::Workspace> workspace;
 };
 
 }  // namespace zorvan

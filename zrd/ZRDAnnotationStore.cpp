@@ -96,6 +96,7 @@ std::string ZRDAnnotationStore::defaultDatabaseURL(const platform::Directories& 
 std::optional<ZRError> ZRDAnnotationStore::loadDb() {
     std::optional<ZRError> error;
     text_.allChanged();
+    platform::removeLeftovers(annotationsURL_);
     auto root = platform::readPropertyListFile(annotationsURL_, AnnotationText::kMaxSize);
     if (!root) {
         error = zrError(root.error());

@@ -13,6 +13,7 @@
 #include "platform/services/Consent.h"
 #include "platform/spawnerd/Launcher.h"
 #include "platform/system/Files.h"
+#include "platform/tandry/Workspace.h"
 #include "zrd/HostProcess.h"
 #include "zrd/PlugInContext.h"
 #include "zrd/ZRDPlugIn.h"
@@ -104,14 +105,20 @@ std::optional<ZRError> ZRDPlugIn::enableForClient(const HostProcess& host) const
     EVLOG_DEBUG(ops(), "activation overlay={}", overlay);
     const platform::ExternalService service{*executable, bundleDirectory(),
                                             tdproxy_->dataContainerPath.value_or("")};
+    const ZRError unable = ZRErrorWithFormat(
+        kZRErrorInvalidRequest, "unable to enable plug-in {}({})", identifier(), uuid().string());
+    if (const auto error = context_->workspace->restoreContainer(*tdproxy_)) {
+        EVLOG_ERROR(ops(), "cannot restore the data container of plug-in {}({}): {}", identifier(),
+                    pub(uuid()), pub(*error));
+        return unable;
+    }
     const auto token = host.auditToken();
     int failure = token ? context_->launcher->addExternalService(*token, service, overlay) : ESRCH;
     if (failure == 0) return std::nullopt;
     EVLOG_ERROR(ops(),
                 "spawnerd error {} trying to allow {} {} to use plug-in {}({}) uuid={} at {}",
                 failure, host.pid(), host.path(), identifier(), version(), pub(uuid()), path());
-    return ZRErrorWithFormat(kZRErrorInvalidRequest, "unable to enable plug-in {}({})",
-                             identifier(), uuid().string());
+    return unable;
 }
 
 Dictionary ZRDPlugIn::issueResourceExtensions(const Value& resources) const {

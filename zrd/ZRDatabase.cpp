@@ -23,7 +23,8 @@ bool ZRDatabase::initWithDatabase(const std::optional<std::string>& path,
                                                              .assertions = services_.assertions,
                                                              .sandbox = services_.sandbox,
                                                              .consent = services_.consent,
-                                                             .types = services_.types});
+                                                             .types = services_.types,
+                                                             .workspace = services_.workspace});
     observation_ = services_.workspace->addObserver(*this);
     return true;
 }

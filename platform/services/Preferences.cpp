@@ -36,8 +36,9 @@ std::string Preferences::path(const std::string& domain) const {
 }
 
 void Preferences::synchronize(const std::string& domain) {
-    const auto known = domains_.try_emplace(domain, path(domain), "preferences").first;
+    const auto [known, isNew] = domains_.try_emplace(domain, path(domain), "preferences");
     DictionaryFile& file = known->second;
+    if (isNew) removeLeftovers(file.path());
     // What was known stays in force while the file cannot be read.
     static_cast<void>(file.update(FileStamp::of(file.path())));
 }

@@ -26,6 +26,7 @@ FileIdentity FileIdentity::at(int dirfd, const char* path) {
 }
 
 void FileIdentity::appendTo(std::string& bytes) const {
+    static_assert(sizeof(Stored) == kStoredSize);
     const Stored stored{device, inode};
     bytes.append(reinterpret_cast<const char*>(stored.data()), sizeof stored);
 }

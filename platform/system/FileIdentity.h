@@ -2,6 +2,7 @@
 
 #include <sys/types.h>
 
+#include <cstddef>
 #include <string>
 #include <string_view>
 
@@ -20,7 +21,9 @@ struct FileIdentity {
     /// relative path starts at the directory `dirfd` (borrowed, or AT_FDCWD).
     static FileIdentity at(int dirfd, const char* path);
 
-    /// Appends it as bytes, always as many, for storage.
+    /// Bytes of a stored identity.
+    static constexpr std::size_t kStoredSize = 16;
+    /// Appends it as bytes for storage.
     void appendTo(std::string& bytes) const;
     /// Reads what `appendTo` wrote from the beginning of the bytes; all 0 when they are too few.
     static FileIdentity from(std::string_view bytes);

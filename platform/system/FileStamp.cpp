@@ -3,9 +3,12 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdlib>
+#include <cstring>
 #include <ctime>
+#include <span>
 
 namespace platform {
 
@@ -13,6 +16,11 @@ namespace {
 
 /// Two ticks of the slowest clock that kernels stamp files by.
 constexpr std::int64_t kSettlingTime = 20'000'000;
+
+// Places among the facts: between them lie size and time of modification.
+constexpr std::size_t kInode = 1;
+constexpr std::size_t kChangeSeconds = 5;
+constexpr std::size_t kChangeNanoseconds = 6;
 
 std::int64_t nanoseconds(const timespec& time) {
     return time.tv_sec * std::int64_t{1'000'000'000} + time.tv_nsec;
@@ -37,7 +45,8 @@ FileStamp FileStamp::of(int dirfd, const char* path) {
     timespec now;
     ::clock_gettime(CLOCK_REALTIME, &now);
     // The time of the last change, which no writer can set back as it can that of the content.
-    const std::int64_t age = nanoseconds(now) - nanoseconds(status.st_ctim);
+    stamp.lookedAt = nanoseconds(now);
+    const std::int64_t age = stamp.lookedAt - nanoseconds(status.st_ctim);
     stamp.settled = std::abs(age) >= kSettlingTime;
     return stamp;
 }
@@ -51,8 +60,29 @@ bool FileStamp::isMissing() const {
 }
 
 void FileStamp::appendTo(std::string& bytes) const {
-    bytes.append(reinterpret_cast<const char*>(facts.data()), sizeof facts);
+    static_assert(sizeof facts + sizeof error == kStoredSize);
+    auto stored = facts;
+    // No file was changed a negative number of nanoseconds after a second began.
+    if (!settled) stored[kChangeNanoseconds] = -lookedAt;
+    bytes.append(reinterpret_cast<const char*>(stored.data()), sizeof stored);
     bytes.append(reinterpret_cast<const char*>(&error), sizeof error);
+}
+
+FileStamp FileStamp::from(std::string_view bytes) {
+    FileStamp stamp;
+    stamp.error = EINVAL;
+    if (bytes.size() < kStoredSize) return stamp;
+    std::memcpy(stamp.facts.data(), bytes.data(), sizeof stamp.facts);
+    std::memcpy(&stamp.error, bytes.data() + sizeof stamp.facts, sizeof stamp.error);
+    stamp.settled = stamp.facts[kChangeNanoseconds] >= 0;
+    return stamp;
+}
+
+bool FileStamp::isLike(const FileStamp& other) const {
+    const auto lasting = [](const FileStamp& stamp) {
+        return std::span(stamp.facts).subspan(kInode, kChangeSeconds - kInode);
+    };
+    return error == other.error && std::ranges::equal(lasting(*this), lasting(other));
 }
 
 }  // namespace platform

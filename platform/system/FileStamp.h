@@ -3,6 +3,7 @@
 #include <array>
 #include <cstdint>
 #include <string>
+#include <string_view>
 
 namespace platform {
 
@@ -16,6 +17,7 @@ struct FileStamp {
     /// False for a file that was changed within the last clock ticks: it may be changed again
     /// without another stamp. Such a stamp must not be remembered for what is read after it.
     bool settled = true;
+    std::int64_t lookedAt = 0;  // when it was taken, in nanoseconds since 1970
 
     /// The stamp that a file has now; symbolic links are followed. A relative path starts at the
     /// directory `dirfd` (borrowed, or AT_FDCWD).
@@ -27,8 +29,18 @@ struct FileStamp {
     /// says why.
     bool isMissing() const;
 
-    /// Appends the stamp as bytes, always as many, for storage: equal stamps have equal bytes.
+    /// Bytes of a stored stamp.
+    static constexpr std::size_t kStoredSize = 64;
+    /// Appends the stamp as bytes for storage. Equal stamps have equal bytes, but what is not
+    /// settled has bytes like no other: it vouches for nothing that is read.
     void appendTo(std::string& bytes) const;
+    /// Reads what `appendTo` wrote from the beginning of the bytes; too few are an error.
+    static FileStamp from(std::string_view bytes);
+
+    /// Whether the stamps may be of one file with one content: they differ by device and time of
+    /// change at the most. New links, another mode and numbers that a start of the machine gave
+    /// out anew leave a file like that.
+    bool isLike(const FileStamp& other) const;
 
     friend bool operator==(const FileStamp& a, const FileStamp& b) {
         return a.error == b.error && a.facts == b.facts;

@@ -1,6 +1,8 @@
 #include "platform/system/Files.h"
 
+#include <dirent.h>
 #include <fcntl.h>
+#include <sys/file.h>
 #include <sys/random.h>
 #include <unistd.h>
 
@@ -21,6 +23,7 @@ namespace {
 constexpr std::size_t kMaxName = 255;
 constexpr int kMaxLinks = 40;
 constexpr int kMaxTemporaryNames = 100;
+constexpr std::size_t kRandomDigits = 16;
 constexpr int kMaxDamagedNames = 100;
 
 /// Paths come from messages: one with a NUL would be cut short by the kernel.
@@ -73,11 +76,21 @@ Result<std::string> followLinks(std::string path) {
     return Error::posix(ELOOP, path);
 }
 
-/// A file without a name until it is whole, so that a crash leaves nothing behind; where the file
-/// system has no such files, one under a temporary name until it is renamed or given up.
+/// What the names of temporary files begin with that are to become the file of a name. Both parts
+/// are short whatever the name is.
+std::string temporaryPrefix(std::string_view name) {
+    std::uint64_t digest = 14695981039346656037u;  // FNV-1a
+    for (const char c : name) digest = (digest ^ static_cast<unsigned char>(c)) * 1099511628211u;
+    return fmt::format(".zorvan-{:016x}-", digest);
+}
+
+/// A file without a name until it is whole; where the file system has no such files, and for the
+/// moment before it is renamed, one under a temporary name. It is locked as long as it is in use,
+/// so that what a crash leaves behind is told from it.
 class TemporaryFile {
   public:
-    explicit TemporaryFile(int dirfd) : dirfd_(dirfd) {}
+    TemporaryFile(int dirfd, std::string_view target)
+        : dirfd_(dirfd), prefix_(temporaryPrefix(target)) {}
     TemporaryFile(const TemporaryFile&) = delete;
     ~TemporaryFile() {
         if (!name_.empty()) ::unlinkat(dirfd_, name_.c_str(), 0);
@@ -88,11 +101,13 @@ class TemporaryFile {
         constexpr int kFlags = O_WRONLY | O_CLOEXEC;
         constexpr mode_t kMode = S_IRUSR | S_IWUSR;
         fd_.reset(::openat(dirfd_, ".", kFlags | O_TMPFILE, kMode));
-        if (fd_) return 0;
-        return takeName([this](const char* name) {
+        const int failure = fd_ ? 0 : takeName([this](const char* name) {
             fd_.reset(::openat(dirfd_, name, kFlags | O_CREAT | O_EXCL, kMode));
             return static_cast<bool>(fd_);
         });
+        // Where there are no locks, leftovers stay.
+        if (!failure) ::flock(fd_.get(), LOCK_EX | LOCK_NB);
+        return failure;
     }
 
     int setMode(mode_t mode) { return ::fchmod(fd_.get(), mode) == 0 ? 0 : errno; }
@@ -127,7 +142,7 @@ class TemporaryFile {
         for (int i = 0; i < kMaxTemporaryNames; ++i) {
             std::uint64_t random = 0;
             if (::getrandom(&random, sizeof random, 0) != sizeof random) return errno;
-            std::string name = fmt::format(".tmp-{:016x}", random);
+            std::string name = fmt::format("{}{:016x}", prefix_, random);
             if (use(name.c_str())) {
                 name_ = std::move(name);
                 return 0;
@@ -138,6 +153,7 @@ class TemporaryFile {
     }
 
     int dirfd_;
+    std::string prefix_;
     std::string name_;  // while it has one
     UniqueFd fd_;
 };
@@ -148,7 +164,7 @@ int replaceIn(int dirfd, const char* name, std::string_view bytes) {
     if (!exists && errno != ENOENT) return errno;
     if (exists && !S_ISREG(existing.st_mode)) return EINVAL;
 
-    TemporaryFile file(dirfd);
+    TemporaryFile file(dirfd, name);
     int failure = file.create();
     if (!failure && exists) failure = file.setMode(existing.st_mode & 07777);
     if (!failure) failure = file.write(bytes);
@@ -156,6 +172,14 @@ int replaceIn(int dirfd, const char* name, std::string_view bytes) {
     // The rename itself is durable only once the directory is.
     if (!failure && ::fsync(dirfd) != 0) failure = errno;
     return failure;
+}
+
+/// Whether a file bears a temporary name, is this user's own, and nobody is writing it.
+bool isLeftover(int dirfd, const char* name) {
+    const UniqueFd fd(::openat(dirfd, name, kReading | O_NOFOLLOW));
+    struct stat status {};
+    return fd && ::fstat(fd.get(), &status) == 0 && S_ISREG(status.st_mode) &&
+           status.st_uid == ::geteuid() && ::flock(fd.get(), LOCK_EX | LOCK_NB) == 0;
 }
 
 std::string_view withoutTrailingSlashes(std::string_view path) {
@@ -195,6 +219,22 @@ std::optional<Error> writeFileAtomically(const std::string& path, std::string_vi
     if (int failure = replaceIn(dirfd.get(), name.c_str(), bytes))
         return Error::posix(failure, path);
     return std::nullopt;
+}
+
+void removeLeftovers(const std::string& path) {
+    const auto target = followLinks(path);
+    if (hasNul(path) || !target) return;
+    const std::unique_ptr<DIR, int (*)(DIR*)> folder(
+        ::opendir(std::string(parentPath(*target)).c_str()), &::closedir);
+    if (!folder) return;
+    const std::string prefix = temporaryPrefix(lastPathComponent(*target));
+    const int dirfd = ::dirfd(folder.get());
+    while (const dirent* entry = ::readdir(folder.get())) {
+        const std::string_view name = entry->d_name;
+        if (name.size() == prefix.size() + kRandomDigits && name.starts_with(prefix) &&
+            isLeftover(dirfd, entry->d_name))
+            ::unlinkat(dirfd, entry->d_name, 0);
+    }
 }
 
 std::optional<Error> makeDirectories(const std::string& path, mode_t mode) {

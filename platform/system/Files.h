@@ -24,11 +24,16 @@ Result<std::string> readFileBeneath(int dirfd, const std::string& name, std::siz
 /// Replaces the file at `path` by one that holds `bytes`, in one rename, so that whoever opens the
 /// path sees either the old file or the new one, also after a crash: file and directory are synced.
 /// The new file lies in the same directory and has no name until it is whole (on file systems
-/// without such files a random one of its own, which a crash leaves behind); no other file is
-/// touched. A new file gets mode 0600; an existing one keeps its mode. A symbolic link stays, and
-/// the file that it leads to is replaced. None on success. Errors: the system's; EINVAL when
-/// something other than a regular file is there.
+/// without such files one of its own, see `removeLeftovers`); no other file is touched. A new file
+/// gets mode 0600; an existing one keeps its mode. A symbolic link stays, and the file that it
+/// leads to is replaced. None on success. Errors: the system's; EINVAL when something other than a
+/// regular file is there.
 std::optional<Error> writeFileAtomically(const std::string& path, std::string_view bytes);
+
+/// Removes what writing this very file has left beside it when it was interrupted by a crash.
+/// Nobody else's files are touched: such a file bears a name of ours that follows from the name at
+/// `path`, belongs to this user, and is locked while somebody writes it.
+void removeLeftovers(const std::string& path);
 
 /// Makes the directory and its missing parents, each with `mode`. An existing directory is fine.
 std::optional<Error> makeDirectories(const std::string& path, mode_t mode);

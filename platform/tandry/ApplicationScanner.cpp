@@ -17,6 +17,8 @@ namespace {
 
 constexpr std::string_view kApplicationSuffix = ".app";
 constexpr std::string_view kPlugIns = "PlugIns";
+/// The domain of refusals for want of room.
+constexpr const char* kRoom = "Room";
 
 Date now() {
     using Seconds = std::chrono::duration<double>;
@@ -71,7 +73,9 @@ void ApplicationScanner::begin(bool overEverything) {
     reader_.beginPass();
     watch_.beginWalk(overEverything);
     untrusted_.beginWalk();
+    containers_.beginWalk();
     complaints_.beginWalk();
+    room_.count(state_);
     if (overEverything) links_.clear();
 }
 
@@ -253,6 +257,12 @@ TDApplicationProxyRef ApplicationScanner::applicationAt(const std::string& path)
     BundleReader::ApplicationReading reading = reader_.readApplication(folder);
     // What cannot be read just now is not known to have changed.
     if (reading.failure && noteTransient(*reading.failure) && entry.record) return entry.record;
+    if (entry.record && *entry.record == *reading.record &&
+        reader_.areApplicationStampsLike(entry.stamps, reading.stamps)) {
+        entry.stamps = std::move(reading.stamps);
+        changes_.restamped.insert(path);
+        return entry.record;
+    }
     if (reading.failure && !reading.record->isPlaceholder)
         complaints_.add(path, fmt::format("application without name and identifier: {}",
                                           reading.failure->text));
@@ -283,30 +293,30 @@ bool ApplicationScanner::isUntrusted(const std::string& path, const char* kind) 
     complaints_.add(path, fmt::format("leaving out {}: {}", kind, reason));
     if (changes_.refusal.empty()) changes_.refusal = reason;
     forEachWithin(state_.plugIns, path, [this](auto entry) {
+        room_.remove(entry->second);
         changes_.uninstalled.push_back(entry->second.record);
         state_.plugIns.erase(entry);
     });
     return true;
 }
 
+/// Nothing is left of a forgotten bundle that its content could be compared with.
 bool ApplicationScanner::isForgotten(const BundleFolder& folder) {
     auto found = state_.forgotten.find(folder.path);
-    if (found == state_.forgotten.end() || !reader_.isUnchanged(folder, found->second.print))
-        return false;
+    if (found == state_.forgotten.end()) return false;
+    const Fingerprint& print = found->second.print;
+    if (!reader_.isLike(reader_.refreshed(folder, print), print)) return false;
     found->second.pass = pass_;
     return true;
 }
 
-bool ApplicationScanner::isRefused(const BundleFolder& folder) {
+bool ApplicationScanner::isRefused(const BundleFolder& folder, const std::string& application) {
     auto found = state_.refusals.find(folder.path);
     if (found == state_.refusals.end()) return false;
     Refusal& refusal = found->second;
     if (refusal.pass == pass_) return true;
-    if (!reader_.isUnchanged(folder, refusal.print)) {
-        state_.refusals.erase(found);
-        changes_.refusals.insert(folder.path);
-        return false;
-    }
+    if (!reader_.isUnchanged(folder, refusal.print)) return false;
+    if (refusal.size != 0 && !room_.excess(application, refusal.size)) return false;
     // Remembered from an earlier run: its author has to be told in this one as well.
     if (std::exchange(refusal.pass, pass_) == 0)
         EVLOG_ERROR(ops(), "leaving out a plug-in: {}", pub(refusal.reason));
@@ -314,13 +324,42 @@ bool ApplicationScanner::isRefused(const BundleFolder& folder) {
     return true;
 }
 
-/// Whether a record that did not change has its container: one from the catalogue is given it. A
-/// published one has lost it when its application was away and another one took its place.
-bool ApplicationScanner::keepsContainer(PlugInEntry& entry) {
-    if (!entry.needsContainer) return true;
-    TDPlugInProxy& record = *entry.record;
-    if (entry.pass == 0) record.dataContainerPath = containers_.locate(record, true);
-    return !record.dataContainerPath || containers_.isOwn(record);
+/// Meets a plug-in that did not change. Its container may have: when something came into its place
+/// or went, and when its application was away and another one took it over. Then another record
+/// says so; one that nobody has seen yet is completed.
+void ApplicationScanner::keep(PlugInEntry& entry) {
+    const bool isShared = std::exchange(entry.pass, pass_) != 0;
+    if (!entry.needsContainer) return;
+    const auto container = containers_.locate(*entry.record, true);
+    if (!container) return static_cast<void>(noteTransient(container.error()));
+    if (*container == entry.record->dataContainerPath) return;
+    if (isShared) replace(entry);
+    entry.record->dataContainerPath = *container;
+}
+
+/// Puts a copy, which nobody has seen, in the place of a record.
+void ApplicationScanner::replace(PlugInEntry& entry) {
+    changes_.uninstalled.push_back(entry.record);
+    entry.record = std::make_shared<TDPlugInProxy>(*entry.record);
+    entry.record->plugInUuid = Uuid::random();
+    changes_.installed.push_back(entry.record);
+}
+
+/// Whether what was read anew is what is known, so that at most stamps have changed. A record that
+/// nobody has seen yet takes over the number that its device has now.
+bool ApplicationScanner::isSame(PlugInEntry& known, const PlugInEntry& read) {
+    TDPlugInProxy& record = *known.record;
+    const FileIdentity& identity = read.record->bundleIdentity;
+    const bool isSame = *known.dictionaries == *read.dictionaries &&
+                        known.infoPlistSize == read.infoPlistSize && known.points == read.points &&
+                        record.localizedName == read.record->localizedName &&
+                        record.localizedShortName == read.record->localizedShortName &&
+                        (known.pass == 0 || record.bundleIdentity == identity) &&
+                        (known.print.executableDigest.empty() ||
+                         known.print.executableDigest == read.print.executableDigest) &&
+                        reader_.isLike(known.print, read.print);
+    if (isSame && known.pass == 0) record.bundleIdentity = identity;
+    return isSame;
 }
 
 void ApplicationScanner::visitPlugIn(const BundleFolder& folder,
@@ -329,60 +368,91 @@ void ApplicationScanner::visitPlugIn(const BundleFolder& folder,
     if (isUntrusted(folder.path, "a plug-in")) return;
     watch_.markContents(folder.path, scope);
     auto found = state_.plugIns.find(folder.path);
-    if (found != state_.plugIns.end()) {
-        PlugInEntry& entry = found->second;
-        if (entry.pass == pass_) {
-            ++metPlugIns_;
-            return;
-        }
-        if (entry.record->containingApplication == application &&
-            reader_.isUnchanged(folder, entry.print) && keepsContainer(entry)) {
-            entry.pass = pass_;
-            ++metPlugIns_;
-            return;
-        }
+    PlugInEntry* known = found == state_.plugIns.end() ? nullptr : &found->second;
+    if (known && known->pass == pass_) return static_cast<void>(++metPlugIns_);
+    const bool isInPlace =
+        known && known->record->containingApplication == application && !isBeyondRoom(*known);
+    if (isInPlace && reader_.isUnchanged(folder, known->print)) {
+        ++metPlugIns_;
+        return keep(*known);
     }
-    if (isForgotten(folder) || isRefused(folder)) return;
-    BundleReader::Reading reading = reader_.readPlugIn(folder);
+    if (isForgotten(folder)) return;
+    if (isRefused(folder, application ? application->bundlePath : std::string())) return;
+    const bool hasDigest = known && !known->print.executableDigest.empty();
+    BundleReader::Reading reading = reader_.readPlugIn(folder, hasDigest);
     // One that cannot be read is not known to have changed.
     if (reading.refusal && reading.refusal->domain == "POSIX")
         unreachable_.push_back(folder.path);
     else if (state_.forgotten.erase(folder.path))
         changes_.forgotten.insert(folder.path);
-    if (reading.refusal)
-        refuse(folder, std::move(reading));
-    else
-        install(folder, std::move(reading.entry), application);
+    if (reading.refusal) return refuse(folder, std::move(reading));
+    if (!isInPlace || !isSame(*known, reading.entry))
+        return install(folder, std::move(reading), application);
+    known->print = std::move(reading.entry.print);
+    changes_.restamped.insert(folder.path);
+    ++metPlugIns_;
+    keep(*known);
+}
+
+/// Whether a record of the catalogue takes more room than there is.
+bool ApplicationScanner::isBeyondRoom(const PlugInEntry& entry) const {
+    return entry.pass == 0 && room_.excess(DictionaryRoom::applicationOf(*entry.record), 0);
 }
 
 void ApplicationScanner::refuse(const BundleFolder& folder, BundleReader::Reading reading) {
     const Error& error = *reading.refusal;
-    complaints_.add(folder.path, fmt::format("leaving out a plug-in: {}", error.text));
     if (changes_.refusal.empty()) changes_.refusal = error.text;
+    const std::string complaint = fmt::format("leaving out a plug-in: {}", error.text);
     if (error.domain == "POSIX") {
+        complaints_.add(folder.path, complaint);
         auto known = state_.plugIns.find(folder.path);
-        if (noteTransient(error) && known != state_.plugIns.end()) known->second.pass = pass_;
+        if (noteTransient(error) && known != state_.plugIns.end()) keep(known->second);
         return;
     }
-    state_.refusals[folder.path] = {std::move(reading.entry.print), error.text, pass_};
+    Refusal& refusal = state_.refusals[folder.path];
+    // Read again, and the same: that has been told.
+    if (refusal.pass == 0 || refusal.reason != error.text ||
+        !reader_.isLike(refusal.print, reading.entry.print))
+        complaints_.add(folder.path, complaint);
+    const std::size_t size = reading.entry.dictionaries ? reading.entry.dictionaries->size() : 0;
+    refusal = {std::move(reading.entry.print), error.text, error.domain == kRoom ? size : 0, pass_};
     changes_.refusals.insert(folder.path);
 }
 
-void ApplicationScanner::install(const BundleFolder& folder, PlugInEntry entry,
+void ApplicationScanner::install(const BundleFolder& folder, BundleReader::Reading reading,
                                  const TDApplicationProxyRef& application) {
+    PlugInEntry& entry = reading.entry;
     TDPlugInProxy& record = *entry.record;
     record.plugInUuid = Uuid::random();
     record.registrationDate = now();
     record.containingApplication = application;
-    auto [place, isNew] = state_.plugIns.try_emplace(folder.path);
+    auto known = state_.plugIns.find(folder.path);
+    const bool isNew = known == state_.plugIns.end();
     const bool isRemembered =
-        !isNew && place->second.record->plugInIdentifier == record.plugInIdentifier;
-    if (entry.needsContainer) record.dataContainerPath = containers_.locate(record, isRemembered);
+        !isNew && known->second.record->plugInIdentifier == record.plugInIdentifier;
+    if (!isNew) {
+        room_.remove(known->second);
+        changes_.uninstalled.push_back(known->second.record);
+        state_.plugIns.erase(known);
+    }
+    if (const char* excess =
+            room_.excess(DictionaryRoom::applicationOf(record), entry.dictionaries->size())) {
+        reading.refusal = Error{kRoom, 0, fmt::format("{}: {}", folder.path, excess)};
+        return refuse(folder, std::move(reading));
+    }
+    if (state_.refusals.erase(folder.path)) changes_.refusals.insert(folder.path);
+    room_.add(entry);
+    if (entry.needsContainer) {
+        const auto container = containers_.locate(record, isRemembered);
+        if (container)
+            record.dataContainerPath = *container;
+        else
+            noteTransient(container.error());
+    }
     entry.pass = pass_;
     ++metPlugIns_;
     changes_.installed.push_back(entry.record);
-    if (!isNew) changes_.uninstalled.push_back(place->second.record);
-    place->second = std::move(entry);
+    state_.plugIns.emplace(folder.path, std::move(entry));
 }
 
 bool ApplicationScanner::isAllMet(const std::string& scope) {
@@ -424,6 +494,10 @@ void ApplicationScanner::dropUnmet(const std::string& scope) {
 RegistryChanges ApplicationScanner::finish(const Scopes& scopes) {
     if (!isIncomplete_)
         for (const std::string& scope : scopes) dropUnmet(scope);
+    else
+        // What the first walk could not reach is there all the same, and is to be seen now.
+        for (auto& [path, entry] : state_.plugIns)
+            if (entry.pass == 0) keep(entry);
     watch_.endWalk();
     containers_.saveOwners();
     return std::exchange(changes_, {});

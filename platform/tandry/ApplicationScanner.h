@@ -6,6 +6,7 @@
 #include "platform/tandry/BundleReader.h"
 #include "platform/tandry/Complaints.h"
 #include "platform/tandry/DataContainers.h"
+#include "platform/tandry/DictionaryRoom.h"
 #include "platform/tandry/FolderWatch.h"
 #include "platform/tandry/RegistryState.h"
 #include "platform/tandry/UntrustedPlaces.h"
@@ -61,13 +62,16 @@ class ApplicationScanner {
     bool isUntrusted(const std::string& path, const char* kind);
     void refuse(const BundleFolder& folder, BundleReader::Reading reading);
     bool noteTransient(const Error& error);
-    void install(const BundleFolder& folder, PlugInEntry entry,
+    void install(const BundleFolder& folder, BundleReader::Reading reading,
                  const TDApplicationProxyRef& application);
     TDApplicationProxyRef applicationAt(const std::string& path);
     TDApplicationProxyRef applicationOf(const std::string& plugInPath);
-    bool keepsContainer(PlugInEntry& entry);
+    void keep(PlugInEntry& entry);
+    void replace(PlugInEntry& entry);
+    bool isSame(PlugInEntry& known, const PlugInEntry& read);
+    bool isBeyondRoom(const PlugInEntry& entry) const;
     bool isForgotten(const BundleFolder& folder);
-    bool isRefused(const BundleFolder& folder);
+    bool isRefused(const BundleFolder& folder, const std::string& application);
     bool isAllMet(const std::string& scope);
     bool isSelfContained(const std::string& scope) const;
     bool isOutdated(const std::string& application) const;
@@ -88,6 +92,7 @@ class ApplicationScanner {
     // Of the walk under way:
     Pass pass_ = 0;
     RegistryChanges changes_;
+    DictionaryRoom room_;
     std::size_t metPlugIns_ = 0;            // good ones that were looked at
     bool isIncomplete_ = false;             // what was not met may be there all the same
     bool hasTransientFailure_ = false;      // something failed that says nothing about the disk

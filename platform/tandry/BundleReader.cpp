@@ -2,7 +2,9 @@
 
 #include <fcntl.h>
 #include <fmt/format.h>
+#include <openssl/evp.h>
 
+#include <algorithm>
 #include <cerrno>
 
 #include "platform/log/OpsLog.h"
@@ -77,6 +79,18 @@ Result<Dictionary> readDictionary(const BundleFolder& folder, const char* name) 
     if (!dictionary) return malformed(file, "not a dictionary");
     if (auto error = excess(file, *dictionary)) return *error;
     return *dictionary;
+}
+
+/// A digest of what a file holds; empty when it cannot be read, or is too large for that.
+std::string digestOf(const BundleFolder& folder, const std::string& file) {
+    const Result<std::string> bytes = readFileBeneath(folder.dirfd, file, kMaxDigested);
+    std::string digest(EVP_MAX_MD_SIZE, '\0');
+    unsigned size = 0;
+    if (bytes)
+        EVP_Digest(bytes->data(), bytes->size(), reinterpret_cast<unsigned char*>(digest.data()),
+                   &size, EVP_sha256(), nullptr);
+    digest.resize(size);
+    return digest;
 }
 
 bool isMissing(const Error& error) {
@@ -170,7 +184,9 @@ BundleFolder BundleFolder::reachedBy(int directory) const {
 
 BundleReader::BundleReader(SdkDictionaries& sdks, SdkMerge merge,
                            std::vector<std::string> languages)
-    : sdks_(sdks), merge_(std::move(merge)), languages_(std::move(languages)) {}
+    : sdks_(sdks), merge_(std::move(merge)), languages_(std::move(languages)) {
+    for (const std::string& language : languages_) languageText_.append(language).push_back('\0');
+}
 
 void BundleReader::beginPass() {
     sdkStamps_.clear();
@@ -186,8 +202,39 @@ bool BundleReader::appendStamp(const BundleFolder& folder, std::string_view file
 
 /// Names from the file depend on the user's languages as well.
 void BundleReader::appendLocalizedStamp(const BundleFolder& folder, std::string& stamps) {
-    if (!appendStamp(folder, kLocalized, stamps)) return;
-    for (const std::string& language : languages_) stamps.append(language).push_back('\0');
+    if (appendStamp(folder, kLocalized, stamps)) stamps += languageText_;
+}
+
+/// Compares stamps, of which the last of the first `stampsToLocalized` is Localized.plist's.
+bool BundleReader::areLike(std::string_view a, std::string_view b, int stampsToLocalized) const {
+    if (a.size() != b.size()) return false;
+    for (int number = 1; !a.empty(); ++number) {
+        const FileStamp stamp = FileStamp::from(a);
+        if (a.size() < FileStamp::kStoredSize || !stamp.isLike(FileStamp::from(b))) return false;
+        a.remove_prefix(FileStamp::kStoredSize);
+        b.remove_prefix(FileStamp::kStoredSize);
+        if (number != stampsToLocalized || !stamp.exists()) continue;
+        if (!a.starts_with(languageText_) || !b.starts_with(languageText_)) return false;
+        a.remove_prefix(languageText_.size());
+        b.remove_prefix(languageText_.size());
+    }
+    return true;
+}
+
+bool BundleReader::isLike(const Fingerprint& a, const Fingerprint& b) const {
+    constexpr int kStampsToLocalized = 3;
+    const auto filesOf = [](const Fingerprint& print) {
+        return std::string_view(print.stamps)
+            .substr(std::min(print.stamps.size(), FileIdentity::kStoredSize));
+    };
+    return a.executable == b.executable && a.sdk == b.sdk &&
+           a.directory().inode == b.directory().inode &&
+           areLike(filesOf(a), filesOf(b), kStampsToLocalized);
+}
+
+bool BundleReader::areApplicationStampsLike(std::string_view a, std::string_view b) const {
+    constexpr int kStampsToLocalized = 2;
+    return areLike(a, b, kStampsToLocalized);
 }
 
 void BundleReader::appendFixedStamps(const BundleFolder& folder, std::string& stamps) {
@@ -222,7 +269,7 @@ Fingerprint BundleReader::refreshed(const BundleFolder& folder, Fingerprint prin
     return print;
 }
 
-BundleReader::Reading BundleReader::readPlugIn(const BundleFolder& place) {
+BundleReader::Reading BundleReader::readPlugIn(const BundleFolder& place, bool withDigest) {
     Reading reading;
     reading.entry.record = std::make_shared<TDPlugInProxy>();
     const Result<UniqueFd> directory = openDirectory(place);
@@ -233,7 +280,7 @@ BundleReader::Reading BundleReader::readPlugIn(const BundleFolder& place) {
     const BundleFolder folder = place.reachedBy(directory->get());
     // Stamps are older than what is read, so a change in between is seen by the next walk.
     appendFixedStamps(folder, reading.entry.print.stamps);
-    reading.refusal = fill(folder, reading.entry);
+    reading.refusal = fill(folder, reading.entry, withDigest);
     return reading;
 }
 
@@ -271,7 +318,8 @@ Result<Dictionary> BundleReader::localizations(const BundleFolder& folder) {
     return Dictionary();
 }
 
-std::optional<Error> BundleReader::fill(const BundleFolder& folder, PlugInEntry& entry) {
+std::optional<Error> BundleReader::fill(const BundleFolder& folder, PlugInEntry& entry,
+                                        bool withDigest) {
     const std::string file = joinPath(folder.path, kInfoPlist);
     Result<Dictionary> read = readDictionary(folder, kInfoPlist);
     if (!read) return read.error();
@@ -284,7 +332,11 @@ std::optional<Error> BundleReader::fill(const BundleFolder& folder, PlugInEntry&
     if (executable) entry.print.executable = *executable;
     const std::string* sdk = stringAt(*extension, kPointIdentifier);
     if (sdk && isSafeName(*sdk)) entry.print.sdk = *sdk;
+    const std::size_t fixedSize = entry.print.stamps.size();
     appendNamedStamps(folder, entry.print, entry.print.stamps);
+    if (executable &&
+        (withDigest || !FileStamp::from(entry.print.stamps.substr(fixedSize)).settled))
+        entry.print.executableDigest = digestOf(folder, *executable);
 
     if (std::optional<Error> error = complete(info, entry.print.sdk))
         return Error{error->domain, error->code, fmt::format("{}: {}", file, error->text)};

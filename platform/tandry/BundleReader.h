@@ -18,6 +18,8 @@ inline constexpr std::size_t kMaxBundleFile = 1u << 20;
 inline constexpr std::size_t kMaxBundleValues = 16384;
 /// Most bytes of a plug-in's encoded dictionaries: Info.plist and entitlements.
 inline constexpr std::size_t kMaxRecordSize = 512u << 10;
+/// Largest executable that is read where its stamp says too little.
+inline constexpr std::size_t kMaxDigested = 64u << 20;
 
 /// Where a bundle lies: its canonical path, and how its files are reached with few look-ups.
 struct BundleFolder {
@@ -52,14 +54,20 @@ class BundleReader {
 
     /// Whether the bundle's files still have the stamps of `print`.
     bool isUnchanged(const BundleFolder& folder, const Fingerprint& print);
+    /// Whether two fingerprints may be of one bundle with one content: see `FileStamp::isLike`.
+    /// Reading it tells, but for the executable, of which at most a digest is known.
+    bool isLike(const Fingerprint& a, const Fingerprint& b) const;
     /// `print` with the stamps that the bundle's files have now.
     Fingerprint refreshed(const BundleFolder& folder, Fingerprint print);
 
     /// Reads a plug-in bundle: an Info.plist with a "VXExtension" dictionary and an identifier.
-    Reading readPlugIn(const BundleFolder& place);
+    /// `withDigest` says that the executable is read in any case.
+    Reading readPlugIn(const BundleFolder& place, bool withDigest = false);
 
     /// The stamps of the files that go into an application's record.
     std::string applicationStamps(const BundleFolder& folder);
+    /// As `isLike`, for those of an application.
+    bool areApplicationStampsLike(std::string_view a, std::string_view b) const;
     struct ApplicationReading {
         TDApplicationProxyRef record;
         std::string stamps;  // empty after a failure that may pass, so that it is read again
@@ -76,8 +84,9 @@ class BundleReader {
     void appendFixedStamps(const BundleFolder& folder, std::string& stamps);
     void appendNamedStamps(const BundleFolder& folder, const Fingerprint& print,
                            std::string& stamps);
+    bool areLike(std::string_view a, std::string_view b, int stampsToLocalized) const;
     const std::string& sdkStamps(const std::string& sdk);
-    std::optional<Error> fill(const BundleFolder& folder, PlugInEntry& entry);
+    std::optional<Error> fill(const BundleFolder& folder, PlugInEntry& entry, bool withDigest);
     std::optional<Error> encode(const BundleFolder& folder, const Dictionary& info,
                                 PlugInEntry& entry);
     std::optional<Error> describePlugIn(const BundleFolder& folder, const Dictionary& info,
@@ -88,6 +97,7 @@ class BundleReader {
     SdkDictionaries& sdks_;
     SdkMerge merge_;
     std::vector<std::string> languages_;
+    std::string languageText_;  // each ended by a NUL
     std::map<std::string, std::string> sdkStamps_;
     std::string scratch_;
 };

@@ -46,10 +46,7 @@ void addDirectories(RegistryState& state) {
         FileIdentity::at(AT_FDCWD, path.c_str()).appendTo(stamps);
         print.stamps.insert(0, stamps);
     };
-    for (auto& [path, entry] : state.plugIns) {
-        add(path, entry.print);
-        entry.record->bundleIdentity = entry.print.directory();
-    }
+    for (auto& [path, entry] : state.plugIns) add(path, entry.print);
     for (auto& [path, forgotten] : state.forgotten) add(path, forgotten.print);
     for (auto& [path, refusal] : state.refusals) add(path, refusal.print);
 }
@@ -91,13 +88,7 @@ RegistryState Catalogue::load() {
         state = {};
         error = openDatabase();
     }
-    if (!error) {
-        if (version_ == CatalogueTables::kVersionWithoutDirectories) {
-            addDirectories(state);
-            isStale_ = true;
-        }
-        return state;
-    }
+    if (!error) return state;
     EVLOG_ERROR(ops(), "working without the catalogue {}: {}", pub(path_), pub(*error));
     database_.close();
     isStale_ = hasUnreadLists_ = true;
@@ -121,9 +112,8 @@ std::optional<Error> Catalogue::prepareDatabase() {
     Result<std::int64_t> tables = database_.integer("SELECT count(*) FROM sqlite_master");
     if (!tables) return tables.error();
     const bool isNew = *version == 0 && *tables == 0;
-    version_ = isNew ? CatalogueTables::kVersion : *version;
-    if (version_ != CatalogueTables::kVersion &&
-        version_ != CatalogueTables::kVersionWithoutDirectories)
+    if (!isNew && (*version < CatalogueTables::kVersionWithoutDirectories ||
+                   *version > CatalogueTables::kVersion))
         return Error{"SQLite", SQLITE_CORRUPT,
                      fmt::format("version {} instead of {}", *version, CatalogueTables::kVersion)};
     // Rows of a few KiB waste little of pages of this size. What was confirmed must be there after
@@ -132,11 +122,37 @@ std::optional<Error> Catalogue::prepareDatabase() {
                                    "PRAGMA synchronous = FULL;"
                                    "PRAGMA journal_size_limit = 1048576;"))
         return error;
-    if (!isNew) return std::nullopt;
-    if (auto error = database_.run("BEGIN")) return error;
-    if (auto error = CatalogueTables(database_).create()) return error;
-    if (auto error = writeVersion()) return error;
-    return database_.run("COMMIT");
+    if (!isNew) return upgrade(*version);
+    return inTransaction([this] {
+        const std::optional<Error> error = CatalogueTables(database_).create();
+        return error ? error : writeVersion();
+    });
+}
+
+/// Brings the file to this version, or leaves it as it is.
+std::optional<Error> Catalogue::upgrade(std::int64_t version) {
+    if (version == CatalogueTables::kVersion) return std::nullopt;
+    return inTransaction([&]() -> std::optional<Error> {
+        CatalogueTables tables(database_);
+        if (auto error = tables.addColumns()) return error;
+        if (version <= CatalogueTables::kVersionWithoutDirectories) {
+            RegistryState state;
+            if (auto error = tables.read(state, isStale_)) return error;
+            addDirectories(state);
+            if (auto error = tables.clear(true)) return error;
+            if (auto error = tables.write(state, everythingOf(state))) return error;
+        }
+        return writeVersion();
+    });
+}
+
+std::optional<Error> Catalogue::inTransaction(const std::function<std::optional<Error>()>& work) {
+    if (auto error = database_.run("BEGIN IMMEDIATE")) return error;
+    std::optional<Error> error = work();
+    if (!error) error = database_.run("COMMIT");
+    // The second failure would only repeat the first.
+    if (error) static_cast<void>(database_.run("ROLLBACK"));
+    return error;
 }
 
 std::optional<Error> Catalogue::writeVersion() {
@@ -179,6 +195,7 @@ bool Catalogue::setAside(const Error& reason) {
 }
 
 std::optional<Error> Catalogue::save(const RegistryState& state, const RegistryChanges& changes) {
+    leaveLostFile();
     if (!isStale_ && !changes.records() && !changes.lists()) return std::nullopt;
     std::optional<Error> error = store(state, changes);
     if (error && isDamage(*error) && setAside(*error)) error = store(state, changes);
@@ -188,19 +205,24 @@ std::optional<Error> Catalogue::save(const RegistryState& state, const RegistryC
 }
 
 std::optional<Error> Catalogue::store(const RegistryState& state, const RegistryChanges& changes) {
-    std::optional<Error> error;
-    if (!database_) error = openDatabase();
-    if (!error) error = database_.run("BEGIN IMMEDIATE");
-    if (error) return error;
-    error = isStale_ ? writeAll(state) : CatalogueTables(database_).write(state, changes);
-    // Lists that could not be read yet are as they were.
-    const bool isUpgraded = version_ != CatalogueTables::kVersion && !hasUnreadLists_;
-    if (!error && isUpgraded) error = writeVersion();
-    if (!error) error = database_.run("COMMIT");
-    if (!error && isUpgraded) version_ = CatalogueTables::kVersion;
-    // The second failure would only repeat the first.
-    if (error) static_cast<void>(database_.run("ROLLBACK"));
-    return error;
+    if (!database_)
+        if (auto error = openDatabase()) return error;
+    return inTransaction([&] {
+        return isStale_ ? writeAll(state) : CatalogueTables(database_).write(state, changes);
+    });
+}
+
+/// What is written to a file without a name is gone with the daemon.
+void Catalogue::leaveLostFile() {
+    if (!database_ || !database_.hasMoved()) return;
+    database_.close();
+    isStale_ = true;
+    hasUnreadLists_ = false;
+    struct stat status;
+    if (::lstat(path_.c_str(), &status) == 0)
+        setAside({"SQLite", SQLITE_READONLY, "it was put in the place of the one in use"});
+    else
+        EVLOG_ERROR(ops(), "the catalogue {} is gone, and is written anew", pub(path_));
 }
 
 /// What could not be read of registrations and removals is not known to be gone: it stays, and

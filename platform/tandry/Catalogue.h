@@ -1,5 +1,6 @@
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -13,6 +14,9 @@ namespace platform::tandry {
 
 /// The registry's state on disk: a cache of what the bundles say, and the home of the UUIDs and of
 /// what was registered or forgotten by path. Belongs to the registry's thread once made.
+///
+/// A file that is deleted or exchanged while it is open is noticed by the next save, which goes to
+/// a new one with all that the state holds; what was put in its place is set aside.
 ///
 /// Without a usable file the registry goes on in memory, and each save tries again. Every failure
 /// is logged here.
@@ -37,7 +41,10 @@ class Catalogue {
     std::optional<Error> takeLock();
     std::optional<Error> openDatabase();
     std::optional<Error> prepareDatabase();
+    std::optional<Error> upgrade(std::int64_t version);
+    std::optional<Error> inTransaction(const std::function<std::optional<Error>()>& work);
     std::optional<Error> writeVersion();
+    void leaveLostFile();
     std::optional<Error> store(const RegistryState& state, const RegistryChanges& changes);
     std::optional<Error> writeAll(const RegistryState& state);
     bool isDamage(const Error& error) const;
@@ -46,7 +53,6 @@ class Catalogue {
     std::string directory_;
     std::string path_;
     UniqueFd lock_;                // none when it could not be made
-    std::int64_t version_ = 0;     // of the file's tables
     SqliteDatabase database_;      // none while the registry works in memory alone
     bool isStale_ = false;         // the file differs from the state by more than the next changes
     bool hasUnreadLists_ = false;  // the file may hold registrations that the state lacks

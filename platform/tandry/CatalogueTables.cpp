@@ -18,7 +18,8 @@ CREATE TABLE plugins(
     info_plist_size INTEGER, dictionaries BLOB, sum BLOB);
 CREATE TABLE registrations(path TEXT PRIMARY KEY);
 CREATE TABLE forgotten(path TEXT PRIMARY KEY, executable TEXT, sdk TEXT, stamps BLOB);
-CREATE TABLE refusals(path TEXT PRIMARY KEY, executable TEXT, sdk TEXT, stamps BLOB, reason TEXT);
+CREATE TABLE refusals(
+    path TEXT PRIMARY KEY, executable TEXT, sdk TEXT, stamps BLOB, reason TEXT, size INTEGER);
 )";
 
 Error damage(std::string text) {
@@ -71,6 +72,10 @@ std::optional<PlugInEntry> plugInOf(const SqliteStatement& row, const RegistrySt
 
 std::optional<Error> CatalogueTables::create() {
     return database_.run(kSchema);
+}
+
+std::optional<Error> CatalogueTables::addColumns() {
+    return execute("ALTER TABLE refusals ADD COLUMN size INTEGER");
 }
 
 std::optional<Error> CatalogueTables::read(RegistryState& state, bool& leftOut) {
@@ -126,10 +131,11 @@ std::optional<Error> CatalogueTables::readLists(RegistryState& state) {
         state.forgotten[forgotten.text(0)] = {
             {forgotten.text(1), forgotten.text(2), forgotten.text(3)}};
     SqliteStatement refusal(database_,
-                            "SELECT path, executable, sdk, stamps, reason FROM refusals");
+                            "SELECT path, executable, sdk, stamps, reason, size FROM refusals");
     while (refusal.next())
         state.refusals[refusal.text(0)] = {{refusal.text(1), refusal.text(2), refusal.text(3)},
-                                           refusal.text(4)};
+                                           refusal.text(4),
+                                           static_cast<std::size_t>(refusal.integer(5))};
     for (const SqliteStatement* statement : {&registration, &forgotten, &refusal})
         if (statement->error()) return statement->error();
     return std::nullopt;
@@ -170,16 +176,21 @@ std::optional<Error> CatalogueTables::writeApplications(const RegistryState& sta
     SqliteStatement put(database_,
                         "INSERT OR REPLACE INTO applications VALUES(?1, ?2, ?3, ?4, ?5,"
                         " checksum(?1, ?2, ?3, ?4, ?5))");
+    const auto write = [&](const std::string& path, const ApplicationEntry& entry) {
+        const TDApplicationProxy& record = *entry.record;
+        put.execute({path, record.bundleIdentifier, record.localizedName,
+                     std::int64_t{record.isPlaceholder}, blob(entry.stamps)});
+    };
     for (const std::string& path : changes.applications) {
         auto found = state.applications.find(path);
-        if (found == state.applications.end()) {
+        if (found == state.applications.end())
             remove.execute({path});
-            continue;
-        }
-        const TDApplicationProxy& record = *found->second.record;
-        put.execute({path, record.bundleIdentifier, record.localizedName,
-                     std::int64_t{record.isPlaceholder}, blob(found->second.stamps)});
+        else
+            write(path, found->second);
     }
+    for (const std::string& path : changes.restamped)
+        if (auto found = state.applications.find(path); found != state.applications.end())
+            write(path, found->second);
     return remove.error() ? remove.error() : put.error();
 }
 
@@ -193,8 +204,10 @@ std::optional<Error> CatalogueTables::writePlugIns(const RegistryState& state,
                         "INSERT OR REPLACE INTO plugins VALUES(?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9,"
                         " ?10, ?11, ?12, ?13, ?14, ?15, ?16, ?17, checksum(?1, ?2, ?3, ?4, ?5, ?6,"
                         " ?7, ?8, ?9, ?10, ?11, ?12, ?13, ?14, ?15, ?16, ?17))");
-    for (const TDPlugInProxyRef& plugIn : changes.installed) {
-        auto found = state.plugIns.find(*plugIn->bundlePath);
+    std::set<std::string> paths = changes.restamped;
+    for (const TDPlugInProxyRef& plugIn : changes.installed) paths.insert(*plugIn->bundlePath);
+    for (const std::string& path : paths) {
+        auto found = state.plugIns.find(path);
         if (found == state.plugIns.end()) continue;
         const PlugInEntry& entry = found->second;
         const TDPlugInProxy& record = *entry.record;
@@ -239,7 +252,7 @@ std::optional<Error> CatalogueTables::writeForgotten(const RegistryState& state,
 std::optional<Error> CatalogueTables::writeRefusals(const RegistryState& state,
                                                     const RegistryChanges& changes) {
     SqliteStatement remove(database_, "DELETE FROM refusals WHERE path = ?");
-    SqliteStatement put(database_, "INSERT OR REPLACE INTO refusals VALUES(?, ?, ?, ?, ?)");
+    SqliteStatement put(database_, "INSERT OR REPLACE INTO refusals VALUES(?, ?, ?, ?, ?, ?)");
     for (const std::string& path : changes.refusals) {
         auto found = state.refusals.find(path);
         if (found == state.refusals.end()) {
@@ -248,7 +261,7 @@ std::optional<Error> CatalogueTables::writeRefusals(const RegistryState& state,
         }
         const Refusal& refusal = found->second;
         put.execute({path, refusal.print.executable, refusal.print.sdk, blob(refusal.print.stamps),
-                     refusal.reason});
+                     refusal.reason, static_cast<std::int64_t>(refusal.size)});
     }
     return remove.error() ? remove.error() : put.error();
 }

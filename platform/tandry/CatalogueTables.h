@@ -12,14 +12,18 @@ namespace platform::tandry {
 /// Errors are the database's; SQLITE_CORRUPT also for a row whose digest does not fit.
 class CatalogueTables {
   public:
-    static constexpr int kVersion = 2;
-    /// The same tables, but for the identities of directories, which fingerprints lack.
+    static constexpr int kVersion = 3;
+    /// The same tables, but for the sizes of refused plug-ins.
+    static constexpr int kVersionWithoutSizes = 2;
+    /// Fingerprints lack the identities of directories as well.
     static constexpr int kVersionWithoutDirectories = 1;
 
     explicit CatalogueTables(SqliteDatabase& database) : database_(database) {}
 
     /// Makes the tables in an empty database.
     std::optional<Error> create();
+    /// Gives the tables of an earlier version all columns.
+    std::optional<Error> addColumns();
 
     /// Adds what is stored to an empty state. Rows that do not fit the others are left out, and
     /// `leftOut` becomes true: their bundles want reading again.

@@ -59,6 +59,7 @@ const Dictionary* dictionaryAt(const Dictionary& dictionary, const char* key) {
 
 std::optional<Error> ContainerOwners::load() {
     if (isLoaded_) return std::nullopt;
+    removeLeftovers(file_);
     if (std::optional<Error> error = read()) {
         if (error->domain == "POSIX") return error;
         owners_.clear();
@@ -187,14 +188,6 @@ std::string ContainerOwners::unownedName(const ContainerClaim& claim, Owners& ow
     }
     for (int number = 0;; ++number)
         if (std::string name = ownName(claim, number); ownerOf(name) == owners.end()) return name;
-}
-
-bool ContainerOwners::isOwner(const std::string& identifier, const std::string& place,
-                              const std::string& name) const {
-    const auto owners = owners_.find(identifier);
-    if (owners == owners_.end()) return false;
-    const auto owner = owners->second.find(place);
-    return owner != owners->second.end() && owner->second.container == name;
 }
 
 void ContainerOwners::save() {

@@ -50,8 +50,6 @@ class ContainerOwners {
 
     /// The name of the claimant's container. Only when loaded.
     std::string nameFor(const ContainerClaim& claim, const Exists& exists);
-    bool isOwner(const std::string& identifier, const std::string& place,
-                 const std::string& name) const;
 
     /// Stores what has changed, if anything has. A failure is told once, and the next call tries
     /// again.

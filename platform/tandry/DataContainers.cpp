@@ -1,6 +1,5 @@
 #include "platform/tandry/DataContainers.h"
 
-#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -8,7 +7,6 @@
 #include <utility>
 
 #include "platform/log/OpsLog.h"
-#include "platform/system/Error.h"
 #include "platform/system/Files.h"
 
 namespace platform::tandry {
@@ -16,102 +14,121 @@ namespace platform::tandry {
 namespace {
 
 constexpr mode_t kPrivate = 0700;
+constexpr const char* kTemporary = "tmp";
 
 const std::string& placeOf(const TDPlugInProxy& plugIn) {
     return plugIn.containingApplication ? plugIn.containingApplication->bundlePath
                                         : *plugIn.bundlePath;
 }
 
+/// Why what lies at a path cannot be a container, as an errno; 0 when it can.
+int faultOf(const std::string& path) {
+    struct stat status;
+    if (::lstat(path.c_str(), &status) != 0) return errno;
+    if (!S_ISDIR(status.st_mode)) return ENOTDIR;
+    return status.st_uid == ::geteuid() ? 0 : EPERM;
+}
+
+/// Whatever the plug-in has put there is its own business.
+bool hasTemporary(const std::string& path) {
+    struct stat status;
+    return ::lstat(joinPath(path, kTemporary).c_str(), &status) == 0 || errno != ENOENT;
+}
+
 }  // namespace
+
+std::optional<Error> makeContainer(const std::string& path) {
+    int fault = faultOf(path);
+    if (fault == 0 && hasTemporary(path)) return std::nullopt;
+    if (fault == ENOENT) {
+        if (auto error = makeDirectories(std::string(parentPath(path)), kPrivate)) return error;
+        fault = ::mkdir(path.c_str(), kPrivate) == 0 || errno == EEXIST ? faultOf(path) : errno;
+    }
+    if (fault == 0 && ::mkdir(joinPath(path, kTemporary).c_str(), kPrivate) != 0 && errno != EEXIST)
+        fault = errno;
+    return fault == 0 ? std::nullopt : std::optional(Error::posix(fault, path));
+}
 
 DataContainers::DataContainers(const std::string& dataFolder)
     : root_(joinPath(dataFolder, "Containers")),
       owners_(joinPath(dataFolder, "ContainerOwners.plist")) {}
 
-bool DataContainers::open() {
-    if (folder_) return true;
-    std::optional<Error> error = makeDirectories(root_, kPrivate);
-    if (!error) {
-        folder_.reset(::open(root_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-        if (!folder_) error = Error::posix(errno, root_);
-    }
-    if (!error) error = owners_.load();
-    if (error) folder_.reset();
-    std::string problem = error ? describe(*error) : std::string();
-    // Once for all plug-ins.
-    if (error && problem != problem_) EVLOG_ERROR(ops(), "no data containers: {}", pub(problem));
-    problem_ = std::move(problem);
-    return bool(folder_);
-}
-
-/// Logs why there is no container.
-void DataContainers::refuse(const std::string& name, int errnum) {
-    EVLOG_ERROR(ops(), "no data container: {}", pub(Error::posix(errnum, joinPath(root_, name))));
-}
-
-DataContainers::State DataContainers::stateOf(const std::string& name) {
+void DataContainers::beginWalk() {
     struct stat status;
-    if (::fstatat(folder_.get(), name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0) {
-        if (errno == ENOENT) return State::Missing;
-        refuse(name, errno);
-        return State::Impossible;
-    }
-    if (!S_ISDIR(status.st_mode) || status.st_uid != ::geteuid()) {
-        EVLOG_ERROR(ops(), "{} is not a directory of this user, so no data container",
-                    pub(joinPath(root_, name)));
-        return State::Impossible;
-    }
-    // A directory inside counts as a link; a file system that does not count them says 1.
-    return status.st_nlink > 2 ? State::Whole : State::Missing;
+    const bool isNoDirectory = ::stat(root_.c_str(), &status) == 0 && !S_ISDIR(status.st_mode);
+    fail(isNoDirectory ? Error::posix(ENOTDIR, root_) : owners_.load());
 }
 
-std::optional<std::string> DataContainers::locate(const TDPlugInProxy& plugIn, bool isRemembered) {
-    if (!open()) return std::nullopt;
+/// None is given in this walk, which is told once for all plug-ins.
+void DataContainers::fail(std::optional<Error> failure) {
+    failure_ = std::move(failure);
+    complain(root_, failure_ ? "no data containers: " + describe(*failure_) : std::string());
+}
+
+/// Logs what is wrong at a path, unless that is known; nothing is wrong when `problem` is empty.
+void DataContainers::complain(const std::string& path, const std::string& problem) {
+    if (problem.empty()) {
+        told_.erase(path);
+        return;
+    }
+    std::string& told = told_[path];
+    if (told != problem) EVLOG_ERROR(ops(), "{}", pub(problem));
+    told = problem;
+}
+
+Result<DataContainers::State> DataContainers::stateOf(const std::string& path) {
+    const int fault = faultOf(path);
+    if (fault == 0 && hasTemporary(path)) {
+        told_.erase(path);
+        return State::Whole;
+    }
+    if (fault == 0 || fault == ENOENT) return State::Missing;
+    const Error error = Error::posix(fault, path);
+    if (isTransient(error)) return error;
+    const bool isForeign = fault == ENOTDIR || fault == EPERM;
+    complain(path, isForeign ? path + " is not a directory of this user, so no data container"
+                             : "no data container: " + describe(error));
+    return State::Impossible;
+}
+
+Result<std::optional<std::string>> DataContainers::locate(const TDPlugInProxy& plugIn,
+                                                          bool isRemembered) {
+    std::optional<std::string> none;
+    if (failure_ && isTransient(*failure_)) return *failure_;
+    if (failure_) return none;
     ContainerClaim claim{*plugIn.plugInIdentifier, placeOf(plugIn), std::nullopt, isRemembered};
     if (const auto& application = plugIn.containingApplication)
         claim.application = application->bundleIdentifier;
     const std::string name = owners_.nameFor(claim, [this](const std::string& container) {
-        struct stat status;
-        return ::fstatat(folder_.get(), container.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 ||
-               errno != ENOENT;
+        return faultOf(joinPath(root_, container)) != ENOENT;
     });
-    const State state = stateOf(name);
-    if (state == State::Impossible) return std::nullopt;
-    if (state == State::Missing) {
-        if (canMake_)
-            missing_.insert(name);
-        else if (!(canMake_ = make(name)))
-            return std::nullopt;
+    std::string path = joinPath(root_, name);
+    const Result<State> state = stateOf(path);
+    if (!state) return state.error();
+    if (*state == State::Impossible) return none;
+    if (*state == State::Whole) return std::optional(std::move(path));
+    if (canMake_) {
+        missing_.insert(path);
+        return std::optional(std::move(path));
     }
-    return joinPath(root_, name);
+    if (std::optional<Error> error = makeDirectories(root_, kPrivate)) {
+        fail(std::move(error));
+        return locate(plugIn, isRemembered);
+    }
+    canMake_ = make(path);
+    return canMake_ ? std::optional(std::move(path)) : none;
 }
 
-bool DataContainers::isOwn(const TDPlugInProxy& plugIn) const {
-    return owners_.isOwner(*plugIn.plugInIdentifier, placeOf(plugIn),
-                           std::string(lastPathComponent(*plugIn.dataContainerPath)));
-}
-
-bool DataContainers::make(const std::string& name) {
-    int made = ::mkdirat(folder_.get(), name.c_str(), kPrivate);
-    if (made != 0 && errno == ENOENT) {
-        // Somebody has removed the root.
-        folder_.reset();
-        if (!open()) return false;
-        made = ::mkdirat(folder_.get(), name.c_str(), kPrivate);
-    }
-    const bool isThere = made != 0 && errno == EEXIST;
-    if (isThere && stateOf(name) == State::Impossible) return false;
-    if ((made == 0 || isThere) &&
-        (::mkdirat(folder_.get(), (name + "/tmp").c_str(), kPrivate) == 0 || errno == EEXIST))
-        return true;
-    refuse(name, errno);
-    return false;
+bool DataContainers::make(const std::string& path) {
+    const std::optional<Error> error = makeContainer(path);
+    complain(path, error ? "no data container: " + describe(*error) : std::string());
+    return !error;
 }
 
 std::set<std::string> DataContainers::makeMissing() {
     std::set<std::string> failed;
-    for (const std::string& name : std::exchange(missing_, {}))
-        if (!make(name)) failed.insert(joinPath(root_, name));
+    for (const std::string& path : std::exchange(missing_, {}))
+        if (!make(path)) failed.insert(path);
     canMake_ = false;
     return failed;
 }

@@ -65,6 +65,9 @@ class DiskWorkspace final : public Workspace {
                                         Requester requester) override;
     std::optional<Error> unregisterPlugIn(const std::string& bundlePath,
                                           Requester requester) override;
+    std::optional<Error> restoreContainer(const TDPlugInProxy& plugIn) override {
+        return plugIn.dataContainerPath ? makeContainer(*plugIn.dataContainerPath) : std::nullopt;
+    }
     void clearSchemaCaches() override { sdks_.clear(); }
 
   private:
@@ -76,15 +79,17 @@ class DiskWorkspace final : public Workspace {
 
     void firstScan();
     void rescan(const Scopes& touched);
-    void publish(RegistryChanges& changes);
-    void publishSnapshot(const RegistryChanges& changes);
-    void withdrawContainers(const std::set<std::string>& paths, RegistryChanges& changes);
+    void publish(const RegistryChanges& changes);
+    void withdraw(const TDPlugInProxyList& plugIns);
+    void announceGoing(const TDPlugInProxyList& plugIns);
+    bool lacksRoom() const;
+    void makeContainers();
     std::optional<Error> registerOnQueue(const std::string& bundlePath);
     std::optional<Error> unregisterOnQueue(const std::string& bundlePath);
     void dropApplications(const std::string& path, RegistryChanges& changes);
     bool dropRegistrations(const std::string& path, RegistryChanges& changes);
     bool forgetWithin(const std::string& path, RegistryChanges& changes);
-    std::optional<Error> apply(RegistryChanges& changes);
+    std::optional<Error> apply(const RegistryChanges& changes);
 
     SdkDictionaries& sdks_;
     CurrentSnapshot current_;
@@ -161,6 +166,7 @@ void DiskWorkspace::activate() {
 void DiskWorkspace::firstScan() {
     queue_.assertCurrent();
     if (closing_ || std::exchange(isScanned_, true)) return;
+    containers_.beginWalk();
     // Filled in place: the scanner refers to the state.
     state_ = catalogue_->load();
     // Marking every directory takes time, and lookups wait: it is left to a second walk, which
@@ -182,51 +188,74 @@ void DiskWorkspace::rescan(const Scopes& touched) {
     queue_.assertCurrent();
     if (closing_) return;
     RegistryChanges changes = scanner_.scanTouched(touched);
-    if (!changes.records() && !changes.lists()) return gatherer_->walkEnded(scanner_.isComplete());
-    static_cast<void>(apply(changes));
+    if (changes.records() || changes.lists()) return static_cast<void>(apply(changes));
+    gatherer_->walkEnded(scanner_.isComplete());
+    makeContainers();
 }
 
-void DiskWorkspace::publish(RegistryChanges& changes) {
-    publishSnapshot(changes);
-    const std::set<std::string> impossible = containers_.makeMissing();
-    if (impossible.empty()) return;
-    withdrawContainers(impossible, changes);
-    publishSnapshot(changes);
-}
-
-void DiskWorkspace::publishSnapshot(const RegistryChanges& changes) {
+/// Lookups see the state; nobody has seen anything before the first time.
+void DiskWorkspace::publish(const RegistryChanges& changes) {
     published_ = published_ ? std::make_shared<const Snapshot>(*published_, state_, changes)
                             : std::make_shared<const Snapshot>(state_);
     current_.publish(published_);
 }
 
-/// Records that were published are what they are: others take their places.
-void DiskWorkspace::withdrawContainers(const std::set<std::string>& paths,
-                                       RegistryChanges& changes) {
+/// Takes records out of what lookups see, and tells observers.
+void DiskWorkspace::withdraw(const TDPlugInProxyList& plugIns) {
+    if (plugIns.empty()) return;
+    RegistryChanges changes;
+    changes.uninstalled = plugIns;
+    published_ = std::make_shared<const Snapshot>(*published_, RegistryState(), changes);
+    current_.publish(published_);
+    announceGoing(plugIns);
+}
+
+void DiskWorkspace::announceGoing(const TDPlugInProxyList& plugIns) {
+    if (plugIns.empty()) return;
+    for (WorkspaceObserver* observer : observers_) observer->pluginsWillUninstall(plugIns);
+}
+
+bool DiskWorkspace::lacksRoom() const {
+    return std::ranges::any_of(state_.refusals,
+                               [](const auto& entry) { return entry.second.size != 0; });
+}
+
+/// Makes the containers that the last walk found missing. Where that fails, records that say so
+/// take the places of those that were published.
+void DiskWorkspace::makeContainers() {
+    const std::set<std::string> impossible = containers_.makeMissing();
+    if (impossible.empty()) return;
+    RegistryChanges changes;
     for (auto& [path, entry] : state_.plugIns) {
         const TDPlugInProxyRef before = entry.record;
-        if (!before->dataContainerPath || !paths.contains(*before->dataContainerPath)) continue;
+        if (!before->dataContainerPath || !impossible.contains(*before->dataContainerPath))
+            continue;
         entry.record = std::make_shared<TDPlugInProxy>(*before);
         entry.record->plugInUuid = Uuid::random();
         entry.record->dataContainerPath.reset();
-        std::erase(changes.installed, before);
         changes.uninstalled.push_back(before);
         changes.installed.push_back(entry.record);
     }
+    static_cast<void>(apply(changes));
 }
 
-/// The record that goes is hidden before its observers hear of it, so that what they drop is not
-/// built again; the catalogue changes after them. The error says why it did not.
-std::optional<Error> DiskWorkspace::apply(RegistryChanges& changes) {
-    gatherer_->walkEnded(scanner_.isComplete());
-    if (changes.records()) publish(changes);
-    if (!changes.uninstalled.empty())
-        for (WorkspaceObserver* observer : observers_)
-            observer->pluginsWillUninstall(changes.uninstalled);
+/// What goes is hidden before its observers hear of it, so that what they drop is not built again;
+/// the catalogue changes after them. What comes is stored before anybody sees it, so that it is
+/// there after a crash as well. Before the first time nobody can have seen what goes, and
+/// observers, who may look up, come last. The error says why nothing was stored.
+std::optional<Error> DiskWorkspace::apply(const RegistryChanges& changes) {
+    // What had no room may find it where something went.
+    const bool mayFit = !changes.uninstalled.empty() && lacksRoom();
+    gatherer_->walkEnded(scanner_.isComplete() && !mayFit);
+    const bool isFirst = !published_;
+    if (!isFirst) withdraw(changes.uninstalled);
     std::optional<Error> error = catalogue_->save(state_, changes);
+    if (changes.records()) publish(changes);
+    if (isFirst) announceGoing(changes.uninstalled);
     if (!changes.installed.empty())
         for (WorkspaceObserver* observer : observers_)
             observer->pluginsDidInstall(changes.installed);
+    makeContainers();
     return error;
 }
 

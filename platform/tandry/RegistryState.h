@@ -12,7 +12,7 @@
 
 namespace platform::tandry {
 
-/// Number of a walk over the disk; 0 stands for "not met by any yet".
+/// Number of a walk over the disk; 0 stands for "known from the catalogue, before any walk".
 using Pass = std::uint32_t;
 
 /// What tells whether a plug-in bundle has changed: which directory it is, the stamps of every file
@@ -21,13 +21,15 @@ struct Fingerprint {
     std::string executable;  // "QFBundleExecutable"; empty when there is none
     std::string sdk;         // its extension point, when SDK dictionaries are looked up for it
     std::string stamps;      // the directory's identity first
+    /// Of the executable's content, while its stamp was not settled when it was read.
+    std::string executableDigest{};
 
     FileIdentity directory() const { return FileIdentity::from(stamps); }
 };
 
 /// One registered plug-in.
 struct PlugInEntry {
-    /// Shared with readers, and so immutable, once a walk has met it (`pass` is not 0).
+    /// Shared with readers, and so immutable, after the first walk (`pass` is not 0).
     std::shared_ptr<TDPlugInProxy> record;
     Fingerprint print;
     /// The texts by which rules can name its extension point, each ended by a NUL.
@@ -53,6 +55,7 @@ struct ApplicationEntry {
 struct Refusal {
     Fingerprint print;
     std::string reason;
+    std::size_t size = 0;  // of its encoded dictionaries, when nothing else kept it out
     Pass pass = 0;
 };
 
@@ -79,12 +82,17 @@ struct RegistryChanges {
     std::set<std::string> registrations;
     std::set<std::string> forgotten;
     std::set<std::string> refusals;
+    std::set<std::string> restamped;  // applications and plug-ins whose records stay
     std::string refusal;  // why the first bundle that was refused or not read was, if any was
 
     bool records() const {
         return !installed.empty() || !uninstalled.empty() || !applications.empty();
     }
-    bool lists() const { return !registrations.empty() || !forgotten.empty() || !refusals.empty(); }
+    /// Whether anything differs that no record shows.
+    bool lists() const {
+        return !registrations.empty() || !forgotten.empty() || !refusals.empty() ||
+               !restamped.empty();
+    }
 };
 
 inline bool isOnSystemPartition(std::string_view path) {

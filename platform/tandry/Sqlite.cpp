@@ -95,6 +95,12 @@ Result<SqliteDatabase> SqliteDatabase::open(const std::string& path) {
     return database;
 }
 
+bool SqliteDatabase::hasMoved() const {
+    int moved = 0;
+    const int code = sqlite3_file_control(handle_.get(), nullptr, SQLITE_FCNTL_HAS_MOVED, &moved);
+    return code == SQLITE_OK && moved != 0;
+}
+
 Error SqliteDatabase::lastError() const {
     return errorOf(handle_.get(), sqlite3_errcode(handle_.get()));
 }

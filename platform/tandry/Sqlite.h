@@ -26,6 +26,8 @@ class SqliteDatabase {
 
     explicit operator bool() const { return bool(handle_); }
     void close() { handle_.reset(); }
+    /// Whether its path leads to the open file no more.
+    bool hasMoved() const;
 
     /// Runs statements that answer no rows.
     std::optional<Error> run(const char* sql);

@@ -11,6 +11,8 @@ struct TDApplicationProxy {
     std::string bundleIdentifier;  // empty when its Info.plist names none
     std::string localizedName;     // display name in the user's language; may be empty
     bool isPlaceholder = false;    // still being installed
+
+    friend bool operator==(const TDApplicationProxy&, const TDApplicationProxy&) = default;
 };
 
 using TDApplicationProxyRef = std::shared_ptr<const TDApplicationProxy>;

@@ -81,6 +81,11 @@ class Workspace {
     virtual std::optional<Error> unregisterPlugIn(const std::string& bundlePath,
                                                   Requester requester) = 0;
 
+    /// Makes what somebody has removed of a plug-in's data container meanwhile, without waiting for
+    /// a walk over the disk. Does nothing for a plug-in that has none. Error: it cannot be made,
+    /// or something else has its place.
+    virtual std::optional<Error> restoreContainer(const TDPlugInProxy& plugIn) = 0;
+
     /// Drops what the registry caches of SDK dictionaries.
     virtual void clearSchemaCaches() = 0;
 };

@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 
 #include "Zorvan/Keys.h"
+#include "platform/values/Cbor.h"
 #include "tests/Zorvan/LogLines.h"
 #include "tests/zrd/Fakes.h"
 #include "zrd/CandidateGates.h"
@@ -151,6 +152,21 @@ TEST_F(MatchResultTest, EqualVersionsAreDecidedByTheSystemVolumeThenByTheTime) {
         EXPECT_THAT(outcome(flags, {system, newSystem}), ElementsAre("newSystem"));
         EXPECT_THAT(outcome(flags, {newSystem, system}), ElementsAre("newSystem"));
     }
+}
+
+TEST_F(MatchResultTest, NoMoreIsAcceptedThanOneReplyHolds) {
+    const Dictionary large{{"text", std::string(100u << 20, 'x')}};
+    platform::keepCborEncoded(large);
+    const FakeWorld world;
+    MatchResult result(0, 0);
+    const auto accepts = [&](const char* identifier) {
+        const auto plugIn = world.record(makeProxy(identifier, {{"VXExtensionVersion", "1"}}));
+        return result.admit(*plugIn) && result.append(plugIn, large);
+    };
+    EXPECT_TRUE(accepts("a") && accepts("b"));
+    EXPECT_FALSE(accepts("c"));
+    EXPECT_TRUE(accepts("a")) << "it displaces the other";
+    EXPECT_EQ(result.size(), 2u);
 }
 
 TEST_F(MatchResultTest, ReplacersAreLinkedWithWhatTheyReplace) {

@@ -152,25 +152,6 @@ struct FakeAssertions final : platform::Assertions {
     std::vector<std::string> asked;
 };
 
-/// What records need of the world, and records in it.
-struct FakeWorld {
-    std::shared_ptr<ZRDPlugIn> record(platform::TDPlugInProxyRef proxy) const {
-        return ZRDPlugIn::initWithTDData(std::move(proxy), context);
-    }
-    std::shared_ptr<FakeAnnotations> annotations = std::make_shared<FakeAnnotations>();
-    std::shared_ptr<FakeConsent> consent = std::make_shared<FakeConsent>();
-    std::shared_ptr<FakeSandbox> sandbox = std::make_shared<FakeSandbox>();
-    std::shared_ptr<FakeLauncher> launcher = std::make_shared<FakeLauncher>();
-    std::shared_ptr<FakeAssertions> assertions = std::make_shared<FakeAssertions>();
-    std::shared_ptr<PlugInContext> context =
-        std::make_shared<PlugInContext>(PlugInContext{.annotations = annotations,
-                                                      .launcher = launcher,
-                                                      .assertions = assertions,
-                                                      .sandbox = sandbox,
-                                                      .consent = consent,
-                                                      .types = std::make_shared<FakeTypes>()});
-};
-
 /// A registry in memory, which refuses what confined processes ask for. Its query keeps whatever
 /// the filter keeps, or fails.
 struct FakeWorkspace final : platform::Workspace {
@@ -215,13 +196,18 @@ struct FakeWorkspace final : platform::Workspace {
                                                     platform::Requester requester) override {
         return change("remove ", path, requester);
     }
+    std::optional<platform::Error> restoreContainer(const platform::TDPlugInProxy& proxy) override {
+        restored.push_back(proxy.dataContainerPath.value_or(""));
+        return lostContainers ? std::optional(platform::Error::posix(ENOSPC, "/")) : std::nullopt;
+    }
     void clearSchemaCaches() override { ++schemaClears; }
 
     List installed;
     std::set<std::string> refused;
     std::vector<std::string> changes;
     platform::WorkspaceObserver* observer = nullptr;
-    bool active = false, queryFails = false;
+    bool active = false, queryFails = false, lostContainers = false;
+    std::vector<std::string> restored;
     int queries = 0, schemaClears = 0;
 
   private:
@@ -237,6 +223,27 @@ struct FakeWorkspace final : platform::Workspace {
             return platform::Error{"test", 1, "refused"};
         return std::nullopt;
     }
+};
+
+/// What records need of the world, and records in it.
+struct FakeWorld {
+    std::shared_ptr<ZRDPlugIn> record(platform::TDPlugInProxyRef proxy) const {
+        return ZRDPlugIn::initWithTDData(std::move(proxy), context);
+    }
+    std::shared_ptr<FakeAnnotations> annotations = std::make_shared<FakeAnnotations>();
+    std::shared_ptr<FakeConsent> consent = std::make_shared<FakeConsent>();
+    std::shared_ptr<FakeSandbox> sandbox = std::make_shared<FakeSandbox>();
+    std::shared_ptr<FakeLauncher> launcher = std::make_shared<FakeLauncher>();
+    std::shared_ptr<FakeAssertions> assertions = std::make_shared<FakeAssertions>();
+    std::shared_ptr<FakeWorkspace> workspace = std::make_shared<FakeWorkspace>();
+    std::shared_ptr<PlugInContext> context =
+        std::make_shared<PlugInContext>(PlugInContext{.annotations = annotations,
+                                                      .launcher = launcher,
+                                                      .assertions = assertions,
+                                                      .sandbox = sandbox,
+                                                      .consent = consent,
+                                                      .types = std::make_shared<FakeTypes>(),
+                                                      .workspace = workspace});
 };
 
 /// Entitlements that every process has.

@@ -221,6 +221,11 @@ TEST(Enabling, TheLauncherIsToldOfTheVeryBundle) {
     EXPECT_EQ(service.bundle.path, *proxy->bundlePath);
     EXPECT_EQ(service.bundle.identity, proxy->bundleIdentity);
     EXPECT_EQ(service.container, *proxy->dataContainerPath);
+    // Which somebody may have removed.
+    EXPECT_EQ(world.workspace->restored, std::vector{*proxy->dataContainerPath});
+    world.workspace->lostContainers = true;
+    EXPECT_TRUE(world.record(proxy)->enableForClient(FakeHost()));
+    EXPECT_EQ(world.launcher->services.size(), 1u);
 }
 
 TEST(Signature, StandsForNoRealOne) {

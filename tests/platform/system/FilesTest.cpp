@@ -2,13 +2,21 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <linux/filter.h>
+#include <linux/seccomp.h>
+#include <sys/file.h>
+#include <sys/prctl.h>
 #include <sys/resource.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <csignal>
+#include <cstddef>
 #include <filesystem>
 #include <fstream>
+#include <thread>
 
+#include "platform/system/FileStamp.h"
 #include "platform/system/UniqueFd.h"
 
 namespace platform {
@@ -124,6 +132,64 @@ TEST_F(Files, ACrashWhileWritingLeavesNothingBehind) {
                 , testing::KilledBySignal(SIGXFSZ), "");
     EXPECT_EQ(text("a"), "old");
     EXPECT_EQ(count(), 1);
+}
+
+TEST_F(Files, LeftoversOfACrashAreTold) {
+    put("a", "old");
+    // Ended between the moment that the new file has a name and the one that it has the right one.
+    const auto writeAndDie = [this](const std::string& name) {
+        sock_filter rules[] = {
+            BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
+            BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_renameat, 0, 1),
+            BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_KILL_PROCESS),
+            BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
+        };
+        const sock_fprog program{std::size(rules), rules};
+        ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0);
+        ::prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &program);
+        writeFileAtomically(at(name), "new");
+    };
+    const auto crash = [&](const std::string& name) {
+        EXPECT_EXIT(writeAndDie(name), testing::KilledBySignal(SIGSYS), "");
+    };
+    crash("a");
+    ASSERT_EQ(count(), 2);
+    std::string leftover;
+    for (const auto& entry : fs::directory_iterator(directory))
+        if (entry.path().filename() != "a") leftover = entry.path().filename();
+    put(leftover.substr(0, leftover.size() - 1), "another's");
+    put(leftover + "0", "another's");
+    crash("b");
+    {
+        const UniqueFd writer(::open(at(leftover).c_str(), O_WRONLY | O_CLOEXEC));
+        ::flock(writer.get(), LOCK_EX);
+        removeLeftovers(at("a"));
+        EXPECT_EQ(count(), 5) << "somebody is writing it";
+    }
+    fs::create_symlink("a", at("link"));
+    removeLeftovers(at("link"));
+    EXPECT_FALSE(fs::exists(at(leftover)));
+    EXPECT_EQ(count(), 5);
+    EXPECT_EQ(text("a"), "old");
+}
+
+TEST(FileStamps, VouchForNothingUntilTheyHaveSettled) {
+    const std::string file = testing::TempDir() + "stamped";
+    std::string fresh, again, settled;
+    std::ofstream(file) << "text";
+    FileStamp::of(file).appendTo(fresh);
+    FileStamp::of(file).appendTo(again);
+    EXPECT_NE(fresh, again);
+    while (!FileStamp::of(file).settled) std::this_thread::yield();
+    again.clear();
+    FileStamp::of(file).appendTo(settled);
+    FileStamp::of(file).appendTo(again);
+    EXPECT_EQ(settled, again);
+    EXPECT_NE(settled, fresh);
+    EXPECT_TRUE(FileStamp::from(settled).isLike(FileStamp::from(fresh)));
+    EXPECT_FALSE(FileStamp::from(settled).isLike(FileStamp::of("/")));
+    fs::remove(file);
+    EXPECT_FALSE(FileStamp::from(settled).isLike(FileStamp::of(file)));
 }
 
 TEST_F(Files, MakesMissingDirectories) {

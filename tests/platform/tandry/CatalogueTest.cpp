@@ -4,6 +4,7 @@
 #include <cerrno>
 #include <filesystem>
 
+#include "platform/system/Files.h"
 #include "platform/tandry/Sqlite.h"
 #include "tests/platform/tandry/RegistryFixture.h"
 
@@ -36,6 +37,16 @@ class CatalogueTest : public RegistryTest {
         return FileIdentity::at(AT_FDCWD, files.path(folder + name).c_str());
     }
 
+    /// Changes rows of plug-ins, whose digests keep fitting.
+    void editPlugIns(const std::string& change) {
+        auto opened = SqliteDatabase::open(database);
+        ASSERT_TRUE(opened);
+        const std::string sum =
+            "UPDATE plugins SET sum = checksum(path, uuid, application, bundle_identifier,"
+            " identifier, original_identifier, version, registered, name, short_name,"
+            " executable, sdk, points, container, stamps, info_plist_size, dictionaries)";
+        EXPECT_EQ(opened->run(("UPDATE plugins SET " + change + "; " + sum).c_str()), std::nullopt);
+    }
     void sql(const char* statement) {
         sqlite3* handle = nullptr;
         sqlite3_open(database.c_str(), &handle);
@@ -88,35 +99,130 @@ TEST_F(CatalogueTest, AnExchangedDirectoryIsAnotherPlugIn) {
     EXPECT_EQ(plugIn("b")->bundlePath, files.path("new"));
 }
 
-TEST_F(CatalogueTest, OneWithoutTheIdentitiesOfDirectoriesIsTakenOver) {
+TEST_F(CatalogueTest, OnlyTheContentCountsWhereStampsSayLittle) {
+    for (const char* name : {"a", "b", "c"}) add(name, {{"QFBundleExecutable", "run"}});
+    for (const char* name : {"a", "b", "c"}) files.write(folder + name + "/run", "");
+    start();
+    const auto before = uuids();
+    recorder.take();
+    // A backup by hard links, and another mode.
+    int links = 0;
+    for (const std::string& bundle : {apps + "A.app", folder + "a", folder + "b"})
+        fs::create_hard_link(files.path(bundle + "/Info.plist"),
+                             files.path("link" + std::to_string(++links)));
+    fs::permissions(files.path(folder + "c/run"), fs::perms::owner_all);
+    for (const int read : {3, 0}) {
+        start();
+        EXPECT_EQ(uuids(), before);
+        EXPECT_EQ(merges, read);
+    }
+    EXPECT_THAT(recorder.take(), IsEmpty());
+
+    // Written anew, with the old size and time.
+    const std::string info = files.path(folder + "b/Info.plist");
+    const auto time = fs::last_write_time(info);
+    std::string text = *readFile(info, 1 << 20);
+    text.replace(text.find("<string>b<"), 10, "<string>B<");
+    files.write(folder + "b/Info.plist", text);
+    fs::last_write_time(info, time);
+    start();
+    EXPECT_EQ(recorder.take().size(), 2u);
+    EXPECT_EQ(uuids()["a"], before.at("a"));
+
+    // The devices have other numbers.
+    const auto after = uuids();
+    stop();
+    editPlugIns("stamps = x'0102030405060708' || substr(stamps, 9)");
+    start();
+    EXPECT_EQ(uuids(), after);
+    EXPECT_EQ(plugIn("a")->bundleIdentity, identity("a"));
+    EXPECT_THAT(recorder.take(), IsEmpty());
+}
+
+TEST_F(CatalogueTest, WhatIsSeenIsStored) {
+    start();
+    TDPlugInProxyRef before;
+    for (const bool isNew : {true, false}) {
+        add("d", {{"new", isNew}});
+        auto done = std::async([&] { return registerPlugIn(files.path(folder + "d")); });
+        TDPlugInProxyRef seen;
+        while (!(seen = plugIn("d")) || seen == before) std::this_thread::yield();
+        auto stored = SqliteDatabase::open(database);
+        std::string uuid = seen->plugInUuid.string();
+        std::erase(uuid, '-');
+        const std::string query = "SELECT count(*) FROM plugins WHERE hex(uuid) = upper('" + uuid;
+        EXPECT_EQ(*stored->integer((query + "')").c_str()), 1) << isNew;
+        EXPECT_EQ(done.get(), std::nullopt);
+        before = seen;
+    }
+}
+
+TEST_F(CatalogueTest, AFileThatIsDeletedOrExchangedIsWrittenAnew) {
+    start();
+    const auto before = uuids();
+    const std::string copy = files.path("copy");
+    const std::function<void()> losses[] = {
+        [&] { fs::remove(database); },
+        [&] {
+            for (const char* suffix : {"", "-wal", "-shm"}) fs::remove(database + suffix);
+        },
+        [&] {
+            static_cast<void>(*SqliteDatabase::open(copy));
+            fs::rename(copy, database);
+        },
+    };
+    int number = 0;
+    for (const auto& lose : losses) {
+        const std::string name = "loose" + std::to_string(++number);
+        const std::string loose = addPlugIn("opt/" + name, name);
+        lose();
+        ErrorLines errors;
+        EXPECT_EQ(registerPlugIn(loose), std::nullopt);
+        EXPECT_THAT(errors.lines, ElementsAre(HasSubstr(database)));
+        start();
+        EXPECT_EQ(merges, 0);
+        EXPECT_TRUE(plugIn(name));
+        for (const auto& [identifier, uuid] : before) EXPECT_EQ(uuids()[identifier], uuid);
+    }
+    EXPECT_TRUE(fs::exists(database + ".damaged-1"));
+}
+
+TEST_F(CatalogueTest, ThoseOfEarlierVersionsAreTakenOver) {
+    files.write(folder + "bad/Info.plist", "broken");
     start();
     EXPECT_EQ(unregisterPlugIn(files.path(folder + "c")), std::nullopt);
     const std::string own = addPlugIn("Own.app/PlugIns/own", "own");
     EXPECT_EQ(registerPlugIn(own), std::nullopt);
-    const auto before = uuids();
-    stop();
+    auto before = uuids();
     recorder.take();
-    {
-        auto opened = SqliteDatabase::open(database);
-        ASSERT_TRUE(opened);
-        for (const char* statement :
-             {"UPDATE plugins SET stamps = substr(stamps, 17)",
-              "UPDATE forgotten SET stamps = substr(stamps, 17)",
-              "UPDATE plugins SET sum = checksum(path, uuid, application, bundle_identifier,"
-              " identifier, original_identifier, version, registered, name, short_name,"
-              " executable, sdk, points, container, stamps, info_plist_size, dictionaries)",
-              "PRAGMA user_version = 1"})
-            EXPECT_EQ(opened->run(statement), std::nullopt) << statement;
-    }
-    ErrorLines errors;
-    for (int run = 0; run < 2; ++run) {
-        start();
-        EXPECT_EQ(uuids(), before);
-        EXPECT_EQ(merges, 0) << "nothing is read again";
-        EXPECT_EQ(plugIn("b")->bundleIdentity, identity("b"));
-    }
-    EXPECT_THAT(recorder.take(), IsEmpty());
-    EXPECT_THAT(errors.lines, IsEmpty());
+    for (const int version : {2, 1})
+        for (const bool isLocked : {false, true}) {
+            stop();
+            sql("ALTER TABLE refusals DROP COLUMN size");
+            if (version == 1) {
+                sql("UPDATE forgotten SET stamps = substr(stamps, 17)");
+                sql("UPDATE refusals SET stamps = substr(stamps, 17)");
+                editPlugIns("stamps = substr(stamps, 17)");
+            }
+            sql(("PRAGMA user_version = " + std::to_string(version)).c_str());
+            sqlite3* other = nullptr;
+            sqlite3_open(database.c_str(), &other);
+            const char* lock = "PRAGMA locking_mode = EXCLUSIVE; BEGIN EXCLUSIVE";
+            if (isLocked) sqlite3_exec(other, lock, nullptr, nullptr, nullptr);
+            start();
+            sqlite3_close(other);
+            // What could not be read at first is upgraded as well, and once only.
+            EXPECT_EQ(registerPlugIn(own), std::nullopt);
+            if (isLocked) before = uuids(), before.erase("c");
+            for (int run = 0; run < 2; ++run) {
+                ErrorLines errors;
+                start();
+                EXPECT_EQ(uuids(), before) << version << isLocked;
+                EXPECT_EQ(merges, 0) << "nothing is read again";
+                EXPECT_EQ(plugIn("b")->bundleIdentity, identity("b"));
+                EXPECT_THAT(errors.lines, ElementsAre(HasSubstr("/bad/")));
+            }
+        }
 }
 
 TEST_F(CatalogueTest, WhatChangedGetsANewUuid) {

@@ -146,6 +146,47 @@ TEST_F(ContainersTest, WhoComesBackToALostContainerGetsAnother) {
     EXPECT_EQ(workspace->plugInWithUuid(uuid), nullptr);
 }
 
+TEST_F(ContainersTest, WhatHappensToContainersIsNoticedMeanwhile) {
+    files.write("home/zorvan/Containers/x", "in the way");
+    addApp(a, "com.a");
+    const std::string b = addPlugIn(a + "/PlugIns/B.appex", "b");
+    start();
+    const auto walk = [&] { EXPECT_EQ(registerPlugIn(files.path(a)), std::nullopt); };
+    EXPECT_EQ(containerAt(a + "/PlugIns/X"), "");
+    fs::remove(plain);
+    walk();
+    EXPECT_EQ(containerAt(a + "/PlugIns/X"), plain);
+    const TDPlugInProxyRef record = plugIn("x");
+
+    const std::string temporary = plain + "/tmp";
+    files.makeDirectory("home/zorvan/Containers/x/other");
+    const std::function<void()> losses[] = {
+        [&] { fs::remove(temporary); },
+        [&] { fs::remove_all(plain); },
+        [&] { rename("home/zorvan/Containers", "moved"); },
+    };
+    for (const auto& lose : losses) {
+        ASSERT_TRUE(fs::exists(temporary));
+        lose();
+        walk();
+        EXPECT_TRUE(fs::exists(temporary));
+        fs::remove_all(files.path("moved"));
+        lose();
+        EXPECT_EQ(workspace->restoreContainer(*record), std::nullopt);
+        EXPECT_TRUE(fs::exists(temporary));
+        EXPECT_EQ(plugIn("x"), record);
+    }
+    fs::remove_all(plain);
+    files.write("home/zorvan/Containers/x", "in the way again");
+    EXPECT_TRUE(workspace->restoreContainer(*record));
+    ErrorLines errors;
+    for (int i = 0; i < 2; ++i) walk();
+    EXPECT_THAT(errors.lines, ElementsAre(HasSubstr(plain)));
+    EXPECT_EQ(containerAt(a + "/PlugIns/X"), "");
+    EXPECT_NE(plugIn("x")->plugInUuid, record->plugInUuid);
+    EXPECT_TRUE(plugIn("b")->dataContainerPath);
+}
+
 TEST_F(ContainersTest, WhatNobodyOwnsIsTheFirstClaimants) {
     files.write("home/zorvan/Containers/x/kept", "from before there were owners");
     addApp(a, "com.a");

@@ -169,7 +169,8 @@ TEST_F(LiveRegistryTest, WhatCannotBeReadJustNowStaysAndIsReadLater) {
     // The application's names may be read in one walk, the plug-in's in the next.
     ASSERT_TRUE(recorder.waitUntil([&] {
         const TDPlugInProxyRef now = plugIn("a");
-        return now->localizedName == "Anna" && now->containingApplication->localizedName == "Anna";
+        return now && now->localizedName == "Anna" &&
+               now->containingApplication->localizedName == "Anna";
     }));
     EXPECT_EQ(plugIn("a")->containingApplication->bundleIdentifier, "app");
 }

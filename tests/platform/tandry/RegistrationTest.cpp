@@ -3,6 +3,7 @@
 
 #include <filesystem>
 
+#include "platform/tandry/DictionaryRoom.h"
 #include "tests/platform/tandry/RegistryFixture.h"
 
 namespace platform::tandry {
@@ -182,15 +183,13 @@ TEST_F(RegistryTest, RegisteringAnApplicationKeepsWhatOtherRoadsLeadTo) {
     EXPECT_THAT(installed(), UnorderedElementsAre("a", "extra", "inner"));
 }
 
-/// Leaves the process no file descriptors while it lives.
+/// Lets the process open no file while it lives, also in the place of one that is closed.
 class NoDescriptors {
   public:
     NoDescriptors() {
         ::getrlimit(RLIMIT_NOFILE, &before_);
         rlimit none = before_;
-        const int lowest = ::dup(STDIN_FILENO);
-        ::close(lowest);
-        none.rlim_cur = static_cast<rlim_t>(lowest);
+        none.rlim_cur = 0;
         ::setrlimit(RLIMIT_NOFILE, &none);
     }
     ~NoDescriptors() { ::setrlimit(RLIMIT_NOFILE, &before_); }
@@ -198,6 +197,87 @@ class NoDescriptors {
   private:
     rlimit before_;
 };
+
+TEST_F(RegistryTest, WhatTheFirstWalkCannotReachIsWhatItWas) {
+#ifdef __SANITIZE_ADDRESS__
+    GTEST_SKIP() << "the sanitizers of this build open a pipe for each class that they meet";
+#endif
+    addApplication(apps + "B.app");
+    addPlugIn(apps + "B.app/PlugIns/B.appex", "b");
+    start();
+    const TDPlugInProxyRef before = plugIn("b");
+    addApplication(apps + "A.app");
+    writePlist("home/zorvan/SDKs/org.point.plist", {{"FromSdk", true}});
+    addPlugIn(apps + "A.app/PlugIns/A.appex", "a", {{"VXExtensionPointIdentifier", "org.point"}});
+    std::optional<NoDescriptors> limit;
+    const LogCapture end([&](const std::string&, LogLevel, const std::string& text) {
+        if (text.find("B.app/PlugIns: Too many") != std::string::npos) limit.reset();
+    });
+    TDPlugInProxyRef seen;
+    std::optional<std::string> container;
+    onMerge = [&] {
+        if (merges == 1) return void(limit.emplace());
+        // In the second walk, before it comes there.
+        seen = workspace->plugInAtPath(*before->bundlePath);
+        container = seen->dataContainerPath;
+    };
+    start();
+    ASSERT_TRUE(seen);
+    EXPECT_EQ(seen->plugInUuid, before->plugInUuid);
+    EXPECT_EQ(container, before->dataContainerPath);
+    EXPECT_EQ(plugIn("b"), seen);
+}
+
+TEST_F(RegistryTest, AnApplicationHasSoMuchRoom) {
+    watching.retry = std::chrono::milliseconds(20);
+    const std::string folder = apps + "A.app/PlugIns/";
+    addApplication(apps + "A.app");
+    const std::string text(500'000, 'x');
+    const auto name = [](int number) { return "p" + std::to_string(number); };
+    constexpr int kFit = 67;
+    for (int i = 10; i < 10 + kFit + 2; ++i)
+        addPlugIn(folder + name(i), name(i), {{"VXExtensionPointIdentifier", "org.point"}},
+                  {{"Text", text}});
+    writePlist("home/zorvan/SDKs/org.point.plist", {{"FromSdk", true}});
+    addApplication(apps + "B.app");
+    addPlugIn(apps + "B.app/PlugIns/b", "b");
+    for (const int read : {kFit + 2, 0}) {
+        ErrorLines errors;
+        start();
+        EXPECT_EQ(merges, read);
+        EXPECT_EQ(installed().size(), kFit + 1u);
+        EXPECT_TRUE(plugIn("b"));
+        EXPECT_THAT(errors.lines,
+                    ElementsAre(AllOf(HasSubstr("/p77"), HasSubstr("32 MiB")), HasSubstr("/p78")));
+    }
+    // Where another goes there is room.
+    recorder.take();
+    EXPECT_EQ(unregisterPlugIn(files.path(folder + "p20")), std::nullopt);
+    EXPECT_THAT(recorder.take(2), ElementsAre("-p20", "+p77"));
+}
+
+TEST(DictionaryRoom, BoundsAnApplicationAndTheWhole) {
+    RegistryState state;
+    const auto add = [&](const std::string& application, const std::string& path) {
+        PlugInEntry& entry = state.plugIns[application + path];
+        entry.record = std::make_shared<TDPlugInProxy>();
+        if (!application.empty())
+            entry.record->containingApplication = std::make_shared<TDApplicationProxy>(
+                TDApplicationProxy{application, "", "", false});
+        entry.dictionaries = std::make_shared<const std::string>(kMaxApplicationSize / 2, 'x');
+    };
+    for (const char* application : {"/a", "/b", "/c", ""})
+        for (const char* path : {"/1", "/2"}) add(application, path);
+    DictionaryRoom room;
+    room.count(state);
+    EXPECT_FALSE(room.excess("/a", 0));
+    EXPECT_TRUE(room.excess("/d", 1)) << "all together have their bound";
+    room.remove(state.plugIns.at("/b/1"));
+    EXPECT_TRUE(room.excess("/a", 1));
+    EXPECT_FALSE(room.excess("/b", kMaxApplicationSize / 2));
+    EXPECT_FALSE(room.excess("", kMaxApplicationSize / 2));
+    EXPECT_TRUE(room.excess("", kMaxApplicationSize / 2 + 1));
+}
 
 TEST_F(RegistryTest, WhatIsForgottenStaysSoWhileItCannotBeRead) {
 #ifdef __SANITIZE_ADDRESS__

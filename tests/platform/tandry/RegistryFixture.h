@@ -9,12 +9,14 @@
 #include <memory>
 #include <mutex>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "platform/log/Log.h"
 #include "platform/plist/PropertyList.h"
 #include "platform/services/SdkDictionaries.h"
 #include "platform/system/Directories.h"
+#include "platform/system/FileStamp.h"
 #include "platform/tandry/DiskWorkspace.h"
 #include "tests/support/TemporaryDirectory.h"
 
@@ -72,9 +74,12 @@ class RegistryTest : public testing::Test {
     }
     ~RegistryTest() override { stop(); }
 
-    /// Opens the registry and waits for its first scan, and until directories are watched.
+    /// Opens the registry and waits for its first scan, and until directories are watched. What was
+    /// written before has settled by then, so that its stamps tell all.
     void start() {
         stop();
+        const std::string last = files.write(".last", "");
+        while (!FileStamp::of(last).settled) std::this_thread::yield();
         merges = 0;
         sdks = std::make_unique<SdkDictionaries>(directories);
         auto opened = openDiskWorkspace(

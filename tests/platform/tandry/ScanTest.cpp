@@ -288,7 +288,7 @@ TEST_F(RegistryTest, WithdrawsAContainerThatCannotBeMadeAfterAll) {
     onMerge = [this] { files.write("home/zorvan/Containers/b", "in the way"); };
     start();
     EXPECT_EQ(plugIn("b")->dataContainerPath, std::nullopt);
-    EXPECT_THAT(recorder.take(), ElementsAre("-b", "+a", "+c", "+b"));
+    EXPECT_THAT(recorder.take(), ElementsAre("+a", "+b", "+c", "-b", "+b"));
     const Uuid uuid = plugIn("b")->plugInUuid;
     start();
     EXPECT_EQ(plugIn("b")->plugInUuid, uuid);
