@@ -259,6 +259,7 @@ struct FakeCodeSigning final : platform::CodeSigning {
 
 struct FakeNotifications final : platform::Notifications {
     void post(const std::string& name) override { posted.push_back(name); }
+    void finish() override {}
     std::vector<std::string> posted;
 };
 
