@@ -7,6 +7,7 @@
 #include <atomic>
 #include <cerrno>
 #include <future>
+#include <mutex>
 
 #include "platform/log/OpsLog.h"
 #include "platform/services/SdkDictionaries.h"
@@ -58,6 +59,7 @@ class DiskWorkspace final : public Workspace {
     TDPlugInProxyRef plugInAtPath(const std::string& bundlePath) override;
     TDPlugInProxyList plugInsOfApplication(const std::string& bundlePath) override;
     TDPlugInProxyList installedPlugIns() override;
+    UntouchedBundles untouchedBundles() override;
     std::optional<TDPlugInProxyList> plugInsMatching(const Dictionary& query,
                                                      const Filter& filter) override;
 
@@ -78,6 +80,7 @@ class DiskWorkspace final : public Workspace {
     void rescan(const Scopes& touched);
     void publish(RegistryChanges& changes);
     void publishSnapshot(const RegistryChanges& changes);
+    void published();
     void withdrawContainers(const std::set<std::string>& paths, RegistryChanges& changes);
     std::optional<Error> registerOnQueue(const std::string& bundlePath);
     std::optional<Error> unregisterOnQueue(const std::string& bundlePath);
@@ -88,6 +91,8 @@ class DiskWorkspace final : public Workspace {
 
     SdkDictionaries& sdks_;
     CurrentSnapshot current_;
+    std::mutex unwatchedMutex_;
+    std::shared_ptr<const UntouchedBundles::Paths> unwatched_;  // guarded by it
     std::atomic<bool> closing_ = false;
 
     // Of the registry's thread:
@@ -182,8 +187,9 @@ void DiskWorkspace::rescan(const Scopes& touched) {
     queue_.assertCurrent();
     if (closing_) return;
     RegistryChanges changes = scanner_.scanTouched(touched);
-    if (!changes.records() && !changes.lists()) return gatherer_->walkEnded(scanner_.isComplete());
-    static_cast<void>(apply(changes));
+    if (changes.records() || changes.lists()) return static_cast<void>(apply(changes));
+    gatherer_->walkEnded(scanner_.isComplete());
+    published();
 }
 
 void DiskWorkspace::publish(RegistryChanges& changes) {
@@ -198,6 +204,24 @@ void DiskWorkspace::publishSnapshot(const RegistryChanges& changes) {
     published_ = published_ ? std::make_shared<const Snapshot>(*published_, state_, changes)
                             : std::make_shared<const Snapshot>(state_);
     current_.publish(published_);
+}
+
+/// What the last walk found is there for all to see.
+void DiskWorkspace::published() {
+    auto unwatched = std::make_shared<const UntouchedBundles::Paths>(scanner_.unwatched());
+    {
+        const std::lock_guard lock(unwatchedMutex_);
+        unwatched_.swap(unwatched);
+    }
+    gatherer_->published();
+}
+
+/// Asked in this order, and records looked up afterwards: when the watch is quiet, both the
+/// exceptions and the records are at least as new as what it has seen.
+UntouchedBundles DiskWorkspace::untouchedBundles() {
+    if (!watch_.isQuiet()) return {};
+    const std::lock_guard lock(unwatchedMutex_);
+    return UntouchedBundles(unwatched_);
 }
 
 /// Records that were published are what they are: others take their places.
@@ -220,6 +244,7 @@ void DiskWorkspace::withdrawContainers(const std::set<std::string>& paths,
 std::optional<Error> DiskWorkspace::apply(RegistryChanges& changes) {
     gatherer_->walkEnded(scanner_.isComplete());
     if (changes.records()) publish(changes);
+    published();
     if (!changes.uninstalled.empty())
         for (WorkspaceObserver* observer : observers_)
             observer->pluginsWillUninstall(changes.uninstalled);

@@ -200,6 +200,7 @@ struct FakeWorkspace final : platform::Workspace {
         return found;
     }
     List installedPlugIns() override { return installed; }
+    platform::UntouchedBundles untouchedBundles() override { return {}; }
     std::optional<List> plugInsMatching(const Dictionary&, const Filter& filter) override {
         ++queries;
         if (queryFails) return std::nullopt;
