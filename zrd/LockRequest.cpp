@@ -34,10 +34,10 @@ std::string describePlugIns(const ZRDPlugInList& plugIns) {
 void Transaction::lockDownPlugIns() {
     const Value* tokens = request_.find(message::kUuids);
     if (tokens && tokens->array()) return releaseHolds(*tokens->array());
-    ZRDPlugInList plugIns;
-    if (!collectPlugInsToHold(plugIns)) return;
-    if (unsignedUnder(message::kFlags) != ZRHoldPlugIns && !areIdle(plugIns)) return;
-    takeHold(plugIns);
+    HoldSubject subject;
+    if (!collectPlugInsToHold(subject)) return;
+    if (unsignedUnder(message::kFlags) != ZRHoldPlugIns && !areIdle(subject.plugIns)) return;
+    takeHold(std::move(subject));
 }
 
 void Transaction::releaseHolds(const Array& tokens) {
@@ -48,12 +48,12 @@ void Transaction::releaseHolds(const Array& tokens) {
     done();
 }
 
-bool Transaction::collectPlugInsToHold(ZRDPlugInList& plugIns) {
+bool Transaction::collectPlugInsToHold(HoldSubject& subject) {
     const std::uint64_t flags = unsignedUnder(message::kFlags);
     // A path named again adds nothing: what is collected does not grow with the request's repeats.
     ZRDPlugInHold::PlugIns known;
     const auto add = [&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
-        if (known.insert(plugIn).second) plugIns.push_back(plugIn);
+        if (known.insert(plugIn).second) subject.plugIns.push_back(plugIn);
     };
     return marshalPaths([&](const std::string& path, bool resolved) {
         if (!resolved) {
@@ -68,6 +68,7 @@ bool Transaction::collectPlugInsToHold(ZRDPlugInList& plugIns) {
             }
             add(plugIn);
         } else if (flags == ZRHoldApplications) {
+            if (!subject.applications.insert(path).second) return Walk::Continue;
             const auto inside = server().plugInsWithinApplication(path);
             if (inside) std::ranges::for_each(*inside, add);
         } else {
@@ -94,13 +95,13 @@ bool Transaction::areIdle(const ZRDPlugInList& plugIns) {
     return false;
 }
 
-void Transaction::takeHold(const ZRDPlugInList& plugIns) {
-    // What a hold costs is the daemon's.
+void Transaction::takeHold(HoldSubject subject) {
+    // What a hold costs is the daemon's, and so is each place, which need not hold anything.
     const auto token = client_->auditToken();
-    auto share =
-        server().holdPool().draw(token ? platform::Origin::of(*token) : platform::Origin());
+    auto share = server().holdPool().draw(token ? platform::Origin::of(*token) : platform::Origin(),
+                                          std::max<std::size_t>(subject.applications.size(), 1));
     if (!share) return fail(kZRErrorDenied, "too many holds");
-    auto hold = std::make_shared<ZRDPlugInHold>(plugIns, client_, *std::move(share),
+    auto hold = std::make_shared<ZRDPlugInHold>(std::move(subject), client_, *std::move(share),
                                                 *server().services().launcher);
     server().addHold(hold);
     // The client may have died meanwhile, and its holds been looked for before this one was there.

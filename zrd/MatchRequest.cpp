@@ -55,6 +55,8 @@ void Transaction::matchPlugIns() {
     query.isOnHold = [this](const ZRDPlugIn& plugIn) { return server().holdOnPlugIn(plugIn); };
     if (client_->bundle()) query.hostPlugInsPath = client_->bundle()->plugInsPath();
 
+    // Before the candidates: it says of their records that they hold still, not of older ones.
+    const auto untouched = server().services().workspace->untouchedBundles();
     auto candidates = server().findPlugIns(query.rules).value_or(ZRDPlugInList());
     probes::discoverRaw(static_cast<unsigned int>(candidates.size()));
     MatchResult result(query.flags, candidates.size());
@@ -62,7 +64,7 @@ void Transaction::matchPlugIns() {
     for (const auto& plugIn : candidates) {
         if (firstClosedGate(*plugIn, query)) continue;
         std::optional<ZRError> error;
-        auto form = plugIn->form(error);
+        auto form = plugIn->form(untouched, error);
         if (error) {
             EVLOG_ERROR(ops(), "failed to export matching plug-in {}: {}", pub(plugIn->uuid()),
                         pub(*error));

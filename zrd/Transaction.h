@@ -15,6 +15,7 @@ namespace zorvan {
 class ZRDLumClient;
 class ZRDPlugIn;
 class ZRDServer;
+struct HoldSubject;
 
 /// One request being served: the message, the reply being built for it, and who sent it. Made when
 /// the message arrives; everything else runs on the service queue, one transaction at a time. Every
@@ -49,11 +50,11 @@ class Transaction {
     /// Whether the host may have a plug-in made ready; otherwise the failure has been sent.
     bool admitToReady(const ZRDPlugIn& plugIn);
     void releaseHolds(const platform::Array& tokens);
-    /// The plug-ins that "paths" names; false when the failure has been sent.
-    bool collectPlugInsToHold(std::vector<std::shared_ptr<ZRDPlugIn>>& plugIns);
+    /// What "paths" names; false when the failure has been sent.
+    bool collectPlugInsToHold(HoldSubject& subject);
     /// Whether none of them is busy; otherwise the failure has been sent, with the conflicts.
     bool areIdle(const std::vector<std::shared_ptr<ZRDPlugIn>>& plugIns);
-    void takeHold(const std::vector<std::shared_ptr<ZRDPlugIn>>& plugIns);
+    void takeHold(HoldSubject subject);
 
     /// The request's "annotations"; null when they cannot be stored, and the failure has been sent.
     const platform::Dictionary* requestedAnnotations();

@@ -139,7 +139,8 @@ void ZRDPlugIn::setLocalizedContainingName(std::optional<std::string> value) {
 
 /// The form that was made before, if it still holds. `nameChanges` becomes the number of changes
 /// that it, or one that is made from now on, takes in.
-std::optional<Dictionary> ZRDPlugIn::sharedForm(std::uint64_t& nameChanges) const {
+std::optional<Dictionary> ZRDPlugIn::sharedForm(const platform::UntouchedBundles& untouched,
+                                                std::uint64_t& nameChanges) const {
     std::optional<Dictionary> form;
     {
         std::lock_guard lock(mutex_);
@@ -147,14 +148,16 @@ std::optional<Dictionary> ZRDPlugIn::sharedForm(std::uint64_t& nameChanges) cons
         nameChanges = nameChanges_;
     }
     // The only token of a form that is kept is that for the bundle itself.
-    if (form && isAppExtension() && !platform::isInPlace(path(), tdproxy_->bundleIdentity))
+    if (form && isAppExtension() && !untouched.contains(path()) &&
+        !platform::isInPlace(path(), tdproxy_->bundleIdentity))
         return std::nullopt;
     return form;
 }
 
-std::optional<Dictionary> ZRDPlugIn::form(std::optional<ZRError>& error) const {
+std::optional<Dictionary> ZRDPlugIn::form(const platform::UntouchedBundles& untouched,
+                                          std::optional<ZRError>& error) const {
     std::uint64_t namesAtStart = 0;
-    if (auto shared = sharedForm(namesAtStart)) return shared;
+    if (auto shared = sharedForm(untouched, namesAtStart)) return shared;
     auto made = exportForm(error);
     if (!made) return std::nullopt;
     // Tokens that could not be issued now may be another time, and others may go stale.

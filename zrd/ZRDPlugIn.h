@@ -10,6 +10,7 @@
 #include "Zorvan/ZRPlugInCore.h"
 #include "platform/system/KnownDirectory.h"
 #include "platform/tandry/TDPlugInProxy.h"
+#include "platform/tandry/UntouchedBundles.h"
 
 namespace zorvan {
 
@@ -50,9 +51,10 @@ class ZRDPlugIn final : public ZRPlugInCore {
 
     /// The record's form as `exportForm` makes it and `augmentForm` completes it. Unless its tokens
     /// may go stale, it is made and encoded at the first call and shared from then on, as long as
-    /// the bundle that it has a token for is in its place; setting a name makes it afresh. An
-    /// error: there is none, as with `exportForm`.
-    std::optional<platform::Dictionary> form(std::optional<ZRError>& error) const;
+    /// the bundle that it has a token for is in its place, which is looked at unless it is one of
+    /// `untouched`; setting a name makes it afresh. An error: there is none, as with `exportForm`.
+    std::optional<platform::Dictionary> form(const platform::UntouchedBundles& untouched,
+                                             std::optional<ZRError>& error) const;
 
     /// The plug-in's value for an entitlement, or null.
     const platform::Value* valueForEntitlement(std::string_view name) const;
@@ -95,7 +97,8 @@ class ZRDPlugIn final : public ZRPlugInCore {
   private:
     ZRDPlugIn(platform::TDPlugInProxyRef proxy, std::shared_ptr<const PlugInContext> context);
     bool fillFromProxy();
-    std::optional<platform::Dictionary> sharedForm(std::uint64_t& nameChanges) const;
+    std::optional<platform::Dictionary> sharedForm(const platform::UntouchedBundles& untouched,
+                                                   std::uint64_t& nameChanges) const;
     std::uint32_t declaredHubProtocolVersion() const;
 
     /// The value that a rule's key stands for: borrowed from the registry's record, or made for the

@@ -4,10 +4,10 @@
 
 namespace zorvan {
 
-ZRDPlugInHold::ZRDPlugInHold(const std::vector<std::shared_ptr<ZRDPlugIn>>& plugIns,
-                             std::weak_ptr<ZRDLumClient> client, platform::Pool::Share share,
-                             platform::Launcher& launcher)
-    : blocked_(plugIns.begin(), plugIns.end()),
+ZRDPlugInHold::ZRDPlugInHold(HoldSubject subject, std::weak_ptr<ZRDLumClient> client,
+                             platform::Pool::Share share, platform::Launcher& launcher)
+    : blocked_(subject.plugIns.begin(), subject.plugIns.end()),
+      applications_(std::move(subject.applications)),
       client_(std::move(client)),
       share_(std::move(share)),
       workMarker_(launcher.beginOutstandingWork()) {}

@@ -76,8 +76,10 @@ void ZRDServer::removedPlugIns(const platform::TDPlugInProxyList& plugIns) {
     for (const auto& proxy : plugIns) {
         EVLOG_DEBUG(ops(), "requesting spawnerd termination of plug-in: {}({}) {}",
                     proxy->bundleIdentifier, proxy->bundleVersion, pub(proxy->plugInUuid));
+        const platform::KnownDirectory bundle{proxy->bundlePath.value_or(""),
+                                              proxy->bundleIdentity};
         services().launcher->terminatePlugInInstances(proxy->bundleIdentifier, proxy->bundleVersion,
-                                                      mainQueue_, reportTermination);
+                                                      bundle, mainQueue_, reportTermination);
     }
 }
 

@@ -5,12 +5,11 @@
 #include <memory>
 #include <optional>
 #include <string>
-#include <unordered_map>
 #include <vector>
 
 #include "platform/lum/Listener.h"
 #include "platform/threads/SerialQueue.h"
-#include "zrd/ZRDPlugInHold.h"
+#include "zrd/HoldList.h"
 #include "zrd/ZRDUserPrefs.h"
 #include "zrd/ZRDatabase.h"
 
@@ -43,7 +42,7 @@ class ZRDServer final : public ZRDatabase, public ZRDatabaseDelegate {
 
     // Holds. Each enters the queue "serverSync" synchronously: from any thread, but not from
     // inside.
-    /// Whether any hold, of whichever client, has the plug-in.
+    /// Whether any hold, of whichever client, has the plug-in, or the place where it lies.
     bool holdOnPlugIn(const ZRDPlugIn& plugIn);
     std::vector<std::shared_ptr<ZRDPlugInHold>> holds();
     /// Adds a hold, which also takes its plug-ins back from the hosts that they were made ready
@@ -71,18 +70,15 @@ class ZRDServer final : public ZRDatabase, public ZRDatabaseDelegate {
 
   private:
     static constexpr std::size_t kMaxHolds = 16384;
-    using HoldList = std::vector<std::shared_ptr<ZRDPlugInHold>>;
 
     explicit ZRDServer(const platform::Services& services);
     bool listen(const std::string& serviceName);
-    HoldList::iterator releaseHold(HoldList::iterator hold);
 
     std::atomic<std::uint32_t> verbose_{0};
     platform::SerialQueue lumQueue_;
     platform::Pool holdPool_{kMaxHolds};
     platform::SyncQueue syncQueue_{"serverSync"};
-    HoldList holds_;                                               // guarded by syncQueue_
-    std::unordered_map<platform::Uuid, std::size_t> heldPlugIns_;  // by how many holds; likewise
+    HoldList holds_;  // guarded by syncQueue_
     std::unique_ptr<platform::Listener> service_;
     std::unique_ptr<ZRDUserPrefs> userPrefs_;
     // The last member: it goes first, and the work that still waits in it uses the others.

@@ -65,7 +65,8 @@ int main(int argc, char* argv[]) {
     mainLoop->post(platform::notifyServiceManagerReady);
     server->run();
     platform::lum::removeServiceSockets();
+    services.notifications->finish();
     // What is on disk is whole at any moment. A request that a slow disk holds up must not hold up
-    // the end as well, so nothing is waited for.
+    // the end as well, so nothing else is waited for.
     std::_Exit(EXIT_SUCCESS);
 }

@@ -18,30 +18,32 @@ std::size_t Pool::quarter() const {
     return std::max<std::size_t>(state_->size / 4, 1);
 }
 
-std::optional<Pool::Share> Pool::draw(const Origin& origin) {
+std::optional<Pool::Share> Pool::draw(const Origin& origin, std::size_t count) {
     const std::lock_guard lock(state_->mutex);
     const auto place = state_->byOrigin.try_emplace(origin).first;
-    if (state_->drawn >= state_->size || place->second >= quarter()) {
+    // What is left is never less than nothing, whatever is asked for.
+    if (count > state_->size - state_->drawn || count > quarter() - place->second) {
         if (place->second == 0) state_->byOrigin.erase(place);
         return std::nullopt;
     }
-    ++place->second;
-    ++state_->drawn;
-    return Share(state_, origin);
+    place->second += count;
+    state_->drawn += count;
+    return Share(state_, origin, count);
 }
 
 Pool::Share& Pool::Share::operator=(Share&& other) noexcept {
     std::swap(state_, other.state_);
     std::swap(origin_, other.origin_);
+    std::swap(count_, other.count_);
     return *this;
 }
 
 Pool::Share::~Share() {
     if (!state_) return;
     const std::lock_guard lock(state_->mutex);
-    --state_->drawn;
+    state_->drawn -= count_;
     const auto place = state_->byOrigin.find(origin_);
-    if (--place->second == 0) state_->byOrigin.erase(place);
+    if ((place->second -= count_) == 0) state_->byOrigin.erase(place);
 }
 
 }  // namespace platform

@@ -14,7 +14,7 @@ namespace platform {
 /// nobody keeps the others out. From any thread.
 class Pool {
   public:
-    /// What somebody has drawn; given back at its end, also after the pool's.
+    /// What somebody has drawn at a time; given back at its end, also after the pool's.
     class Share {
       public:
         Share(Share&&) noexcept = default;
@@ -24,17 +24,19 @@ class Pool {
       private:
         friend class Pool;
         struct State;
-        Share(std::shared_ptr<State> state, const Origin& origin)
-            : state_(std::move(state)), origin_(origin) {}
+        Share(std::shared_ptr<State> state, const Origin& origin, std::size_t count)
+            : state_(std::move(state)), origin_(origin), count_(count) {}
 
         std::shared_ptr<State> state_;
         Origin origin_;
+        std::size_t count_;
     };
 
     explicit Pool(std::size_t size);
 
-    /// Draws one; none when the pool is empty or the origin has its quarter already.
-    std::optional<Share> draw(const Origin& origin);
+    /// Draws so many at once; none when there are not as many, or the origin would have more than
+    /// its quarter.
+    std::optional<Share> draw(const Origin& origin, std::size_t count = 1);
     /// As many as one origin may have.
     std::size_t quarter() const;
 

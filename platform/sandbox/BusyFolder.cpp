@@ -11,6 +11,7 @@
 #include <utility>
 
 #include "platform/plist/PropertyList.h"
+#include "platform/system/Digest.h"
 #include "platform/system/Directories.h"
 #include "platform/system/Files.h"
 
@@ -23,6 +24,8 @@ constexpr int kDirectory = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
 std::string allFolders(const Directories& directories) {
     return directories.zorvanRuntime() + "/tenurd";
 }
+
+constexpr char kSeparator = '-';  // the random part of a name has none
 
 Error failed(const std::string& path) {
     return Error::posix(errno, path);
@@ -66,7 +69,8 @@ std::string BusyFolder::ofBundle(const Directories& directories,
 }
 
 Result<BusyFolder> BusyFolder::make(const Directories& directories,
-                                    const std::string& bundleIdentifier) {
+                                    const std::string& bundleIdentifier,
+                                    const std::string& bundlePath) {
     if (!isSafeName(bundleIdentifier)) return Error::posix(EINVAL, bundleIdentifier);
     const std::string parent = ofBundle(directories, bundleIdentifier);
     if (auto error = makeDirectories(parent, 0700)) return *error;
@@ -76,7 +80,7 @@ Result<BusyFolder> BusyFolder::make(const Directories& directories,
     if (status.st_uid != ::geteuid()) return Error::posix(EPERM, parent);
 
     BusyFolder made;
-    made.path_ = joinPath(parent, "XXXXXX");
+    made.path_ = joinPath(parent, prefixOf(bundlePath) + "XXXXXX");
     if (!::mkdtemp(made.path_.data())) return failed(made.path_);
     made.folder_.reset(::open(made.path_.c_str(), kDirectory));
     if (!made.folder_) {
@@ -100,6 +104,14 @@ BusyFolder::~BusyFolder() {
     if (!folder_) return;
     ::unlinkat(folder_.get(), kFile, 0);
     ::rmdir(path_.c_str());
+}
+
+std::string BusyFolder::prefixOf(const std::string& bundlePath) {
+    return bundlePath.empty() ? std::string() : sha256Text(bundlePath) + kSeparator;
+}
+
+bool BusyFolder::isOf(std::string_view name, std::string_view prefix) {
+    return name.find(kSeparator) == name.npos || name.starts_with(prefix);
 }
 
 void BusyFolder::sweep(const Directories& directories) {

@@ -56,16 +56,17 @@ UniqueFd openFolder(int parent, const char* name) {
     return UniqueFd(::openat(parent, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
 }
 
-/// Calls `visit(file)` for each instance whose folder is in a bundle's.
+/// Calls `visit(file)` for each instance of a bundle whose folder is in that of its identifier.
 template <class Visit>
-void forEachInstance(const std::string& path, Visit visit) {
-    const std::unique_ptr<DIR, int (*)(DIR*)> bundle(::opendir(path.c_str()), &::closedir);
-    if (!bundle) return;
+void forEachInstance(const std::string& path, const std::string& bundlePath, Visit visit) {
+    const std::unique_ptr<DIR, int (*)(DIR*)> all(::opendir(path.c_str()), &::closedir);
+    if (!all) return;
+    const std::string prefix = BusyFolder::prefixOf(bundlePath);
     int left = kMaxInstances;
-    while (const dirent* entry = ::readdir(bundle.get())) {
-        if (entry->d_name[0] == '.') continue;
+    while (const dirent* entry = ::readdir(all.get())) {
+        if (entry->d_name[0] == '.' || !BusyFolder::isOf(entry->d_name, prefix)) continue;
         if (--left < 0) return;
-        const UniqueFd folder = openFolder(::dirfd(bundle.get()), entry->d_name);
+        const UniqueFd folder = openFolder(::dirfd(all.get()), entry->d_name);
         const UniqueFd file = folder ? openFile(folder.get()) : UniqueFd();
         if (file) visit(file.get());
     }
@@ -76,13 +77,14 @@ class FileAssertions final : public Assertions {
     explicit FileAssertions(const Directories& directories) : directories_(directories) {}
 
     std::vector<Dictionary> busyInstancesForBundleIdentifiers(
-        const std::set<std::string>& bundleIdentifiers) override {
+        const std::set<std::string>& bundleIdentifiers, const std::string& bundlePath) override {
         std::vector<Dictionary> reports;
         for (const std::string& identifier : bundleIdentifiers) {
             if (!isSafeName(identifier)) continue;
-            forEachInstance(BusyFolder::ofBundle(directories_, identifier), [&](int file) {
-                if (isLocked(file)) reports.push_back(reportIn(file));
-            });
+            forEachInstance(BusyFolder::ofBundle(directories_, identifier), bundlePath,
+                            [&](int file) {
+                                if (isLocked(file)) reports.push_back(reportIn(file));
+                            });
         }
         return reports;
     }
@@ -105,7 +107,7 @@ Result<BusyAssertion> BusyAssertion::take(const Directories& directories,
     UniqueFd file = folder ? openFile(folder.get()) : UniqueFd();
     std::optional<BusyFolder> own;
     if (!file) {
-        auto made = BusyFolder::make(directories, bundleIdentifier);
+        auto made = BusyFolder::make(directories, bundleIdentifier, {});
         if (!made) return made.error();
         path = made->path();
         own.emplace(std::move(*made));

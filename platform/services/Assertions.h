@@ -20,10 +20,11 @@ class Assertions {
   public:
     virtual ~Assertions() = default;
     /// A report for each running instance of these bundles that holds a busy assertion: what its
-    /// file says, or an empty dictionary when that cannot be read. Disturbs nobody. From any
-    /// thread.
+    /// file says, or an empty dictionary when that cannot be read. Of instances that were started
+    /// from a bundle, only those of the one at `bundlePath` count: an identifier is anybody's to
+    /// claim. Disturbs nobody. From any thread.
     virtual std::vector<Dictionary> busyInstancesForBundleIdentifiers(
-        const std::set<std::string>& bundleIdentifiers) = 0;
+        const std::set<std::string>& bundleIdentifiers, const std::string& bundlePath) = 0;
 };
 
 /// Assertions as locks on the files of `BusyFolder`.
@@ -31,7 +32,8 @@ std::unique_ptr<Assertions> makeFileAssertions(const Directories& directories);
 
 /// A plug-in instance's statement that it is busy, for as long as this object, or its process,
 /// lives. It is made in the folder that the launcher made for the instance; a process that was not
-/// started by one makes itself a folder. Move-only.
+/// started by one makes itself a folder, which counts for every bundle of the identifier.
+/// Move-only.
 class BusyAssertion {
   public:
     /// Error: the system's, or EINVAL for an identifier that cannot be a file's name.

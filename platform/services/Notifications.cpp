@@ -5,7 +5,10 @@
 
 #include <cerrno>
 #include <charconv>
+#include <chrono>
 #include <cstdio>
+#include <future>
+#include <map>
 #include <mutex>
 #include <optional>
 
@@ -13,6 +16,7 @@
 #include "platform/system/Directories.h"
 #include "platform/system/Files.h"
 #include "platform/system/UniqueFd.h"
+#include "platform/threads/SerialQueue.h"
 
 namespace platform {
 
@@ -36,7 +40,7 @@ std::optional<Error> replaceFile(const std::string& folder, const std::string& n
     return Error::posix(failure, path);
 }
 
-class FileNotifications : public Notifications {
+class FileNotifications final : public Notifications {
   public:
     explicit FileNotifications(const Directories& directories)
         : folder_(notificationFolder(directories)) {}
@@ -46,19 +50,41 @@ class FileNotifications : public Notifications {
             EVLOG_ERROR(ops(), "cannot post notification {}: not a file name", pub(name));
             return;
         }
-        // Two posts at once must not write the same count.
         const std::lock_guard lock(mutex_);
-        std::optional<Error> error = makeDirectories(folder_, 0700);
-        if (!error) {
-            const std::uint64_t count = notificationPosts(joinPath(folder_, name)) + 1;
-            error = replaceFile(folder_, name, std::to_string(count));
-        }
-        if (error) EVLOG_ERROR(ops(), "cannot post notification {}: {}", pub(name), pub(*error));
+        // Whoever counts first has all written that are counted until the writer has its turn.
+        if (counted_[name]++ == 0) writer_.async([this, name] { write(name); });
+    }
+
+    void finish() override {
+        const auto written = std::make_shared<std::promise<void>>();
+        writer_.async([written] { written->set_value(); });
+        written->get_future().wait_for(kPatience);
     }
 
   private:
+    static constexpr std::chrono::seconds kPatience{1};
+
+    void write(const std::string& name) {
+        writer_.assertCurrent();
+        std::uint64_t& unwritten = unwritten_[name];
+        {
+            const std::lock_guard lock(mutex_);
+            unwritten += counted_.extract(name).mapped();
+        }
+        std::optional<Error> error = makeDirectories(folder_, 0700);
+        if (!error) {
+            const std::uint64_t before = notificationPosts(joinPath(folder_, name));
+            error = replaceFile(folder_, name, std::to_string(before + unwritten));
+        }
+        if (!error) unwritten = 0;
+        if (error) EVLOG_ERROR(ops(), "cannot post notification {}: {}", pub(name), pub(*error));
+    }
+
     const std::string folder_;
     std::mutex mutex_;
+    std::map<std::string, std::uint64_t> counted_;    // since the writer looked; guarded by mutex_
+    std::map<std::string, std::uint64_t> unwritten_;  // the writer's: those, and what failed
+    SerialQueue writer_{"notifications"};  // the last member: what it still does uses the others
 };
 
 }  // namespace

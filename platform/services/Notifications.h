@@ -13,12 +13,17 @@ struct Directories;
 class Notifications {
   public:
     virtual ~Notifications() = default;
-    /// Wakes everybody who waits for the name. From any thread. Failure is logged.
+    /// Wakes everybody who waits for the name, as often as it is posted. Costs the caller next to
+    /// nothing, and waits for nobody. From any thread. Failure is logged.
     virtual void post(const std::string& name) = 0;
+    /// Returns when everybody can see what was posted so far, or that has taken a second. Whoever
+    /// ends the process without destroying this calls it last.
+    virtual void finish() = 0;
 };
 
-/// Notifications as files: a post rewrites <runtime>/zorvan/notify/<name>, by rename, with the
-/// count of posts so far in decimal.
+/// Notifications as files: <runtime>/zorvan/notify/<name> holds the count of posts so far in
+/// decimal. A thread of its own rewrites it, by rename, once for all posts that came meanwhile;
+/// those that cannot be written are written with the next ones. Its end writes what is left.
 std::unique_ptr<Notifications> makeFileNotifications(const Directories& directories);
 
 /// The folder of the files: <runtime>/zorvan/notify.

@@ -55,12 +55,13 @@ class Launcher {
         virtual ~WorkMarker() = default;
     };
     virtual std::unique_ptr<WorkMarker> beginOutstandingWork() = 0;
-    /// Ends the running instances of the plug-in with a bundle identifier and a bundle version, at
-    /// once and without asking them, takes back what lets hosts start it, and runs `completion` on
-    /// `queue`, which must live until then, once the instances are gone. Returns at once. From any
-    /// thread.
+    /// Ends the running instances of the plug-in with a bundle identifier and a bundle version that
+    /// were started from `bundle`, at once and without asking them, takes back what lets hosts
+    /// start it, and runs `completion` on `queue`, which must live until then, once the instances
+    /// are gone. Returns at once. From any thread.
     virtual void terminatePlugInInstances(const std::string& bundleIdentifier,
-                                          const std::string& bundleVersion, SerialQueue& queue,
+                                          const std::string& bundleVersion,
+                                          const KnownDirectory& bundle, SerialQueue& queue,
                                           Completion completion) = 0;
     /// Ends all running instances, as above, and starts no more, for good. Runs `completion` on the
     /// loop's thread once they are gone, or two seconds have passed. From any thread.

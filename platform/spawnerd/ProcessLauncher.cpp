@@ -47,12 +47,16 @@ std::unique_ptr<Launcher::WorkMarker> ProcessLauncher::beginOutstandingWork() {
 }
 
 void ProcessLauncher::terminatePlugInInstances(const std::string& bundleIdentifier,
-                                               const std::string& bundleVersion, SerialQueue& queue,
+                                               const std::string& bundleVersion,
+                                               const KnownDirectory& bundle, SerialQueue& queue,
                                                Completion completion) {
-    service_->terminate(
-        bundleIdentifier, bundleVersion, [&queue, completion = std::move(completion)](bool found) {
-            queue.async([completion, found] { completion(found ? kDone : kNoneOnRecord); });
-        });
+    const auto isOfPlugIn = [=](const Grant& grant) {
+        return grant.bundleIdentifier == bundleIdentifier && grant.bundleVersion == bundleVersion &&
+               grant.bundle == bundle;
+    };
+    service_->terminate(isOfPlugIn, [&queue, completion = std::move(completion)](bool found) {
+        queue.async([completion, found] { completion(found ? kDone : kNoneOnRecord); });
+    });
 }
 
 void ProcessLauncher::shutDown(std::function<void()> completion) {

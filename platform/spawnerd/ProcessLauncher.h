@@ -21,8 +21,8 @@ class ProcessLauncher final : public Launcher {
     void removeExternalServices(const std::string& bundlePath) override;
     std::unique_ptr<WorkMarker> beginOutstandingWork() override;
     void terminatePlugInInstances(const std::string& bundleIdentifier,
-                                  const std::string& bundleVersion, SerialQueue& queue,
-                                  Completion completion) override;
+                                  const std::string& bundleVersion, const KnownDirectory& bundle,
+                                  SerialQueue& queue, Completion completion) override;
     void shutDown(std::function<void()> completion) override;
 
     /// How many work markers live. From any thread.

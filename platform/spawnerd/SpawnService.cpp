@@ -182,7 +182,7 @@ void SpawnService::start(const Host& host, const Asked& asked) {
 std::optional<Error> SpawnService::spawn(std::uint64_t id, Running running,
                                          const std::vector<std::string>& plugInArguments) {
     const Grant& grant = *running.grant;
-    auto busyFolder = BusyFolder::make(directories_, grant.bundleIdentifier);
+    auto busyFolder = BusyFolder::make(directories_, grant.bundleIdentifier, grant.bundle.path);
     if (!busyFolder) return busyFolder.error();
     const Surroundings surroundings{
         .hostHasNetwork = sharesNamespace(running.host->token, NamespaceKind::Network),
@@ -263,19 +263,16 @@ void SpawnService::hostDied(const Host& host) {
         if (running.host == host) running.instance->kill();
 }
 
-void SpawnService::terminate(const std::string& bundleIdentifier, const std::string& bundleVersion,
+void SpawnService::terminate(const std::function<bool(const Grant&)>& which,
                              std::function<void(bool)> completion) {
-    const auto isOfPlugIn = [bundleIdentifier, bundleVersion](const Grant& grant) {
-        return grant.bundleIdentifier == bundleIdentifier && grant.bundleVersion == bundleVersion;
-    };
     // At once: the same plug-in may be granted anew before the loop has its turn.
-    hosts_->takeBack(isOfPlugIn);
-    queue_.async([weak = weak_from_this(), isOfPlugIn, completion = std::move(completion)] {
+    hosts_->takeBack(which);
+    queue_.async([weak = weak_from_this(), which, completion = std::move(completion)] {
         auto self = weak.lock();
         if (!self) return;
         auto left = std::make_shared<std::size_t>(0);
         for (auto& [id, running] : self->instances_) {
-            if (!isOfPlugIn(*running.grant)) continue;
+            if (!which(*running.grant)) continue;
             ++*left;
             running.waiters.push_back([left, completion](int) {
                 if (--*left == 0) completion(true);

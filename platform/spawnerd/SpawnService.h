@@ -41,9 +41,10 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     int grant(const AuditToken& host, const ExternalService& service, const Dictionary& overlay);
     /// As `Launcher::removeExternalServices`. From any thread.
     void takeBack(const std::string& bundlePath);
-    /// As `Launcher::terminatePlugInInstances`, with a completion that is told whether there were
-    /// any, on the loop. From any thread.
-    void terminate(const std::string& bundleIdentifier, const std::string& bundleVersion,
+    /// As `Launcher::terminatePlugInInstances`, for the grants for which `which` holds and what was
+    /// started by them, with a completion that is told whether there were any instances, on the
+    /// loop. From any thread.
+    void terminate(const std::function<bool(const Grant&)>& which,
                    std::function<void(bool found)> completion);
 
     /// As `Launcher::shutDown`. On the queue.

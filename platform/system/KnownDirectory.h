@@ -17,6 +17,8 @@ struct KnownDirectory {
     /// the system's; ELOOP or ENOTDIR when a symbolic link lies on the path, ESTALE when another
     /// directory does, EINVAL for a path that is not absolute.
     Result<UniqueFd> open() const;
+
+    friend bool operator==(const KnownDirectory&, const KnownDirectory&) = default;
 };
 
 /// Whether a path leads to that very directory, for who has thousands to look at: it takes one

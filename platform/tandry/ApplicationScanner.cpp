@@ -491,6 +491,17 @@ void ApplicationScanner::dropUnmet(const std::string& scope) {
     complaints_.forgetUnmet(scope);
 }
 
+void ApplicationScanner::noteUnwatched(const std::string& scope) {
+    forEachWithin(unwatched_, scope, [this](auto path) { unwatched_.erase(path); });
+    std::string known;
+    forEachWithin(state_.plugIns, scope, [&](auto entry) {
+        if (watch_.seesExchangeOf(entry->first, known))
+            known = entry->first;
+        else
+            unwatched_.insert(entry->first);
+    });
+}
+
 RegistryChanges ApplicationScanner::finish(const Scopes& scopes) {
     if (!isIncomplete_)
         for (const std::string& scope : scopes) dropUnmet(scope);
@@ -499,6 +510,7 @@ RegistryChanges ApplicationScanner::finish(const Scopes& scopes) {
         for (auto& [path, entry] : state_.plugIns)
             if (entry.pass == 0) keep(entry);
     watch_.endWalk();
+    for (const std::string& scope : scopes) noteUnwatched(scope);
     containers_.saveOwners();
     return std::exchange(changes_, {});
 }

@@ -40,6 +40,9 @@ class ApplicationScanner {
     /// mend, and all that matters is watched.
     bool isComplete() const { return !hasTransientFailure_ && !watch_.isShort(); }
 
+    /// The paths of plug-ins whose exchange for another directory the watch would not show at once.
+    const std::set<std::string>& unwatched() const { return unwatched_; }
+
     /// Whether an application folder holds the plug-in or application at a path, so that a walk
     /// would find it by itself.
     bool isHeld(const std::string& path) const;
@@ -78,6 +81,7 @@ class ApplicationScanner {
     void noteLink(const std::string& link, const std::string& target);
     bool isUnreachable(const std::string& path) const;
     void dropUnmet(const std::string& scope);
+    void noteUnwatched(const std::string& scope);
     RegistryChanges finish(const Scopes& scopes);
 
     RegistryState& state_;
@@ -89,6 +93,7 @@ class ApplicationScanner {
     Complaints complaints_;
     std::set<std::string> links_;  // links to bundles since the last walk over everything, and
                                    // what they lead to
+    std::set<std::string> unwatched_;
     // Of the walk under way:
     Pass pass_ = 0;
     RegistryChanges changes_;

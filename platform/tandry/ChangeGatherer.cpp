@@ -34,6 +34,10 @@ void ChangeGatherer::walkEnded(bool isComplete) {
     });
 }
 
+void ChangeGatherer::published() {
+    if (touched_.empty() && !willRetry_) watch_.settle();
+}
+
 void ChangeGatherer::awaitChanges() {
     readable_->awaitReadable([this] {
         gather(watch_.takeTouched());
@@ -42,7 +46,8 @@ void ChangeGatherer::awaitChanges() {
 }
 
 void ChangeGatherer::gather(Scopes touched) {
-    if (touched.empty()) return;
+    // Nothing that matters: what was published still holds.
+    if (touched.empty()) return published();
     const Clock::time_point now = Clock::now();
     if (touched_.empty()) burstBegan_ = now;
     touched_.merge(touched);

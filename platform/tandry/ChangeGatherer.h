@@ -36,6 +36,9 @@ class ChangeGatherer {
     /// To be called after each walk. After one that was not `isComplete`, everything counts as
     /// touched once the time to try again has come.
     void walkEnded(bool isComplete);
+    /// To be called when what a walk found is there for all to see. Settles the watch, unless
+    /// something was touched that no walk has looked at since.
+    void published();
 
   private:
     using Clock = std::chrono::steady_clock;

@@ -1,7 +1,5 @@
 #include "platform/tandry/ContainerOwners.h"
 
-#include <fmt/format.h>
-#include <openssl/evp.h>
 #include <sys/stat.h>
 
 #include <algorithm>
@@ -11,6 +9,7 @@
 
 #include "platform/log/OpsLog.h"
 #include "platform/plist/PropertyList.h"
+#include "platform/system/Digest.h"
 #include "platform/system/Files.h"
 
 namespace platform::tandry {
@@ -31,12 +30,7 @@ constexpr const char* kContainers = "containers";
 std::string ownName(const ContainerClaim& claim, int number) {
     const std::string text =
         claim.identifier + '\0' + claim.place + '\0' + (number ? std::to_string(number) : "");
-    unsigned char digest[EVP_MAX_MD_SIZE];
-    unsigned size = 0;
-    EVP_Digest(text.data(), text.size(), digest, &size, EVP_sha256(), nullptr);
-    std::string name = ".";
-    for (unsigned i = 0; i < size; ++i) name += fmt::format("{:02x}", digest[i]);
-    return name;
+    return "." + sha256Text(text);
 }
 
 /// Names from the file become parts of paths.

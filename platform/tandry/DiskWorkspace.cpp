@@ -7,6 +7,7 @@
 #include <atomic>
 #include <cerrno>
 #include <future>
+#include <mutex>
 
 #include "platform/log/OpsLog.h"
 #include "platform/services/SdkDictionaries.h"
@@ -58,6 +59,7 @@ class DiskWorkspace final : public Workspace {
     TDPlugInProxyRef plugInAtPath(const std::string& bundlePath) override;
     TDPlugInProxyList plugInsOfApplication(const std::string& bundlePath) override;
     TDPlugInProxyList installedPlugIns() override;
+    UntouchedBundles untouchedBundles() override;
     std::optional<TDPlugInProxyList> plugInsMatching(const Dictionary& query,
                                                      const Filter& filter) override;
 
@@ -80,6 +82,7 @@ class DiskWorkspace final : public Workspace {
     void firstScan();
     void rescan(const Scopes& touched);
     void publish(const RegistryChanges& changes);
+    void published();
     void withdraw(const TDPlugInProxyList& plugIns);
     void announceGoing(const TDPlugInProxyList& plugIns);
     bool lacksRoom() const;
@@ -93,6 +96,8 @@ class DiskWorkspace final : public Workspace {
 
     SdkDictionaries& sdks_;
     CurrentSnapshot current_;
+    std::mutex unwatchedMutex_;
+    std::shared_ptr<const UntouchedBundles::Paths> unwatched_;  // guarded by it
     std::atomic<bool> closing_ = false;
 
     // Of the registry's thread:
@@ -190,6 +195,7 @@ void DiskWorkspace::rescan(const Scopes& touched) {
     RegistryChanges changes = scanner_.scanTouched(touched);
     if (changes.records() || changes.lists()) return static_cast<void>(apply(changes));
     gatherer_->walkEnded(scanner_.isComplete());
+    published();
     makeContainers();
 }
 
@@ -198,6 +204,24 @@ void DiskWorkspace::publish(const RegistryChanges& changes) {
     published_ = published_ ? std::make_shared<const Snapshot>(*published_, state_, changes)
                             : std::make_shared<const Snapshot>(state_);
     current_.publish(published_);
+}
+
+/// What the last walk found is there for all to see.
+void DiskWorkspace::published() {
+    auto unwatched = std::make_shared<const UntouchedBundles::Paths>(scanner_.unwatched());
+    {
+        const std::lock_guard lock(unwatchedMutex_);
+        unwatched_.swap(unwatched);
+    }
+    gatherer_->published();
+}
+
+/// Asked in this order, and records looked up afterwards: when the watch is quiet, both the
+/// exceptions and the records are at least as new as what it has seen.
+UntouchedBundles DiskWorkspace::untouchedBundles() {
+    if (!watch_.isQuiet()) return {};
+    const std::lock_guard lock(unwatchedMutex_);
+    return UntouchedBundles(unwatched_);
 }
 
 /// Takes records out of what lookups see, and tells observers.
@@ -251,6 +275,7 @@ std::optional<Error> DiskWorkspace::apply(const RegistryChanges& changes) {
     if (!isFirst) withdraw(changes.uninstalled);
     std::optional<Error> error = catalogue_->save(state_, changes);
     if (changes.records()) publish(changes);
+    published();
     if (isFirst) announceGoing(changes.uninstalled);
     if (!changes.installed.empty())
         for (WorkspaceObserver* observer : observers_)

@@ -1,6 +1,9 @@
 #include "platform/tandry/FolderWatch.h"
 
+#include <linux/magic.h>
+#include <sys/ioctl.h>
 #include <sys/stat.h>
+#include <sys/statfs.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -37,6 +40,18 @@ bool isRealDirectory(const std::string& path) {
     return ::lstat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
 }
 
+/// Whether all changes of a file system pass through this kernel. What others change on a server,
+/// or behind a program's back, is not reported; neither is it known of file systems to come.
+bool isLocal(const std::string& path) {
+    constexpr std::array<long, 9> kLocal{
+        EXT4_SUPER_MAGIC,      XFS_SUPER_MAGIC, BTRFS_SUPER_MAGIC,
+        F2FS_SUPER_MAGIC,      TMPFS_MAGIC,     RAMFS_MAGIC,
+        OVERLAYFS_SUPER_MAGIC, SQUASHFS_MAGIC,  EROFS_SUPER_MAGIC_V1};
+    struct statfs status;
+    return ::statfs(path.c_str(), &status) == 0 &&
+           std::ranges::find(kLocal, static_cast<long>(status.f_type)) != kLocal.end();
+}
+
 /// Takes the first component off a path.
 std::string takeComponent(std::string& path) {
     const std::size_t begin = path.find_first_not_of('/');
@@ -53,6 +68,7 @@ std::string takeComponent(std::string& path) {
 }  // namespace
 
 void FolderWatch::beginWalk(bool overEverything) {
+    disturb();
     ++walk_;
     isOverEverything_ = overEverything;
     shortage_ = 0;
@@ -158,7 +174,33 @@ void FolderWatch::endWalk() {
     isShort_ = shortage_ != 0 || (isShort_ && !isOverEverything_);
 }
 
+bool FolderWatch::seesExchangeOf(const std::string& directory, const std::string& known) const {
+    std::string path = directory;
+    for (; path.size() > 1 && !isWithin(known, path); path = parentPath(path))
+        if (!paths_.contains(path)) return false;
+    return isLocal(directory);
+}
+
+void FolderWatch::disturb() {
+    const std::lock_guard lock(mutex_);
+    isSettled_ = false;
+}
+
+void FolderWatch::settle() {
+    const std::lock_guard lock(mutex_);
+    isSettled_ = static_cast<bool>(inotify_);
+}
+
+/// A change leaves the kernel's queue only after `disturb`: whoever finds the queue empty with the
+/// lock in hand, and all settled, has missed none.
+bool FolderWatch::isQuiet() const {
+    const std::lock_guard lock(mutex_);
+    int waiting = 0;
+    return isSettled_ && ::ioctl(inotify_.get(), FIONREAD, &waiting) == 0 && waiting == 0;
+}
+
 Scopes FolderWatch::takeTouched() {
+    disturb();
     Scopes touched;
     alignas(inotify_event) std::array<char, kBufferSize> buffer;
     for (int i = 0; i < kMostBuffers; ++i) {

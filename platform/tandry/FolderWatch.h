@@ -6,6 +6,7 @@
 #include <cstdint>
 #include <limits>
 #include <map>
+#include <mutex>
 #include <set>
 #include <string>
 #include <string_view>
@@ -20,7 +21,8 @@ using Scopes = std::set<std::string>;
 
 /// The directories that walks over the disk depend on, watched by inotify. A walk marks each
 /// directory before it looks into it, so that no later change is lost; at the walk's end the
-/// directories that it did not mark any more are let go. Belongs to the registry's thread.
+/// directories that it did not mark any more are let go. Belongs to the registry's thread, but for
+/// `isQuiet`.
 ///
 /// A directory that is not there, or that may not be read, is not watched: whoever marks it marks
 /// the directory that holds it, too, where its coming or a change of its mode shows.
@@ -53,11 +55,22 @@ class FolderWatch {
     /// memory. Told in one error line when it begins; a walk over everything tries again.
     bool isShort() const { return isShort_; }
 
+    /// Whether whatever makes a canonical path lead to another directory shows at once: that one
+    /// and all above it are watched, and their file system is one whose changes are all made here.
+    /// `known` is one for which this was so a moment ago, or "": neighbours share most of the way.
+    bool seesExchangeOf(const std::string& directory, const std::string& known) const;
+
     /// Readable when there are changes. -1 when the system has no descriptor.
     int descriptor() const { return inotify_.get(); }
     /// What has been touched since the last call. Does not wait; after a flood some may be left for
     /// the next call.
     Scopes takeTouched();
+
+    /// All that was taken has been acted upon, and what walks found is there for all to see.
+    void settle();
+    /// Whether nothing has happened to what is watched that walks have not taken in. From any
+    /// thread; false from the beginning of a walk, or of taking changes, until all is settled.
+    bool isQuiet() const;
 
   private:
     enum class Kind { Self, Name, Entries, Contents };
@@ -79,9 +92,10 @@ class FolderWatch {
     Descriptor add(const std::string& path, Kind kind, bool isKnown);
     void release(std::map<std::string, Descriptor>::iterator place);
     void take(const inotify_event& event, std::string_view name, Scopes& touched);
+    void disturb();
 
     std::size_t mostWatches_;
-    UniqueFd inotify_;
+    UniqueFd inotify_;  // the same one from the first walk that marks something
     std::unordered_map<Descriptor, Watched> watches_;
     std::map<std::string, Descriptor> paths_;
     std::uint32_t walk_ = 0;
@@ -89,6 +103,8 @@ class FolderWatch {
     bool isPostponed_ = false;
     bool isShort_ = false;
     int shortage_ = 0;  // the errno that kept this walk from a watch
+    mutable std::mutex mutex_;
+    bool isSettled_ = false;  // guarded by mutex_; the descriptor is there when it is true
 };
 
 }  // namespace platform::tandry

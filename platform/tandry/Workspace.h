@@ -8,6 +8,7 @@
 
 #include "platform/system/Error.h"
 #include "platform/tandry/TDPlugInProxy.h"
+#include "platform/tandry/UntouchedBundles.h"
 
 namespace platform {
 
@@ -60,6 +61,9 @@ class Workspace {
     virtual TDPlugInProxyList plugInsOfApplication(const std::string& bundlePath) = 0;
 
     virtual TDPlugInProxyList installedPlugIns() = 0;
+    /// Which bundles lie, at the moment of the call, where the records say that are looked up
+    /// afterwards. Costs one look however many there are, and never waits.
+    virtual UntouchedBundles untouchedBundles() = 0;
     /// The plug-ins that may match `query` (a rules dictionary) and that `filter` keeps; an empty
     /// one keeps all. Narrows by "VXExtensionPointIdentifier" and "VXExtensionIdentifier" when
     /// their pattern is a plain string, "=" and a string, or an array of those; never drops a

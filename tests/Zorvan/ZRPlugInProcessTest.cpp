@@ -74,7 +74,7 @@ class PlugInProcess : public testing::Test {
     }
     std::size_t busy() {
         return platform::makeFileAssertions(platform::Directories::fromEnvironment())
-            ->busyInstancesForBundleIdentifiers({"com.test.upper"})
+            ->busyInstancesForBundleIdentifiers({"com.test.upper"}, home_.path("upper.appex"))
             .size();
     }
 

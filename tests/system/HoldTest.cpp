@@ -82,6 +82,12 @@ TEST_F(Hold, BusyPlugInsKeepTheirApplicationInServiceUntilTheyCrash) {
     EXPECT_EQ(refused->wait(), 3);
     EXPECT_EQ(refused->err(), "zrctl: plug-ins are busy (Zorvan 14): com.test.upper\n");
     EXPECT_THAT(match(), ElementsAre("com.test.upper 1"));
+    const std::string twin = home_.path("Twin.app");
+    std::filesystem::copy(home_.path(application_), twin, std::filesystem::copy_options::recursive);
+    EXPECT_EQ(add({twin}), "");
+    EXPECT_EQ(errorOf(hold(kApplication, twin)), "") << "only the name is busy there";
+    EXPECT_EQ(zrctl({"remove", twin})->wait(), 0);
+    EXPECT_EQ(talk(*running, "on"), "ON") << "and only the name has gone";
     running->terminate();
     running->wait();
     EXPECT_EQ(errorOf(hold(kApplication, home_.path(application_))), "");

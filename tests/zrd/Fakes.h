@@ -125,31 +125,34 @@ struct FakeLauncher final : platform::Launcher {
     std::set<std::string> refused;
     int markers = 0;
     void terminatePlugInInstances(const std::string& identifier, const std::string& version,
+                                  const platform::KnownDirectory& bundle,
                                   platform::SerialQueue& queue, Completion completion) override {
         terminated.push_back(identifier + " " + version);
+        terminatedBundles.push_back(bundle);
         Status status = statuses.empty() ? kNoneOnRecord : statuses.front();
         if (!statuses.empty()) statuses.erase(statuses.begin());
         queue.async([completion = std::move(completion), status] { completion(status); });
     }
     void shutDown(std::function<void()> completion) override { completion(); }
     std::vector<std::string> terminated;
+    std::vector<platform::KnownDirectory> terminatedBundles;
     std::vector<Status> statuses;
 };
 
-/// Reports that a test chooses, and the bundles that it was asked about.
+/// Reports that a test chooses, of the bundles at some place.
 struct FakeAssertions final : platform::Assertions {
     std::vector<Dictionary> busyInstancesForBundleIdentifiers(
-        const std::set<std::string>& identifiers) override {
+        const std::set<std::string>& identifiers, const std::string& bundlePath) override {
         std::vector<Dictionary> found;
         for (const std::string& identifier : identifiers) {
-            asked.push_back(identifier);
             auto [first, last] = reports.equal_range(identifier);
-            for (; first != last; ++first) found.push_back(first->second);
+            for (; first != last; ++first)
+                if (bundlePath.starts_with(place)) found.push_back(first->second);
         }
         return found;
     }
     std::multimap<std::string, Dictionary> reports;
-    std::vector<std::string> asked;
+    std::string place;
 };
 
 /// A registry in memory, which refuses what confined processes ask for. Its query keeps whatever
@@ -178,6 +181,7 @@ struct FakeWorkspace final : platform::Workspace {
         return found;
     }
     List installedPlugIns() override { return installed; }
+    platform::UntouchedBundles untouchedBundles() override { return {}; }
     std::optional<List> plugInsMatching(const Dictionary&, const Filter& filter) override {
         ++queries;
         if (queryFails) return std::nullopt;
@@ -266,6 +270,7 @@ struct FakeCodeSigning final : platform::CodeSigning {
 
 struct FakeNotifications final : platform::Notifications {
     void post(const std::string& name) override { posted.push_back(name); }
+    void finish() override {}
     std::vector<std::string> posted;
 };
 

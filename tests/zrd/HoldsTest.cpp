@@ -1,4 +1,6 @@
 #include <algorithm>
+#include <chrono>
+#include <filesystem>
 
 #include "Zorvan/Keys.h"
 #include "tests/zrd/TransactionTest.h"
@@ -90,10 +92,47 @@ TEST_F(HoldsTest, BusyPlugInsKeepTheirApplicationInService) {
     EXPECT_THAT(lines, Contains(HasSubstr("ops D: hold rejected. Busy plug-ins:(")));
     EXPECT_THAT(server_->holds(), IsEmpty());
     EXPECT_EQ(posts(), 0u);
+    assertions_->place = "/elsewhere";
+    const Uuid token = tokenOf(lock(ZRHoldApplications, {directory_.path()}));
+    EXPECT_EQ(server_->holds().size(), 1u) << "only the name is the same";
+    release({token});
+    assertions_->place.clear();
     EXPECT_TRUE(lock(ZRHoldPlugIns, {b_}).contains("uuids")) << "not asked for a plug-in's path";
     assertions_->reports = {{"bundle.com.a", Dictionary()}};
     EXPECT_TRUE(lock(ZRHoldApplications, {directory_.path()}).contains("uuids"))
         << "who does not say what it is does not count";
+}
+
+TEST_F(HoldsTest, WhatComesToAHeldPlaceIsHeld) {
+    const auto comes = [&](std::size_t index, const char* path) {
+        auto proxy = makeProxy("com.new");
+        proxy->bundlePath = directory_.path(path);
+        proxy->containingApplication =
+            makeApplication(std::filesystem::path(*proxy->bundlePath).parent_path());
+        workspace_->installed.resize(index);
+        workspace_->installed.push_back(proxy);
+        return ask({{"request", "ready"}, {"uuids", Array{proxy->plugInUuid}}});
+    };
+    const Dictionary held = error(11, "access to plugin com.new denied: the plug-in is on hold");
+    const Uuid plugIn = tokenOf(lock(ZRHoldPlugIns, {b_}));
+    EXPECT_EQ(comes(1, "com.b.appex"), held);
+    EXPECT_THAT(match({}), ElementsAre("com.a"));
+    EXPECT_NE(comes(1, "com.c.appex"), held);
+    release({plugIn});
+    EXPECT_NE(comes(1, "com.b.appex"), held);
+
+    directory_.makeDirectory("Empty.app");
+    const Uuid application = tokenOf(lock(ZRHoldApplications, {directory_.path("Empty.app")}));
+    EXPECT_EQ(comes(1, "Empty.app/com.b.appex"), held);
+    EXPECT_NE(comes(1, "com.b.appex"), held);
+    EXPECT_EQ(comes(1, "Empty.app/com.c.appex"), held);
+    release({application});
+    EXPECT_NE(comes(1, "Empty.app/com.b.appex"), held);
+
+    Array places;
+    for (std::size_t i = 0; i <= server_->holdPool().quarter(); ++i)
+        places.append(directory_.makeDirectory("places/" + std::to_string(i)));
+    EXPECT_EQ(lock(ZRHoldApplications, places), error(11, "too many holds"));
 }
 
 TEST_F(HoldsTest, BadHoldsAreRefusedAtTheFirstPath) {
@@ -111,8 +150,14 @@ TEST_F(HoldsTest, BadHoldsAreRefusedAtTheFirstPath) {
 }
 
 TEST_F(HoldsTest, ADyingClientGivesItsHoldsBack) {
-    constexpr int kHolds = 1000;
+    constexpr int kHolds = 4000;
     for (int i = 0; i < kHolds; ++i) lock(ZRHoldPlugIns, {a_});
+    // The others must not have to wait, neither for these nor for the end of those.
+    Array unknown;
+    for (int i = 0; i < 200'000; ++i) unknown.append(Uuid::random());
+    const auto begin = std::chrono::steady_clock::now();
+    release(std::move(unknown));
+    EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(1));
     auto other = std::make_shared<FakeConnection>();
     ZRDLumClient::initWithConnection(other, server_);
     other->deliver(platform::Message(

@@ -192,9 +192,10 @@ TEST(Enabling, AFormsTokenIsUsedAgainOnlyWhileTheBundleIsInItsPlace) {
     proxy->bundlePath = path;
     proxy->bundleIdentity = ::test::known(path).identity;
     const auto record = world.record(proxy);
+    platform::UntouchedBundles untouched;
     const auto token = [&] {
         std::optional<ZRError> error;
-        const auto form = record->form(error);
+        const auto form = record->form(untouched, error);
         const Value* found = form->find("extensions")->dictionary()->find(".");
         return found ? *found->string() : std::string("none");
     };
@@ -204,6 +205,11 @@ TEST(Enabling, AFormsTokenIsUsedAgainOnlyWhileTheBundleIsInItsPlace) {
     std::filesystem::create_directory_symlink(directory.path("moved"), path);
     world.sandbox->unreadable = {path};
     EXPECT_EQ(token(), "none");
+    using Untouched = platform::UntouchedBundles;
+    untouched = Untouched(std::make_shared<const Untouched::Paths>());
+    EXPECT_EQ(token(), first) << "nobody looks at what is known";
+    untouched = Untouched(std::make_shared<const Untouched::Paths>(Untouched::Paths{path}));
+    EXPECT_EQ(token(), "none") << "but at what is not";
     std::filesystem::remove(path);
     directory.makeDirectory("PlugIns/a.appex");
     EXPECT_EQ(token(), "none");

@@ -16,6 +16,7 @@ TEST_F(ZRDServerTest, TheLauncherEndsInstancesOfRemovedPlugIns) {
     auto removed = std::make_shared<platform::TDPlugInProxy>(*workspace_->installed[0]);
     removed->bundleIdentifier = "bundle.a";
     removed->bundleVersion = "7";
+    removed->bundleIdentity = {3, 5};
     launcher_->statuses = {0, 3, 22};
     LogLines log;
     workspace_->observer->pluginsWillUninstall({});
@@ -23,6 +24,8 @@ TEST_F(ZRDServerTest, TheLauncherEndsInstancesOfRemovedPlugIns) {
     workspace_->observer->pluginsWillUninstall({removed, removed, workspace_->installed[1]});
     drain();
     EXPECT_THAT(launcher_->terminated, ElementsAre("bundle.a 7", "bundle.a 7", " "));
+    EXPECT_EQ(launcher_->terminatedBundles.at(0),
+              (platform::KnownDirectory{*removed->bundlePath, {3, 5}}));
     auto lines = log.take();
     std::erase_if(
         lines, [](const std::string& line) { return line.find("spawnerd") == std::string::npos; });

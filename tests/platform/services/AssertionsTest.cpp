@@ -1,5 +1,6 @@
 #include "platform/services/Assertions.h"
 
+#include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/wait.h>
@@ -23,7 +24,9 @@ TEST(Assertions, AnInstanceIsBusyWhileItHoldsOneOrLives) {
     Directories directories;
     directories.runtime = home.path("run");
     const auto assertions = makeFileAssertions(directories);
-    const auto busy = [&] { return assertions->busyInstancesForBundleIdentifiers({"a", "b"}); };
+    const auto busy = [&] {
+        return assertions->busyInstancesForBundleIdentifiers({"a", "b"}, "/A.appex");
+    };
     const Dictionary a{{kAssertionBundleIdentifier, "a"}}, b{{kAssertionBundleIdentifier, "b"}};
     EXPECT_THAT(busy(), IsEmpty());
     {
@@ -64,6 +67,24 @@ TEST(Assertions, AnInstanceIsBusyWhileItHoldsOneOrLives) {
     for (const auto& folder : std::filesystem::directory_iterator(home.path("run/zorvan/tenurd/b")))
         std::filesystem::resize_file(folder.path() / "busy", 0);
     EXPECT_THAT(busy(), ElementsAre(Dictionary()));
+}
+
+TEST(Assertions, AnInstanceOfANamesakeIsAnothers) {
+    test::TemporaryDirectory home;
+    Directories directories;
+    directories.runtime = home.path("run");
+    const auto assertions = makeFileAssertions(directories);
+    const auto own = BusyFolder::make(directories, "a", "/One.appex");
+    ASSERT_TRUE(own);
+    const UniqueFd file(::open((own->path() + "/busy").c_str(), O_RDWR | O_CLOEXEC));
+    struct flock lock {};
+    lock.l_type = F_RDLCK;
+    ASSERT_EQ(::fcntl(file.get(), F_OFD_SETLK, &lock), 0);
+    const auto busyAt = [&](const char* place) {
+        return assertions->busyInstancesForBundleIdentifiers({"a"}, place).size();
+    };
+    EXPECT_EQ(busyAt("/One.appex"), 1u);
+    EXPECT_EQ(busyAt("/Other.appex"), 0u);
 }
 
 }  // namespace

@@ -17,6 +17,7 @@ class NotificationListenerTest : public testing::Test {
   protected:
     void post(int times) {
         for (; times > 0; --times) notifications_->post("name");
+        notifications_->finish();
     }
     NotificationListener listen() {
         return std::move(*NotificationListener::make(directories_, "name"));
@@ -36,6 +37,7 @@ TEST_F(NotificationListenerTest, EveryListenerCountsEveryPostSinceItWasMade) {
     EXPECT_EQ(*first.take(), 0u) << "nobody has ever posted";
     post(3);
     notifications_->post("other");
+    notifications_->finish();
     NotificationListener second = listen();
     post(2);
     EXPECT_EQ(*first.take(), 5u);

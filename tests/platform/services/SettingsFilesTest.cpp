@@ -1,4 +1,6 @@
 #include <gtest/gtest.h>
+#include <sys/inotify.h>
+#include <sys/ioctl.h>
 #include <sys/stat.h>
 
 #include <filesystem>
@@ -15,6 +17,7 @@
 #include "platform/system/Directories.h"
 #include "platform/system/FileStamp.h"
 #include "platform/system/Files.h"
+#include "platform/system/UniqueFd.h"
 #include "tests/support/TemporaryDirectory.h"
 
 namespace platform {
@@ -238,31 +241,49 @@ TEST_F(SettingsFiles, ConsentIsRecordedByApplication) {
 }
 
 TEST_F(SettingsFiles, NotificationsCountTheirPosts) {
-    const auto notifications = makeFileNotifications(directories_);
-    const std::string file = files_.path("run/zorvan/notify/name");
+    auto notifications = makeFileNotifications(directories_);
+    const std::string folder = files_.path("run/zorvan/notify"), file = folder + "/name";
+    const auto count = [&] {
+        notifications->finish();
+        return *readFile(file, 100);
+    };
     notifications->post("name");
-    EXPECT_EQ(*readFile(file, 100), "1");
+    EXPECT_EQ(count(), "1");
     struct stat status;
-    ASSERT_EQ(::stat(files_.path("run/zorvan/notify").c_str(), &status), 0);
+    ASSERT_EQ(::stat(folder.c_str(), &status), 0);
     EXPECT_EQ(status.st_mode & 07777, 0700u);
 
+    const UniqueFd watch(::inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
+    ASSERT_GE(::inotify_add_watch(watch.get(), folder.c_str(), IN_CREATE), 0);
     std::vector<std::thread> posters;
     for (int i = 0; i < 4; ++i)
         posters.emplace_back([&] {
-            for (int post = 0; post < 25; ++post) notifications->post("name");
+            for (int post = 0; post < 2500; ++post) notifications->post("name");
         });
     for (std::thread& poster : posters) poster.join();
-    EXPECT_EQ(*readFile(file, 100), "101");
+    EXPECT_EQ(count(), "10001");
+    int bytes = 0;
+    ::ioctl(watch.get(), FIONREAD, &bytes);
+    EXPECT_LT(bytes / (sizeof(inotify_event) + 16), 5000u)
+        << "one file for all that came meanwhile";
     makeFileNotifications(directories_)->post("name");
-    EXPECT_EQ(*readFile(file, 100), "102") << "goes on where another process stopped";
+    EXPECT_EQ(count(), "10002") << "written at its end; goes on where another process stopped";
     files_.write("run/zorvan/notify/name", "garbage");
     notifications->post("name");
-    EXPECT_EQ(*readFile(file, 100), "1");
+    EXPECT_EQ(count(), "1");
 
     notifications->post("../name");
     EXPECT_EQ(errors_, 1);
-    const auto entries = std::filesystem::directory_iterator(files_.path("run/zorvan/notify"));
+    auto entries = std::filesystem::directory_iterator(folder);
     EXPECT_EQ(std::distance(begin(entries), end(entries)), 1) << "nothing temporary is left";
+    std::filesystem::rename(folder, folder + ".old");
+    files_.write("run/zorvan/notify", "no folder");
+    notifications->post("name");
+    notifications->finish();
+    EXPECT_EQ(errors_, 2);
+    std::filesystem::remove(folder);
+    notifications->post("name");
+    EXPECT_EQ(count(), "2") << "what failed is not lost";
 }
 
 }  // namespace

@@ -225,14 +225,16 @@ TEST_F(LauncherTest, AHostHasSoManyPlugInsAndNoMore) {
 
 TEST_F(LauncherTest, RemovalEndsInstancesOfThatVersionAndTakesTheirGrantsBack) {
     const std::string one = plugIn("one", "sleep 1000 &\nread -r line");
-    const std::string two = plugIn("two", "cat", "2");
+    const std::string two = plugIn("two", "cat", "1");
+    writeInfo("two", {{"QFBundleIdentifier", "one"}, {"QFBundleVersion", "1"}});
     EXPECT_EQ(grant(one), 0);
     EXPECT_EQ(grant(two), 0);
     const Message first = start(one), second = start(one), other = start(two);
     std::optional<Launcher::Status> status;
     const auto terminate = [&](const char* version) {
         status.reset();
-        launcher->terminatePlugInInstances("one", version, queue, [&](auto s) { status = s; });
+        launcher->terminatePlugInInstances("one", version, service(one).bundle, queue,
+                                           [&](auto s) { status = s; });
         EXPECT_FALSE(status);
         EXPECT_TRUE(stepUntil([&] { return status.has_value(); }));
     };
@@ -244,7 +246,8 @@ TEST_F(LauncherTest, RemovalEndsInstancesOfThatVersionAndTakesTheirGrantsBack) {
     EXPECT_EQ(number(start(one), kErrorCode), EPERM);
     terminate("1");
     EXPECT_EQ(status, Launcher::kNoneOnRecord);
-    EXPECT_EQ(talk(other.takeDescriptor(), "still here"), "still here");
+    EXPECT_EQ(talk(other.takeDescriptor(), "still here"), "still here") << "only its name is one";
+    EXPECT_GT(number(start(two), kInstance), 0);
 }
 
 TEST_F(LauncherTest, WhatIsTakenBackIsNotStartedAgainButGoesOn) {

@@ -67,6 +67,44 @@ TEST_F(LiveRegistryTest, FollowsAnApplicationThroughItsLife) {
     EXPECT_EQ(plugIn("b")->plugInUuid, last);
 }
 
+TEST_F(LiveRegistryTest, TellsAtOnceThatABundleMayHaveBeenExchanged) {
+    const std::string linked = addPlugIn("opt/Linked.appex", "linked");
+    const std::string bundle = addPlugIn(apps + "A.app/PlugIns/A.appex", "a");
+    fs::create_directory_symlink(linked, at(apps + "A.app/PlugIns/Link.appex"));
+    start();
+    const auto untouched = [&](const std::string& path) {
+        return workspace->untouchedBundles().contains(path);
+    };
+    const auto becomesUntouched = [&](const std::string& path) {
+        const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+        while (!untouched(path) && std::chrono::steady_clock::now() < end) settle();
+        return untouched(path);
+    };
+    EXPECT_TRUE(becomesUntouched(bundle));
+    const std::string decoy = files.makeDirectory("decoy");
+    for (const std::string& way : {bundle, linked})
+        for (fs::path part = way; part != files.path(); part = part.parent_path()) {
+            for (int times = 0; times < 2; ++times) {
+                const fs::path link = at("exchange");
+                fs::create_directory_symlink(decoy, link);
+                ASSERT_EQ(
+                    ::renameat2(AT_FDCWD, link.c_str(), AT_FDCWD, part.c_str(), RENAME_EXCHANGE),
+                    0);
+                EXPECT_FALSE(untouched(way)) << part;
+                ASSERT_EQ(
+                    ::renameat2(AT_FDCWD, link.c_str(), AT_FDCWD, part.c_str(), RENAME_EXCHANGE),
+                    0);
+                fs::remove(link);
+                EXPECT_TRUE(becomesUntouched(way)) << part;
+            }
+        }
+    // Directories that may be passed but not read cannot be watched.
+    fs::permissions(at("opt"), fs::perms::owner_exec);
+    EXPECT_TRUE(becomesUntouched(bundle));
+    EXPECT_EQ(becomesUntouched(linked), ::geteuid() == 0);
+    fs::permissions(at("opt"), fs::perms::owner_all);
+}
+
 TEST_F(LiveRegistryTest, FollowsWhatWasRegisteredAndItsDictionary) {
     const std::string loose =
         addPlugIn("opt/Loose.appex", "loose", {{"VXExtensionPointIdentifier", "org.point"}});
