@@ -180,10 +180,9 @@ void Budget::relieve() {
         if (!isInTheWay(origin)) continue;
         const auto holder = weak.lock();
         const auto since = holder ? holder->stalledSince(*this) : std::nullopt;
-        if (since && now - *since >= patience)
-            holder->cutOff(blame(held));
-        else
-            next = std::min(next, since.value_or(now) + patience);
+        const bool isDue = since && now - *since >= patience;
+        next = std::min(next, (isDue ? now : since.value_or(now)) + patience);
+        if (isDue) holder->cutOff(blame(held));
     }
     {
         std::lock_guard lock(mutex_);

@@ -141,9 +141,10 @@ TEST(Budget, CutsOffTheLargestOfTheStalledUntilThereIsRoom) {
     };
     join('a', kMaxUnsentTotal / 8, longAgo);
     join('b', kMaxUnsentTotal / 4, longAgo);
-    join('c', kMaxUnsentTotal / 2, std::nullopt);  // reads
+    join('c', kMaxUnsentTotal / 4, std::nullopt);  // reads
     join('d', kMaxUnsentTotal / 4, longAgo);
     join('e', kMaxUnsentTotal / 4, std::nullopt);
+    join('f', kMaxUnsentTotal, std::nullopt);  // counts as a quarter
     loop.poll();
     EXPECT_EQ(cut, "") << "nobody waits";
 
@@ -159,7 +160,8 @@ TEST(Budget, CutsOffTheLargestOfTheStalledUntilThereIsRoom) {
 
     // Over the limit once more, by those whose time is not up: the budget looks again by itself.
     budget->leave(*waiting.share);
-    members[2].share->add(kMaxUnsentTotal / 4);
+    members[1].share->add(kMaxUnsentTotal / 4);
+    members[1].holder->stalled = std::nullopt;
     for (Member& member : {std::ref(members[0]), std::ref(members[4])})
         member.holder->stalled = std::chrono::steady_clock::now();
     waiting.share->await();
