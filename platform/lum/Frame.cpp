@@ -122,9 +122,12 @@ Result<std::shared_ptr<const std::string>> FrameReader::take(std::string_view& i
 
     const std::size_t arrived = std::min(input.size(), size - payload_.size());
     const std::size_t wanted = payload_.size() + arrived;
-    // Doubling keeps the copying linear; the announced size bounds it, but is no promise.
+    // The announced size is no promise. But who was let send more than is free to everybody counts
+    // with all of it already, and moving megabytes again and again would hold up others.
     if (wanted > payload_.capacity())
-        payload_.reserve(std::min(size, std::max(wanted, 2 * payload_.capacity())));
+        payload_.reserve(wanted > kFreeReceived
+                             ? size
+                             : std::min(size, std::max(wanted, 2 * payload_.capacity())));
     payload_.append(input.substr(0, arrived));
     input.remove_prefix(arrived);
     if (payload_.size() < size) return std::shared_ptr<const std::string>();

@@ -35,8 +35,8 @@ std::optional<Error> whatIsWrongWith(const Dictionary& body);
 using DecodedPayload = std::variant<Message, UnknownObject, Error>;
 DecodedPayload decodePayload(std::shared_ptr<const std::string> payload, FrameKind expected);
 
-/// Cuts a stream of bytes into payloads. A payload's memory is taken as its bytes arrive, not when
-/// they are announced.
+/// Cuts a stream of bytes into payloads. Memory is taken as bytes arrive, and for all of a payload
+/// once more of it is there than every connection may have (lum/Limits.h).
 class FrameReader {
   public:
     explicit FrameReader(std::size_t maxPayload) : maxPayload_(maxPayload) {}
