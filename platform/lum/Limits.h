@@ -15,7 +15,7 @@ inline constexpr std::size_t kMaxRequestValues = 1u << 18;
 
 /// A request with a larger payload is decoded on a thread of its own: so many values take longer
 /// than others should wait for.
-inline constexpr std::size_t kMaxDecodedAtOnce = 32u << 10;
+inline constexpr std::size_t kMaxDecodedAtOnce = 16u << 10;
 
 /// A connection's next request is not served while more than this many bytes of its own replies, or
 /// of the replies of all connections together, wait to be read by their hosts. A reply counts with
