@@ -44,8 +44,8 @@ class ZRDaemonClient {
     using ReplyCallback = std::function<void(const Reply&)>;
 
     /// Connects to the named service ("com.orbel.zorvan.zrd" for a null name) in this user's
-    /// runtime directory. Never null: without a daemon there, every request is answered by an
-    /// error event.
+    /// runtime directory. Never null, and never waits: without a daemon there, every request is
+    /// answered by an error event; while the daemon lets nobody in, requests wait.
     static std::shared_ptr<ZRDaemonClient> initWithServiceName(const char* serviceName);
 
     /// The version that requests carry, 3 unless it is set.
@@ -64,7 +64,9 @@ class ZRDaemonClient {
     platform::Message request(const char* type, const std::vector<std::string>& paths) const;
     /// Sets the "uuids" of a request.
     static void setUuids(platform::Message& message, const std::vector<platform::Uuid>& uuids);
-    /// Sends a request; the operations below all end here. `reply` may be empty.
+    /// Sends a request; the operations below all end here. What the daemon would have to refuse by
+    /// its limits (docs/protocol.md: text that is not UTF-8, too many values, ...) is not sent: it
+    /// is answered by an error event of its own. `reply` may be empty.
     void send(platform::Message message, ReplyCallback reply);
 
     /// The error that a reply carries, or none. A reply with a message but no code throws

@@ -35,6 +35,17 @@ bool Transaction::hasRoomFor(const Dictionary& change, const ZRDPlugIn& plugIn) 
     return false;
 }
 
+bool Transaction::hasShareFor(const Dictionary& change, const ZRDPlugIn& plugIn) {
+    if (!change.contains(annotation::kExtension)) return true;
+    if (server().hasShareForAnnotation(change, plugIn, origin())) return true;
+    EVLOG_INFO(ops(),
+               "client {} plug-in {}({}) annotation refused: it and those it belongs with "
+               "have stored too much",
+               client_->pid(), plugIn.identifier(), pub(plugIn.uuid()));
+    fail(kZRErrorDenied, "too many annotations");
+    return false;
+}
+
 void Transaction::annotatePlugIns() {
     const Dictionary* annotations = requestedAnnotations();
     if (!annotations) return;
@@ -58,6 +69,7 @@ void Transaction::annotatePlugIns() {
     std::unordered_set<platform::Uuid> changed;
     bool completed = processUuidList([&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
         if (!changed.insert(plugIn->uuid()).second) return Walk::Continue;
+        if (!hasShareFor(change, *plugIn)) return Walk::Stop;
         if (!hasRoomFor(change, *plugIn)) {
             fail(kZRErrorInvalidRequest, "invalid request format (annotation extension)");
             return Walk::Stop;
@@ -68,7 +80,7 @@ void Transaction::annotatePlugIns() {
             EVLOG_INFO(ops(), "client {} plug-in {}({}) election := {}", client_->pid(),
                        plugIn->identifier(), pub(plugIn->uuid()), *election);
         }
-        server().setAnnotation(change, *plugIn);
+        server().setAnnotation(change, *plugIn, origin());
         return Walk::Continue;
     });
     if (!completed) return;
@@ -96,12 +108,13 @@ void Transaction::bulkAnnotatePlugIns() {
         if (!plugIn) return fail(kZRErrorRegistration, "no plug-in with the requested uuid");
         if (lastOf[*uuid] != &value) continue;
         const Dictionary change{{annotation::kExtension, value}};
+        if (!hasShareFor(change, *plugIn)) return;
         if (!hasRoomFor(change, *plugIn)) {
             return fail(kZRErrorAnnotation, "annotations values must be dictionaries");
         }
         EVLOG_DEBUG(ops(), "client {} bulk plug-in {}({}) annotation change: {}", client_->pid(),
                     plugIn->identifier(), pub(plugIn->uuid()), value);
-        server().setAnnotation(change, *plugIn);
+        server().setAnnotation(change, *plugIn, origin());
     }
     server().notifyAnnotationChange();
     done();

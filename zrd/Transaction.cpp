@@ -33,6 +33,11 @@ ZRDServer& Transaction::server() const {
     return *client_->server();
 }
 
+platform::Origin Transaction::origin() const {
+    const auto token = client_->auditToken();
+    return token ? platform::Origin::of(*token) : platform::Origin();
+}
+
 std::uint64_t Transaction::unsignedUnder(const char* key) const {
     const Value* value = request_.find(key);
     return value ? value->unsignedInteger().value_or(0) : 0;

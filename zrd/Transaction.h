@@ -9,6 +9,7 @@
 
 #include "Zorvan/ZRError.h"
 #include "platform/lum/Message.h"
+#include "platform/lum/Origin.h"
 
 namespace zorvan {
 
@@ -60,6 +61,8 @@ class Transaction {
     const platform::Dictionary* requestedAnnotations();
     /// Whether the store has room for a change; what has none counts as of the wrong kind.
     bool hasRoomFor(const platform::Dictionary& change, const ZRDPlugIn& plugIn);
+    /// Whether this client's origin may store a change, too; otherwise the failure has been sent.
+    bool hasShareFor(const platform::Dictionary& change, const ZRDPlugIn& plugIn);
 
     /// Visits "paths" in order: each element resolved to its canonical path (`resolved`), or as it
     /// was sent when it cannot be. True when every element was visited and none answered `Stop`;
@@ -81,6 +84,8 @@ class Transaction {
     void fail(std::int32_t code, const ZRError& error);
 
     ZRDServer& server() const;
+    /// Where the client comes from.
+    platform::Origin origin() const;
 
     const std::shared_ptr<ZRDLumClient> client_;
     const platform::Message request_;

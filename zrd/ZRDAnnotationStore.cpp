@@ -5,6 +5,7 @@
 #include <cerrno>
 
 #include "Zorvan/Helpers.h"
+#include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
 #include "platform/plist/PropertyList.h"
 #include "platform/plist/PropertyListCost.h"
@@ -143,18 +144,28 @@ bool ZRDAnnotationStore::hasRoomFor(const Dictionary& annotation, const ZRDPlugI
     return isNoMore || after.fits(AnnotationText::kMaxSize - kReservedForElections);
 }
 
-void ZRDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,
-                                       const ZRDPlugIn& plugIn) {
+bool ZRDAnnotationStore::hasShareFor(const Dictionary& annotation, const ZRDPlugIn& plugIn,
+                                     const platform::Origin& origin) const {
     const std::string& key = plugIn.annotationKey();
-    std::optional<Dictionary> changed;
-    if (annotation) changed = merged(*annotation, key);
+    return shares_.hasRoomFor(origin, key, costOf(key, merged(annotation, key)));
+}
+
+void ZRDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,
+                                       const ZRDPlugIn& plugIn,
+                                       const std::optional<platform::Origin>& origin) {
+    const std::string& key = plugIn.annotationKey();
+    std::optional<platform::PropertyListCost> cost;
     if (const Value* current = annotations_.find(key)) cost_ -= costOf(key, *current);
-    if (changed) {
-        cost_ += costOf(key, *changed);
-        annotations_.set(key, *std::move(changed));
+    if (annotation) {
+        Dictionary changed = merged(*annotation, key);
+        cost = costOf(key, changed);
+        cost_ += *cost;
+        annotations_.set(key, std::move(changed));
+        if (origin && annotation->contains(annotation::kExtension)) shares_.give(*origin, key);
     } else {
         annotations_.remove(key);
     }
+    shares_.changed(key, cost);
     text_.changed(key);
     if (auto error = saveDb()) {
         EVLOG_ERROR(ops(), "unable to save annotations:{} error:{}", pub(annotationsURL_),

@@ -6,6 +6,7 @@
 
 #include "Zorvan/ZRError.h"
 #include "platform/values/Value.h"
+#include "zrd/AnnotationShares.h"
 #include "zrd/AnnotationText.h"
 
 namespace platform {
@@ -44,11 +45,17 @@ class ZRDAnnotationStore {
     /// keep every later one from being saved.
     bool hasRoomFor(const platform::Dictionary& annotation, const ZRDPlugIn& plugIn) const;
 
+    /// Whether hosts of that origin, too, may have the data of `annotation` stored: what they have
+    /// set since the daemon began is a quarter of that room at the most.
+    bool hasShareFor(const platform::Dictionary& annotation, const ZRDPlugIn& plugIn,
+                     const platform::Origin& origin) const;
+
     /// Merges the entries of `annotation` into the plug-in's annotation, or removes that when there
     /// are none, then saves. A failed save is logged; the change stays and reaches the file with
-    /// the next successful one.
+    /// the next successful one. Hosts' data belongs to the origin from then on, if one is given.
     void setAnnotation(const std::optional<platform::Dictionary>& annotation,
-                       const ZRDPlugIn& plugIn);
+                       const ZRDPlugIn& plugIn,
+                       const std::optional<platform::Origin>& origin = std::nullopt);
 
     /// Each answers what went wrong, or none.
     std::optional<ZRError> loadDb();
@@ -71,6 +78,7 @@ class ZRDAnnotationStore {
     platform::Dictionary annotations_;
     platform::PropertyListCost cost_;  // of the annotations
     AnnotationText text_;
+    AnnotationShares shares_{AnnotationText::kMaxSize - kReservedForElections};
 };
 
 }  // namespace zorvan

@@ -117,9 +117,15 @@ bool ZRDatabase::hasRoomForAnnotation(const Dictionary& annotation, const ZRDPlu
     return sync_.sync([&] { return annotations_->hasRoomFor(annotation, plugIn); });
 }
 
+bool ZRDatabase::hasShareForAnnotation(const Dictionary& annotation, const ZRDPlugIn& plugIn,
+                                       const platform::Origin& origin) {
+    return sync_.sync([&] { return annotations_->hasShareFor(annotation, plugIn, origin); });
+}
+
 std::optional<ZRError> ZRDatabase::setAnnotation(const std::optional<Dictionary>& annotation,
-                                                 const ZRDPlugIn& plugIn) {
-    sync_.sync([&] { annotations_->setAnnotation(annotation, plugIn); });
+                                                 const ZRDPlugIn& plugIn,
+                                                 const std::optional<platform::Origin>& origin) {
+    sync_.sync([&] { annotations_->setAnnotation(annotation, plugIn, origin); });
     return std::nullopt;
 }
 

@@ -10,6 +10,7 @@
 
 #include "Zorvan/ZRError.h"
 #include "platform/Services.h"
+#include "platform/lum/Origin.h"
 #include "platform/tandry/Workspace.h"
 #include "platform/threads/SyncQueue.h"
 #include "zrd/PlugInContext.h"
@@ -77,10 +78,14 @@ class ZRDatabase : public AnnotationReader, public platform::WorkspaceObserver {
     std::optional<platform::Dictionary> annotationForPlugIn(const ZRDPlugIn& plugIn) override;
     /// Whether a change of the plug-in's annotation could be stored together with all others.
     bool hasRoomForAnnotation(const platform::Dictionary& annotation, const ZRDPlugIn& plugIn);
+    /// Whether it would be within what one origin may have stored.
+    bool hasShareForAnnotation(const platform::Dictionary& annotation, const ZRDPlugIn& plugIn,
+                               const platform::Origin& origin);
     /// Merges `annotation` into the plug-in's, or removes that, and saves. Always answers none: a
-    /// failed save is logged, and the change kept.
-    std::optional<ZRError> setAnnotation(const std::optional<platform::Dictionary>& annotation,
-                                         const ZRDPlugIn& plugIn);
+    /// failed save is logged, and the change kept. Hosts' data belongs to the origin, if given.
+    std::optional<ZRError> setAnnotation(
+        const std::optional<platform::Dictionary>& annotation, const ZRDPlugIn& plugIn,
+        const std::optional<platform::Origin>& origin = std::nullopt);
     /// Tells whoever listens that annotations, and with them match results, have changed.
     void notifyAnnotationChange();
 

@@ -44,10 +44,11 @@ platform::Services diskServices(const std::string& serviceName,
 
 int main(int argc, char* argv[]) {
     platform::openStandardDescriptors();
+    // Before the first line: nobody may be reading it.
+    platform::prepareDaemonProcess();
     EVLOG_INFO(zorvan::ops(), "zrd is launching");
     auto options = zorvan::CommandLine::parse(argc, argv);
     if (!options) return 2;
-    platform::prepareDaemonProcess();
     const auto mainLoop = std::make_shared<platform::RunLoop>();
     platform::Services services;
     // Before there are other threads; heard once the loop runs.

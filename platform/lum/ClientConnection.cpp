@@ -6,6 +6,7 @@
 
 #include <atomic>
 #include <cerrno>
+#include <chrono>
 #include <cstring>
 #include <deque>
 #include <map>
@@ -13,6 +14,7 @@
 #include <optional>
 #include <string_view>
 #include <utility>
+#include <vector>
 
 #include "platform/log/OpsLog.h"
 #include "platform/lum/Frame.h"
@@ -26,8 +28,12 @@ namespace platform {
 
 namespace {
 
+constexpr std::chrono::milliseconds kPauseWhileFull{10};
+
+/// A connected socket; none while too many wait to be let in already. Nothing tells of an end of
+/// that but another try.
 Result<UniqueFd> connectTo(const std::string& path) {
-    UniqueFd socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    UniqueFd socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0));
     if (!socket) return Error::posix(errno, "no socket for " + path);
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
@@ -37,8 +43,9 @@ Result<UniqueFd> connectTo(const std::string& path) {
         outcome =
             ::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address);
     } while (outcome != 0 && errno == EINTR);
-    if (outcome != 0) return Error::posix(errno, "no service at " + path);
-    return socket;
+    if (outcome == 0) return socket;
+    if (errno == EAGAIN) return UniqueFd();
+    return Error::posix(errno, "no service at " + path);
 }
 
 }  // namespace
@@ -54,11 +61,13 @@ struct ClientConnection::State : std::enable_shared_from_this<ClientConnection::
     std::optional<ConnectionError> broken{{ConnectionError::Kind::Invalid, "not resumed"}};
     bool closed = false;
     std::map<std::uint64_t, ReplyHandler> waiting;
+    std::vector<SliceList> unsent;  // requests, while there is no socket
     std::atomic<std::uint64_t> lastSerial = 0;
 
-    // Made by `resume`, before anything is sent. It guards its sending itself; the rest of it, and
-    // what follows, is the queue's.
+    // Made once, under the mutex, by `resume` or on the queue. It guards its sending itself; the
+    // rest of it, and what follows, is the queue's.
     std::optional<lum::FrameSocket> socket;
+    std::optional<RunLoop::Timer> nextTry;  // while it has not been made
     lum::FrameReader reader{lum::kMaxReplyPayload};
     std::deque<UniqueFd> descriptors;  // each came before the end of the reply that it belongs to
     std::optional<RunLoop::Watch> watch;
@@ -66,13 +75,17 @@ struct ClientConnection::State : std::enable_shared_from_this<ClientConnection::
     State(const Directories& directories, const std::string& serviceName, SerialQueue& eventQueue)
         : queue(eventQueue), path(lum::socketPath(directories, serviceName)) {}
 
+    void connect();
     void start();
     void awaitReadable();
     void awaitWritable();
     void readable();
     void received(std::string_view input);
     void deliver(std::shared_ptr<const std::string> payload);
-    void interrupted(const std::string& reason);
+    void interrupted(const std::string& reason) {
+        end({ConnectionError::Kind::Interrupted, reason});
+    }
+    void end(const ConnectionError& event);
     void shutDown();
 
     bool isClosed();
@@ -84,13 +97,31 @@ bool ClientConnection::State::isClosed() {
     return closed;
 }
 
+/// Makes the socket, with what has been sent meanwhile, or notes that there will be none.
+void ClientConnection::State::connect() {
+    auto connected = path ? connectTo(*path) : path.error();
+    std::lock_guard lock(mutex);
+    broken.reset();
+    if (!connected) {
+        broken = {ConnectionError::Kind::Invalid, connected.error().text};
+    } else if (*connected) {
+        socket.emplace(std::move(*connected));
+        for (SliceList& frame : std::exchange(unsent, {})) socket->send(std::move(frame));
+    }
+}
+
 void ClientConnection::State::start() {
     if (isClosed()) return;
+    // The reason does not change any more.
+    if (broken) return end(ConnectionError(*broken));
     if (!socket) {
-        // The reason does not change any more.
-        if (auto handler = std::exchange(eventHandler, nullptr)) handler(*broken);
-        return;
+        if (!nextTry) nextTry.emplace(queue.runLoop());
+        return nextTry->start(kPauseWhileFull, [this] {
+            connect();
+            start();
+        });
     }
+    nextTry.reset();
     watch.emplace(queue.runLoop(), socket->fd());
     awaitReadable();
     if (socket->held() > 0) awaitWritable();
@@ -168,17 +199,18 @@ void ClientConnection::State::deliver(std::shared_ptr<const std::string> payload
     entry.mapped()(Reply(std::move(message)));
 }
 
-void ClientConnection::State::interrupted(const std::string& reason) {
-    const ConnectionError event{ConnectionError::Kind::Interrupted, reason};
+void ClientConnection::State::end(const ConnectionError& event) {
     decltype(waiting) unanswered;
     {
         std::lock_guard lock(mutex);
-        if (closed || broken) return;
+        if (closed) return;
         broken = event;
         unanswered.swap(waiting);
+        unsent.clear();
     }
     watch.reset();
-    socket->close();
+    nextTry.reset();
+    if (socket) socket->close();
     if (auto handler = std::exchange(eventHandler, nullptr)) handler(event);
     for (auto& [serial, reply] : unanswered) {
         if (isClosed()) return;
@@ -188,6 +220,7 @@ void ClientConnection::State::interrupted(const std::string& reason) {
 
 void ClientConnection::State::shutDown() {
     watch.reset();
+    nextTry.reset();
     if (socket) socket->close();
     eventHandler = nullptr;
 }
@@ -222,16 +255,7 @@ void ClientConnection::setEventHandler(EventHandler handler) {
 }
 
 void ClientConnection::resume() {
-    auto connected = state_->path ? connectTo(*state_->path) : state_->path.error();
-    {
-        std::lock_guard lock(state_->mutex);
-        if (connected) {
-            state_->socket.emplace(std::move(*connected));
-            state_->broken.reset();
-        } else {
-            state_->broken = {ConnectionError::Kind::Invalid, connected.error().text};
-        }
-    }
+    state_->connect();
     state_->queue.async([weak = std::weak_ptr(state_)] {
         if (auto state = weak.lock()) state->start();
     });
@@ -239,12 +263,14 @@ void ClientConnection::resume() {
 
 void ClientConnection::sendWithReply(Message request, ReplyHandler reply) {
     State& state = *state_;
+    const auto refuse = [&](const Error& error) {
+        state.answerLater(std::move(reply), {ConnectionError::Kind::Refused, error.text});
+    };
+    if (auto wrong = lum::whatIsWrongWith(request.contents())) return refuse(*wrong);
     const std::uint64_t serial = ++state.lastSerial;
     request.setSerial(serial);
     auto frame = lum::encodeFrame(lum::FrameKind::Request, request, lum::kMaxRequestPayload);
-    if (!frame)
-        return state.answerLater(std::move(reply),
-                                 {ConnectionError::Kind::Invalid, frame.error().text});
+    if (!frame) return refuse(frame.error());
     {
         std::unique_lock lock(state.mutex);
         if (state.broken) {
@@ -254,6 +280,10 @@ void ClientConnection::sendWithReply(Message request, ReplyHandler reply) {
         }
         // Before sending: the reply may be here at once.
         state.waiting.emplace(serial, std::move(reply));
+        if (!state.socket) {
+            state.unsent.push_back(std::move(*frame));
+            return;
+        }
     }
     if (!state.socket->send(std::move(*frame)).awaitWritable) return;
     state.queue.async([weak = std::weak_ptr(state_)] {

@@ -32,11 +32,14 @@ class ClientConnection {
     /// Called for the connection's error events: no service at the name (Invalid), the daemon went
     /// away (Interrupted). Set before `resume`.
     void setEventHandler(EventHandler handler);
-    /// Connects before it returns; requests before it are answered with an error event.
+    /// Connects before it returns, if the service has room for one more that waits to be let in;
+    /// otherwise as soon as it has, and what is sent meanwhile waits. It does not block. Requests
+    /// before it are answered with an error event.
     void resume();
 
-    /// Sends `request` and calls `reply` once: with the reply, or with the error event when the
-    /// connection broke before it came, is broken already, or the request is over its limit.
+    /// Sends `request` and calls `reply` once: with the reply, with the error event when the
+    /// connection broke before it came or is broken already, or with an error (Refused) when the
+    /// request is beyond what any service takes. Then it is not sent, and the connection goes on.
     void sendWithReply(Message request, ReplyHandler reply);
 
     std::string description() const;

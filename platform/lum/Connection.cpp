@@ -14,6 +14,9 @@ std::string describe(const ConnectionError& error) {
         case ConnectionError::Kind::Interrupted:
             name = "connection interrupted";
             break;
+        case ConnectionError::Kind::Refused:
+            name = "request not sent";
+            break;
     }
     return error.text.empty() ? name : std::string(name) + ": " + error.text;
 }

@@ -18,6 +18,7 @@ struct ConnectionError {
         Invalid,              // the peer is gone, or broke the protocol; nothing follows this event
         TerminationImminent,  // the peer will send nothing more but still reads replies
         Interrupted,          // on the host's side: the daemon went away
+        Refused,              // likewise: no service takes this request; it was not sent
     };
     Kind kind;
     std::string text;  // for people

@@ -7,6 +7,7 @@
 
 #include "platform/lum/Limits.h"
 #include "platform/values/Cbor.h"
+#include "platform/values/Utf8.h"
 
 namespace platform::lum {
 
@@ -27,7 +28,50 @@ std::optional<Message> asMessage(const Value& item, FrameKind expected) {
     return message;
 }
 
+/// Counts and looks at values as their receiver will. Answers what is wrong, or null.
+class BodyCheck {
+  public:
+    const char* check(const Dictionary& dictionary, int depth) {
+        if (depth > kMaxCborDepth) return kTooDeep;
+        for (const auto& [key, value] : dictionary) {
+            if (const char* wrong = check(key)) return wrong;
+            if (const char* wrong = check(value, depth)) return wrong;
+        }
+        return nullptr;
+    }
+
+  private:
+    static constexpr const char* kTooDeep = "it is nested too deep";
+    /// The array around the body, its kind and serial, and the body.
+    static constexpr std::size_t kValuesAround = 4;
+
+    const char* check(const Value& value, int depth) {
+        if (++count_ > kMaxRequestValues) return "it has too many values";
+        if (const std::string* text = value.string()) return check(*text);
+        if (const Dictionary* dictionary = value.dictionary()) return check(*dictionary, depth + 1);
+        const Array* array = value.array();
+        if (!array) return nullptr;
+        if (depth >= kMaxCborDepth) return kTooDeep;
+        for (const Value& element : *array)
+            if (const char* wrong = check(element, depth + 1)) return wrong;
+        return nullptr;
+    }
+
+    static const char* check(const std::string& text) {
+        if (!isValidUtf8(text)) return "it has text that is not UTF-8";
+        return text.find('\0') == std::string::npos ? nullptr : "it has text with a NUL";
+    }
+
+    std::size_t count_ = kValuesAround;
+};
+
 }  // namespace
+
+std::optional<Error> whatIsWrongWith(const Dictionary& body) {
+    constexpr int kDepthOfBody = 2;
+    const char* wrong = BodyCheck().check(body, kDepthOfBody);
+    return wrong ? std::optional(Error{kDomain, 0, wrong}) : std::nullopt;
+}
 
 Result<SliceList> encodeFrame(FrameKind kind, const Message& message, std::size_t limit) {
     std::string start;
@@ -78,9 +122,12 @@ Result<std::shared_ptr<const std::string>> FrameReader::take(std::string_view& i
 
     const std::size_t arrived = std::min(input.size(), size - payload_.size());
     const std::size_t wanted = payload_.size() + arrived;
-    // Doubling keeps the copying linear; the announced size bounds it, but is no promise.
+    // The announced size is no promise. But who was let send more than is free to everybody counts
+    // with all of it already, and moving megabytes again and again would hold up others.
     if (wanted > payload_.capacity())
-        payload_.reserve(std::min(size, std::max(wanted, 2 * payload_.capacity())));
+        payload_.reserve(wanted > kFreeReceived
+                             ? size
+                             : std::min(size, std::max(wanted, 2 * payload_.capacity())));
     payload_.append(input.substr(0, arrived));
     input.remove_prefix(arrived);
     if (payload_.size() < size) return std::shared_ptr<const std::string>();

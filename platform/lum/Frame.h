@@ -4,6 +4,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <variant>
@@ -24,13 +25,18 @@ inline constexpr std::size_t kFrameHeaderSize = 4;
 /// A whole frame. Error (domain "Lum"): the payload would be over `limit` bytes.
 Result<SliceList> encodeFrame(FrameKind kind, const Message& message, std::size_t limit);
 
+/// What keeps a receiver from taking a request with this body, by the limits of values: too many,
+/// nested too deep, or text that no text string can be. None when it can be sent, if it is not too
+/// large. Domain "Lum".
+std::optional<Error> whatIsWrongWith(const Dictionary& body);
+
 /// What a payload is to a receiver of frames of the kind `expected`: a message; a well-formed item
 /// that is no such message; or, for anything else, an error that says what is wrong with it.
 using DecodedPayload = std::variant<Message, UnknownObject, Error>;
 DecodedPayload decodePayload(std::shared_ptr<const std::string> payload, FrameKind expected);
 
-/// Cuts a stream of bytes into payloads. A payload's memory is taken as its bytes arrive, not when
-/// they are announced.
+/// Cuts a stream of bytes into payloads. Memory is taken as bytes arrive, and for all of a payload
+/// once more of it is there than every connection may have (lum/Limits.h).
 class FrameReader {
   public:
     explicit FrameReader(std::size_t maxPayload) : maxPayload_(maxPayload) {}

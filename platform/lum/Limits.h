@@ -13,9 +13,15 @@ inline constexpr std::size_t kMaxReplyPayload = 256u << 20;
 /// byte that is enough to encode it.
 inline constexpr std::size_t kMaxRequestValues = 1u << 18;
 
+/// A request with a larger payload is decoded on a thread of its own: so many values take longer
+/// than others should wait for.
+inline constexpr std::size_t kMaxDecodedAtOnce = 16u << 10;
+
 /// A connection's next request is not served while more than this many bytes of its own replies, or
 /// of the replies of all connections together, wait to be read by their hosts. A reply counts with
-/// its whole length until its last byte is written: that is what its memory costs.
+/// its whole length until its last byte is written: that is what its memory costs. Of the latter
+/// one origin may fill a quarter; a reply that is larger than what is left of it may stand beyond,
+/// one at a time, and does not count there.
 inline constexpr std::size_t kMaxUnsentPerConnection = 8u << 20;
 inline constexpr std::size_t kMaxUnsentTotal = 256u << 20;
 
@@ -26,13 +32,14 @@ inline constexpr std::size_t kMaxWaitingBytes = 16u << 20;
 
 /// A connection is read on only while the requests of all connections, from the moment that their
 /// length is known until they are served, have no more than this many bytes together. So many bytes
-/// of each connection are not counted.
+/// of each connection are not counted. One origin may have a quarter of them.
 inline constexpr std::size_t kMaxReceivedTotal = 256u << 20;
 inline constexpr std::size_t kFreeReceived = 64u << 10;
 
-/// When others wait because one of the two limits over all connections is reached, a connection
-/// that counts in it is cut off if its peer has been expected to read, or to send the rest of a
-/// request, for so long and has moved less than this many bytes meanwhile.
+/// When others wait because one of the two limits over all connections, or over those of one
+/// origin, is reached, a connection that counts in it is cut off if its peer has been expected to
+/// read, or to send the rest of a request, for so long and has moved less than this many bytes
+/// meanwhile.
 inline constexpr std::chrono::milliseconds kPatience{5000};
 inline constexpr std::size_t kLeastProgress = 1u << 20;
 

@@ -58,13 +58,18 @@ std::size_t mostConnections() {
         lum::kMaxConnections);
 }
 
+/// What this process's descriptors allow, whichever listener accepts: as many as at the first.
+Pool& connectionPool() {
+    static Pool pool{mostConnections()};
+    return pool;
+}
+
 }  // namespace
 
 struct Listener::State : std::enable_shared_from_this<Listener::State> {
     SerialQueue& queue;
     lum::ServiceSocket socket;
-    const std::shared_ptr<lum::ReplyBudget> replyBudget;
-    const std::shared_ptr<lum::ReceiveBudget> receiveBudget;
+    const lum::PeerConnection::Common common;
     EventHandler handler;
     std::optional<RunLoop::Watch> watch;  // since `resume`
     // To be closed at the end. Those that are gone are dropped when the list is full.
@@ -72,15 +77,15 @@ struct Listener::State : std::enable_shared_from_this<Listener::State> {
     RunLoop::Timer pause;
     bool failing = false;  // accepting has failed, and hosts have waited since then
     bool closed = false;
-    UniqueFd undecided;  // accepted when no descriptors were left to look at its peer
-    Pool pool{mostConnections()};
+    UniqueFd undecided;        // accepted when no descriptors were left to look at its peer
     std::set<Origin> refused;  // and told so in the log, until one of theirs is let in again
 
     State(SerialQueue& eventQueue, lum::ServiceSocket serviceSocket)
         : queue(eventQueue),
           socket(std::move(serviceSocket)),
-          replyBudget(std::make_shared<lum::ReplyBudget>(eventQueue.runLoop())),
-          receiveBudget(std::make_shared<lum::ReceiveBudget>(eventQueue.runLoop())),
+          common{std::make_shared<lum::ReplyBudget>(eventQueue.runLoop()),
+                 std::make_shared<lum::ReceiveBudget>(eventQueue.runLoop()),
+                 std::make_shared<lum::Decoder>()},
           pause(eventQueue.runLoop()) {}
 
     void awaitConnections() {
@@ -140,9 +145,8 @@ void Listener::State::admit(UniqueFd connected) {
     }
     auto share = drawFor(*token);
     if (!share) return;
-    auto connection =
-        std::make_shared<lum::PeerConnection>(std::move(connected), std::move(*token),
-                                              std::move(*share), queue, replyBudget, receiveBudget);
+    auto connection = std::make_shared<lum::PeerConnection>(std::move(connected), std::move(*token),
+                                                            std::move(*share), queue, common);
     remember(connection);
     handler(std::move(connection));
 }
@@ -150,7 +154,7 @@ void Listener::State::admit(UniqueFd connected) {
 /// None, with a line the first time, when those of the peer's origin have their part already.
 std::optional<Pool::Share> Listener::State::drawFor(const AuditToken& token) {
     const Origin origin = Origin::of(token);
-    auto share = pool.draw(origin);
+    auto share = connectionPool().draw(origin);
     if (share) {
         refused.erase(origin);
     } else {
@@ -160,7 +164,7 @@ std::optional<Pool::Share> Listener::State::drawFor(const AuditToken& token) {
         EVLOG_ERROR(ops(),
                     "client {} is not let in: there are too many connections, or it and those it "
                     "belongs with have too many, {} are the most",
-                    token.pid(), pool.quarter());
+                    token.pid(), connectionPool().quarter());
     }
     return share;
 }
@@ -182,8 +186,9 @@ void Listener::State::close() {
     closed = true;
     for (const auto& weak : std::exchange(connections, {}))
         if (auto connection = weak.lock()) connection->abandon();
-    replyBudget->close();
-    receiveBudget->close();
+    common.decoder->close();
+    common.replies->close();
+    common.requests->close();
 }
 
 Result<std::unique_ptr<Listener>> Listener::make(const Directories& directories,

@@ -49,9 +49,9 @@ class Message {
     }
 
   private:
+    std::shared_ptr<void> turn_;  // goes last: it may see to it where the contents are freed
     Dictionary contents_;
     std::uint64_t serial_ = 0;
-    std::shared_ptr<void> turn_;
     std::shared_ptr<UniqueFd> descriptor_;
 };
 

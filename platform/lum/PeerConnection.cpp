@@ -16,36 +16,52 @@ class PeerConnection::Turn {
   public:
     explicit Turn(PeerConnection& connection)
         : connection_(connection.weak_from_this()),
-          replyBudget_(connection.replyBudget_),
+          replyBudget_(connection.common_.replies),
+          replies_(connection.replies_),
           requests_(connection.requests_) {}
     Turn(const Turn&) = delete;
     ~Turn() {
         if (auto connection = connection_.lock()) connection->endTurn();
         requests_->remove(counted_);
-        replyBudget_->leave();
+        replyBudget_->leave(*replies_);
+        if (freeLater_) freeLater_();
     }
 
     /// Takes over bytes that count in the connection's share of requests.
     void carry(std::size_t counted) { counted_ += counted; }
 
+    /// Has what was decoded freed where it was decoded: that takes as long.
+    void freeLater(std::shared_ptr<Decoder> decoder, const Origin& origin, Dictionary contents) {
+        freeLater_ = [decoder = std::move(decoder), origin,
+                      contents = std::move(contents)]() mutable {
+            decoder->async(origin, [contents = std::move(contents)] {});
+        };
+    }
+
   private:
     std::weak_ptr<PeerConnection> connection_;
     std::shared_ptr<ReplyBudget> replyBudget_;
+    std::shared_ptr<Budget::Share> replies_;
     std::shared_ptr<Budget::Share> requests_;
     std::size_t counted_ = 0;
+    std::function<void()> freeLater_;
+};
+
+/// The turn is the last to go.
+struct PeerConnection::Decoded {
+    std::shared_ptr<Turn> turn;
+    DecodedPayload payload;
 };
 
 PeerConnection::PeerConnection(UniqueFd socket, AuditToken token, Pool::Share share,
-                               SerialQueue& queue, std::shared_ptr<ReplyBudget> replyBudget,
-                               std::shared_ptr<ReceiveBudget> receiveBudget)
+                               SerialQueue& queue, Common common)
     : queue_(queue),
       loop_(queue.runLoop()),
       token_(std::move(token)),
       share_(std::move(share)),
-      replyBudget_(std::move(replyBudget)),
-      receiveBudget_(std::move(receiveBudget)),
-      replies_(replyBudget_->open()),
-      requests_(receiveBudget_->open()),
+      common_(std::move(common)),
+      replies_(common_.replies->open(share_.origin())),
+      requests_(common_.requests->open(share_.origin())),
       socket_(std::move(socket)),
       reader_(kMaxRequestPayload) {}
 
@@ -60,13 +76,17 @@ void PeerConnection::start() {
     replies_->setHolder(weak_from_this());
     requests_->setHolder(weak_from_this());
     watch_.emplace(loop_, socket_.fd());
-    watch_->awaitHangup([self = shared_from_this()] { self->hungUp(); });
+    awaitHangup();
     if (socket_.held() > 0) awaitWritable();
     proceed();
 }
 
 // The watch's callbacks run only while it exists, and it goes with this object: they may hold a
 // bare pointer.
+
+void PeerConnection::awaitHangup() {
+    watch_->awaitHangup([self = shared_from_this()] { self->hungUp(); });
+}
 
 void PeerConnection::awaitReadable() {
     awaitsReadable_ = true;
@@ -85,8 +105,10 @@ void PeerConnection::readable() {
 }
 
 void PeerConnection::hungUp() {
-    // What wakes us is a hang-up or out-of-band data, which a receive in between may have dropped.
-    if (socket_.hasOutOfBandData() || !socket_.isHungUp()) return breakOff("out-of-band data");
+    if (socket_.hasOutOfBandData()) return breakOff("out-of-band data");
+    // Nothing: a receive in between has dropped that, or the wake was for another socket, one that
+    // had this one's place in the loop before.
+    if (!socket_.isHungUp()) return awaitHangup();
     // What the peer sent last may still be worth an error line.
     while (mayReadOn() && receiveSome()) proceed();
     becomeInvalid("the peer closed the connection");
@@ -152,7 +174,7 @@ bool PeerConnection::takeCounted() {
     const std::size_t wanted = countedBytes();
     if (wanted > counted_) {
         const std::size_t more = wanted - counted_;
-        if (requests_->isWaiting() || !receiveBudget_->tryTake(*requests_, more)) {
+        if (requests_->isWaiting() || !common_.requests->tryTake(*requests_, more)) {
             requests_->await(more);
             return false;
         }
@@ -171,7 +193,7 @@ void PeerConnection::proceed() {
         deliverWaiting();
     }
     if (invalid_) return;
-    if (ended_ && !announcedEnd_ && waiting_.empty() && uncut_.empty()) {
+    if (ended_ && !announcedEnd_ && !decoding_ && waiting_.empty() && uncut_.empty()) {
         announcedEnd_ = true;
         handler_(ConnectionError{ConnectionError::Kind::TerminationImminent,
                                  "the peer will send nothing more"});
@@ -195,14 +217,39 @@ void PeerConnection::deliverWaiting() {
 
 void PeerConnection::deliver(std::shared_ptr<const std::string> payload,
                              std::shared_ptr<Turn> turn) {
-    DecodedPayload decoded = decodePayload(std::move(payload), FrameKind::Request);
-    if (auto* message = std::get_if<Message>(&decoded)) {
-        message->setTurn(std::move(turn));
+    if (payload->size() <= kMaxDecodedAtOnce) {
+        auto decoded = decodePayload(std::move(payload), FrameKind::Request);
+        return handOver({std::move(turn), std::move(decoded)});
+    }
+    // The connection's next request waits for the end of this one's turn: their order holds.
+    decoding_ = true;
+    const Origin& origin = share_.origin();
+    common_.decoder->async(
+        origin, [weak = weak_from_this(), decoder = common_.decoder, origin, &loop = loop_,
+                 payload = std::move(payload), turn = std::move(turn)]() mutable {
+            auto decoded = std::make_shared<Decoded>();
+            decoded->turn = std::move(turn);
+            decoded->payload = decodePayload(std::move(payload), FrameKind::Request);
+            if (auto* message = std::get_if<Message>(&decoded->payload))
+                decoded->turn->freeLater(std::move(decoder), origin, message->contents());
+            loop.post([weak = std::move(weak), decoded = std::move(decoded)] {
+                auto self = weak.lock();
+                if (!self || self->invalid_) return;
+                self->decoding_ = false;
+                self->handOver(std::move(*decoded));
+                self->proceed();
+            });
+        });
+}
+
+void PeerConnection::handOver(Decoded decoded) {
+    if (auto* message = std::get_if<Message>(&decoded.payload)) {
+        message->setTurn(std::move(decoded.turn));
         handler_(std::move(*message));
-    } else if (auto* unknown = std::get_if<UnknownObject>(&decoded)) {
+    } else if (auto* unknown = std::get_if<UnknownObject>(&decoded.payload)) {
         handler_(std::move(*unknown));
     } else {
-        breakOff(std::get<Error>(decoded).text);
+        breakOff(std::get<Error>(decoded.payload).text);
     }
 }
 
@@ -215,7 +262,7 @@ std::shared_ptr<PeerConnection::Turn> PeerConnection::takeTurn() {
     TurnState state = turn_;
     if (state == Taken && turn_.compare_exchange_strong(state, Awaited)) return nullptr;
     if (state == Awaited || replies_->isWaiting()) return nullptr;
-    if (!replyBudget_->tryEnter()) {
+    if (!common_.replies->tryEnter(*replies_)) {
         replies_->await();
         return nullptr;
     }
@@ -260,7 +307,7 @@ std::optional<StallClock::Time> PeerConnection::stalledSince(const Budget& budge
     if (invalid_) return std::nullopt;
     // After a time in which this process did nothing it is not the peer who is behind.
     auto reads = socket_.isWritable() ? std::nullopt : peerReads_.since();
-    if (&budget == replyBudget_.get()) return reads;
+    if (&budget == common_.replies.get()) return reads;
     // Requests may also wait because the peer does not read the replies to those before them.
     if (waiting_.empty() || socket_.held() <= kMaxUnsentPerConnection) reads.reset();
     const auto sends = socket_.isReadable() ? std::nullopt : peerSends_.since();

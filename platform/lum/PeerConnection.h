@@ -9,6 +9,7 @@
 #include <string_view>
 
 #include "platform/lum/Connection.h"
+#include "platform/lum/Decoder.h"
 #include "platform/lum/Frame.h"
 #include "platform/lum/FrameSocket.h"
 #include "platform/lum/Pool.h"
@@ -30,9 +31,14 @@ class PeerConnection final : public Connection,
                              public Budget::Holder,
                              public std::enable_shared_from_this<PeerConnection> {
   public:
+    /// What all connections of a listener have in common.
+    struct Common {
+        std::shared_ptr<ReplyBudget> replies;
+        std::shared_ptr<ReceiveBudget> requests;
+        std::shared_ptr<Decoder> decoder;
+    };
     PeerConnection(UniqueFd socket, AuditToken token, Pool::Share share, SerialQueue& queue,
-                   std::shared_ptr<ReplyBudget> replyBudget,
-                   std::shared_ptr<ReceiveBudget> receiveBudget);
+                   Common common);
 
     pid_t pid() const override { return token_.pid(); }
     const AuditToken& auditToken() const override { return token_; }
@@ -52,6 +58,7 @@ class PeerConnection final : public Connection,
 
   private:
     class Turn;
+    struct Decoded;
     enum TurnState { Free, Taken, Awaited };
 
     void start();
@@ -68,12 +75,14 @@ class PeerConnection final : public Connection,
     void proceed();
     void deliverWaiting();
     void deliver(std::shared_ptr<const std::string> payload, std::shared_ptr<Turn> turn);
+    void handOver(Decoded decoded);
     bool hasRoomForRequests() const;
     bool mayReadOn();
     /// What counts in the budget of all connections of what has been received; whether that has
     /// room for it, else it is awaited.
     std::size_t countedBytes() const;
     bool takeCounted();
+    void awaitHangup();
     void awaitReadable();
     void awaitWritable();
 
@@ -90,8 +99,7 @@ class PeerConnection final : public Connection,
     RunLoop& loop_;
     const AuditToken token_;
     const Pool::Share share_;  // of the connections that there may be
-    const std::shared_ptr<ReplyBudget> replyBudget_;
-    const std::shared_ptr<ReceiveBudget> receiveBudget_;
+    const Common common_;
     const std::shared_ptr<Budget::Share> replies_;
     const std::shared_ptr<Budget::Share> requests_;
     std::shared_ptr<void> context_;
@@ -103,6 +111,7 @@ class PeerConnection final : public Connection,
     bool invalid_ = false;
     bool ended_ = false;  // the peer sends nothing more
     bool announcedEnd_ = false;
+    bool decoding_ = false;  // a request is on the decoder's thread
     bool awaitsReadable_ = false;
 
     // Requests that wait for their turn, still encoded, and bytes behind the last one that fitted.

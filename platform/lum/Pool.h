@@ -21,6 +21,8 @@ class Pool {
         Share& operator=(Share&& other) noexcept;
         ~Share();
 
+        const Origin& origin() const { return origin_; }
+
       private:
         friend class Pool;
         struct State;

@@ -4,14 +4,10 @@
 
 namespace platform::lum {
 
-bool ReceiveBudget::fits(std::int64_t bytes) const {
-    return held_ + bytes <= static_cast<std::int64_t>(kMaxReceivedTotal);
-}
-
 bool ReceiveBudget::tryTake(Share& share, std::size_t bytes) {
     const auto count = static_cast<std::int64_t>(bytes);
     std::lock_guard lock(mutex_);
-    if (isBehind() || !fits(count)) return false;
+    if (!mayTake(accountOf(share), count)) return false;
     changeHeld(share, count);
     return true;
 }

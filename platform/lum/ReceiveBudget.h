@@ -12,15 +12,18 @@ namespace platform::lum {
 class ReceiveBudget final : public Budget {
   public:
     explicit ReceiveBudget(RunLoop& loop, std::chrono::milliseconds patience = kPatience)
-        : Budget(loop, patience) {}
+        : Budget(loop, kMaxReceivedTotal, patience) {}
 
     /// Adds the bytes to the share if there is room and nobody in line comes first. On the loop.
     bool tryTake(Share& share, std::size_t bytes);
 
   private:
-    bool fits(std::int64_t bytes) const;
-    bool hasRoom() const override { return fits(firstWanted()); }
-    bool isOverfull() const override { return !hasRoom(); }
+    bool hasRoom(const Tally& tally, std::int64_t limit, std::int64_t wanted) const override {
+        return tally.held + wanted <= limit;
+    }
+    bool isOverfull(const Tally& tally, std::int64_t limit, std::int64_t wanted) const override {
+        return !hasRoom(tally, limit, wanted);
+    }
     std::string blame(std::int64_t held) const override;
 };
 

@@ -7,27 +7,29 @@
 
 namespace platform::lum {
 
-constexpr auto kLimit = static_cast<std::int64_t>(kMaxUnsentTotal);
-
-bool ReplyBudget::hasRoom() const {
-    if (inService_ == 0) return !isOverfull();
-    return held_ + (inService_ + 1) * expected_ <= kLimit;
+bool ReplyBudget::hasRoom(const Tally& tally, std::int64_t limit, std::int64_t wanted) const {
+    if (tally.inService == 0) return !isOverfull(tally, limit, wanted);
+    return tally.held + (tally.inService + 1) * expected_ <= limit;
 }
 
-bool ReplyBudget::isOverfull() const {
-    return held_ > kLimit;
+bool ReplyBudget::isOverfull(const Tally& tally, std::int64_t limit,
+                             std::int64_t /*wanted*/) const {
+    return tally.held > limit;
 }
 
-bool ReplyBudget::tryEnter() {
+bool ReplyBudget::tryEnter(const Share& share) {
     std::lock_guard lock(mutex_);
-    if (isBehind() || !hasRoom()) return false;
-    inService_ += 1;
+    Account& account = accountOf(share);
+    if (!mayTake(account, 0)) return false;
+    account.inService += 1;
+    total_.inService += 1;
     return true;
 }
 
-void ReplyBudget::leave() {
+void ReplyBudget::leave(const Share& share) {
     std::unique_lock lock(mutex_);
-    inService_ -= 1;
+    accountOf(share).inService -= 1;
+    total_.inService -= 1;
     heldChanged(0);
     wake(std::move(lock));
 }
@@ -35,7 +37,7 @@ void ReplyBudget::leave() {
 void ReplyBudget::heldChanged(std::int64_t by) {
     expected_ = std::max(expected_, by);
     // One client's large replies are no reason to serve others one by one for ever after.
-    if (held_ == 0 && inService_ == 0) expected_ = kMaxUnsentPerConnection;
+    if (total_.held == 0 && total_.inService == 0) expected_ = kMaxUnsentPerConnection;
 }
 
 std::string ReplyBudget::blame(std::int64_t held) const {

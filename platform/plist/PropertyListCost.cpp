@@ -79,11 +79,12 @@ bool PropertyListCost::isReadable() const {
     return objects < kMaxPropertyListObjects && work <= PropertyListWork::kMost;
 }
 
-bool PropertyListCost::fits(std::size_t limit) const {
+bool PropertyListCost::fits(std::size_t limit, std::size_t parts) const {
     // Tags and the deepest indentation of one object's line.
     constexpr std::size_t kMostAround = 192;
-    return objects < kMaxPropertyListObjects / 2 && bytes + objects * kMostAround <= limit &&
-           work <= PropertyListWork::kMost / 2;
+    return objects < kMaxPropertyListObjects / 2 / parts &&
+           bytes + objects * kMostAround <= limit / parts &&
+           work <= PropertyListWork::kMost / 2 / parts;
 }
 
 PropertyListCost costOfPropertyList(const Value& value) {

@@ -18,8 +18,9 @@ struct PropertyListCost {
     /// Whether the reader takes what is written, as far as objects and work go.
     bool isReadable() const;
     /// Whether it is within the limits, with half of the objects and of the work left for what
-    /// holds the pieces together, and `limit` bytes of XML whatever tags and indentation add.
-    bool fits(std::size_t limit) const;
+    /// holds the pieces together, and `limit` bytes of XML whatever tags and indentation add. With
+    /// `parts`: whether it is within that part of each.
+    bool fits(std::size_t limit, std::size_t parts = 1) const;
 };
 PropertyListCost costOfPropertyList(const Value& value);
 

@@ -236,9 +236,9 @@ void SpawnService::awaitEnd(const Host& host, const Asked& asked, bool kill) {
     Running& running = found->second;
     if (running.waiters.size() >= kMaxWaitersPerInstance)
         return refuse(asked, Error::posix(EBUSY, "too many requests wait for this instance"));
-    // Without the turn: the connection goes on meanwhile.
-    Asked later = asked;
-    later.message.setTurn(nullptr);
+    // Without its contents and its turn: the connection goes on meanwhile.
+    Asked later{asked.connection, {}};
+    later.message.setSerial(asked.message.serial());
     running.waiters.push_back([later](int status) { replyStatus(later, status); });
     if (kill) running.instance->kill();
 }

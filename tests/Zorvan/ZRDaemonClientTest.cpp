@@ -162,6 +162,26 @@ TEST_F(ClientTest, UnpacksPropertyListsInTheCurrentVersionOnly) {
     EXPECT_EQ(client_->convertFromLum(received), std::nullopt);
 }
 
+TEST_F(ClientTest, WhatTheDaemonMustRefuseCostsThatRequestAndNothingElse) {
+    Value deep = Dictionary();
+    for (int i = 0; i < 200; ++i) deep = Array{deep};
+    const Value cases[] = {"\xff",
+                           Dictionary{{"\xff", 1}},
+                           std::string("a\0b", 3),
+                           deep,
+                           Array(std::vector<Value>(300'000, 1)),
+                           platform::Data(std::string(16 << 20, 'x'))};
+    for (const Value& value : cases) {
+        Reply reply = replyOf([&](auto done) { client_->matchPlugIns({{"k", value}}, 0, done); });
+        const auto error = ZRDaemonClient::errorInReply(reply);
+        ASSERT_TRUE(error);
+        EXPECT_EQ(error->code, kZRErrorInvalidRequest);
+        EXPECT_THAT(*error->description, testing::StartsWith("request not sent: "));
+    }
+    EXPECT_EQ(sent("bulk", [&](auto done) { client_->bulkPlugins(0, done); }),
+              (Dictionary{{"flags", 0}}));
+}
+
 TEST_F(ClientTest, MayBeReleasedInACallback) {
     std::promise<void> answered;
     client_->bulkPlugins(0, [client = client_, &answered](const Reply&) { answered.set_value(); });

@@ -155,6 +155,9 @@ TEST_F(HostileClients, IdleConnectionsOfSomeKeepNobodyElseOut) {
                                       [](const RawClient& client) { return !client.isClosed(); });
     EXPECT_THAT(served, testing::AllOf(testing::Ge(20), testing::Le(27)));
     EXPECT_EQ(zrd_->errLines("have too many, 28 are the most"), 1u);
+    const RawClient launcher(socket_ + ".spawnerd");
+    launcher.send(bulk_);
+    EXPECT_TRUE(launcher.isClosed()) << "what is full is full at every door";
     expectService();
     const auto other = spawn("/usr/bin/setsid", {"--wait", zrctlProgram_, "match"});
     EXPECT_EQ(other->wait(), 0) << other->err();

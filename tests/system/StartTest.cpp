@@ -1,5 +1,7 @@
 // Starts, among damage and other daemons.
 
+#include <unistd.h>
+
 #include <csignal>
 #include <filesystem>
 
@@ -55,6 +57,20 @@ TEST_F(Start, ClosedStandardStreamsAreNoFilesOfItsOwn) {
     const std::string descriptors = "/proc/" + std::to_string(zrd->pid()) + "/fd/";
     for (const char* number : {"0", "1", "2"})
         EXPECT_EQ(std::filesystem::read_symlink(descriptors + number), "/dev/null");
+}
+
+TEST_F(Start, NobodyHasToReadWhatItWrites) {
+    int ends[2];
+    ASSERT_EQ(::pipe(ends), 0);
+    ::close(ends[0]);
+    const std::string unread = " 2>&" + std::to_string(ends[1]);
+    const auto daemon = [&](const std::string& start) {
+        return spawn("/bin/sh", {"-c", start + unread});
+    };
+    EXPECT_EQ(daemon("exec " ZRD_PROGRAM " -v -x")->wait(), 2);
+    zrd_ = daemon("export ZR_LOG=info; exec " ZRD_PROGRAM " -v");
+    ::close(ends[1]);
+    EXPECT_TRUE(waitUntil([&] { return !zrd_->isRunning() || RawClient(socket_).isConnected(); }));
 }
 
 TEST_F(Start, AJournalOutOfReachLosesNoLines) {

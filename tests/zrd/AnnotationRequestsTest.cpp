@@ -94,20 +94,33 @@ TEST_F(AnnotationRequestsTest, BadChangesChangeNothing) {
 }
 
 TEST_F(AnnotationRequestsTest, NoHostCanFillTheStoreForOthers) {
-    // Each may be stored, both together could not be read back.
-    Array many(std::vector<Value>(263'000, Value(1)));
-    const Dictionary large{{"extension", Dictionary{{"k", many}}}};
-    EXPECT_EQ(annotate(large, Array{uuid(0)}), Dictionary());
+    const auto withObjects = [](std::size_t count) {
+        return Dictionary{{"k", Array(std::vector<Value>(count, Value(1)))}};
+    };
+    // What an earlier daemon has stored leaves room for less than what may be read back.
+    server_->setAnnotation(Dictionary{{"extension", withObjects(470'000)}},
+                           *server_->findPlugIn(uuid(0)));
+    const Dictionary extension = withObjects(60'000), large{{"extension", extension}};
     EXPECT_EQ(annotate(large, Array{uuid(1)}),
               error(4, "invalid request format (annotation extension)"));
-    EXPECT_EQ(bulkAnnotate(Dictionary{{uuid(1).string(), Dictionary{{"k", many}}}}),
+    EXPECT_EQ(bulkAnnotate(Dictionary{{uuid(1).string(), extension}}),
               error(18, "annotations values must be dictionaries"));
     LogLines log;
     EXPECT_EQ(annotate(Dictionary{{"election", 2}}, Array{uuid(1)}), Dictionary());
     EXPECT_THAT(log.take(), Not(Contains(HasSubstr("unable to save"))));
     EXPECT_EQ(annotate(large, Array{uuid(0)}), Dictionary()) << "it takes its own place";
-    EXPECT_EQ(annotate(Dictionary{{"extension", Dictionary()}}, Array{uuid(0)}), Dictionary());
     EXPECT_EQ(annotate(large, Array{uuid(1)}), Dictionary());
+
+    // The two are less than a quarter; with any more of them it would be over.
+    const Dictionary more = withObjects(80'000);
+    const Dictionary refused = error(11, "too many annotations");
+    EXPECT_EQ(annotate(Dictionary{{"extension", more}}, Array{uuid(1)}), refused);
+    EXPECT_EQ(bulkAnnotate(Dictionary{{uuid(0).string(), more}}), refused);
+    const ZRDPlugInRef plugIn = server_->findPlugIn(uuid(1));
+    EXPECT_TRUE(server_->hasShareForAnnotation({{"extension", more}}, *plugIn, {1, 1, 0}));
+    server_->setAnnotation(large, *plugIn, platform::Origin{1, 1, 0});
+    EXPECT_EQ(annotate(Dictionary{{"extension", more}}, Array{uuid(0)}), Dictionary())
+        << "what somebody else has replaced is theirs";
 }
 
 TEST_F(AnnotationRequestsTest, TheListIsWalkedUpToTheFirstFailure) {

@@ -15,7 +15,8 @@ namespace {
 Error whyNoAnswer(const ConnectionError& error) {
     if (error.kind == ConnectionError::Kind::Interrupted)
         return {"zrctl", 0, "zrd ended the connection: " + error.text};
-    // The text names the socket, or says what is wrong with the service's name or the request.
+    if (error.kind == ConnectionError::Kind::Refused) return {"zrctl", 0, describe(error)};
+    // The text names the socket, or says what is wrong with the service's name.
     const bool noService = error.text.starts_with("no service at ");
     return {"zrctl", 0, noService ? "zrd is not running: " + error.text : error.text};
 }

@@ -1,3 +1,4 @@
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/socket.h>
 
@@ -10,6 +11,8 @@
 namespace platform::lum {
 namespace {
 
+using ::testing::ElementsAre;
+
 struct FakeHolder final : Budget::Holder {
     std::function<void()> onRetry;
     std::function<void()> onCutOff;
@@ -20,32 +23,45 @@ struct FakeHolder final : Budget::Holder {
     void cutOff(const std::string&) override { onCutOff(); }
 };
 
+/// As many origins as there are numbers.
+Origin origin(pid_t session) {
+    return {0, 0, session};
+}
+
+constexpr std::size_t kQuarterOfReplies = kMaxUnsentTotal / 4;
+constexpr std::size_t kQuarterOfRequests = kMaxReceivedTotal / 4;
+
 TEST(ReplyBudget, LetsRequestsInWhileTheirRepliesFit) {
     RunLoop loop;
     auto budget = std::make_shared<ReplyBudget>(loop);
-    auto share = budget->open();
-    const auto enterAll = [&budget] {
-        std::size_t entered = 0;
-        while (budget->tryEnter()) entered += 1;
+    std::vector<std::shared_ptr<Budget::Share>> shares;
+    for (pid_t session : {1, 2, 3, 4, 5}) shares.push_back(budget->open(origin(session)));
+    const auto enterAll = [&] {
+        std::vector<std::size_t> entered;
+        for (const auto& share : shares) {
+            entered.push_back(0);
+            while (budget->tryEnter(*share)) entered.back() += 1;
+        }
         return entered;
     };
-    std::size_t entered = enterAll();
-    EXPECT_EQ(entered, kMaxUnsentTotal / kMaxUnsentPerConnection);
+    EXPECT_THAT(enterAll(), ElementsAre(8, 8, 8, 8, 0));
 
     // The first reply shows that replies are large: from now on one request at a time.
-    share->add(kMaxUnsentTotal);
-    for (; entered > 0; --entered) budget->leave();
-    EXPECT_EQ(enterAll(), 1u);
-    budget->leave();
+    shares[0]->add(kMaxUnsentTotal);
+    for (int i = 0; i < 32; ++i) budget->leave(*shares[i / 8]);
+    EXPECT_THAT(enterAll(), ElementsAre(0, 1, 0, 0, 0)) << "nor one of who holds its quarter";
+    budget->leave(*shares[1]);
 
-    share->add(1);
-    EXPECT_FALSE(budget->tryEnter());
+    for (int i : {1, 2, 3}) shares[i]->add(kQuarterOfReplies);
+    shares[4]->add(1);
+    EXPECT_FALSE(budget->tryEnter(*shares[4]));
     std::string order;
     std::vector<std::pair<std::shared_ptr<FakeHolder>, std::shared_ptr<Budget::Share>>> line;
     for (char name : {'a', 'b', 'x', 'c'}) {
-        auto& [holder, waiting] = line.emplace_back(std::make_shared<FakeHolder>(), budget->open());
-        holder->onRetry = [&order, &budget, name] {
-            if (budget->tryEnter()) order += name;
+        auto& [holder, waiting] =
+            line.emplace_back(std::make_shared<FakeHolder>(), budget->open(origin(name)));
+        holder->onRetry = [&order, &budget, name, share = waiting.get()] {
+            if (budget->tryEnter(*share)) order += name;
         };
         waiting->setHolder(holder);
         waiting->await();
@@ -53,20 +69,52 @@ TEST(ReplyBudget, LetsRequestsInWhileTheirRepliesFit) {
     line[2].second->stopWaiting();
     loop.poll();
     EXPECT_EQ(order, "");
-    share->remove(1);
-    EXPECT_FALSE(budget->tryEnter()) << "those who wait come first";
+    shares[4]->remove(1);
+    EXPECT_FALSE(budget->tryEnter(*shares[4])) << "those who wait come first";
     loop.poll();
     EXPECT_EQ(order, "a");
-    budget->leave();
+    budget->leave(*line[0].second);
     loop.poll();
     EXPECT_EQ(order, "ab");
-    share.reset();
-    budget->leave();
+    shares.clear();
+    budget->leave(*line[1].second);
     loop.poll();
     EXPECT_EQ(order, "abc");
 
-    budget->leave();
-    EXPECT_EQ(enterAll(), kMaxUnsentTotal / kMaxUnsentPerConnection) << "large replies forgotten";
+    budget->leave(*line[3].second);
+    shares.push_back(budget->open(origin(1)));
+    EXPECT_THAT(enterAll(), ElementsAre(8)) << "large replies forgotten";
+}
+
+TEST(Budget, WhoHasUsedUpItsQuarterStandsInItsOwnWayAlone) {
+    RunLoop loop;
+    auto budget = std::make_shared<ReceiveBudget>(loop, std::chrono::milliseconds(20));
+    std::string events;
+    struct Member {
+        std::shared_ptr<FakeHolder> holder = std::make_shared<FakeHolder>();
+        std::shared_ptr<Budget::Share> share;
+    };
+    const auto join = [&](char name, pid_t session, std::size_t holds) {
+        Member member;
+        member.share = budget->open(origin(session));
+        member.share->setHolder(member.holder);
+        member.holder->stalled = std::chrono::steady_clock::now() - std::chrono::hours(1);
+        member.holder->onRetry = [&events, name] { events += name; };
+        member.holder->onCutOff = [&events, share = member.share.get(), holds, name] {
+            events += std::string("-") + name;
+            share->remove(holds);
+        };
+        EXPECT_TRUE(budget->tryTake(*member.share, holds)) << name;
+        return member;
+    };
+    Member small = join('s', 1, 1), hoarder = join('h', 1, kQuarterOfRequests - 1);
+    Member waiting = join('w', 1, 0), other = join('o', 2, kMaxRequestPayload);
+    EXPECT_FALSE(budget->tryTake(*waiting.share, 1));
+    waiting.share->await(1);
+    EXPECT_TRUE(budget->tryTake(*other.share, kMaxRequestPayload)) << "a stranger's line";
+    loop.poll();
+    loop.poll();
+    EXPECT_EQ(events, "-hw");
 }
 
 TEST(Budget, CutsOffTheLargestOfTheStalledUntilThereIsRoom) {
@@ -82,7 +130,7 @@ TEST(Budget, CutsOffTheLargestOfTheStalledUntilThereIsRoom) {
     std::vector<Member> members;
     const auto join = [&](char name, std::size_t holds, std::optional<StallClock::Time> stalled) {
         Member& member = members.emplace_back();
-        member.share = budget->open();
+        member.share = budget->open(origin(name));
         member.share->setHolder(member.holder);
         member.share->add(holds);
         member.holder->stalled = stalled;
@@ -93,15 +141,16 @@ TEST(Budget, CutsOffTheLargestOfTheStalledUntilThereIsRoom) {
     };
     join('a', kMaxUnsentTotal / 8, longAgo);
     join('b', kMaxUnsentTotal / 4, longAgo);
-    join('c', kMaxUnsentTotal / 2, std::nullopt);  // reads
+    join('c', kMaxUnsentTotal / 4, std::nullopt);  // reads
     join('d', kMaxUnsentTotal / 4, longAgo);
     join('e', kMaxUnsentTotal / 4, std::nullopt);
+    join('f', kMaxUnsentTotal, std::nullopt);  // counts as a quarter
     loop.poll();
     EXPECT_EQ(cut, "") << "nobody waits";
 
     bool entered = false;
-    Member waiting{std::make_shared<FakeHolder>(), budget->open()};
-    waiting.holder->onRetry = [&] { entered = budget->tryEnter(); };
+    Member waiting{std::make_shared<FakeHolder>(), budget->open(origin('w'))};
+    waiting.holder->onRetry = [&] { entered = budget->tryEnter(*waiting.share); };
     waiting.share->setHolder(waiting.holder);
     waiting.share->await();
     loop.poll();
@@ -110,8 +159,9 @@ TEST(Budget, CutsOffTheLargestOfTheStalledUntilThereIsRoom) {
     EXPECT_TRUE(entered);
 
     // Over the limit once more, by those whose time is not up: the budget looks again by itself.
-    budget->leave();
-    members[2].share->add(kMaxUnsentTotal / 4);
+    budget->leave(*waiting.share);
+    members[1].share->add(kMaxUnsentTotal / 4);
+    members[1].holder->stalled = std::nullopt;
     for (Member& member : {std::ref(members[0]), std::ref(members[4])})
         member.holder->stalled = std::chrono::steady_clock::now();
     waiting.share->await();
@@ -128,7 +178,7 @@ TEST(Budget, WhoeverStallsInTurnIsNotGivenAllThePatienceInTurn) {
     const std::chrono::milliseconds patience(200);
     auto budget = std::make_shared<ReplyBudget>(loop, patience);
     auto staller = std::make_shared<FakeHolder>(), waiting = std::make_shared<FakeHolder>();
-    auto stalled = budget->open(), waits = budget->open();
+    auto stalled = budget->open(origin(1)), waits = budget->open(origin(1));
     stalled->setHolder(staller);
     waits->setHolder(waiting);
     stalled->add(kMaxUnsentTotal + 1);
@@ -141,7 +191,7 @@ TEST(Budget, WhoeverStallsInTurnIsNotGivenAllThePatienceInTurn) {
         if (++cut == 10) stalled->remove(kMaxUnsentTotal + 1);
     };
     bool entered = false;
-    waiting->onRetry = [&] { entered = budget->tryEnter(); };
+    waiting->onRetry = [&] { entered = budget->tryEnter(*waits); };
     waits->await();
     while (!entered && std::chrono::steady_clock::now() - begin < std::chrono::seconds(20))
         loop.runOnce(patience);
@@ -156,12 +206,22 @@ class SharedBudgetsTest : public LumTest {
         std::shared_ptr<PeerConnection> connection;
         std::unique_ptr<RawPeer> peer;
     };
+    ~SharedBudgetsTest() override { decoder->close(); }
+
+    /// Each comes from elsewhere.
     Pair connect() {
+        Pair pair = pairOf(++origins);
+        queue.async([connection = pair.connection] { connection->resume(); });
+        loop.poll();
+        return pair;
+    }
+    Pair pairOf(pid_t session) {
         int ends[2];
         if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) != 0) return {};
         auto peer = std::make_unique<RawPeer>(UniqueFd(ends[1]));
         auto connection = std::make_shared<PeerConnection>(
-            UniqueFd(ends[0]), *AuditToken::ofSelf(), *Pool(4).draw({}), queue, replies, requests);
+            UniqueFd(ends[0]), *AuditToken::ofSelf(), *Pool(4).draw(origin(session)), queue,
+            PeerConnection::Common{replies, requests, decoder});
         connection->setEventHandler(
             [this, weak = std::weak_ptr(connection)](const ConnectionEvent& event) {
                 auto self = weak.lock();
@@ -171,8 +231,6 @@ class SharedBudgetsTest : public LumTest {
                     self->send(Message::replyTo(*message));
                 }
             });
-        queue.async([connection] { connection->resume(); });
-        loop.poll();
         return {std::move(connection), std::move(peer)};
     }
     bool isAnswered(Pair& pair, std::string_view request) {
@@ -187,6 +245,8 @@ class SharedBudgetsTest : public LumTest {
     std::shared_ptr<ReplyBudget> replies = std::make_shared<ReplyBudget>(loop, kLittlePatience);
     std::shared_ptr<ReceiveBudget> requests =
         std::make_shared<ReceiveBudget>(loop, kLittlePatience);
+    std::shared_ptr<Decoder> decoder = std::make_shared<Decoder>();
+    pid_t origins = 0;
     std::size_t served = 0;
     bool keeps = false;
     std::vector<Message> kept;
@@ -254,6 +314,28 @@ TEST_F(SharedBudgetsTest, ARequestCountsUntilItIsServedToItsEnd) {
     EXPECT_TRUE(isAnswered(next, std::string_view(large).substr(written)));
     for (auto& [connection, peer] : busy) connection->abandon();
     next.connection->abandon();
+}
+
+TEST_F(SharedBudgetsTest, AWakeThatWasForAnotherSocketEndsNobody) {
+    Pair gone = connect(), next;
+    int ends[2];
+    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends), 0);
+    const UniqueFd watched(ends[0]), written(ends[1]);
+    RunLoop::Watch watch(loop, watched.get());
+    // While the end of the one is known to the loop already, another takes its place there.
+    watch.awaitReadable([&] {
+        gone.connection->abandon();
+        next = pairOf(++origins);
+        next.connection->resume();
+    });
+    loop.poll();
+    ASSERT_EQ(::write(written.get(), "x", 1), 1);
+    gone.peer->close();
+    loop.poll();
+    EXPECT_TRUE(isAnswered(next, requestFrame(1)));
+    EXPECT_EQ(errorLines(), 0u);
+    next.peer->close();
+    EXPECT_TRUE(stepUntil([&] { return next.connection.use_count() == 1; })) << "it still listens";
 }
 
 TEST(Pool, OneOriginHasAQuarterAtTheMost) {

@@ -1,5 +1,6 @@
 #include "platform/lum/ClientConnection.h"
 
+#include <fcntl.h>
 #include <gmock/gmock.h>
 
 #include "tests/platform/lum/LumFixture.h"
@@ -85,6 +86,33 @@ TEST_F(ClientConnectionTest, WritesALongRequestAsTheServiceReads) {
     send("over the limit", {{"data", Data(std::string(16 << 20, 'x'))}});
     EXPECT_TRUE(stepUntil([&] { return !outcomes.empty(); }));
     EXPECT_THAT(outcomes, ElementsAre(HasSubstr("over the limit of 16777216")));
+}
+
+TEST_F(ClientConnectionTest, DoesNotWaitForAServiceThatLetsNobodyIn) {
+    serve();
+    const auto connectAtOnce = [](int fd, const sockaddr* address, socklen_t size) {
+        ::fcntl(fd, F_SETFL, O_NONBLOCK);
+        return ::connect(fd, address, size);
+    };
+    std::vector<UniqueFd> others;
+    while (UniqueFd other = unixSocket(path(), connectAtOnce)) others.push_back(std::move(other));
+    client = std::make_unique<ClientConnection>(directories, "test", queue);
+    client->resume();
+    send("a");
+    send("b");
+    ::fcntl(listening.get(), F_SETFL, O_NONBLOCK);
+    // It comes behind the others.
+    std::size_t letIn = 0;
+    ASSERT_TRUE(stepUntil([&] {
+        server.emplace(UniqueFd(accept(listening.get(), nullptr, nullptr)));
+        letIn += server->fd() >= 0 ? 1 : 0;
+        return letIn > others.size();
+    }));
+    const Message a = request(), b = request();
+    reply(a);
+    reply(b);
+    EXPECT_TRUE(stepUntil([&] { return outcomes.size() == 2; }));
+    EXPECT_THAT(outcomes, ElementsAre("a", "b"));
 }
 
 TEST_F(ClientConnectionTest, WithoutAServiceEverythingFailsAtOnce) {

@@ -86,6 +86,38 @@ TEST(Frame, LimitsTheValuesOfRequestsButNotOfReplies) {
     EXPECT_TRUE(std::holds_alternative<Message>(decodeBody(2 * kMaxCborValues, FrameKind::Reply)));
 }
 
+TEST(Frame, ASenderKnowsWhatItsReceiverWouldRefuse) {
+    const auto nested = [](int levels, auto around) {
+        Value value = 1;
+        for (int i = 0; i < levels; ++i) value = around(value);
+        return value;
+    };
+    const auto arrays = [](Value value) { return Value(Array{std::move(value)}); };
+    const auto maps = [](Value value) { return Value(Dictionary{{"k", std::move(value)}}); };
+    constexpr int kDeepest = kMaxCborDepth - 2;  // in [kind, serial, {"k": ...}]
+    const std::pair<Value, bool> cases[] = {
+        {nested(kDeepest, arrays), true},
+        {nested(kDeepest + 1, arrays), false},
+        {nested(kDeepest, maps), true},
+        {nested(kDeepest + 1, maps), false},
+        {Array(std::vector<Value>(kMaxRequestValues - 5, Value(0))), true},
+        {Array(std::vector<Value>(kMaxRequestValues - 4, Value(0))), false},
+        {Array{"\xc3\xa4", Data(std::string("\0\xff", 2)), Uuid::random(), Date{1}}, true},
+        {Packed(Value("\xff")), true},
+        {"\xff", false},
+        {std::string("\0", 1), false},
+        {Dictionary{{"\xff", 1}}, false},
+    };
+    for (const auto& [value, isTaken] : cases) {
+        const Message message(Dictionary{{"k", value}});
+        EXPECT_EQ(!whatIsWrongWith(message.contents()), isTaken) << describe(value).substr(0, 80);
+        const std::string bytes =
+            encodeFrame(FrameKind::Request, message, kMaxReplyPayload)->string();
+        const auto decoded = decode(std::string_view(bytes).substr(kFrameHeaderSize));
+        EXPECT_EQ(std::holds_alternative<Message>(decoded), isTaken);
+    }
+}
+
 TEST(FrameReader, PutsPiecesTogetherAndCutsRuns) {
     std::string stream;
     std::vector<std::string> payloads{"a", "", std::string(300, 'b'), std::string(70000, 'c')};

@@ -7,6 +7,7 @@
 #include <sys/wait.h>
 
 #include <algorithm>
+#include <ctime>
 #include <fstream>
 #include <memory>
 
@@ -274,6 +275,49 @@ TEST_F(ListenerTest, DeliversOneRequestAtATimeAndAnswersInOrder) {
     }));
     EXPECT_TRUE(std::is_sorted(serials.begin(), serials.end()));
     EXPECT_EQ(events.size(), kCount);
+}
+
+/// How long a thread works at something, whatever else the machine does.
+template <class Work>
+double cpuSeconds(Work work) {
+    const auto now = [] {
+        timespec time{};
+        clock_gettime(CLOCK_THREAD_CPUTIME_ID, &time);
+        return static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_nsec) * 1e-9;
+    };
+    const double begin = now();
+    work();
+    return now() - begin;
+}
+
+TEST_F(ListenerTest, LargeRequestsAreDecodedAndFreedElsewhereAndKeepTheirOrder) {
+    replySize = 1;
+    openAndResume();
+    const std::string large =
+        requestFrame(1, {{"b", Array(std::vector<Value>(kMaxRequestValues - 5, "text"))}});
+    const double decoding = cpuSeconds([&] {
+        decodePayload(std::make_shared<const std::string>(large.substr(4)), FrameKind::Request);
+    });
+    std::string broken = large;
+    broken.back() = '\xff';
+    RawPeer peer(path()), breaker(path());
+    const std::string requests = large + requestFrame(2) + large + requestFrame(4);
+    std::size_t written = 0, writtenBroken = 0;
+    double longest = 0;
+    const auto begin = std::chrono::steady_clock::now();
+    while (events.size() < 6 &&
+           std::chrono::steady_clock::now() - begin < std::chrono::seconds(20)) {
+        written += peer.write(std::string_view(requests).substr(written));
+        if (written == requests.size()) peer.halfClose();
+        writtenBroken += breaker.write(std::string_view(broken).substr(writtenBroken));
+        longest = std::max(longest, cpuSeconds([&] { loop.runOnce(std::chrono::seconds(1)); }));
+        peer.read();
+    }
+    std::erase(events, "invalid");
+    EXPECT_THAT(events,
+                ElementsAre("message 1", "message 2", "message 1", "message 4", "imminent"));
+    EXPECT_EQ(errorLines("not UTF-8"), 1u);
+    EXPECT_LT(longest, decoding / 3);
 }
 
 TEST_F(ListenerTest, AHalfClosedPeerStillGetsItsReplies) {

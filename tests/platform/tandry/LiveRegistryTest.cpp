@@ -164,21 +164,31 @@ TEST_F(LiveRegistryTest, WithoutEnoughWatchesItLooksFromTimeToTime) {
     EXPECT_THAT(errors.lines, testing::Contains(HasSubstr("cannot watch all")).Times(1));
 }
 
-/// While it lives, this process can open so many descriptors more.
+/// While it lives, this process can open no descriptors, or few.
 class FewDescriptors {
   public:
-    explicit FewDescriptors(std::size_t count) {
+    static constexpr std::size_t kMost = 32;
+
+    FewDescriptors() {
         ::getrlimit(RLIMIT_NOFILE, &before_);
-        std::vector<UniqueFd> free(count);
-        for (UniqueFd& fd : free) fd.reset(::open("/dev/null", O_RDONLY | O_CLOEXEC));
-        rlimit limit = before_;
-        limit.rlim_cur = static_cast<rlim_t>(free.back().get()) + 1;
-        ::setrlimit(RLIMIT_NOFILE, &limit);
+        std::vector<UniqueFd> opened(kMost + 1);
+        for (UniqueFd& fd : opened) {
+            fd.reset(::open("/dev/null", O_RDONLY | O_CLOEXEC));
+            free_.push_back(static_cast<rlim_t>(fd.get()));
+        }
+        allow(0);
     }
     ~FewDescriptors() { ::setrlimit(RLIMIT_NOFILE, &before_); }
 
+    /// Together.
+    void allow(std::size_t count) {
+        const rlimit limit{free_[count], before_.rlim_max};
+        ::setrlimit(RLIMIT_NOFILE, &limit);
+    }
+
   private:
     rlimit before_{};
+    std::vector<rlim_t> free_;
 };
 
 TEST_F(LiveRegistryTest, WhatCannotBeReadJustNowStaysAndIsReadLater) {
@@ -197,11 +207,17 @@ TEST_F(LiveRegistryTest, WhatCannotBeReadJustNowStaysAndIsReadLater) {
                    {{"de", Dictionary{{"QFBundleDisplayName", "Anna"}}}});
     fs::remove_all(at(apps + "A.app/PlugIns/B.appex"));
     {
-        // A folder and a bundle in it, and no file.
-        const FewDescriptors few(2);
-        static_cast<void>(registerPlugIn(files.path(apps + "A.app")));
-        EXPECT_THAT(recorder.take(), ElementsAre("-b"));
-        EXPECT_EQ(plugIn("a")->plugInUuid, uuid);
+        // One more at a time, until there are enough to see into the folder, but not into its
+        // files.
+        FewDescriptors few;
+        std::vector<std::string> told;
+        for (std::size_t count = 0; told.empty() && count < FewDescriptors::kMost; ++count) {
+            few.allow(count);
+            static_cast<void>(registerPlugIn(files.path(apps + "A.app")));
+            told = recorder.take();
+            EXPECT_EQ(plugIn("a")->plugInUuid, uuid) << count;
+        }
+        EXPECT_THAT(told, ElementsAre("-b"));
     }
     ::unsetenv("LC_ALL");
     // The application's names may be read in one walk, the plug-in's in the next.
