@@ -10,27 +10,29 @@ namespace platform::spawnerd {
 struct InstanceLimits {
     std::uint64_t memory;        // bytes, of all its processes; where there are groups
     std::uint64_t processes;     // and threads
-    std::uint64_t descriptors;   // of each process; `kMostDescriptors` once it asks for more
+    std::uint64_t descriptors;   // of each process
     std::uint64_t sharedMemory;  // bytes in /dev/shm
     std::uint64_t temporary;     // bytes in /tmp
     std::uint64_t cpuWeight;     // beside others, which have 100; where there are groups
 };
 
 inline constexpr std::uint64_t kMiB = 1u << 20;
-/// What a process can raise its limit of descriptors to.
-inline constexpr std::uint64_t kMostDescriptors = 4096;
+/// Half of what most programs of the user have: descriptors that are on their way through sockets
+/// count for all of the user's processes together, and each may send more as long as there are no
+/// more of them than its own limit says.
+inline constexpr std::uint64_t kUsualDescriptors = 512;
 
 /// For what has to load what the user works with.
 inline constexpr InstanceLimits kWorkLimits{.memory = 2048 * kMiB,
                                             .processes = 512,
-                                            .descriptors = 1024,
+                                            .descriptors = kUsualDescriptors,
                                             .sharedMemory = 64 * kMiB,
                                             .temporary = 64 * kMiB,
                                             .cpuWeight = 50};
 /// For what waits most of its time, and there is much of.
 inline constexpr InstanceLimits kSmallLimits{.memory = 512 * kMiB,
                                              .processes = 128,
-                                             .descriptors = 1024,
+                                             .descriptors = kUsualDescriptors,
                                              .sharedMemory = 16 * kMiB,
                                              .temporary = 64 * kMiB,
                                              .cpuWeight = 100};

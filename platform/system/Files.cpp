@@ -1,6 +1,7 @@
 #include "platform/system/Files.h"
 
 #include <fcntl.h>
+#include <sys/mman.h>
 #include <sys/random.h>
 #include <unistd.h>
 
@@ -195,6 +196,17 @@ std::optional<Error> writeFileAtomically(const std::string& path, std::string_vi
     if (int failure = replaceIn(dirfd.get(), name.c_str(), bytes))
         return Error::posix(failure, path);
     return std::nullopt;
+}
+
+UniqueFd memoryFile(std::string_view bytes) {
+    UniqueFd file(::memfd_create("zrd", MFD_CLOEXEC));
+    while (file && !bytes.empty()) {
+        const ssize_t count = ::write(file.get(), bytes.data(), bytes.size());
+        if (count < 0) return UniqueFd();
+        bytes.remove_prefix(static_cast<std::size_t>(count));
+    }
+    if (file) ::lseek(file.get(), 0, SEEK_SET);
+    return file;
 }
 
 std::optional<Error> makeDirectories(const std::string& path, mode_t mode) {

@@ -8,6 +8,7 @@
 #include <string_view>
 
 #include "platform/system/Error.h"
+#include "platform/system/UniqueFd.h"
 
 namespace platform {
 
@@ -29,6 +30,10 @@ Result<std::string> readFileBeneath(int dirfd, const std::string& name, std::siz
 /// the file that it leads to is replaced. None on success. Errors: the system's; EINVAL when
 /// something other than a regular file is there.
 std::optional<Error> writeFileAtomically(const std::string& path, std::string_view bytes);
+
+/// A file without a name, in memory, with these bytes, to be read from its beginning; none, with
+/// errno set, when there is no room.
+UniqueFd memoryFile(std::string_view bytes);
 
 /// Makes the directory and its missing parents, each with `mode`. An existing directory is fine.
 std::optional<Error> makeDirectories(const std::string& path, mode_t mode);
