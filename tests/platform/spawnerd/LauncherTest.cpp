@@ -69,6 +69,7 @@ class NetworkTest : public LauncherTest {
         const auto text = readFile(home.path("started"), 1u << 20);
         return text ? static_cast<std::size_t>(std::ranges::count(*text, '\n')) : 0;
     }
+    static bool hasDevice() { return ::access("/dev/net/tun", R_OK | W_OK) == 0; }
     void wantNetwork(const Value& wanted = true) {
         home.write("one.appex/Entitlements.plist",
                    *writeXmlPropertyList(Dictionary{{kNetworkEntitlement, wanted}}));
@@ -92,16 +93,15 @@ TEST_F(NetworkTest, IsForThoseThatAskForItAndMayHaveIt) {
     EXPECT_EQ(started(), 0u);
     settings.set("plug-ins", Dictionary());
     EXPECT_EQ(start(executable_), kAlone + "/etc/resolv.conf\n"s);
-    EXPECT_EQ(started(), 1u);
+    EXPECT_EQ(started(), hasDevice() ? 1u : 0u);
     EXPECT_TRUE(stepUntil([&] { return processesWith(home.path("pasta")).empty(); }));
 }
 
 TEST_F(NetworkTest, AProgramThatFailsLeavesThePlugInWithoutOne) {
     wantNetwork();
     usePasta("echo no route >&2");
-    const bool hasDevice = ::access("/dev/net/tun", R_OK | W_OK) == 0;
     EXPECT_EQ(start(executable_), kAlone + "/etc/resolv.conf\n"s);
-    EXPECT_EQ(errorLines(hasDevice ? "no route" : "/dev/net/tun"), 1u);
+    EXPECT_EQ(errorLines(hasDevice() ? "no route" : "/dev/net/tun"), 1u);
     useLauncher({.pasta = home.path("missing")});
     EXPECT_EQ(start(executable_), kAlone + "/etc/resolv.conf\n"s);
     EXPECT_EQ(errorLines("starts without a network"), 2u);
@@ -110,7 +110,7 @@ TEST_F(NetworkTest, AProgramThatFailsLeavesThePlugInWithoutOne) {
 /// What listens on the machine's loopback interface, or without a name in the file system, is not
 /// there for a plug-in.
 TEST_F(NetworkTest, DoesNotLeadToTheMachineItself) {
-    if (::access(kPasta, X_OK) != 0 || ::access("/dev/net/tun", R_OK | W_OK) != 0)
+    if (::access(kPasta, X_OK) != 0 || !hasDevice())
         GTEST_SKIP() << "there is no pasta, or no device for it";
     const UniqueFd listening(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
     sockaddr_in address{};
@@ -124,9 +124,9 @@ TEST_F(NetworkTest, DoesNotLeadToTheMachineItself) {
     const std::string executable = plugIn(
         "one",
         "tail -n+2 /proc/net/route | wc -l\n"
-        "gateway=$(awk '$2 == \"00000000\" { for (i = 7; i > 0; i -= 2) printf \"%d%s\","
-        " \"0x\" substr($3, i, 2), i > 1 ? \".\" : \"\" }' /proc/net/route)\n"
-        "for host in 127.0.0.1 ${gateway:-127.0.0.1} 169.254.1.1; do\n"
+        "gateway=$(perl -ane 'print join \".\", reverse map hex, unpack \"(A2)4\", $F[2]"
+        " if $F[1] eq \"00000000\"' /proc/net/route)\n"
+        "for host in 127.0.0.1 $gateway 169.254.1.1; do\n"
         "perl -MIO::Socket::INET -e 'print IO::Socket::INET->new(PeerAddr => $ARGV[0], PeerPort =>"
         " $ARGV[1], Timeout => 1) ? \"in\" : \"out\", \"\\n\"' $host " + port + "\ndone");
     wantNetwork();
