@@ -30,8 +30,8 @@ platform::Services diskServices(const std::string& serviceName,
     services.directories = platform::Directories::fromEnvironment();
     services.mainLoop = std::move(mainLoop);
     // First, while there are no other threads.
-    services.launcher = platform::makeLauncher(services.directories, serviceName,
-                                               services.mainLoop, limits(services.directories));
+    services.launcher = platform::makeLauncher(services.directories, serviceName, services.mainLoop,
+                                               limits(services.directories));
     services.codeSigning = platform::makeFileCodeSigning();
     services.sandbox =
         platform::makeKernelSandbox(services.directories, serviceName, *services.mainLoop);

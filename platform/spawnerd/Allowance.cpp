@@ -18,7 +18,7 @@ constexpr const char* kNetwork = "network";
 /// The numbers that there are, as people write them: in units of so much, from a least to a most.
 struct Limit {
     std::string_view key;
-    std::uint64_t InstanceLimits::* place;
+    std::uint64_t InstanceLimits::*place;
     std::uint64_t unit, least, most;
 };
 constexpr std::uint64_t kMostMiB = 1u << 24;
@@ -61,7 +61,8 @@ Allowance allowanceFor(const Grant& grant, const LauncherSettings& settings) {
         if (!own || !own->dictionary()) continue;
         for (const auto& [key, value] : *own->dictionary())
             if (!apply(key, value, hasNetwork, allowance))
-                EVLOG_ERROR(ops(), "ignoring the limit \"{}\" of {} {}: no such limit, or out of bounds",
+                EVLOG_ERROR(ops(),
+                            "ignoring the limit \"{}\" of {} {}: no such limit, or out of bounds",
                             key, pub(kind), *name);
     }
     return allowance;

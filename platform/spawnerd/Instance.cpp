@@ -52,9 +52,9 @@ UniqueFd firstProcessOf(const std::string& info) {
 
 }  // namespace
 
-Instance::Instance(RunLoop& loop, const Keeper& keeper, std::string pasta,
-                   SandboxedProcess process, std::string name, const Allowance& allowance,
-                   InstanceGroup group, std::function<void()> runs, std::function<void(int)> ended)
+Instance::Instance(RunLoop& loop, const Keeper& keeper, std::string pasta, SandboxedProcess process,
+                   std::string name, const Allowance& allowance, InstanceGroup group,
+                   std::function<void()> runs, std::function<void(int)> ended)
     : loop_(loop),
       keeper_(keeper),
       pasta_(std::move(pasta)),

@@ -17,15 +17,15 @@
 namespace platform::spawnerd {
 
 /// A plug-in that is being started, runs, or ends: the bubblewrap process outside, and the first
-/// process of the sandbox's pid namespace, with which everything in there ends, whatever the plug-in
-/// forked. On the loop's thread.
+/// process of the sandbox's pid namespace, with which everything in there ends, whatever the
+/// plug-in forked. On the loop's thread.
 class Instance {
   public:
-    /// `allowance` is in force before the plug-in runs, and that of `group`, if it is one, too; when
-    /// it is allowed the network, which `pasta` brings, and that cannot be had, an error line says
-    /// so and the plug-in runs without. `runs` is called once the sandbox is there; `ended`, once,
-    /// when no process of it is left, with the plug-in's exit status, or 128 and the number of the
-    /// signal that ended it. The instance may be destroyed in `ended`.
+    /// `allowance` is in force before the plug-in runs, and that of `group`, if it is one, too;
+    /// when it is allowed the network, which `pasta` brings, and that cannot be had, an error line
+    /// says so and the plug-in runs without. `runs` is called once the sandbox is there; `ended`,
+    /// once, when no process of it is left, with the plug-in's exit status, or 128 and the number
+    /// of the signal that ended it. The instance may be destroyed in `ended`.
     Instance(RunLoop& loop, const Keeper& keeper, std::string pasta, SandboxedProcess process,
              std::string name, const Allowance& allowance, InstanceGroup group,
              std::function<void()> runs, std::function<void(int status)> ended);

@@ -25,13 +25,10 @@ constexpr const char* kResolver = "169.254.1.1";
 std::vector<std::string> wordsFor(const std::string& program) {
     const std::string self = "/proc/self/fd/";
     const std::string user = std::to_string(::geteuid()) + ":" + std::to_string(::getegid());
-    return {program,
-            "--foreground", "--quiet", "--runas", user,
-            "--userns", self + std::to_string(STDIN_FILENO),
-            "--netns", self + std::to_string(STDOUT_FILENO), "--no-netns-quit",
-            "--pid", self + std::to_string(STDERR_FILENO),
-            "--config-net", "--no-dhcp", "--no-dhcpv6", "--no-ra", "--no-icmp",
-            "--dns-forward", kResolver,
+    return {program, "--foreground", "--quiet", "--runas", user, "--userns",
+            self + std::to_string(STDIN_FILENO), "--netns", self + std::to_string(STDOUT_FILENO),
+            "--no-netns-quit", "--pid", self + std::to_string(STDERR_FILENO), "--config-net",
+            "--no-dhcp", "--no-dhcpv6", "--no-ra", "--no-icmp", "--dns-forward", kResolver,
             // Nothing comes in, and nothing goes to the machine itself.
             "--tcp-ports", "none", "--udp-ports", "none", "--tcp-ns", "none", "--udp-ns", "none",
             "--no-map-gw"};

@@ -46,8 +46,7 @@ Result<Parcel> Keeper::ask(const KeeperOrder& order, std::span<const int> descri
     Result<Parcel> answer = Parcel::receive(socket_.get());
     if (!answer) return answer;
     KeeperAnswer told{.error = EPROTO, .pid = -1};
-    if (answer->bytes.size() == sizeof told)
-        std::memcpy(&told, answer->bytes.data(), sizeof told);
+    if (answer->bytes.size() == sizeof told) std::memcpy(&told, answer->bytes.data(), sizeof told);
     if (told.error != 0) return Error::posix(told.error, "the process that keeps plug-ins");
     return answer;
 }

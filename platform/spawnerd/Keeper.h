@@ -28,7 +28,7 @@ class Keeper {
     /// What is to be started: with the descriptors that it is given and no others, without anything
     /// of the daemon's environment, and as `ChildProcess` has it.
     struct Order {
-        std::vector<std::string> words;               // the program's path, and its arguments
+        std::vector<std::string> words;                // the program's path, and its arguments
         std::vector<std::pair<int, int>> descriptors;  // borrowed, with their numbers in there
     };
     /// A process that was started. It is a child of the keeper, not of this process.
@@ -47,8 +47,8 @@ class Keeper {
 
     pid_t pid() const { return pid_; }
 
-    /// Returns once the program runs. Error: the system's, also that it could not be run; EPIPE when
-    /// the keeper is gone.
+    /// Returns once the program runs. Error: the system's, also that it could not be run; EPIPE
+    /// when the keeper is gone.
     Result<Child> run(const Order& order) const;
 
     /// Bounds what the processes of a user namespace, one below this process's, may use of what the

@@ -95,8 +95,7 @@ std::optional<KeeperOrder> KeeperOrder::decode(std::string_view bytes) {
     if (bytes.size() < sizeof count) return std::nullopt;
     std::memcpy(&count, bytes.data(), sizeof count);
     bytes.remove_prefix(sizeof count);
-    if (count > Parcel::kMostDescriptors || bytes.size() < count * sizeof(int))
-        return std::nullopt;
+    if (count > Parcel::kMostDescriptors || bytes.size() < count * sizeof(int)) return std::nullopt;
     order.targets.resize(count);
     std::memcpy(order.targets.data(), bytes.data(), count * sizeof(int));
     bytes.remove_prefix(count * sizeof(int));

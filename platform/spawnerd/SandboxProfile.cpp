@@ -48,9 +48,19 @@ constexpr const char* kSystemFiles[] = {"/etc/alternatives", "/etc/ld.so.cache",
                                         "/etc/ld.so.conf.d", "/etc/localtime"};
 
 constexpr const char* kConfinement[] = {
-    "--unshare-user", "--disable-userns", "--unshare-pid", "--unshare-ipc", "--unshare-uts",
-    "--unshare-net", "--unshare-cgroup", "--new-session", "--die-with-parent", "--cap-drop", "ALL",
-    "--hostname", "plugin",
+    "--unshare-user",
+    "--disable-userns",
+    "--unshare-pid",
+    "--unshare-ipc",
+    "--unshare-uts",
+    "--unshare-net",
+    "--unshare-cgroup",
+    "--new-session",
+    "--die-with-parent",
+    "--cap-drop",
+    "ALL",
+    "--hostname",
+    "plugin",
 };
 
 using Arguments = std::vector<std::string>;
@@ -59,8 +69,7 @@ void append(Arguments& arguments, std::initializer_list<std::string_view> more) 
     arguments.insert(arguments.end(), more.begin(), more.end());
 }
 
-void bindSystem(Arguments& arguments, const SandboxProfile& profile,
-                const InstanceLimits& limits) {
+void bindSystem(Arguments& arguments, const SandboxProfile& profile, const InstanceLimits& limits) {
     for (const char* path : kSystem) {
         char target[PATH_MAX];
         const ssize_t length = ::readlink(path, target, sizeof target);
@@ -74,8 +83,8 @@ void bindSystem(Arguments& arguments, const SandboxProfile& profile,
     // Root owns the kernel's settings below /proc, also without any privileges.
     append(arguments, {"--proc", "/proc", "--remount-ro", "/proc"});
     // Everything in /dev that can be written to lies in memory.
-    append(arguments, {"--dev", "/dev", "--size", std::to_string(limits.sharedMemory),
-                       "--tmpfs", "/dev/shm", "--remount-ro", "/dev"});
+    append(arguments, {"--dev", "/dev", "--size", std::to_string(limits.sharedMemory), "--tmpfs",
+                       "/dev/shm", "--remount-ro", "/dev"});
     append(arguments, {"--size", std::to_string(limits.temporary), "--tmpfs", "/tmp"});
 }
 

@@ -62,18 +62,17 @@ Result<SandboxedProcess> SandboxedProcess::spawn(const Keeper& keeper, const std
     const UniqueFd null(::open("/dev/null", O_RDONLY | O_CLOEXEC));
     if (!file || !filter || !null || !info.open() || !gate.open() || !output.open())
         return Error::posix(errno, "cannot start " + program);
-    Keeper::Order order{
-        .words = {program, "--args", std::to_string(kArgumentsFd), "--info-fd",
-                  std::to_string(kInfoFd), "--block-fd", std::to_string(kGateFd), "--seccomp",
-                  std::to_string(kFilterFd), "--"},
-        .descriptors = {{null.get(), STDIN_FILENO},
-                        {output.writeEnd.get(), STDOUT_FILENO},
-                        {output.writeEnd.get(), STDERR_FILENO},
-                        {connection.get(), kConnectionDescriptor},
-                        {file.get(), kArgumentsFd},
-                        {info.writeEnd.get(), kInfoFd},
-                        {gate.readEnd.get(), kGateFd},
-                        {filter.get(), kFilterFd}}};
+    Keeper::Order order{.words = {program, "--args", std::to_string(kArgumentsFd), "--info-fd",
+                                  std::to_string(kInfoFd), "--block-fd", std::to_string(kGateFd),
+                                  "--seccomp", std::to_string(kFilterFd), "--"},
+                        .descriptors = {{null.get(), STDIN_FILENO},
+                                        {output.writeEnd.get(), STDOUT_FILENO},
+                                        {output.writeEnd.get(), STDERR_FILENO},
+                                        {connection.get(), kConnectionDescriptor},
+                                        {file.get(), kArgumentsFd},
+                                        {info.writeEnd.get(), kInfoFd},
+                                        {gate.readEnd.get(), kGateFd},
+                                        {filter.get(), kFilterFd}}};
     order.words.insert(order.words.end(), command.begin(), command.end());
     for (int number = kFirstSetupDescriptor; const UniqueFd& descriptor : setup.descriptors)
         order.descriptors.emplace_back(descriptor.get(), number++);

@@ -30,7 +30,8 @@ struct SandboxedProcess {
     /// the filter of system calls (which is in force from just before the command on). The command
     /// inherits `connection` as `kConnectionDescriptor`, and nothing else but /dev/null and
     /// `output`. Error: the system's.
-    static Result<SandboxedProcess> spawn(const Keeper& keeper, const std::string& program, const SandboxSetup& setup,
+    static Result<SandboxedProcess> spawn(const Keeper& keeper, const std::string& program,
+                                          const SandboxSetup& setup,
                                           const std::vector<std::string>& command,
                                           const UniqueFd& connection);
 };

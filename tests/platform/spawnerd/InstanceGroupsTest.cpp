@@ -30,7 +30,9 @@ class Groups : public testing::Test {
     std::string read(const std::string& name) {
         return *readFile(tree_.path("user.slice/zrd.service/" + name), 1000);
     }
-    InstanceGroups find() { return InstanceGroups::find({::getpid(), 1}, tree_.path(), membership_); }
+    InstanceGroups find() {
+        return InstanceGroups::find({::getpid(), 1}, tree_.path(), membership_);
+    }
 
     const std::string self_ = std::to_string(::getpid());
     test::TemporaryDirectory tree_;

@@ -56,9 +56,9 @@ TEST_F(LauncherTest, APlugInTalksToItsHostAndSeesNothingElse) {
 class NetworkTest : public LauncherTest {
   protected:
     void usePasta(const std::string& rest) {
-        std::filesystem::permissions(
-            home.write("pasta", "#!/bin/sh\necho $$ \"$@\" >>" + home.path("started") + "\n" + rest),
-            std::filesystem::perms::owner_all);
+        std::filesystem::permissions(home.write("pasta", "#!/bin/sh\necho $$ \"$@\" >>" +
+                                                             home.path("started") + "\n" + rest),
+                                     std::filesystem::perms::owner_all);
         useLauncher({.pasta = home.path("pasta")});
     }
     std::string start(const std::string& executable, const std::string& profile = "plugin") {
@@ -128,7 +128,8 @@ TEST_F(NetworkTest, DoesNotLeadToTheMachineItself) {
         " if $F[1] eq \"00000000\"' /proc/net/route)\n"
         "for host in 127.0.0.1 $gateway 169.254.1.1; do\n"
         "perl -MIO::Socket::INET -e 'print IO::Socket::INET->new(PeerAddr => $ARGV[0], PeerPort =>"
-        " $ARGV[1], Timeout => 1) ? \"in\" : \"out\", \"\\n\"' $host " + port + "\ndone");
+        " $ARGV[1], Timeout => 1) ? \"in\" : \"out\", \"\\n\"' $host " +
+            port + "\ndone");
     wantNetwork();
     if (start(executable).substr(0, 2) == kAlone) GTEST_SKIP() << "there is no network here";
     EXPECT_TRUE(start(executable).ends_with("\nout\nout\nout\n"));
