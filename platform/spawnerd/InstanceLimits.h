@@ -39,9 +39,9 @@ inline constexpr InstanceLimits kSmallLimits{.memory = 512 * kMiB,
 
 /// Sets what the kernel limits by process on the first process of a sandbox, before it starts any
 /// other: they all inherit it. Not memory: a process has a limit of addresses only, and runtimes
-/// reserve far more of these than they use. The number of processes counts in the sandbox's own
-/// user namespace, and so has to be set on a process in there; root's have no such limit. False,
-/// with errno set, when that failed.
+/// reserve far more of these than they use. From Linux 5.14 on the number of processes counts in
+/// the sandbox's own user namespace, and so has to be set on a process in there; root's have no
+/// such limit. False, with errno set, when that failed.
 bool setProcessLimits(pid_t first, const InstanceLimits& limits);
 
 }  // namespace platform::spawnerd

@@ -189,6 +189,7 @@ TEST_F(HostilePlugIn, DoesNotOutliveTheDaemon) {
 
 TEST_F(HostilePlugIn, HasSoManyProcessesAndDescriptorsAndNoMore) {
     EXPECT_EQ(tell("descriptors"), "512");
+    EXPECT_EQ(tell("watch-queues"), "16");
     EXPECT_EQ(tell("sh ulimit -c; ulimit -Hc; ulimit -n"), "0\n0\n512\n");
     if (::geteuid() == 0) GTEST_SKIP() << "without a group, root has as many processes as it likes";
     EXPECT_THAT(std::stoi(tell("fork-bomb 2000")), AllOf(Gt(100), Le(512)));
