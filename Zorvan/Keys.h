@@ -148,4 +148,7 @@ inline constexpr const char* kAnnotationChangeNotification = "com.orbel.zorvan.a
 inline constexpr const char* kUserPreferences = "com.orbel.zorvan.userprefs";
 inline constexpr const char* kExclusions = "exclusions";
 
+/// The preference domain with the administrator's limits of plug-ins (docs/security.md).
+inline constexpr const char* kLimitPreferences = "com.orbel.zorvan.limits";
+
 }  // namespace zorvan

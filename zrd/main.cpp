@@ -1,10 +1,12 @@
 #include <cstdlib>
 #include <utility>
 
+#include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
 #include "Zorvan/ZRPlugInCore.h"
 #include "platform/Services.h"
 #include "platform/lum/ServiceSocket.h"
+#include "platform/services/Preferences.h"
 #include "platform/system/Process.h"
 #include "platform/tandry/DiskWorkspace.h"
 #include "platform/threads/TerminationWatch.h"
@@ -13,20 +15,29 @@
 
 namespace {
 
+/// What the administrator says of the limits of plug-ins, read afresh.
+platform::LauncherSettings limits(const platform::Directories& directories) {
+    return [preferences = std::make_shared<platform::Preferences>(directories)](const auto& key) {
+        preferences->synchronize(zorvan::kLimitPreferences);
+        return preferences->value(zorvan::kLimitPreferences, key);
+    };
+}
+
 /// The services of this machine. Without a registry the server cannot be constructed.
 platform::Services diskServices(const std::string& serviceName,
                                 std::shared_ptr<platform::RunLoop> mainLoop) {
     platform::Services services;
     services.directories = platform::Directories::fromEnvironment();
     services.mainLoop = std::move(mainLoop);
+    // First, while there are no other threads.
+    services.launcher = platform::makeLauncher(services.directories, serviceName, services.mainLoop,
+                                               limits(services.directories));
     services.codeSigning = platform::makeFileCodeSigning();
     services.sandbox =
         platform::makeKernelSandbox(services.directories, serviceName, *services.mainLoop);
     services.assertions = platform::makeFileAssertions(services.directories);
     services.consent = platform::makeFileConsent(services.directories);
     services.notifications = platform::makeFileNotifications(services.directories);
-    services.launcher =
-        platform::makeLauncher(services.directories, serviceName, services.mainLoop);
     services.types = platform::makeMimeTypes(services.directories);
     services.sdks = std::make_shared<platform::SdkDictionaries>(services.directories);
     auto workspace = platform::tandry::openDiskWorkspace(services.directories, *services.sdks,

@@ -2,6 +2,7 @@
 
 #include <sys/types.h>
 
+#include <string>
 #include <utility>
 #include <vector>
 
@@ -10,28 +11,22 @@
 
 namespace platform::spawnerd {
 
-/// How a child process of a program with threads begins: with the descriptors that it is given and
-/// no others, with the signals as they are by default, as the first to go when memory runs out, and
-/// without the names that namespaces do not take away: it possesses no key of the user's session,
-/// and where the kernel can do that (Landlock) it reaches no abstract socket that was not made by
-/// itself or its children.
+/// How a child process begins: with the descriptors that it is given and no others, with the
+/// signals as they are by default, with an environment of one fixed search path, as the first to go
+/// when memory runs out, and without the name that no namespace takes away: it possesses no key of
+/// the user's session. It ends when its parent does.
 class ChildProcess {
   public:
-    /// The child's descriptors have numbers up to `lastDescriptor`.
-    explicit ChildProcess(int lastDescriptor) : lastDescriptor_(lastDescriptor) {}
-
     /// Duplicates `source` for the child; false when there are no descriptors left.
     bool give(int source, int target);
 
-    /// Starts the program, on whose calling thread parent-death signals will depend. Error: the
+    /// Starts the program that is the first of `words`, from a process with one thread. Error: the
     /// system's, also that the program could not be run.
-    Result<pid_t> run(const char* program, char* const argv[], char* const environment[]) const;
+    Result<pid_t> run(const std::vector<std::string>& words) const;
 
   private:
-    [[noreturn]] void begin(const char* program, char* const argv[], char* const environment[],
-                            int failure) const;
+    [[noreturn]] void begin(char* const argv[], int failure) const;
 
-    const int lastDescriptor_;
     std::vector<std::pair<UniqueFd, int>> given_;
 };
 

@@ -37,9 +37,9 @@ std::optional<Error> checkExecutable(int bundle, const std::string& name, const 
     return std::nullopt;
 }
 
-/// The Info.plist of an open bundle; none when it has none that can be used.
-std::optional<Dictionary> readInfo(int bundle) {
-    const Result<std::string> bytes = readFileBeneath(bundle, "Info.plist", kMaxPropertyListFile);
+/// A property list of an open bundle; none when it has none that can be used.
+std::optional<Dictionary> readList(int bundle, const char* name) {
+    const Result<std::string> bytes = readFileBeneath(bundle, name, kMaxPropertyListFile);
     const Result<Value> value = bytes ? parsePropertyList(*bytes) : bytes.error();
     const Dictionary* dictionary = value ? value->dictionary() : nullptr;
     return dictionary ? std::optional(*dictionary) : std::nullopt;
@@ -54,12 +54,24 @@ std::string textAt(const Dictionary& info, std::initializer_list<const char*> ke
     return {};
 }
 
-std::string plugInIdentifier(const Dictionary& info) {
+void readIdentifiers(const Dictionary& info, Grant& grant) {
     constexpr const char* kIdentifier = "VXExtensionIdentifier";
     const Value* extension = info.find("VXExtension");
-    const Dictionary* plugIn = extension ? extension->dictionary() : nullptr;
-    const std::string identifier = plugIn ? textAt(*plugIn, {kIdentifier}) : std::string();
-    return identifier.empty() ? textAt(info, {kIdentifier}) : identifier;
+    if (const Dictionary* plugIn = extension ? extension->dictionary() : nullptr) {
+        grant.plugInIdentifier = textAt(*plugIn, {kIdentifier});
+        grant.extensionPoint = textAt(*plugIn, {"VXExtensionPointIdentifier"});
+    }
+    if (grant.plugInIdentifier.empty()) grant.plugInIdentifier = textAt(info, {kIdentifier});
+    grant.bundleIdentifier = textAt(info, {"QFBundleIdentifier"});
+    if (grant.plugInIdentifier.empty()) grant.plugInIdentifier = grant.bundleIdentifier;
+    if (grant.bundleIdentifier.empty()) grant.bundleIdentifier = grant.plugInIdentifier;
+    grant.bundleVersion = textAt(info, {"QFBundleVersion", "QFBundleShortVersionString"});
+}
+
+bool asksForNetwork(int bundle) {
+    const auto entitlements = readList(bundle, "Entitlements.plist");
+    const Value* value = entitlements ? entitlements->find(kNetworkEntitlement) : nullptr;
+    return value && value->boolean().value_or(false);
 }
 
 bool isVariableName(std::string_view name) {
@@ -119,15 +131,14 @@ Result<Grant> Grant::make(const Directories& directories, const ExternalService&
     const std::string name = pathWithin(service.bundle.path, service.executable);
     if (name.empty()) return Error::posix(EINVAL, service.executable + " is not in its bundle");
     if (auto error = checkExecutable(bundle->get(), name, service.executable)) return *error;
-    const auto info = readInfo(bundle->get());
+    const auto info = readList(bundle->get(), "Info.plist");
     if (!info) return Error::posix(EINVAL, "the Info.plist of " + service.bundle.path);
 
     Grant grant;
     grant.executable = service.executable;
     grant.bundle = service.bundle;
-    grant.bundleIdentifier = textAt(*info, {"QFBundleIdentifier"});
-    if (grant.bundleIdentifier.empty()) grant.bundleIdentifier = plugInIdentifier(*info);
-    grant.bundleVersion = textAt(*info, {"QFBundleVersion", "QFBundleShortVersionString"});
+    grant.wantsNetwork = asksForNetwork(bundle->get());
+    readIdentifiers(*info, grant);
     if (!isSafeName(grant.bundleIdentifier))
         return Error::posix(EINVAL, "the bundle's identifier, " + grant.bundle.path);
     if (!service.container.empty()) {

@@ -19,14 +19,20 @@ namespace spawnerd {
 
 struct SandboxProfile;
 
+/// The entitlement with which a plug-in asks for the user's network.
+inline constexpr const char* kNetworkEntitlement = "com.orbel.developer.network-client";
+
 /// What a host may start, and how it is run: an executable with what its bundle and its activation
 /// overlay say about it. A plain value.
 struct Grant {
     std::string executable;
     KnownDirectory bundle;
     std::string bundleIdentifier;
-    std::string bundleVersion;  // empty when the bundle has none
-    std::string container;      // the plug-in's data container; empty when it has none
+    std::string plugInIdentifier;
+    std::string extensionPoint;  // empty when the bundle names none
+    bool wantsNetwork = false;   // as its entitlements say
+    std::string bundleVersion;   // empty when the bundle has none
+    std::string container;       // the plug-in's data container; empty when it has none
     std::vector<std::pair<std::string, std::string>> environment;
     const SandboxProfile* profile = nullptr;
 

@@ -4,7 +4,6 @@
 #include <signal.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -24,6 +23,11 @@ constexpr std::string_view kFirstProcess = "\"child-pid\":";
 
 void sendKill(const UniqueFd& pidFd) {
     if (pidFd) ::syscall(SYS_pidfd_send_signal, pidFd.get(), SIGKILL, nullptr, 0);
+}
+
+void awaitEnd(const UniqueFd& pidFd) {
+    pollfd state{pidFd.get(), POLLIN, 0};
+    if (pidFd) ::poll(&state, 1, kPatience);
 }
 
 /// A number in what bubblewrap tells, a JSON object of numbers; 0 when it is not there.
@@ -48,19 +52,21 @@ UniqueFd firstProcessOf(const std::string& info) {
 
 }  // namespace
 
-Instance::Instance(RunLoop& loop, SandboxedProcess process, std::string name,
-                   const InstanceLimits& limits, InstanceGroup group, std::function<void()> runs,
-                   std::function<void(int)> ended)
+Instance::Instance(RunLoop& loop, const Keeper& keeper, std::string pasta, SandboxedProcess process,
+                   std::string name, const Allowance& allowance, InstanceGroup group,
+                   std::function<void()> runs, std::function<void(int)> ended)
     : loop_(loop),
+      keeper_(keeper),
+      pasta_(std::move(pasta)),
       process_(std::move(process)),
       name_(std::move(name)),
-      limits_(limits),
+      allowance_(allowance),
       group_(std::move(group)),
       runs_(std::move(runs)),
       ended_(std::move(ended)),
       output_(loop, std::move(process_.output), name_) {
-    childWatch_.emplace(loop_, process_.pidFd.get());
-    childWatch_->awaitReadable([this] { reap(); });
+    endWatch_.emplace(loop_, process_.child.end.get());
+    endWatch_->awaitReadable([this] { takeStatus(); });
     infoWatch_.emplace(loop_, process_.info.get());
     infoWatch_->awaitReadable([this] { awaitInfo(); });
 }
@@ -69,22 +75,19 @@ Instance::~Instance() {
     if (status_ && !first_) return;
     takeInfoNow();
     sendKill(first_);
-    if (!status_) {
-        sendKill(process_.pidFd);
-        ::waitpid(process_.pid, nullptr, 0);
-    }
-    pollfd first{first_.get(), POLLIN, 0};
-    if (first_) ::poll(&first, 1, kPatience);
+    if (!status_) sendKill(process_.child.pidFd);
+    awaitEnd(process_.child.pidFd);
+    awaitEnd(first_);
 }
 
-/// Before its first process is known, killing our child would leave that one without the tie that
-/// it has to it later: it waits at the gate until it is known, and never passes then.
+/// Before its first process is known, killing bubblewrap would leave that one without the tie
+/// that it has to it later: it waits at the gate until it is known, and never passes then.
 void Instance::kill() {
     isDoomed_ = true;
     if (!first_ && process_.info) return;
     group_.kill();
     sendKill(first_);
-    if (!status_) sendKill(process_.pidFd);
+    if (!status_) sendKill(process_.child.pidFd);
 }
 
 bool Instance::readInfo() {
@@ -111,19 +114,56 @@ void Instance::takeInfoNow() {
 void Instance::awaitInfo() {
     if (!readInfo()) return infoWatch_->awaitReadable([this] { awaitInfo(); });
     if (first_) watchFirst();
-    if (isDoomed_ || !first_ || !limit()) return kill();
+    if (isDoomed_ || !first_) return kill();
+    const auto namespaces = SandboxNamespaces::of(firstPid(), first_);
+    if (!limit(namespaces)) return kill();
+    if (allowance_.network) return connect(namespaces);
+    pass();
+}
+
+pid_t Instance::firstPid() const {
+    return static_cast<pid_t>(numberIn(infoText_, kFirstProcess));
+}
+
+bool Instance::limit(const Result<SandboxNamespaces>& namespaces) const {
+    const auto failure = namespaces ? keeper_.limit(namespaces->user) : namespaces.error();
+    if (failure)
+        EVLOG_ERROR(ops(), "cannot limit what plug-in {} uses of the user's: {}", name_,
+                    pub(*failure));
+    if (setProcessLimits(firstPid(), allowance_.limits) && group_.add(process_.child.pid) &&
+        group_.add(firstPid()))
+        return true;
+    EVLOG_ERROR(ops(), "cannot limit a plug-in: {}", pub(Error::posix(errno, name_)));
+    return false;
+}
+
+void Instance::connect(const Result<SandboxNamespaces>& namespaces) {
+    if (!namespaces) return connected(namespaces.error());
+    auto network = InstanceNetwork::connect(loop_, keeper_, pasta_, *namespaces,
+                                            [this](const auto& error) { connected(error); });
+    if (!network) return connected(network.error());
+    network_ = std::move(*network);
+    // What it takes counts as the instance's, and ends with it.
+    group_.add(network_->pid());
+}
+
+void Instance::connected(const std::optional<Error>& error) {
+    if (error) {
+        network_.reset();
+        EVLOG_ERROR(ops(),
+                    "plug-in {} starts without a network: {} (it takes the program pasta, of the"
+                    " package passt, and a /dev/net/tun that this user may open)",
+                    name_, pub(*error));
+    }
+    pass();
+}
+
+void Instance::pass() {
+    if (isDoomed_) return;
     const bool passed = ::write(process_.gate.get(), "", 1) == 1;
     process_.gate.reset();
     if (!passed) return kill();
     runs_();
-}
-
-bool Instance::limit() const {
-    const auto first = static_cast<pid_t>(numberIn(infoText_, kFirstProcess));
-    if (setProcessLimits(first, limits_) && group_.add(process_.pid) && group_.add(first))
-        return true;
-    EVLOG_ERROR(ops(), "cannot limit a plug-in: {}", pub(Error::posix(errno, name_)));
-    return false;
 }
 
 void Instance::watchFirst() {
@@ -135,12 +175,10 @@ void Instance::watchFirst() {
     });
 }
 
-void Instance::reap() {
-    int raw = 0;
-    if (::waitpid(process_.pid, &raw, WNOHANG) != process_.pid)
-        return childWatch_->awaitReadable([this] { reap(); });
-    childWatch_.reset();
-    status_ = WIFEXITED(raw) ? WEXITSTATUS(raw) : 128 + WTERMSIG(raw);
+void Instance::takeStatus() {
+    status_ = Keeper::statusAt(process_.child.end);
+    if (!status_) return endWatch_->awaitReadable([this] { takeStatus(); });
+    endWatch_.reset();
     // What it wrote before it ended is there; nobody else writes it.
     if (process_.info) {
         takeInfoNow();
@@ -153,6 +191,7 @@ void Instance::reap() {
 
 void Instance::endedPartly() {
     if (!status_ || first_) return;
+    network_.reset();
     output_.finish();
     // The last that is done: it may be the end of this object.
     const auto ended = ended_;

@@ -4,7 +4,10 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <filesystem>
+#include <iterator>
 #include <optional>
 #include <sstream>
 #include <string_view>
@@ -18,8 +21,9 @@ namespace {
 constexpr std::size_t kMostBytes = 64u << 10;
 constexpr const char* kProcesses = "cgroup.procs";
 constexpr const char* kDivision = "cgroup.subtree_control";
-/// Two are bubblewrap's.
-constexpr std::uint64_t kOwnProcesses = 2;
+/// Two are bubblewrap's, one carries the network.
+constexpr std::uint64_t kOwnProcesses = 3;
+const std::string kInstance = "instance-";
 
 bool writeTo(const UniqueFd& folder, const char* name, const std::string& text) {
     const UniqueFd file(::openat(folder.get(), name, O_WRONLY | O_TRUNC | O_CLOEXEC));
@@ -49,30 +53,51 @@ std::optional<std::string> placeIn(const std::string& membership) {
     return std::nullopt;
 }
 
-bool isOursAlone(const UniqueFd& folder) {
-    const auto controllers = readFileAt(folder.get(), "cgroup.controllers", kMostBytes);
-    const auto processes = readFileAt(folder.get(), kProcesses, kMostBytes);
-    return controllers && holdsWord(*controllers, "memory") && holdsWord(*controllers, "pids") &&
-           processes && *processes == std::to_string(::getpid()) + "\n" &&
-           ::faccessat(folder.get(), ".", W_OK, AT_EACCESS) == 0;
+/// The numbers in a file of processes, ordered.
+std::vector<pid_t> processesIn(const UniqueFd& folder) {
+    const auto text = readFileAt(folder.get(), kProcesses, kMostBytes);
+    std::istringstream numbers(text ? *text : std::string());
+    std::vector<pid_t> processes{std::istream_iterator<pid_t>(numbers), {}};
+    std::ranges::sort(processes);
+    return processes;
 }
 
-bool divide(const std::string& path, const UniqueFd& folder) {
-    const std::string own = joinPath(path, "daemon"), self = std::to_string(::getpid());
-    if (::mkdir(own.c_str(), 0755) != 0 && errno != EEXIST) return false;
-    if (writeTo(openFolder(own), kProcesses, self) && writeTo(folder, kDivision, "+memory +pids")) {
+bool isOursAlone(const UniqueFd& folder, const std::vector<pid_t>& own) {
+    const auto controllers = readFileAt(folder.get(), "cgroup.controllers", kMostBytes);
+    return controllers && holdsWord(*controllers, "memory") && holdsWord(*controllers, "pids") &&
+           processesIn(folder) == own && ::faccessat(folder.get(), ".", W_OK, AT_EACCESS) == 0;
+}
+
+bool moveTo(const UniqueFd& folder, const std::vector<pid_t>& processes) {
+    return std::ranges::all_of(processes, [&](pid_t process) {
+        return writeTo(folder, kProcesses, std::to_string(process));
+    });
+}
+
+bool divide(const std::string& path, const UniqueFd& folder, const std::vector<pid_t>& own) {
+    const std::string place = joinPath(path, "daemon");
+    if (::mkdir(place.c_str(), 0755) != 0 && errno != EEXIST) return false;
+    if (moveTo(openFolder(place), own) && writeTo(folder, kDivision, "+memory +pids")) {
         writeTo(folder, kDivision, "+cpu");  // not everywhere delegated, and less needed
         return true;
     }
-    writeTo(folder, kProcesses, self);
-    ::rmdir(own.c_str());
+    moveTo(folder, own);
+    ::rmdir(place.c_str());
     return false;
+}
+
+/// What still has processes stays.
+void removeInstances(const std::string& path) {
+    std::error_code ignored;
+    for (const auto& entry : std::filesystem::directory_iterator(path, ignored))
+        if (entry.path().filename().string().starts_with(kInstance)) ::rmdir(entry.path().c_str());
 }
 
 }  // namespace
 
 InstanceGroup::~InstanceGroup() {
-    if (folder_) ::rmdir(path_.c_str());
+    // A process that has just ended may still count as one that is there.
+    if (folder_ && ::rmdir(path_.c_str()) != 0 && errno == EBUSY) leftBehind_->push_back(path_);
 }
 
 bool InstanceGroup::add(pid_t process) const {
@@ -83,13 +108,17 @@ void InstanceGroup::kill() const {
     if (folder_) writeTo(folder_, "cgroup.kill", "1");
 }
 
-InstanceGroups InstanceGroups::find(const std::string& tree, const std::string& membership) {
+InstanceGroups InstanceGroups::find(std::vector<pid_t> own, const std::string& tree,
+                                    const std::string& membership) {
     InstanceGroups groups;
     const auto place = placeIn(membership);
     if (!place) return groups;
     const std::string path = tree + *place;
     const UniqueFd folder = openFolder(path);
-    if (folder && isOursAlone(folder) && divide(path, folder)) groups.path_ = path;
+    std::ranges::sort(own);
+    if (!folder || !isOursAlone(folder, own) || !divide(path, folder, own)) return groups;
+    groups.path_ = path;
+    removeInstances(path);
     return groups;
 }
 
@@ -97,8 +126,10 @@ Result<InstanceGroup> InstanceGroups::make(std::uint64_t instance,
                                            const InstanceLimits& limits) const {
     InstanceGroup group;
     if (!areThere()) return group;
-    group.path_ = joinPath(path_, "instance-" + std::to_string(instance));
-    // One that was left by an earlier daemon will do.
+    std::erase_if(*leftBehind_, [](const std::string& path) { return ::rmdir(path.c_str()) == 0; });
+    group.leftBehind_ = leftBehind_;
+    group.path_ = joinPath(path_, kInstance + std::to_string(instance));
+    // One that an earlier daemon has left will do.
     if (::mkdir(group.path_.c_str(), 0755) != 0 && errno != EEXIST)
         return Error::posix(errno, group.path_);
     group.folder_ = openFolder(group.path_);

@@ -3,7 +3,9 @@
 #include <sys/types.h>
 
 #include <cstdint>
+#include <memory>
 #include <string>
+#include <vector>
 
 #include "platform/spawnerd/InstanceLimits.h"
 #include "platform/system/Error.h"
@@ -12,8 +14,8 @@
 namespace platform::spawnerd {
 
 /// The kernel's group (cgroup v2) of one instance, whose limits hold for all its processes
-/// together. It is removed with this object, once nothing runs in it. Without a group, operations
-/// do nothing and succeed. Move-only.
+/// together. It is removed with this object, or, when something is left in it then, before a later
+/// one is made. Without a group, operations do nothing and succeed. Move-only.
 class InstanceGroup {
   public:
     InstanceGroup() = default;
@@ -29,8 +31,10 @@ class InstanceGroup {
 
   private:
     friend class InstanceGroups;
+    using Paths = std::vector<std::string>;
     std::string path_;
     UniqueFd folder_;
+    std::shared_ptr<Paths> leftBehind_;  // of all instances
 };
 
 /// The daemon's own group, where that is delegated to it, with a group in it for each instance. On
@@ -38,11 +42,12 @@ class InstanceGroup {
 class InstanceGroups {
   public:
     /// Takes the daemon's group into use when it has the unified tree's controllers of memory and
-    /// processes, is writable, and no other process is in it; the daemon then moves to a group of
-    /// its own in there, because groups have either processes or groups. Otherwise there are no
-    /// groups, and nothing has changed. `tree` is where the unified tree is mounted, `membership`
+    /// processes, is writable, and no others than the daemon's `own` processes are in it; these
+    /// then move to a group of their own in there, because groups have either processes or groups.
+    /// What an earlier daemon left there goes. Otherwise there are no groups, and nothing has
+    /// changed. `tree` is where the unified tree is mounted, `membership`
     /// the file that says where in it this process is.
-    static InstanceGroups find(const std::string& tree = "/sys/fs/cgroup",
+    static InstanceGroups find(std::vector<pid_t> own, const std::string& tree = "/sys/fs/cgroup",
                                const std::string& membership = "/proc/self/cgroup");
 
     bool areThere() const { return !path_.empty(); }
@@ -51,6 +56,7 @@ class InstanceGroups {
 
   private:
     std::string path_;
+    std::shared_ptr<InstanceGroup::Paths> leftBehind_ = std::make_shared<InstanceGroup::Paths>();
 };
 
 }  // namespace platform::spawnerd

@@ -8,21 +8,25 @@ namespace platform::spawnerd {
 
 namespace {
 
+// Counted by user, and more than anybody needs.
+constexpr std::uint64_t kMostSignals = 1024, kMostQueueBytes = 64u << 10;
+
 /// Never above what was allowed before.
-bool setLimit(pid_t process, __rlimit_resource resource, std::uint64_t soft, std::uint64_t hard) {
+bool setLimit(pid_t process, __rlimit_resource resource, std::uint64_t most) {
     rlimit before{};
     if (::prlimit(process, resource, nullptr, &before) != 0) return false;
-    const rlimit after{.rlim_cur = std::min<rlim_t>(soft, before.rlim_max),
-                       .rlim_max = std::min<rlim_t>(hard, before.rlim_max)};
+    const rlim_t limit = std::min<rlim_t>(most, before.rlim_max);
+    const rlimit after{.rlim_cur = limit, .rlim_max = limit};
     return ::prlimit(process, resource, &after, nullptr) == 0;
 }
 
 }  // namespace
 
 bool setProcessLimits(pid_t first, const InstanceLimits& limits) {
-    return setLimit(first, RLIMIT_NPROC, limits.processes, limits.processes) &&
-           setLimit(first, RLIMIT_NOFILE, limits.descriptors, kMostDescriptors) &&
-           setLimit(first, RLIMIT_CORE, 0, 0);
+    return setLimit(first, RLIMIT_NPROC, limits.processes) &&
+           setLimit(first, RLIMIT_NOFILE, limits.descriptors) &&
+           setLimit(first, RLIMIT_SIGPENDING, kMostSignals) &&
+           setLimit(first, RLIMIT_MSGQUEUE, kMostQueueBytes) && setLimit(first, RLIMIT_CORE, 0);
 }
 
 }  // namespace platform::spawnerd

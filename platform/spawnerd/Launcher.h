@@ -2,6 +2,7 @@
 
 #include <functional>
 #include <memory>
+#include <optional>
 #include <string>
 
 #include "platform/lum/AuditToken.h"
@@ -68,14 +69,18 @@ class Launcher {
     virtual void shutDown(std::function<void()> completion) = 0;
 };
 
+/// What the administrator says of the limits of instances, by key (docs/security.md): as it is at
+/// that moment. Asked on the loop's thread, at every start.
+using LauncherSettings = std::function<std::optional<Value>(const std::string& key)>;
+
 /// The launcher of the daemon of a service name: it starts plug-ins under bubblewrap, for the hosts
-/// that it was told of, which ask for it on a service of its own (docs/protocol.md). Made on the
-/// thread that runs `loop`, to which its instances are tied: they end with that thread. It listens
+/// that it was told of, which ask for it on a service of its own (docs/protocol.md). It forks a
+/// process that its instances belong to, so it is best made before there are threads. It listens
 /// from the loop's first turn; when it cannot, an error line says so and nothing is ever started.
 ///
 /// It goes where `loop` runs or while it does not run, and takes its instances along.
 std::unique_ptr<Launcher> makeLauncher(const Directories& directories,
                                        const std::string& daemonService,
-                                       std::shared_ptr<RunLoop> loop);
+                                       std::shared_ptr<RunLoop> loop, LauncherSettings settings);
 
 }  // namespace platform

@@ -24,9 +24,11 @@ class CountedMarker final : public Launcher::WorkMarker {
 }  // namespace
 
 ProcessLauncher::ProcessLauncher(const Directories& directories, const std::string& daemonService,
-                                 std::shared_ptr<RunLoop> loop, const std::string& program)
+                                 std::shared_ptr<RunLoop> loop, LauncherSettings settings,
+                                 Programs programs)
     : outstanding_(std::make_shared<std::atomic<int>>(0)),
-      service_(SpawnService::make(directories, daemonService, std::move(loop), program)) {
+      service_(SpawnService::make(directories, daemonService, std::move(loop), std::move(settings),
+                                  std::move(programs))) {
     // Not before the daemon runs: only then does its name, and so this one, belong to it.
     service_->queue().async([weak = std::weak_ptr(service_)] {
         if (auto service = weak.lock()) service->listen();
@@ -69,8 +71,9 @@ void ProcessLauncher::shutDown(std::function<void()> completion) {
 
 std::unique_ptr<Launcher> makeLauncher(const Directories& directories,
                                        const std::string& daemonService,
-                                       std::shared_ptr<RunLoop> loop) {
-    return std::make_unique<spawnerd::ProcessLauncher>(directories, daemonService, std::move(loop));
+                                       std::shared_ptr<RunLoop> loop, LauncherSettings settings) {
+    return std::make_unique<spawnerd::ProcessLauncher>(directories, daemonService, std::move(loop),
+                                                       std::move(settings));
 }
 
 }  // namespace platform

@@ -5,7 +5,6 @@
 #include <string>
 
 #include "platform/spawnerd/Launcher.h"
-#include "platform/spawnerd/SandboxedProcess.h"
 #include "platform/spawnerd/SpawnService.h"
 
 namespace platform::spawnerd {
@@ -14,7 +13,8 @@ namespace platform::spawnerd {
 class ProcessLauncher final : public Launcher {
   public:
     ProcessLauncher(const Directories& directories, const std::string& daemonService,
-                    std::shared_ptr<RunLoop> loop, const std::string& program = kBubblewrap);
+                    std::shared_ptr<RunLoop> loop, LauncherSettings settings = nullptr,
+                    Programs programs = {});
 
     int addExternalService(const AuditToken& host, const ExternalService& service,
                            const Dictionary& overlay) override;

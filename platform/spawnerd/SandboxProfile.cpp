@@ -15,6 +15,7 @@
 #include "platform/sandbox/BusyFolder.h"
 #include "platform/sandbox/SandboxTokens.h"
 #include "platform/spawnerd/Grant.h"
+#include "platform/spawnerd/InstanceNetwork.h"
 #include "platform/spawnerd/Protocol.h"
 #include "platform/spawnerd/SandboxedProcess.h"
 #include "platform/system/Directories.h"
@@ -25,15 +26,16 @@ namespace platform::spawnerd {
 namespace {
 
 /// Names are resolved and certificates checked only where there is a network.
-constexpr const char* kNetworkFiles[] = {"/etc/resolv.conf",   "/etc/hosts",
-                                         "/etc/nsswitch.conf", "/etc/services",
-                                         "/etc/ssl/certs",     "/etc/ssl/openssl.cnf"};
+constexpr const char* kNetworkFiles[] = {"/etc/hosts", "/etc/nsswitch.conf", "/etc/services",
+                                         "/etc/ssl/certs", "/etc/ssl/openssl.cnf"};
+constexpr const char* kResolverSettings = "/etc/resolv.conf";
+constexpr std::size_t kMostResolverSettings = 64u << 10;
 constexpr const char* kFonts[] = {"/etc/fonts"};
 
 /// What a keyboard sees is typed, what a filter or a preview sees is the user's data: nothing of it
 /// may leave the machine.
 constexpr SandboxProfile kProfiles[] = {
-    {.name = "plugin", .network = true, .files = kNetworkFiles, .limits = kWorkLimits},
+    {.name = "plugin", .network = true, .files = {}, .limits = kWorkLimits},
     {.name = "keyboard", .network = false, .files = {}, .limits = kSmallLimits},
     {.name = "network-filter", .network = false, .files = {}, .limits = kSmallLimits},
     {.name = "glimsed", .network = false, .files = kFonts, .limits = kWorkLimits},
@@ -46,9 +48,19 @@ constexpr const char* kSystemFiles[] = {"/etc/alternatives", "/etc/ld.so.cache",
                                         "/etc/ld.so.conf.d", "/etc/localtime"};
 
 constexpr const char* kConfinement[] = {
-    "--unshare-user",   "--disable-userns", "--unshare-pid",     "--unshare-ipc", "--unshare-uts",
-    "--unshare-cgroup", "--new-session",    "--die-with-parent", "--cap-drop",    "ALL",
-    "--hostname",       "plugin",
+    "--unshare-user",
+    "--disable-userns",
+    "--unshare-pid",
+    "--unshare-ipc",
+    "--unshare-uts",
+    "--unshare-net",
+    "--unshare-cgroup",
+    "--new-session",
+    "--die-with-parent",
+    "--cap-drop",
+    "ALL",
+    "--hostname",
+    "plugin",
 };
 
 using Arguments = std::vector<std::string>;
@@ -57,7 +69,7 @@ void append(Arguments& arguments, std::initializer_list<std::string_view> more) 
     arguments.insert(arguments.end(), more.begin(), more.end());
 }
 
-void bindSystem(Arguments& arguments, const SandboxProfile& profile) {
+void bindSystem(Arguments& arguments, const SandboxProfile& profile, const InstanceLimits& limits) {
     for (const char* path : kSystem) {
         char target[PATH_MAX];
         const ssize_t length = ::readlink(path, target, sizeof target);
@@ -71,9 +83,9 @@ void bindSystem(Arguments& arguments, const SandboxProfile& profile) {
     // Root owns the kernel's settings below /proc, also without any privileges.
     append(arguments, {"--proc", "/proc", "--remount-ro", "/proc"});
     // Everything in /dev that can be written to lies in memory.
-    append(arguments, {"--dev", "/dev", "--size", std::to_string(profile.limits.sharedMemory),
-                       "--tmpfs", "/dev/shm", "--remount-ro", "/dev"});
-    append(arguments, {"--size", std::to_string(profile.limits.temporary), "--tmpfs", "/tmp"});
+    append(arguments, {"--dev", "/dev", "--size", std::to_string(limits.sharedMemory), "--tmpfs",
+                       "/dev/shm", "--remount-ro", "/dev"});
+    append(arguments, {"--size", std::to_string(limits.temporary), "--tmpfs", "/tmp"});
 }
 
 /// Where tokens are traded for access. The daemon itself and its launcher serve hosts, which a
@@ -86,11 +98,21 @@ std::optional<Error> bindTokenBroker(Arguments& arguments, const Directories& di
     return std::nullopt;
 }
 
-void bindDirectory(SandboxSetup& setup, std::string_view how, UniqueFd directory,
-                   std::string_view place) {
-    const auto number = static_cast<int>(setup.directories.size()) + kFirstDirectoryDescriptor;
+void bindDescriptor(SandboxSetup& setup, std::string_view how, UniqueFd descriptor,
+                    std::string_view place) {
+    const auto number = static_cast<int>(setup.descriptors.size()) + kFirstSetupDescriptor;
     append(setup.arguments, {how, std::to_string(number), place});
-    setup.directories.push_back(std::move(directory));
+    setup.descriptors.push_back(std::move(descriptor));
+}
+
+std::optional<Error> bindNetworkFiles(SandboxSetup& setup) {
+    for (const char* path : kNetworkFiles) append(setup.arguments, {"--ro-bind-try", path, path});
+    const auto machine = readFile(kResolverSettings, kMostResolverSettings);
+    UniqueFd settings = memoryFile(resolverSettings(machine ? *machine : std::string()));
+    if (!settings) return Error::posix(errno, kResolverSettings);
+    append(setup.arguments, {"--perms", "0444"});
+    bindDescriptor(setup, "--ro-bind-data", std::move(settings), kResolverSettings);
+    return std::nullopt;
 }
 
 /// The plug-in's own variables may replace the first ones, not the last.
@@ -123,9 +145,9 @@ Result<SandboxSetup> sandboxSetup(const Grant& grant, const Directories& directo
     SandboxSetup setup;
     Arguments& arguments = setup.arguments;
     arguments.assign(std::begin(kConfinement), std::end(kConfinement));
-    if (!grant.profile->network || !surroundings.hostHasNetwork)
-        append(arguments, {"--unshare-net"});
-    bindSystem(arguments, *grant.profile);
+    bindSystem(arguments, *grant.profile, surroundings.allowance.limits);
+    if (surroundings.allowance.network)
+        if (auto error = bindNetworkFiles(setup)) return *error;
     if (auto error = bindTokenBroker(arguments, directories, daemonService)) return *error;
     append(arguments, {"--ro-bind", surroundings.busyFolder,
                        BusyFolder::ofBundle(directories, grant.bundleIdentifier)});
@@ -133,11 +155,11 @@ Result<SandboxSetup> sandboxSetup(const Grant& grant, const Directories& directo
     if (!grant.container.empty()) {
         auto container = openContainer(directories, grant.container);
         if (!container) return container.error();
-        bindDirectory(setup, "--bind-fd", std::move(*container), grant.container);
+        bindDescriptor(setup, "--bind-fd", std::move(*container), grant.container);
     }
     auto bundle = grant.bundle.open();
     if (!bundle) return bundle.error();
-    bindDirectory(setup, "--ro-bind-fd", std::move(*bundle), grant.bundle.path);
+    bindDescriptor(setup, "--ro-bind-fd", std::move(*bundle), grant.bundle.path);
     append(arguments, {"--remount-ro", "/"});
     append(arguments, {"--chdir", grant.container.empty() ? "/" : grant.container});
     setEnvironment(arguments, grant, directories, daemonService);

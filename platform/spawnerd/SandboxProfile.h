@@ -5,6 +5,7 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/spawnerd/Allowance.h"
 #include "platform/spawnerd/InstanceLimits.h"
 #include "platform/system/Error.h"
 #include "platform/system/UniqueFd.h"
@@ -20,7 +21,7 @@ struct Grant;
 /// A kind of sandbox that plug-ins run in.
 struct SandboxProfile {
     const char* name;
-    /// Shares the machine's network, for a host that has it; otherwise there is none.
+    /// May have the user's network; otherwise there is none.
     bool network;
     /// Files below /etc that it sees besides those that every plug-in sees.
     std::span<const char* const> files;
@@ -32,8 +33,8 @@ const SandboxProfile* findSandboxProfile(std::string_view name);
 
 /// What an instance finds for itself, beside what its profile and its grant say.
 struct Surroundings {
-    /// Nothing is wider than the host that it is started for.
-    bool hostHasNetwork;
+    /// What it may have; a network only when its host has one, too.
+    Allowance allowance;
     /// A directory, which it sees, read-only, as the place where it states that it is busy.
     std::string busyFolder;
 };
@@ -42,8 +43,8 @@ struct Surroundings {
 struct SandboxSetup {
     std::vector<std::string> arguments;  // up to the command
     /// What the arguments bind by descriptor, so that it is what was looked at, whatever happens to
-    /// its name; numbered from `kFirstDirectoryDescriptor` on.
-    std::vector<UniqueFd> directories;
+    /// its name; numbered from `kFirstSetupDescriptor` on.
+    std::vector<UniqueFd> descriptors;
 };
 
 /// The setup for a granted plug-in of the daemon of a service name. Everything that confines it is

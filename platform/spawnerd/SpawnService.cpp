@@ -8,6 +8,7 @@
 
 #include "platform/log/OpsLog.h"
 #include "platform/sandbox/Namespaces.h"
+#include "platform/sandbox/Sandbox.h"
 #include "platform/spawnerd/Launcher.h"
 #include "platform/spawnerd/Protocol.h"
 #include "platform/spawnerd/SandboxProfile.h"
@@ -63,9 +64,10 @@ void replyStatus(const Asked& asked, int status) {
 
 std::shared_ptr<SpawnService> SpawnService::make(Directories directories, std::string daemonService,
                                                  std::shared_ptr<RunLoop> loop,
-                                                 std::string program) {
-    std::shared_ptr<SpawnService> service(new SpawnService(
-        std::move(directories), std::move(daemonService), std::move(loop), std::move(program)));
+                                                 LauncherSettings settings, Programs programs) {
+    std::shared_ptr<SpawnService> service(
+        new SpawnService(std::move(directories), std::move(daemonService), std::move(loop),
+                         std::move(settings), std::move(programs)));
     service->hosts_ = std::make_shared<GrantedHosts>(
         service->queue_, [weak = std::weak_ptr(service)](const Host& host) {
             if (auto self = weak.lock()) self->hostDied(host);
@@ -74,11 +76,14 @@ std::shared_ptr<SpawnService> SpawnService::make(Directories directories, std::s
 }
 
 SpawnService::SpawnService(Directories directories, std::string daemonService,
-                           std::shared_ptr<RunLoop> loop, std::string program)
+                           std::shared_ptr<RunLoop> loop, LauncherSettings settings,
+                           Programs programs)
     : directories_(std::move(directories)),
       daemonService_(std::move(daemonService)),
       loop_(std::move(loop)),
-      program_(std::move(program)),
+      settings_(std::move(settings)),
+      programs_(std::move(programs)),
+      keeper_(Keeper::make()),
       queue_("spawnerd", *loop_),
       pool_(kMaxInstances),
       shutDownTimer_(*loop_) {}
@@ -99,7 +104,11 @@ void SpawnService::listen() {
         });
     listener_->resume();
     BusyFolder::sweep(directories_);
-    groups_ = InstanceGroups::find();
+    if (!keeper_) {
+        EVLOG_ERROR(ops(), "no plug-in will be started: {}", pub(keeper_.error()));
+        return;
+    }
+    groups_ = InstanceGroups::find({::getpid(), keeper_->pid()});
     if (groups_.areThere())
         EVLOG_DEFAULT(ops(), "plug-ins are limited by groups of their own");
     else
@@ -179,16 +188,25 @@ void SpawnService::start(const Host& host, const Asked& asked) {
     }
 }
 
+Allowance SpawnService::allowanceFor(const Running& running) const {
+    Allowance allowance = spawnerd::allowanceFor(*running.grant, settings_);
+    const AuditToken& host = running.host->token;
+    // What confines a host may keep it from the network in ways that do not show.
+    allowance.network &= sharesNamespace(host, NamespaceKind::Network) && !isConfined(host);
+    return allowance;
+}
+
 std::optional<Error> SpawnService::spawn(std::uint64_t id, Running running,
                                          const std::vector<std::string>& plugInArguments) {
+    if (!keeper_) return keeper_.error();
     const Grant& grant = *running.grant;
     auto busyFolder = BusyFolder::make(directories_, grant.bundleIdentifier, grant.bundle.path);
     if (!busyFolder) return busyFolder.error();
-    const Surroundings surroundings{
-        .hostHasNetwork = sharesNamespace(running.host->token, NamespaceKind::Network),
-        .busyFolder = busyFolder->path()};
+    const Surroundings surroundings{.allowance = allowanceFor(running),
+                                    .busyFolder = busyFolder->path()};
+    const Allowance& allowance = surroundings.allowance;
     running.busyFolder.emplace(std::move(*busyFolder));
-    auto group = groups_.make(id, grant.profile->limits);
+    auto group = groups_.make(id, allowance.limits);
     if (!group) return group.error();
     const auto setup = sandboxSetup(grant, directories_, daemonService_, surroundings);
     if (!setup) return setup.error();
@@ -200,10 +218,11 @@ std::optional<Error> SpawnService::spawn(std::uint64_t id, Running running,
 
     std::vector<std::string> command{grant.executable};
     command.insert(command.end(), plugInArguments.begin(), plugInArguments.end());
-    auto process = SandboxedProcess::spawn(program_, *setup, command, plugInEnd);
+    auto process =
+        SandboxedProcess::spawn(*keeper_, programs_.bubblewrap, *setup, command, plugInEnd);
     if (!process) return process.error();
     running.instance = std::make_unique<Instance>(
-        *loop_, std::move(*process), grant.bundleIdentifier, grant.profile->limits,
+        *loop_, *keeper_, programs_.pasta, std::move(*process), grant.bundleIdentifier, allowance,
         std::move(*group), [this, id] { runs(id); }, [this, id](int status) { ended(id, status); });
     instances_.emplace(id, std::move(running));
     return std::nullopt;

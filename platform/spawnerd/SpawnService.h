@@ -14,11 +14,19 @@
 #include "platform/spawnerd/GrantedHosts.h"
 #include "platform/spawnerd/Instance.h"
 #include "platform/spawnerd/InstanceGroups.h"
+#include "platform/spawnerd/Keeper.h"
+#include "platform/spawnerd/Launcher.h"
 #include "platform/system/Directories.h"
 #include "platform/system/UniqueFd.h"
 #include "platform/threads/SerialQueue.h"
 
 namespace platform::spawnerd {
+
+/// The programs that are used; tests use others.
+struct Programs {
+    std::string bubblewrap = kBubblewrap;
+    std::string pasta = kPasta;
+};
 
 /// The service that hosts ask to start what they were granted, and the instances that run.
 ///
@@ -27,9 +35,9 @@ namespace platform::spawnerd {
 /// Everything happens on the loop unless it says otherwise.
 class SpawnService : public std::enable_shared_from_this<SpawnService> {
   public:
-    /// `program` is bubblewrap's.
     static std::shared_ptr<SpawnService> make(Directories directories, std::string daemonService,
-                                              std::shared_ptr<RunLoop> loop, std::string program);
+                                              std::shared_ptr<RunLoop> loop,
+                                              LauncherSettings settings, Programs programs);
     SpawnService(const SpawnService&) = delete;
     /// Ends the instances. On the loop, or where it does not run.
     ~SpawnService();
@@ -73,13 +81,15 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     };
 
     SpawnService(Directories directories, std::string daemonService, std::shared_ptr<RunLoop> loop,
-                 std::string program);
+                 LauncherSettings settings, Programs programs);
 
     void accept(const std::shared_ptr<Connection>& connection);
     void serve(const Host& host, const Asked& asked);
     void start(const Host& host, const Asked& asked);
     std::optional<Error> spawn(std::uint64_t id, Running running,
                                const std::vector<std::string>& plugInArguments);
+    /// What the grant allows, as narrow as the host is.
+    Allowance allowanceFor(const Running& running) const;
     void runs(std::uint64_t id);
     void awaitEnd(const Host& host, const Asked& asked, bool kill);
     void ended(std::uint64_t id, int status);
@@ -91,7 +101,9 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     const Directories directories_;
     const std::string daemonService_;
     const std::shared_ptr<RunLoop> loop_;
-    const std::string program_;
+    const LauncherSettings settings_;
+    const Programs programs_;
+    const Result<Keeper> keeper_;  // parent of all instances, and so goes after them
     SerialQueue queue_;
     std::shared_ptr<GrantedHosts> hosts_;  // set once, before this object is shared
     std::unique_ptr<Listener> listener_;

@@ -3,6 +3,7 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <sys/file.h>
+#include <sys/mman.h>
 #include <sys/random.h>
 #include <unistd.h>
 
@@ -235,6 +236,17 @@ void removeLeftovers(const std::string& path) {
             isLeftover(dirfd, entry->d_name))
             ::unlinkat(dirfd, entry->d_name, 0);
     }
+}
+
+UniqueFd memoryFile(std::string_view bytes) {
+    UniqueFd file(::memfd_create("zrd", MFD_CLOEXEC));
+    while (file && !bytes.empty()) {
+        const ssize_t count = ::write(file.get(), bytes.data(), bytes.size());
+        if (count < 0) return UniqueFd();
+        bytes.remove_prefix(static_cast<std::size_t>(count));
+    }
+    if (file) ::lseek(file.get(), 0, SEEK_SET);
+    return file;
 }
 
 std::optional<Error> makeDirectories(const std::string& path, mode_t mode) {

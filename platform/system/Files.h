@@ -8,6 +8,7 @@
 #include <string_view>
 
 #include "platform/system/Error.h"
+#include "platform/system/UniqueFd.h"
 
 namespace platform {
 
@@ -34,6 +35,10 @@ std::optional<Error> writeFileAtomically(const std::string& path, std::string_vi
 /// Nobody else's files are touched: such a file bears a name of ours that follows from the name at
 /// `path`, belongs to this user, and is locked while somebody writes it.
 void removeLeftovers(const std::string& path);
+
+/// A file without a name, in memory, with these bytes, to be read from its beginning; none, with
+/// errno set, when there is no room.
+UniqueFd memoryFile(std::string_view bytes);
 
 /// Makes the directory and its missing parents, each with `mode`. An existing directory is fine.
 std::optional<Error> makeDirectories(const std::string& path, mode_t mode);

@@ -3,6 +3,7 @@
 // needs nothing here; for other attempts add a function to `kAttempts`.
 
 #include <fcntl.h>
+#include <sys/inotify.h>
 #include <sys/ioctl.h>
 #include <sys/ptrace.h>
 #include <sys/resource.h>
@@ -111,6 +112,14 @@ std::string descriptors(const std::string&) {
     return std::to_string(last + 1);
 }
 
+/// How many queues for watches on files it can have, which the kernel counts by user.
+std::string watchQueues(const std::string&) {
+    int count = 0;
+    while (::inotify_init1(IN_CLOEXEC) >= 0) ++count;
+    ::close_range(4, ~0U, 0);
+    return std::to_string(count);
+}
+
 /// Attaches to the sandbox's first process, whose death with the launcher's is what ends us.
 std::string traceFirst(const std::string&) {
     return outcome(::ptrace(PTRACE_SEIZE, 1, nullptr, nullptr));
@@ -127,6 +136,7 @@ const std::map<std::string, Attempt> kAttempts{
     {"call32", call32},
     {"fork-bomb", forkBomb},
     {"descriptors", descriptors},
+    {"watch-queues", watchQueues},
     {"trace-first", traceFirst},
     {"write-first", writeFirst},
 };

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <poll.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -12,6 +13,14 @@
 #include "tests/system/SystemTest.h"
 
 namespace test {
+
+/// Whether, within a limit of time, nothing that a plug-in has started holds its connection.
+inline bool hasClosed(const zorvan::ZRPlugInProcess& process) {
+    pollfd state{process.connection(), POLLIN, 0};
+    char byte = 0;
+    return ::poll(&state, 1, 10000) == 1 &&
+           ::recv(process.connection(), &byte, 1, MSG_DONTWAIT) <= 0;
+}
 
 /// A daemon that knows "com.test.upper", a plug-in of an application that turns what it is sent
 /// into upper case and is busy from then on.

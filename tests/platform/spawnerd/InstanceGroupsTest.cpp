@@ -17,7 +17,7 @@ class Groups : public testing::Test {
   protected:
     Groups() {
         write("cgroup.controllers", "cpu memory pids\n");
-        write("cgroup.procs", self_ + "\n");
+        write("cgroup.procs", "1\n" + self_ + "\n");
         write("cgroup.subtree_control", "");
         write("daemon/cgroup.procs", "");
         for (const char* name : {"cgroup.procs", "cgroup.kill", "memory.max", "pids.max",
@@ -30,7 +30,9 @@ class Groups : public testing::Test {
     std::string read(const std::string& name) {
         return *readFile(tree_.path("user.slice/zrd.service/" + name), 1000);
     }
-    InstanceGroups find() { return InstanceGroups::find(tree_.path(), membership_); }
+    InstanceGroups find() {
+        return InstanceGroups::find({::getpid(), 1}, tree_.path(), membership_);
+    }
 
     const std::string self_ = std::to_string(::getpid());
     test::TemporaryDirectory tree_;
@@ -39,14 +41,16 @@ class Groups : public testing::Test {
 };
 
 TEST_F(Groups, AnInstanceHasOneWithItsLimits) {
+    const std::string old = tree_.makeDirectory("user.slice/zrd.service/instance-3");
     const InstanceGroups groups = find();
     ASSERT_TRUE(groups.areThere());
+    EXPECT_FALSE(std::filesystem::exists(old)) << "an earlier daemon's";
     EXPECT_EQ(read("daemon/cgroup.procs"), self_);
     EXPECT_EQ(read("cgroup.subtree_control"), "+cpu") << "the last that was written";
     const auto group = groups.make(7, kSmallLimits);
     ASSERT_TRUE(group);
     EXPECT_EQ(read("instance-7/memory.max"), "536870912");
-    EXPECT_EQ(read("instance-7/pids.max"), "130");
+    EXPECT_EQ(read("instance-7/pids.max"), "131");
     EXPECT_EQ(read("instance-7/cpu.weight"), "100");
     EXPECT_TRUE(group->add(1234));
     EXPECT_EQ(read("instance-7/cgroup.procs"), "1234");
@@ -62,9 +66,9 @@ TEST_F(Groups, WhatIsNotDelegatedStaysAsItIs) {
         return !find().areThere() && read("daemon/cgroup.procs").empty() &&
                read("cgroup.subtree_control").empty();
     };
-    write("cgroup.procs", "1\n" + self_ + "\n");
+    write("cgroup.procs", "1\n2\n" + self_ + "\n");
     EXPECT_TRUE(refused()) << "others are there too";
-    write("cgroup.procs", self_ + "\n");
+    write("cgroup.procs", self_ + "\n1\n");
     write("cgroup.controllers", "cpu\n");
     EXPECT_TRUE(refused());
     tree_.write("membership", "4:memory:/user.slice/zrd.service\n");

@@ -24,12 +24,13 @@ class LauncherTest : public lum::LumTest {
   protected:
     LauncherTest() {
         directories.dataHome = home.makeDirectory("data");
-        useLauncher(kBubblewrap);
+        useLauncher({});
     }
-    void useLauncher(const std::string& program) {
+    void useLauncher(const Programs& programs) {
         launcher.reset();
-        launcher.emplace(directories, "test", std::shared_ptr<RunLoop>(&loop, [](RunLoop*) {}),
-                         program);
+        launcher.emplace(
+            directories, "test", std::shared_ptr<RunLoop>(&loop, [](RunLoop*) {}),
+            [this](const auto& key) { return Value(*settings.find(key)); }, programs);
         loop.poll();
         connection.emplace(directories, "test.spawnerd", queue);
         connection->resume();
@@ -112,6 +113,7 @@ class LauncherTest : public lum::LumTest {
     }
 
     test::TemporaryDirectory home;
+    Dictionary settings{{"extension-points", Dictionary()}, {"plug-ins", Dictionary()}};
     std::optional<ProcessLauncher> launcher;
     std::optional<ClientConnection> connection;
 };

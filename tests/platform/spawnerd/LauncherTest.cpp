@@ -1,5 +1,5 @@
+#include <netinet/in.h>
 #include <sys/socket.h>
-#include <sys/syscall.h>
 #include <sys/un.h>
 
 #include <cstddef>
@@ -51,15 +51,88 @@ TEST_F(LauncherTest, APlugInTalksToItsHostAndSeesNothingElse) {
     EXPECT_EQ(number(askAbout(kWait, reply), kStatus), 1);
 }
 
-TEST_F(LauncherTest, OnlyPlugInsThatMayUseItHaveTheNetwork) {
-    const std::string executable = plugIn("one", "readlink /proc/self/ns/net");
-    const std::string ours = std::filesystem::read_symlink("/proc/self/ns/net").string() + "\n";
-    for (const std::string profile : {"plugin", "keyboard", "network-filter", "glimsed"}) {
-        EXPECT_EQ(grant(executable, overlay(Dictionary(), profile)), 0);
-        const std::string seen = talk(start(executable).takeDescriptor());
-        EXPECT_TRUE(seen.starts_with("net:")) << profile;
-        EXPECT_EQ(seen == ours, profile == "plugin") << profile;
+/// A program in the place of the one that connects instances, which notes that it was started and
+/// goes on as told.
+class NetworkTest : public LauncherTest {
+  protected:
+    void usePasta(const std::string& rest) {
+        std::filesystem::permissions(home.write("pasta", "#!/bin/sh\necho $$ \"$@\" >>" +
+                                                             home.path("started") + "\n" + rest),
+                                     std::filesystem::perms::owner_all);
+        useLauncher({.pasta = home.path("pasta")});
     }
+    std::string start(const std::string& executable, const std::string& profile = "plugin") {
+        EXPECT_EQ(grant(executable, overlay(Dictionary(), profile)), 0);
+        return talk(LauncherTest::start(executable).takeDescriptor());
+    }
+    std::size_t started() const {
+        const auto text = readFile(home.path("started"), 1u << 20);
+        return text ? static_cast<std::size_t>(std::ranges::count(*text, '\n')) : 0;
+    }
+    static bool hasDevice() { return ::access("/dev/net/tun", R_OK | W_OK) == 0; }
+    void wantNetwork(const Value& wanted = true) {
+        home.write("one.appex/Entitlements.plist",
+                   *writeXmlPropertyList(Dictionary{{kNetworkEntitlement, wanted}}));
+    }
+
+    const std::string executable_ =
+        plugIn("one", "tail -n+2 /proc/net/route | wc -l; ls /etc/resolv.conf 2>/dev/null");
+    static constexpr const char* kAlone = "0\n";  // no way leads anywhere
+};
+
+TEST_F(NetworkTest, IsForThoseThatAskForItAndMayHaveIt) {
+    usePasta("echo $$ >&2\nexec sleep 1000");
+    EXPECT_EQ(start(executable_), kAlone) << "did not ask";
+    wantNetwork("yes");
+    EXPECT_EQ(start(executable_), kAlone);
+    wantNetwork();
+    for (const char* profile : {"keyboard", "network-filter", "glimsed"})
+        EXPECT_EQ(start(executable_, profile), kAlone) << profile;
+    settings.set("plug-ins", Dictionary{{"one", Dictionary{{"network", false}}}});
+    EXPECT_EQ(start(executable_), kAlone) << "the administrator is against it";
+    EXPECT_EQ(started(), 0u);
+    settings.set("plug-ins", Dictionary());
+    EXPECT_EQ(start(executable_), kAlone + "/etc/resolv.conf\n"s);
+    EXPECT_EQ(started(), hasDevice() ? 1u : 0u);
+    EXPECT_TRUE(stepUntil([&] { return processesWith(home.path("pasta")).empty(); }));
+}
+
+TEST_F(NetworkTest, AProgramThatFailsLeavesThePlugInWithoutOne) {
+    wantNetwork();
+    usePasta("echo no route >&2");
+    EXPECT_EQ(start(executable_), kAlone + "/etc/resolv.conf\n"s);
+    EXPECT_EQ(errorLines(hasDevice() ? "no route" : "/dev/net/tun"), 1u);
+    useLauncher({.pasta = home.path("missing")});
+    EXPECT_EQ(start(executable_), kAlone + "/etc/resolv.conf\n"s);
+    EXPECT_EQ(errorLines("starts without a network"), 2u);
+}
+
+/// What listens on the machine's loopback interface, or without a name in the file system, is not
+/// there for a plug-in.
+TEST_F(NetworkTest, DoesNotLeadToTheMachineItself) {
+    if (::access(kPasta, X_OK) != 0 || !hasDevice())
+        GTEST_SKIP() << "there is no pasta, or no device for it";
+    const UniqueFd listening(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    sockaddr_in address{};
+    address.sin_family = AF_INET;
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    socklen_t size = sizeof address;
+    ASSERT_EQ(::bind(listening.get(), reinterpret_cast<sockaddr*>(&address), size), 0);
+    ASSERT_EQ(::listen(listening.get(), 8), 0);
+    ::getsockname(listening.get(), reinterpret_cast<sockaddr*>(&address), &size);
+    const std::string port = std::to_string(ntohs(address.sin_port));
+    const std::string executable = plugIn(
+        "one",
+        "tail -n+2 /proc/net/route | wc -l\n"
+        "gateway=$(perl -ane 'print join \".\", reverse map hex, unpack \"(A2)4\", $F[2]"
+        " if $F[1] eq \"00000000\"' /proc/net/route)\n"
+        "for host in 127.0.0.1 $gateway 169.254.1.1; do\n"
+        "perl -MIO::Socket::INET -e 'print IO::Socket::INET->new(PeerAddr => $ARGV[0], PeerPort =>"
+        " $ARGV[1], Timeout => 1) ? \"in\" : \"out\", \"\\n\"' $host " +
+            port + "\ndone");
+    wantNetwork();
+    if (start(executable).substr(0, 2) == kAlone) GTEST_SKIP() << "there is no network here";
+    EXPECT_TRUE(start(executable).ends_with("\nout\nout\nout\n"));
 }
 
 TEST_F(LauncherTest, NamesOutsideTheFilesAreOutOfReach) {
@@ -70,14 +143,37 @@ TEST_F(LauncherTest, NamesOutsideTheFilesAreOutOfReach) {
     const auto size = static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + 1 + name.size());
     ASSERT_EQ(::bind(socket.get(), reinterpret_cast<sockaddr*>(&address), size), 0);
     ASSERT_EQ(::listen(socket.get(), 1), 0);
-    if (::syscall(444, nullptr, 0, 1) < 6) GTEST_SKIP() << "this kernel cannot keep them apart";
     const std::string executable =
         plugIn("one",
                "exec perl -MSocket -e 'socket(S, AF_UNIX, SOCK_STREAM, 0);"
                "print connect(S, pack(\"S a*\", AF_UNIX, \"\\0" +
                    name + "\")) ? \"in\" : \"$!\"'");
     EXPECT_EQ(grant(executable), 0);
-    EXPECT_EQ(talk(start(executable).takeDescriptor()), "Operation not permitted");
+    EXPECT_EQ(talk(start(executable).takeDescriptor()), "Connection refused");
+}
+
+TEST_F(LauncherTest, TheAdministratorWidensAndNarrowsLimits) {
+    const std::string executable = plugIn("one", "ulimit -n; df -m /tmp | awk 'END { print $2 }'");
+    writeInfo("one", {{"QFBundleIdentifier", "one"},
+                      {"VXExtension", Dictionary{{"VXExtensionPointIdentifier", "point"}}}});
+    EXPECT_EQ(grant(executable), 0);
+    const auto seen = [&] { return talk(start(executable).takeDescriptor()); };
+    EXPECT_EQ(seen(), "512\n64\n");
+    settings.set("extension-points",
+                 Dictionary{{"point", Dictionary{{"descriptors", 100}, {"temporary", 200}}},
+                            {"other", Dictionary{{"descriptors", 50}}}});
+    EXPECT_EQ(seen(), "100\n200\n");
+    settings.set("plug-ins", Dictionary{{"one", Dictionary{{"descriptors", 600}}}});
+    EXPECT_EQ(seen(), "600\n200\n") << "the plug-in counts over its point";
+    for (const Value& bad : {Value(-1), Value("600"), Value(0), Value(std::uint64_t{1} << 40)}) {
+        settings.set("plug-ins", Dictionary{{"one", Dictionary{{"descriptors", bad}}}});
+        EXPECT_EQ(seen(), "100\n200\n") << describe(bad);
+    }
+    settings.set("plug-ins", Dictionary{{"one", Dictionary{{"speed", 1}}}});
+    EXPECT_EQ(seen(), "100\n200\n");
+    settings.set("plug-ins", Array());
+    EXPECT_EQ(seen(), "100\n200\n");
+    EXPECT_EQ(errorLines("ignoring the limit"), 6u);
 }
 
 TEST_F(LauncherTest, BadGrantsAreRefused) {
@@ -184,7 +280,7 @@ TEST_F(LauncherTest, BadRequestsAreAnsweredAndTheConnectionGoesOn) {
 }
 
 TEST_F(LauncherTest, NothingRunsWithoutBubblewrap) {
-    useLauncher(home.path("bwrap"));
+    useLauncher({.bubblewrap = home.path("bwrap")});
     const std::string executable = plugIn("one", "touch $HOME/ran");
     EXPECT_EQ(grant(executable, overlay(Dictionary{{"HOME", home.path()}})), 0);
     const Message reply = start(executable);
@@ -192,7 +288,7 @@ TEST_F(LauncherTest, NothingRunsWithoutBubblewrap) {
     EXPECT_NE(reply.find(kError)->string()->find(home.path("bwrap")), std::string::npos);
     EXPECT_EQ(errorLines("cannot confine plug-ins without"), 1u);
 
-    useLauncher("/bin/false");
+    useLauncher({.bubblewrap = "/bin/false"});
     EXPECT_EQ(grant(executable), 0);
     EXPECT_EQ(number(start(executable), kErrorCode), EIO);
     EXPECT_FALSE(std::filesystem::exists(home.path("ran")));

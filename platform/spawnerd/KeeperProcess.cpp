@@ -1,0 +1,178 @@
+#include "platform/spawnerd/KeeperProcess.h"
+
+#include <dirent.h>
+#include <fcntl.h>
+#include <poll.h>
+#include <sched.h>
+#include <sys/prctl.h>
+#include <sys/signalfd.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <charconv>
+#include <csignal>
+#include <cstdio>
+#include <cstring>
+#include <memory>
+#include <span>
+#include <utility>
+
+#include "platform/spawnerd/ChildProcess.h"
+#include "platform/spawnerd/Parcel.h"
+#include "platform/system/Files.h"
+
+namespace platform::spawnerd {
+
+namespace {
+
+constexpr std::size_t kMostStat = 4096;
+
+pid_t parentOf(int proc, const char* process) {
+    const auto text = readFileAt(proc, std::string(process) + "/stat", kMostStat);
+    // The name, in parentheses, may contain anything.
+    const std::size_t place = text ? text->rfind(')') : std::string::npos;
+    int parent = 0;
+    if (place != std::string::npos) std::sscanf(text->c_str() + place, ") %*c %d", &parent);
+    return parent;
+}
+
+void killChildren() {
+    const std::unique_ptr<DIR, int (*)(DIR*)> proc(::opendir("/proc"), &::closedir);
+    if (!proc) return;
+    while (const dirent* entry = ::readdir(proc.get())) {
+        pid_t process = 0;
+        std::from_chars(entry->d_name, entry->d_name + std::strlen(entry->d_name), process);
+        if (process > 0 && parentOf(::dirfd(proc.get()), entry->d_name) == ::getpid())
+            ::kill(process, SIGKILL);
+    }
+}
+
+/// As this process reaps orphans, what a child leaves when it ends is a child of this one by the
+/// time that it can be waited for.
+void endAll() {
+    do {
+        killChildren();
+    } while (::waitpid(-1, nullptr, 0) > 0);
+}
+
+/// What the kernel counts by user, with bounds that leave the user the greater part.
+constexpr std::pair<const char*, std::string_view> kUserLimits[] = {
+    {"/proc/sys/user/max_inotify_instances", "16"},
+    {"/proc/sys/user/max_inotify_watches", "8192"},
+};
+
+/// In a child: who has entered a user namespace does not come back. Answers 0 or an errno.
+int limitUserNamespace(const UniqueFd& userNamespace) {
+    const pid_t pid = ::fork();
+    if (pid == 0) {
+        if (::setns(userNamespace.get(), CLONE_NEWUSER) != 0) ::_exit(errno);
+        for (const auto& [path, bound] : kUserLimits) {
+            const UniqueFd file(::open(path, O_WRONLY | O_CLOEXEC));
+            (void)!::write(file.get(), bound.data(), bound.size());
+        }
+        ::_exit(0);
+    }
+    int status = 0;
+    if (pid < 0 || ::waitpid(pid, &status, 0) != pid) return errno;
+    return WIFEXITED(status) ? WEXITSTATUS(status) : EIO;
+}
+
+}  // namespace
+
+std::string KeeperOrder::encode() const {
+    const auto count = static_cast<std::uint32_t>(targets.size());
+    std::string bytes(reinterpret_cast<const char*>(&count), sizeof count);
+    bytes.append(reinterpret_cast<const char*>(targets.data()), count * sizeof(int));
+    for (const std::string& word : words) bytes.append(word).push_back('\0');
+    return bytes;
+}
+
+std::optional<KeeperOrder> KeeperOrder::decode(std::string_view bytes) {
+    KeeperOrder order;
+    std::uint32_t count = 0;
+    if (bytes.size() < sizeof count) return std::nullopt;
+    std::memcpy(&count, bytes.data(), sizeof count);
+    bytes.remove_prefix(sizeof count);
+    if (count > Parcel::kMostDescriptors || bytes.size() < count * sizeof(int)) return std::nullopt;
+    order.targets.resize(count);
+    std::memcpy(order.targets.data(), bytes.data(), count * sizeof(int));
+    bytes.remove_prefix(count * sizeof(int));
+    for (std::size_t end = 0; (end = bytes.find('\0')) != bytes.npos; bytes.remove_prefix(end + 1))
+        order.words.emplace_back(bytes.substr(0, end));
+    return order;
+}
+
+void KeeperProcess::main(int socket) {
+    ::prctl(PR_SET_NAME, "zrd-keeper");
+    // Whatever of the daemon's it had open beyond the daemon's end, others would wait for.
+    constexpr int kSocket = STDERR_FILENO + 1;
+    const int null = ::open("/dev/null", O_RDWR);
+    for (int fd = STDIN_FILENO; fd <= STDERR_FILENO; ++fd) ::dup2(null, fd);
+    if (::dup3(socket, kSocket, O_CLOEXEC) < 0 && socket != kSocket) ::_exit(1);
+    ::close_range(kSocket + 1, ~0U, 0);
+    sigset_t children;
+    ::sigemptyset(&children);
+    ::sigaddset(&children, SIGCHLD);
+    ::signal(SIGCHLD, SIG_DFL);
+    UniqueFd childSignals(::signalfd(-1, &children, SFD_CLOEXEC | SFD_NONBLOCK));
+    if (!childSignals || ::prctl(PR_SET_CHILD_SUBREAPER, 1, 0, 0, 0) != 0) ::_exit(1);
+    KeeperProcess(UniqueFd(kSocket), std::move(childSignals)).serve();
+    endAll();
+    ::_exit(0);
+}
+
+void KeeperProcess::serve() {
+    for (;;) {
+        pollfd states[] = {{socket_.get(), POLLIN, 0}, {childSignals_.get(), POLLIN, 0}};
+        if (::poll(states, std::size(states), -1) < 0) continue;
+        if (states[1].revents != 0) reap();
+        if (states[0].revents != 0 && !obey()) return;
+    }
+}
+
+bool KeeperProcess::obey() {
+    Result<Parcel> parcel = Parcel::receive(socket_.get());
+    const auto order = parcel ? KeeperOrder::decode(parcel->bytes) : std::nullopt;
+    if (!order || parcel->descriptors.size() != order->targets.size() + 1) return false;
+    UniqueFd pidFd;
+    const KeeperAnswer answer =
+        order->words.empty()
+            ? KeeperAnswer{.error = limitUserNamespace(parcel->descriptors.front()), .pid = -1}
+            : start(*order, parcel->descriptors, pidFd);
+    const int borrowed = pidFd.get();
+    const std::string_view bytes(reinterpret_cast<const char*>(&answer), sizeof answer);
+    return !Parcel::send(socket_.get(), bytes, std::span(&borrowed, pidFd ? 1 : 0));
+}
+
+KeeperAnswer KeeperProcess::start(const KeeperOrder& order, std::vector<UniqueFd>& descriptors,
+                                  UniqueFd& pidFd) {
+    ChildProcess child;
+    for (std::size_t i = 0; i < order.targets.size(); ++i)
+        if (!child.give(descriptors[i + 1].get(), order.targets[i]))
+            return {.error = errno, .pid = -1};
+    const Result<pid_t> pid = child.run(order.words);
+    if (!pid) return {.error = pid.error().code, .pid = -1};
+    // It may have ended, but is not reaped before this returns: the number is its own.
+    pidFd.reset(static_cast<int>(::syscall(SYS_pidfd_open, *pid, 0)));
+    const int error = pidFd ? 0 : errno;
+    if (!pidFd) ::kill(*pid, SIGKILL);
+    ends_[*pid] = std::move(descriptors.front());
+    return {.error = error, .pid = *pid};
+}
+
+void KeeperProcess::reap() {
+    signalfd_siginfo signal;
+    while (::read(childSignals_.get(), &signal, sizeof signal) > 0) {
+    }
+    int status = 0;
+    for (pid_t pid = 0; (pid = ::waitpid(-1, &status, WNOHANG)) > 0;) {
+        const auto found = ends_.find(pid);
+        if (found == ends_.end()) continue;  // an orphan
+        (void)!::write(found->second.get(), &status, sizeof status);
+        ends_.erase(found);
+    }
+}
+
+}  // namespace platform::spawnerd

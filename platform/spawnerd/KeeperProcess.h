@@ -1,0 +1,55 @@
+#pragma once
+
+#include <sys/types.h>
+
+#include <map>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+#include "platform/system/Error.h"
+#include "platform/system/UniqueFd.h"
+
+namespace platform::spawnerd {
+
+/// What goes to the keeper: a program to be started, with the pipe for its status first among the
+/// descriptors; without words, a user namespace to be limited, the one descriptor.
+struct KeeperOrder {
+    std::vector<int> targets;  // of the descriptors behind the first
+    std::vector<std::string> words;
+
+    std::string encode() const;
+    static std::optional<KeeperOrder> decode(std::string_view bytes);
+};
+
+/// What comes back, for a program with its pidfd unless there is an error.
+struct KeeperAnswer {
+    int error;
+    pid_t pid;
+};
+
+/// The keeper's own side: see `Keeper`.
+class KeeperProcess {
+  public:
+    /// What the process does from its fork to its end. `socket` leads to the daemon.
+    [[noreturn]] static void main(int socket);
+
+  private:
+    KeeperProcess(UniqueFd socket, UniqueFd childSignals)
+        : socket_(std::move(socket)), childSignals_(std::move(childSignals)) {}
+
+    /// Until the daemon is gone.
+    void serve();
+    /// One order; false when none will come any more.
+    bool obey();
+    KeeperAnswer start(const KeeperOrder& order, std::vector<UniqueFd>& descriptors,
+                       UniqueFd& pidFd);
+    void reap();
+
+    const UniqueFd socket_, childSignals_;
+    std::map<pid_t, UniqueFd> ends_;  // where to tell how a child ended
+};
+
+}  // namespace platform::spawnerd
