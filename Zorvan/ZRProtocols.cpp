@@ -2,7 +2,7 @@
 
 #include <fmt/format.h>
 
-#include <charconv>
+#include <cstdlib>
 #include <string_view>
 #include <vector>
 
@@ -30,11 +30,9 @@ std::vector<std::string> split(std::string_view text, char separator) {
     }
 }
 
-/// What a field's digits say; 0 without any.
+/// What a field's digits say, after white space and a sign; 0 without any.
 std::size_t decimalValue(const std::string& text) {
-    std::size_t value = 0;
-    std::from_chars(text.data(), text.data() + text.size(), value);
-    return value;
+    return static_cast<std::size_t>(std::strtol(text.c_str(), nullptr, 10));
 }
 
 ZRError wrong(const std::string& what) {
@@ -60,12 +58,11 @@ std::optional<ZRError> setClasses(ObjectRuntime& runtime, ObjectInterface& inter
 ProtocolRef ZRProtocolNamed(ObjectRuntime& runtime, const std::string& name,
                             std::optional<ZRError>* error) {
     if (auto protocol = runtime.protocol(name)) return protocol;
-    const std::string text = fmt::format(
+    constexpr const char* kText =
         "unable to locate protocol \"{}\" - check that it is defined and not inadvertently "
-        "optimized away",
-        name);
-    EVLOG_DEFAULT(ops(), "{}", text);
-    report(error, text);
+        "optimized away";
+    EVLOG_DEFAULT(ops(), kText, name);
+    report(error, fmt::format(kText, name));
     return nullptr;
 }
 

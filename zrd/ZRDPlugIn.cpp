@@ -42,7 +42,8 @@ std::shared_ptr<ZRDPlugIn> ZRDPlugIn::initWithTDData(platform::TDPlugInProxyRef 
     std::shared_ptr<ZRDPlugIn> plugIn(new ZRDPlugIn(std::move(proxy), std::move(context)));
     if (!plugIn->fillFromProxy()) return nullptr;
     if (auto fault = plugIn->diagnose()) {
-        EVLOG_INFO(ops(), "ignoring mis-configured plug-in at {}: {}", plugIn->path(), pub(*fault));
+        EVLOG_INFO(ops(), "ignoring mis-configured plug-in at {}: {}", plugIn->path(),
+                   pub(fault->description.value_or("")));
         return nullptr;
     }
     return plugIn;

@@ -83,11 +83,11 @@ const Value* ZRDPlugIn::attributeOrInfoKey(std::string_view key) const {
 }
 
 std::string ZRDPlugIn::userElection() const {
-    std::int64_t election = 0;
+    std::uint64_t election = 0;
     if (auto reader = context_->annotations.lock()) {
         if (auto annotation = reader->annotationForPlugIn(*this)) {
             const Value* stored = annotation->find(annotation::kElection);
-            election = stored ? stored->numberAsInteger().value_or(0) : 0;
+            election = stored ? stored->numberAsBits().value_or(0) : 0;
         }
     }
     // Bits 8 to 15 are not part of the choice.

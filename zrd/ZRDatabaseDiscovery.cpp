@@ -96,10 +96,10 @@ bool ZRDatabase::electionAdmits(const std::vector<std::string>& patterns,
     const Value* replaced = entitlements.find(entitlement::kReplacePlugIn);
     std::string key =
         replaced && replaced->string() ? *replaced->string() : identifier.value_or("");
-    auto stored = sync_.sync([&]() -> std::optional<std::int64_t> {
+    auto stored = sync_.sync([&]() -> std::optional<std::uint64_t> {
         const Dictionary* annotation = annotations_->annotationForIdentifier(key);
         const Value* election = annotation ? annotation->find(annotation::kElection) : nullptr;
-        return election ? std::optional(election->numberAsInteger().value_or(0)) : std::nullopt;
+        return election ? std::optional(election->numberAsBits().value_or(0)) : std::nullopt;
     });
     if (!stored) {
         const Value* autoElect = entitlements.find(entitlement::kAutoElectPlugIn);

@@ -9,7 +9,7 @@ Message Message::replyTo(const Message& request) {
 }
 
 std::string describe(const Message& message) {
-    return describe(message.contents());
+    return describeWhole(message.contents());
 }
 
 }  // namespace platform

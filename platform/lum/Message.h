@@ -55,6 +55,7 @@ class Message {
     std::shared_ptr<UniqueFd> descriptor_;
 };
 
+/// The text of the whole message, for tracers: never cut.
 std::string describe(const Message& message);
 
 }  // namespace platform

@@ -269,6 +269,12 @@ std::optional<std::int64_t> Value::numberAsInteger() const {
     return static_cast<std::int64_t>(*value);
 }
 
+std::optional<std::uint64_t> Value::numberAsBits() const {
+    if (auto large = copied<std::uint64_t>(content_)) return large;
+    auto value = numberAsInteger();
+    return value ? std::optional(static_cast<std::uint64_t>(*value)) : std::nullopt;
+}
+
 namespace {
 
 /// Whether a real and an integer are the same number, without rounding the integer.

@@ -191,6 +191,9 @@ class Value {
     /// and what does not fit becomes the nearest end of the range (NaN becomes 0). None for other
     /// kinds.
     std::optional<std::int64_t> numberAsInteger() const;
+    /// The same in two's complement, for who wants some of its bits: integers above 2^63-1 keep
+    /// theirs.
+    std::optional<std::uint64_t> numberAsBits() const;
 
     bool operator==(const Value& other) const;
 
@@ -221,6 +224,8 @@ bool equalsFalse(const Value& value);
 std::string describe(const Value& value);
 std::string describe(const Dictionary& value);
 std::string describe(const Array& value);
+/// The same, however long it is.
+std::string describeWhole(const Dictionary& value);
 
 /// Whether the value could be stored in a property-list file and read back: no UUID and no packed
 /// value at any depth, no text (keys included) with characters that XML 1.0 forbids, no date

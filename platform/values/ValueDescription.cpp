@@ -2,6 +2,8 @@
 
 #include <fmt/format.h>
 
+#include <limits>
+
 #include "platform/values/Value.h"
 
 namespace platform {
@@ -9,10 +11,13 @@ namespace platform {
 namespace {
 
 constexpr std::size_t kMaxDescription = 64 * 1024;
+constexpr std::size_t kNoLimit = std::numeric_limits<std::size_t>::max() - 1;
 
 /// Writes until the text is full: what lies behind that is not even walked.
 class Describer {
   public:
+    explicit Describer(std::size_t limit = kMaxDescription) : limit_(limit) {}
+
     std::string text;
 
     void add(const Value& value, bool quoted) {
@@ -74,17 +79,19 @@ class Describer {
 
     std::string take() {
         if (isFull()) {
-            text.resize(kMaxDescription);
+            text.resize(limit_);
             text += "...";
         }
         return std::move(text);
     }
 
   private:
-    bool isFull() const { return text.size() > kMaxDescription; }
+    const std::size_t limit_;
 
-    static std::string_view upToLimit(std::string_view string) {
-        return string.substr(0, kMaxDescription + 1);
+    bool isFull() const { return text.size() > limit_; }
+
+    std::string_view upToLimit(std::string_view string) const {
+        return string.substr(0, limit_ + 1);
     }
 
     template <class... Arguments>
@@ -127,6 +134,12 @@ std::string describe(const Dictionary& value) {
 
 std::string describe(const Array& value) {
     Describer describer;
+    describer.add(value);
+    return describer.take();
+}
+
+std::string describeWhole(const Dictionary& value) {
+    Describer describer(kNoLimit);
     describer.add(value);
     return describer.take();
 }

@@ -57,6 +57,8 @@ TEST_F(ProtocolsTest, DescriptionsSetArgumentsUpToTheFirstThatIsWrong) {
     EXPECT_THAT(*interface_.classes({"do", 0, false}), ElementsAre("A", "B"));
     EXPECT_EQ(interface_.interface({"do", 1, true})->protocol(), runtime_.protocol("Q"));
     EXPECT_FALSE(interface_.classes({"do", 0, true}));
+    EXPECT_EQ(describe("request: +7th:{B}"), "");
+    EXPECT_THAT(*interface_.classes({"do", 7, false}), ElementsAre("B"));
 
     EXPECT_EQ(describe("request:3:{A},request:0"), "6 request:3:{A},request:0");
     EXPECT_TRUE(interface_.classes({"do", 3, false})) << "what came before stays";

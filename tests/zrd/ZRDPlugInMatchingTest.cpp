@@ -113,8 +113,8 @@ TEST_F(MatchingTest, AMissingApplicationFailsEveryPattern) {
 TEST_F(MatchingTest, ElectionDropsBits8To15AndIsSigned) {
     auto plugIn = makePlugIn();
     const std::pair<Value, const char*> cases[] = {
-        {1, "1"},       {0x1FF01, "65537"}, {0x80000002, "-2147483646"},
-        {-1, "-65281"}, {Value("3"), "0"},  {0x100000005, "5"},
+        {1, "1"},          {0x1FF01, "65537"}, {0x80000002, "-2147483646"}, {-1, "-65281"},
+        {Value("3"), "0"}, {0x100000005, "5"}, {UINT64_MAX - 4, "-65285"},
     };
     for (const auto& [election, text] : cases) {
         world_.annotations->stored["com.a"] = {{"election", election}};

@@ -156,7 +156,7 @@ TEST_F(ZRDatabaseTest, SkipsRecordsThatCannotBeUsed) {
 TEST_F(ZRDatabaseTest, TheElectionNarrowsByUsablePatterns) {
     const char* autoElect = entitlement::kAutoElectPlugIn;
     elect(install("one"), 257);
-    elect(install("zero"), 256);
+    elect(install("zero"), (std::uint64_t{1} << 63) + 256);
     elect(install("minus"), -1);
     install("never");
     install("sharing", {{entitlement::kReplacePlugIn, "one"}});

@@ -50,6 +50,8 @@ TEST(Value, IntegersAreReadInTheRangeTheyFit) {
     EXPECT_EQ(Value(-1e300).numberAsInteger(), INT64_MIN);
     EXPECT_EQ(Value(-2.7).numberAsInteger(), -2);
     EXPECT_EQ(Value("3").numberAsInteger(), std::nullopt);
+    EXPECT_EQ(Value(UINT64_MAX - 1).numberAsBits(), UINT64_MAX - 1);
+    EXPECT_EQ(Value(-1.5).numberAsBits(), UINT64_MAX);
 }
 
 TEST(Dictionary, ChangingACopyLeavesTheOriginal) {
@@ -137,6 +139,7 @@ TEST(Describe, IsCutWhereItGrowsWithoutEnd) {
     // More elements, counted through, than anybody could walk.
     for (int i = 0; i < 40; ++i) list = Array{list, list, list, list};
     EXPECT_LT(describe(list).size(), 70'000U);
+    EXPECT_GT(describeWhole({{"text", std::string(100'000, 'x')}}).size(), 100'000U);
     EXPECT_EQ(describe(Value(Dictionary{{"a", Array{true, "s", -1}}, {"b", Packed(Value(1.5))}})),
               R"({a: [true, "s", -1], b: 1.5})");
 }
