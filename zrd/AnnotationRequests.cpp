@@ -32,6 +32,7 @@ bool Transaction::hasRoomFor(const Dictionary& change, const ZRDPlugIn& plugIn) 
     if (server().hasRoomForAnnotation(change, plugIn)) return true;
     EVLOG_INFO(ops(), "client {} plug-in {}({}) annotation refused: the annotations are too large",
                client_->pid(), plugIn.identifier(), pub(plugIn.uuid()));
+    fail(kZRErrorDenied, "no room for more annotations");
     return false;
 }
 
@@ -70,10 +71,7 @@ void Transaction::annotatePlugIns() {
     bool completed = processUuidList([&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
         if (!changed.insert(plugIn->uuid()).second) return Walk::Continue;
         if (!hasShareFor(change, *plugIn)) return Walk::Stop;
-        if (!hasRoomFor(change, *plugIn)) {
-            fail(kZRErrorInvalidRequest, "invalid request format (annotation extension)");
-            return Walk::Stop;
-        }
+        if (!hasRoomFor(change, *plugIn)) return Walk::Stop;
         EVLOG_DEBUG(ops(), "client {} plug-in {}({}) annotation change: {}", client_->pid(),
                     plugIn->identifier(), pub(plugIn->uuid()), change);
         if (election) {
@@ -109,9 +107,7 @@ void Transaction::bulkAnnotatePlugIns() {
         if (lastOf[*uuid] != &value) continue;
         const Dictionary change{{annotation::kExtension, value}};
         if (!hasShareFor(change, *plugIn)) return;
-        if (!hasRoomFor(change, *plugIn)) {
-            return fail(kZRErrorAnnotation, "annotations values must be dictionaries");
-        }
+        if (!hasRoomFor(change, *plugIn)) return;
         EVLOG_DEBUG(ops(), "client {} bulk plug-in {}({}) annotation change: {}", client_->pid(),
                     plugIn->identifier(), pub(plugIn->uuid()), value);
         server().setAnnotation(change, *plugIn, origin());

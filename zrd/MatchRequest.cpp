@@ -64,14 +64,16 @@ void Transaction::matchPlugIns() {
     for (const auto& plugIn : candidates) {
         if (firstClosedGate(*plugIn, query)) continue;
         std::optional<ZRError> error;
-        auto form = plugIn->form(untouched, error);
+        auto draft = plugIn->draftForm(untouched, error);
         if (error) {
             EVLOG_ERROR(ops(), "failed to export matching plug-in {}: {}", pub(plugIn->uuid()),
                         pub(*error));
         }
-        if (!form || !result.admit(*plugIn)) continue;
-        addAnnotationForPlugIn(*plugIn, *form);
-        if (!result.append(plugIn, *std::move(form))) ++leftOut;
+        if (!draft || !result.admit(*plugIn)) continue;
+        // Only who has won is given tokens.
+        Dictionary form = plugIn->completedForm(*std::move(draft));
+        addAnnotationForPlugIn(*plugIn, form);
+        if (!result.append(plugIn, std::move(form))) ++leftOut;
     }
     if (leftOut != 0)
         EVLOG_ERROR(ops(), "leaving {} plug-ins out of a match that no reply can hold", leftOut);

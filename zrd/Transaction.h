@@ -59,7 +59,7 @@ class Transaction {
 
     /// The request's "annotations"; null when they cannot be stored, and the failure has been sent.
     const platform::Dictionary* requestedAnnotations();
-    /// Whether the store has room for a change; what has none counts as of the wrong kind.
+    /// Whether the store has room for a change; otherwise the failure has been sent.
     bool hasRoomFor(const platform::Dictionary& change, const ZRDPlugIn& plugIn);
     /// Whether this client's origin may store a change, too; otherwise the failure has been sent.
     bool hasShareFor(const platform::Dictionary& change, const ZRDPlugIn& plugIn);

@@ -138,35 +138,31 @@ void ZRDPlugIn::setLocalizedContainingName(std::optional<std::string> value) {
     setName(localizedContainingName_, std::move(value));
 }
 
-/// The form that was made before, if it still holds. `nameChanges` becomes the number of changes
-/// that it, or one that is made from now on, takes in.
-std::optional<Dictionary> ZRDPlugIn::sharedForm(const platform::UntouchedBundles& untouched,
-                                                std::uint64_t& nameChanges) const {
+std::optional<ZRDPlugIn::Draft> ZRDPlugIn::draftForm(const platform::UntouchedBundles& untouched,
+                                                    std::optional<ZRError>& error) const {
     std::optional<Dictionary> form;
+    std::uint64_t nameChanges = 0;
     {
         std::lock_guard lock(mutex_);
         form = form_;
         nameChanges = nameChanges_;
     }
     // The only token of a form that is kept is that for the bundle itself.
-    if (form && isAppExtension() && !untouched.contains(path()) &&
-        !platform::isInPlace(path(), tdproxy_->bundleIdentity))
-        return std::nullopt;
-    return form;
+    if (form && (!isAppExtension() || untouched.contains(path()) ||
+                 platform::isInPlace(path(), tdproxy_->bundleIdentity)))
+        return Draft{*std::move(form), true, nameChanges};
+    form = exportForm(error);
+    if (!form) return std::nullopt;
+    return Draft{*std::move(form), false, nameChanges};
 }
 
-std::optional<Dictionary> ZRDPlugIn::form(const platform::UntouchedBundles& untouched,
-                                          std::optional<ZRError>& error) const {
-    std::uint64_t namesAtStart = 0;
-    if (auto shared = sharedForm(untouched, namesAtStart)) return shared;
-    auto made = exportForm(error);
-    if (!made) return std::nullopt;
+Dictionary ZRDPlugIn::completedForm(Draft draft) const {
     // Tokens that could not be issued now may be another time, and others may go stale.
-    if (!augmentForm(*made)) return made;
-    platform::keepCborEncoded(*made);
+    if (draft.isComplete || !augmentForm(draft.form)) return std::move(draft.form);
+    platform::keepCborEncoded(draft.form);
     std::lock_guard lock(mutex_);
-    if (namesAtStart == nameChanges_) form_ = made;
-    return made;
+    if (draft.nameChanges == nameChanges_) form_ = draft.form;
+    return std::move(draft.form);
 }
 
 std::optional<ZRError> ZRDPlugIn::diagnose() const {

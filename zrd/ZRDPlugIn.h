@@ -49,12 +49,21 @@ class ZRDPlugIn final : public ZRPlugInCore {
     /// around what is not part of the system.
     std::optional<ZRError> diagnose() const override;
 
-    /// The record's form as `exportForm` makes it and `augmentForm` completes it. Unless its tokens
-    /// may go stale, it is made and encoded at the first call and shared from then on, as long as
-    /// the bundle that it has a token for is in its place, which is looked at unless it is one of
-    /// `untouched`; setting a name makes it afresh. An error: there is none, as with `exportForm`.
-    std::optional<platform::Dictionary> form(const platform::UntouchedBundles& untouched,
-                                             std::optional<ZRError>& error) const;
+    /// A form on its way into an answer: as `exportForm` makes it, or complete already.
+    struct Draft {
+        platform::Dictionary form;
+        bool isComplete = false;
+        std::uint64_t nameChanges = 0;  // that the form takes in
+    };
+    /// The record's form, without tokens unless it was completed before. An error: there is none,
+    /// as with `exportForm`.
+    std::optional<Draft> draftForm(const platform::UntouchedBundles& untouched,
+                                   std::optional<ZRError>& error) const;
+    /// The form with what `augmentForm` adds. Unless its tokens may go stale, it is encoded at the
+    /// first call and shared from then on, as long as the bundle that it has a token for is in its
+    /// place, which `draftForm` looks at unless it is one of `untouched`; setting a name makes it
+    /// afresh.
+    platform::Dictionary completedForm(Draft draft) const;
 
     /// The plug-in's value for an entitlement, or null.
     const platform::Value* valueForEntitlement(std::string_view name) const;
@@ -97,8 +106,6 @@ class ZRDPlugIn final : public ZRPlugInCore {
   private:
     ZRDPlugIn(platform::TDPlugInProxyRef proxy, std::shared_ptr<const PlugInContext> context);
     bool fillFromProxy();
-    std::optional<platform::Dictionary> sharedForm(const platform::UntouchedBundles& untouched,
-                                                   std::uint64_t& nameChanges) const;
     std::uint32_t declaredHubProtocolVersion() const;
 
     /// The value that a rule's key stands for: borrowed from the registry's record, or made for the

@@ -17,6 +17,8 @@ namespace {
 
 constexpr std::string_view kApplicationSuffix = ".app";
 constexpr std::string_view kPlugIns = "PlugIns";
+constexpr const char* kLeavingOut = "leaving out a plug-in:";
+
 /// The domain of refusals for want of room.
 constexpr const char* kRoom = "Room";
 
@@ -88,7 +90,9 @@ RegistryChanges ApplicationScanner::scanAll() {
 RegistryChanges ApplicationScanner::scanPath(const std::string& path, bool& hasPlugIns) {
     begin(false);
     if (state_.registrations.contains(path)) watch_.markWay(path);
+    complaints_.setLevel(LogLevel::Info);
     visitPath(path);
+    complaints_.setLevel(LogLevel::Error);
     hasPlugIns = metPlugIns_ != 0;
     std::string refusal = changes_.refusal;
     const bool isAlone = isSelfContained(path) && visitScope(path);
@@ -171,8 +175,7 @@ void ApplicationScanner::visitFolder(const std::string& folder) {
     watch_.markEntries(folder, kApplicationSuffix);
     Result<FolderEntries> found = FolderEntries::read(folder, watch_, complaints_);
     if (!found) {
-        complaints_.add(folder,
-                        fmt::format("cannot look for applications: {}", found.error().text));
+        complaints_.add(folder, "cannot look for applications:", found.error().text);
         unreachable_.push_back(folder);
         // Its links may lead anywhere.
         if (noteTransient(found.error())) isIncomplete_ = true;
@@ -187,8 +190,8 @@ void ApplicationScanner::visitFolder(const std::string& folder) {
         if (isApplication(path))
             visitApplication(path);
         else
-            complaints_.add(
-                entry, fmt::format("skipping {}: {} is not an application directory", entry, path));
+            complaints_.add(entry, "skipping",
+                            fmt::format("{}: {} is not an application directory", entry, path));
     }
 }
 
@@ -227,7 +230,7 @@ void ApplicationScanner::visitPlugIns(const std::string& application, const std:
     watch_.markContents(folder, application);
     Result<FolderEntries> found = FolderEntries::read(folder, watch_, complaints_);
     if (!found && !isMissing(found.error())) {
-        complaints_.add(folder, fmt::format("cannot look for plug-ins: {}", found.error().text));
+        complaints_.add(folder, "cannot look for plug-ins:", found.error().text);
         if (changes_.refusal.empty()) changes_.refusal = found.error().text;
         unreachable_.push_back(application);
         if (noteTransient(found.error())) isIncomplete_ = true;
@@ -264,8 +267,7 @@ TDApplicationProxyRef ApplicationScanner::applicationAt(const std::string& path)
         return entry.record;
     }
     if (reading.failure && !reading.record->isPlaceholder)
-        complaints_.add(path, fmt::format("application without name and identifier: {}",
-                                          reading.failure->text));
+        complaints_.add(path, "application without name and identifier:", reading.failure->text);
     entry.record = std::move(reading.record);
     entry.stamps = std::move(reading.stamps);
     changes_.applications.insert(path);
@@ -290,7 +292,7 @@ bool ApplicationScanner::isUntrusted(const std::string& path, const char* kind) 
     const char* place = untrusted_.around(path);
     if (!place) return false;
     const std::string reason = fmt::format("{}: it lies in {}", path, place);
-    complaints_.add(path, fmt::format("leaving out {}: {}", kind, reason));
+    complaints_.add(path, "leaving out", fmt::format("{}: {}", kind, reason));
     if (changes_.refusal.empty()) changes_.refusal = reason;
     forEachWithin(state_.plugIns, path, [this](auto entry) {
         room_.remove(entry->second);
@@ -318,8 +320,7 @@ bool ApplicationScanner::isRefused(const BundleFolder& folder, const std::string
     if (!reader_.isUnchanged(folder, refusal.print)) return false;
     if (refusal.size != 0 && !room_.excess(application, refusal.size)) return false;
     // Remembered from an earlier run: its author has to be told in this one as well.
-    if (std::exchange(refusal.pass, pass_) == 0)
-        EVLOG_ERROR(ops(), "leaving out a plug-in: {}", pub(refusal.reason));
+    if (std::exchange(refusal.pass, pass_) == 0) complaints_.say(kLeavingOut, refusal.reason);
     if (changes_.refusal.empty()) changes_.refusal = refusal.reason;
     return true;
 }
@@ -402,9 +403,8 @@ bool ApplicationScanner::isBeyondRoom(const PlugInEntry& entry) const {
 void ApplicationScanner::refuse(const BundleFolder& folder, BundleReader::Reading reading) {
     const Error& error = *reading.refusal;
     if (changes_.refusal.empty()) changes_.refusal = error.text;
-    const std::string complaint = fmt::format("leaving out a plug-in: {}", error.text);
     if (error.domain == "POSIX") {
-        complaints_.add(folder.path, complaint);
+        complaints_.add(folder.path, kLeavingOut, error.text);
         auto known = state_.plugIns.find(folder.path);
         if (noteTransient(error) && known != state_.plugIns.end()) keep(known->second);
         return;
@@ -413,7 +413,7 @@ void ApplicationScanner::refuse(const BundleFolder& folder, BundleReader::Readin
     // Read again, and the same: that has been told.
     if (refusal.pass == 0 || refusal.reason != error.text ||
         !reader_.isLike(refusal.print, reading.entry.print))
-        complaints_.add(folder.path, complaint);
+        complaints_.add(folder.path, kLeavingOut, error.text);
     const std::size_t size = reading.entry.dictionaries ? reading.entry.dictionaries->size() : 0;
     refusal = {std::move(reading.entry.print), error.text, error.domain == kRoom ? size : 0, pass_};
     changes_.refusals.insert(folder.path);

@@ -5,10 +5,14 @@
 
 namespace platform::tandry {
 
-void Complaints::add(const std::string& path, const std::string& text) {
+void Complaints::add(const std::string& path, const char* what, const std::string& which) {
     Complaint& complaint = complaints_[path];
-    if (complaint.text != text) EVLOG_ERROR(ops(), "{}", pub(text));
-    complaint = {text, walk_};
+    if (complaint.what != what || complaint.which != which) say(what, which);
+    complaint = {what, which, walk_};
+}
+
+void Complaints::say(const char* what, const std::string& which) const {
+    EVLOG_AT(level_, ops(), "{} {}", pub(what), which);
 }
 
 void Complaints::forgetUnmet(const std::string& scope) {

@@ -38,7 +38,7 @@ ApplicationScanner::Folders scannedFolders(const Directories& directories) {
 
 /// Tells of a change that is refused, and why.
 Error refused(const char* change, const std::string& path, const std::string& reason) {
-    EVLOG_ERROR(ops(), "refusing to {} {}: {}", change, pub(path), pub(reason));
+    EVLOG_ERROR(ops(), "refusing to {} {}: {}", change, path, pub(reason));
     return {"Registry", 0, fmt::format("{}: {}", path, reason)};
 }
 

@@ -1,7 +1,6 @@
 #include "platform/tandry/FolderEntries.h"
 
 #include <fcntl.h>
-#include <fmt/format.h>
 #include <sys/stat.h>
 
 #include <algorithm>
@@ -40,7 +39,7 @@ void add(FolderEntries& found, const std::filesystem::path& folder, const dirent
         watch.markWay(path);
         std::optional<std::string> canonical = canonicalPath(path);
         if (!canonical) {
-            complaints.add(path, fmt::format("skipping {}: a link that cannot be resolved", path));
+            complaints.add(path, "skipping", path + ": a link that cannot be resolved");
             std::error_code ignored;
             const auto end = std::filesystem::read_symlink(path, ignored);
             const auto missing = std::filesystem::weakly_canonical(folder / end, ignored);
@@ -54,9 +53,8 @@ void add(FolderEntries& found, const std::filesystem::path& folder, const dirent
     if (isUsablePath(real))
         found.entries.push_back({entry.d_name, std::move(target)});
     else
-        complaints.add(
-            real, fmt::format("skipping {}: its path is not UTF-8 text, or has control characters",
-                              real));
+        complaints.add(real, "skipping",
+                       real + ": its path is not UTF-8 text, or has control characters");
 }
 
 }  // namespace

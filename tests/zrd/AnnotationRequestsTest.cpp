@@ -101,10 +101,9 @@ TEST_F(AnnotationRequestsTest, NoHostCanFillTheStoreForOthers) {
     server_->setAnnotation(Dictionary{{"extension", withObjects(470'000)}},
                            *server_->findPlugIn(uuid(0)));
     const Dictionary extension = withObjects(60'000), large{{"extension", extension}};
-    EXPECT_EQ(annotate(large, Array{uuid(1)}),
-              error(4, "invalid request format (annotation extension)"));
-    EXPECT_EQ(bulkAnnotate(Dictionary{{uuid(1).string(), extension}}),
-              error(18, "annotations values must be dictionaries"));
+    const Dictionary full = error(11, "no room for more annotations");
+    EXPECT_EQ(annotate(large, Array{uuid(1)}), full);
+    EXPECT_EQ(bulkAnnotate(Dictionary{{uuid(1).string(), extension}}), full);
     LogLines log;
     EXPECT_EQ(annotate(Dictionary{{"election", 2}}, Array{uuid(1)}), Dictionary());
     EXPECT_THAT(log.take(), Not(Contains(HasSubstr("unable to save"))));

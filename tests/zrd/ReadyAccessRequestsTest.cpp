@@ -195,8 +195,8 @@ TEST(Enabling, AFormsTokenIsUsedAgainOnlyWhileTheBundleIsInItsPlace) {
     platform::UntouchedBundles untouched;
     const auto token = [&] {
         std::optional<ZRError> error;
-        const auto form = record->form(untouched, error);
-        const Value* found = form->find("extensions")->dictionary()->find(".");
+        const auto form = record->completedForm(*record->draftForm(untouched, error));
+        const Value* found = form.find("extensions")->dictionary()->find(".");
         return found ? *found->string() : std::string("none");
     };
     const std::string first = token();

@@ -108,13 +108,15 @@ TEST_F(TransactionTest, RemovingNeedsTheManagersEntitlement) {
 }
 
 TEST_F(TransactionTest, MatchAnswersForms) {
-    workspace_->installed = {makeProxy("com.a", {{"Color", "red"}}), makeProxy("com.b")};
+    workspace_->installed = {makeProxy("com.a", {{"Color", "red"}}), makeProxy("com.b"),
+                             makeProxy("com.b", {{"VXExtensionVersion", "0.9"}})};
     auto versionless = makeProxy("com.c");
     versionless->infoPlist =
         Dictionary{{"VXExtension", Dictionary{{"VXExtensionAttributes", Dictionary()}}}};
     workspace_->installed.push_back(versionless);
     LogLines log;
     EXPECT_THAT(match({}), ElementsAre("com.a", "com.b"));
+    EXPECT_EQ(sandbox_->issued, 2) << "who loses gets no tokens";
     auto lines = log.take();
     EXPECT_THAT(lines, Contains(HasSubstr("ops E: failed to export matching plug-in " +
                                           versionless->plugInUuid.string())));
