@@ -4,12 +4,14 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
 #include "Zorvan/ZRError.h"
 #include "platform/lum/Message.h"
 #include "platform/lum/Origin.h"
+#include "zrd/HostRestriction.h"
 
 namespace zorvan {
 
@@ -51,6 +53,8 @@ class Transaction {
     /// Whether the host may have a plug-in made ready; otherwise the failure has been sent.
     bool admitToReady(const ZRDPlugIn& plugIn);
     void releaseHolds(const platform::Array& tokens);
+    /// Read when it is first asked for.
+    const HostRestriction& hostRestriction();
     /// What "paths" names; false when the failure has been sent.
     bool collectPlugInsToHold(HoldSubject& subject);
     /// Whether none of them is busy; otherwise the failure has been sent, with the conflicts.
@@ -94,3 +98,4 @@ class Transaction {
 };
 
 }  // namespace zorvan
+    std::optional<HostRestriction> hostRestriction_;

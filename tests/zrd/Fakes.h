@@ -1,6 +1,8 @@
 #pragma once
 
 #include <algorithm>
+#include <atomic>
+#include <functional>
 #include <map>
 #include <memory>
 #include <optional>
@@ -31,8 +33,10 @@ struct FakeAnnotations final : AnnotationReader {
 };
 
 struct FakeTypes final : platform::Types {
-    bool conforms(const std::string& type, const std::string& ancestor) override {
-        return type == ancestor || parents.contains({type, ancestor});
+    std::string name(const std::string& type) override { return type; }
+    std::vector<std::string> lineage(const std::string& type) override {
+        if (type == "png") return {"png", "image"};
+        return {type};
     }
     std::set<std::pair<std::string, std::string>> parents{{"png", "image"}};
 };
@@ -91,10 +95,12 @@ struct FakeSandbox final : platform::Sandbox {
     bool isConfined(const platform::AuditToken&) override { return sandboxed; }
     platform::Result<std::string> issueReadExtension(const platform::KnownDirectory& bundle,
                                                      const std::string& resource) override {
+        if (onIssue) onIssue();
         const std::string path = resource == "." ? bundle.path : bundle.path + "/" + resource;
         if (unreadable.contains(path)) return platform::Error::posix(EACCES, path);
         return "token " + std::to_string(++issued) + " " + path;
     }
+    std::function<void()> onIssue;
     std::set<std::string> unreadable;
     int issued = 0;
     bool sandboxed = false;

@@ -135,11 +135,22 @@ TEST_F(TransactionTest, MatchAnswersForms) {
 }
 
 TEST_F(TransactionTest, BadRulesAndForbiddenFlagsAreRefusedBeforeAnyQuery) {
+    const auto refusal4 = error(4, "invalid request format (bad rules dictionary)");
     for (Value rules :
-         {Value(Array{}), Value("text"), Value(Dictionary{{"k", platform::Uuid::random()}})}) {
-        EXPECT_EQ(ask({{"request", "match"}, {"rules", rules}}),
-                  error(4, "invalid request format (bad rules dictionary)"));
-    }
+         {Value(Array{}), Value("text"), Value(Dictionary{{"k", platform::Uuid::random()}})})
+        EXPECT_EQ(ask({{"request", "match"}, {"rules", rules}}), refusal4);
+    // What would cost others too much time: rules, values in them, and bytes.
+    const auto isRefused = [&](std::size_t keys, std::size_t values, std::size_t bytes) {
+        Dictionary rules{{"k", Array(std::vector<Value>(values - 1 - keys, 1))},
+                         {"l", std::string(bytes - 2 - (keys - 2) * 2, 'x')}};
+        for (std::size_t i = 2; i < keys; ++i) rules.set(std::to_string(i + 8), true);
+        return ask({{"request", "match"}, {"rules", rules}}) == refusal4;
+    };
+    EXPECT_FALSE(isRefused(64, 4096, 65536));
+    EXPECT_TRUE(isRefused(65, 4096, 65536));
+    EXPECT_TRUE(isRefused(64, 4097, 65536));
+    EXPECT_TRUE(isRefused(64, 4096, 65537));
+    workspace_->queries = 0;
     const Dictionary all{{"request", "match"}, {"flags", 0x200}};
     const Dictionary refusal = error(11, "unauthorized discovery flag (ZRDiscoverAll)");
     EXPECT_EQ(ask(all), refusal);
