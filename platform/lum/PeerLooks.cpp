@@ -19,6 +19,9 @@ namespace platform {
 
 namespace {
 
+/// A look is looked after so often within its patience.
+constexpr int kPeriods = 4;
+
 struct Job {
     Job(RunLoop& loop, const Origin& from, PeerLooks::Look work, PeerLooks::Outcome then)
         : origin(from), look(std::move(work)), outcome(std::move(then)), timer(loop) {}
@@ -30,6 +33,7 @@ struct Job {
     PeerLooks::Outcome outcome;  // null once it was told
     RunLoop::Timer timer;
     std::size_t stepsSeen = 0;
+    int periodsWithoutStep = 0;
     std::optional<Pool::Share> share;  // of the threads
 };
 using JobRef = std::shared_ptr<Job>;
@@ -129,15 +133,18 @@ void PeerLooks::State::startWaiting() {
 
 /// Gives the look up unless it gets on.
 void PeerLooks::State::watch(const JobRef& job) {
-    job->timer.start(patience, [weakSelf = weak_from_this(), weakJob = std::weak_ptr(job)] {
-        const auto self = weakSelf.lock();
-        const JobRef watched = weakJob.lock();
-        if (!self || !watched) return;
-        const std::size_t steps = watched->pace.steps();
-        if (std::exchange(watched->stepsSeen, steps) != steps) return self->watch(watched);
-        self->tell(watched, false);
-        self->startWaiting();  // drops it from its line
-    });
+    job->timer.start(
+        patience / kPeriods, [weakSelf = weak_from_this(), weakJob = std::weak_ptr(job)] {
+            const auto self = weakSelf.lock();
+            const JobRef watched = weakJob.lock();
+            if (!self || !watched) return;
+            const std::size_t steps = watched->pace.steps();
+            int& periods = watched->periodsWithoutStep;
+            periods = std::exchange(watched->stepsSeen, steps) == steps ? periods + 1 : 0;
+            if (periods < kPeriods) return self->watch(watched);
+            self->tell(watched, false);
+            self->startWaiting();  // drops it from its line
+        });
 }
 
 void PeerLooks::State::tell(const JobRef& job, bool isDone) {
