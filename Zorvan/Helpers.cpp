@@ -58,4 +58,19 @@ int compareVersionString(std::string_view receiver, std::string_view other) {
     return compare(receiver.size(), other.size());
 }
 
+std::optional<std::string> canonicalVersionString(std::string_view text, std::size_t limit) {
+    std::string form;
+    while (!text.empty()) {
+        if (!isDigit(text.front())) {
+            form += text.front();
+            text.remove_prefix(1);
+        } else {
+            const std::string_view number = takeNumber(text);
+            form += number.empty() ? "0" : number;
+        }
+        if (form.size() > limit) return std::nullopt;
+    }
+    return form;
+}
+
 }  // namespace zorvan

@@ -1,6 +1,8 @@
 #pragma once
 
+#include <cstddef>
 #include <optional>
+#include <string>
 #include <string_view>
 #include <utility>
 #include <vector>
@@ -30,5 +32,10 @@ platform::Dictionary dictionaryChanging(const platform::Dictionary& dictionary,
 /// zeros; every other byte compares by value, case-sensitively; the first difference decides, and a
 /// text that ends first comes first.
 int compareVersionString(std::string_view receiver, std::string_view other);
+
+/// The form that all version texts which compare as the same have in common, and no others: without
+/// leading zeros. None when it has more than `limit` bytes.
+std::optional<std::string> canonicalVersionString(std::string_view text,
+                                                  std::size_t limit = std::string::npos);
 
 }  // namespace zorvan

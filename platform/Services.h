@@ -2,6 +2,7 @@
 
 #include <memory>
 
+#include "platform/lum/PeerLooks.h"
 #include "platform/sandbox/Sandbox.h"
 #include "platform/services/Assertions.h"
 #include "platform/services/CodeSigning.h"
@@ -21,6 +22,7 @@ namespace platform {
 struct Services {
     Directories directories;
     std::shared_ptr<RunLoop> mainLoop;
+    std::shared_ptr<PeerLooks> looks;       // on that loop
     std::shared_ptr<SdkDictionaries> sdks;  // used by the registry, so it goes after it
     std::shared_ptr<Workspace> workspace;   // null when the registry could not be opened
     std::shared_ptr<CodeSigning> codeSigning;

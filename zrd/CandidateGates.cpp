@@ -35,13 +35,13 @@ Refusal holds(const ZRDPlugIn& plugIn, const CandidateQuery& query) {
 }
 
 Refusal rules(const ZRDPlugIn& plugIn, const CandidateQuery& query) {
-    if (plugIn.match(query.rules)) return std::nullopt;
+    if (!query.rules || plugIn.match(*query.rules)) return std::nullopt;
     return "a rule does not hold";
 }
 
 Refusal exclusions(const ZRDPlugIn& plugIn, const CandidateQuery& query) {
-    bool excluded = std::ranges::any_of(
-        query.exclusions, [&](const platform::Dictionary& rules) { return plugIn.match(&rules); });
+    bool excluded = std::ranges::any_of(query.exclusions,
+                                        [&](const RuleSet& rules) { return plugIn.match(rules); });
     if (!excluded) return std::nullopt;
     return "globally excluded";
 }
@@ -53,7 +53,8 @@ void reportExclusion(const ZRDPlugIn& plugIn, const CandidateQuery& query,
 }
 
 Refusal admission(const ZRDPlugIn& plugIn, const CandidateQuery& query) {
-    return plugIn.allowForClient(*query.host);
+    if (!query.restriction) query.restriction.emplace(*query.host, query.types);
+    return plugIn.allowForClient(*query.host, *query.restriction);
 }
 
 void reportAdmission(const ZRDPlugIn& plugIn, const CandidateQuery& query,

@@ -2,13 +2,15 @@
 
 #include <cstdint>
 #include <functional>
+#include <memory>
 #include <optional>
 #include <span>
 #include <string>
 #include <string_view>
 #include <vector>
 
-#include "platform/values/Value.h"
+#include "zrd/HostRestriction.h"
+#include "zrd/RuleSet.h"
 
 namespace zorvan {
 
@@ -17,10 +19,12 @@ class ZRDPlugIn;
 
 /// What one discovery request asks of every candidate. Borrows what it points to.
 struct CandidateQuery {
-    const platform::Dictionary* rules = nullptr;  // null: no rules
-    std::uint64_t flags = 0;                      // ZRDiscover… bits
-    std::vector<platform::Dictionary> exclusions;
+    std::optional<RuleSet> rules;
+    std::uint64_t flags = 0;  // ZRDiscover… bits
+    std::vector<RuleSet> exclusions;
     const HostProcess* host = nullptr;
+    mutable std::optional<HostRestriction> restriction;  // of the host, made when it is asked
+    std::shared_ptr<platform::Types> types;
     std::optional<std::string> hostPlugInsPath;  // of the plug-ins inside the host's own bundle
     std::function<bool(const ZRDPlugIn&)> isOnHold;
 };

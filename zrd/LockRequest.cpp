@@ -55,8 +55,9 @@ bool Transaction::collectPlugInsToHold(HoldSubject& subject) {
     const auto add = [&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
         if (known.insert(plugIn).second) subject.plugIns.push_back(plugIn);
     };
-    return marshalPaths([&](const std::string& path, bool resolved) {
-        if (!resolved) {
+    return marshalPaths([&](const NamedPath& named) {
+        const std::string& path = named.path;
+        if (!named.resolved) {
             fail(kZRErrorPath, fmt::format("invalid path: {}", path));
             return Walk::Stop;
         }

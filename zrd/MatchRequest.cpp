@@ -18,20 +18,18 @@ using platform::Value;
 
 namespace {
 
-/// Matching costs candidates times rules, and everybody waits for it.
-constexpr std::size_t kMaxRuleValues = 4096;
-
 bool areRules(const Value& value) {
-    return value.dictionary() && platform::countValues(value, kMaxRuleValues) <= kMaxRuleValues &&
+    return value.dictionary() && RuleSet::isAffordable(*value.dictionary()) &&
            platform::isPropertyList(value);
 }
 
 /// The dictionaries of a stored exclusions value; anything else in it excludes nothing.
-std::vector<Dictionary> exclusionRules(const std::optional<Value>& stored) {
-    std::vector<Dictionary> rules;
+std::vector<RuleSet> exclusionRules(const std::optional<Value>& stored,
+                                    const std::shared_ptr<platform::Types>& types) {
+    std::vector<RuleSet> rules;
     if (!stored || !stored->array()) return rules;
     for (const Value& element : *stored->array()) {
-        if (element.dictionary()) rules.push_back(*element.dictionary());
+        if (element.dictionary()) rules.emplace_back(*element.dictionary(), types);
     }
     return rules;
 }
@@ -43,25 +41,29 @@ void Transaction::matchPlugIns() {
     if (rules && !areRules(*rules)) {
         return fail(kZRErrorInvalidRequest, "invalid request format (bad rules dictionary)");
     }
+    const Dictionary* given = rules ? rules->dictionary() : nullptr;
     CandidateQuery query;
-    query.rules = rules ? rules->dictionary() : nullptr;
+    query.types = server().services().types;
     query.flags = unsignedUnder(message::kFlags);
     if ((query.flags & ZRDiscoverAll) &&
         (!client_->hasEntitlement(entitlement::kManager) || client_->isSandboxed())) {
         return fail(kZRErrorDenied, "unauthorized discovery flag (ZRDiscoverAll)");
     }
-    query.exclusions = exclusionRules(server().userPrefs().exclusions());
+    if (given) query.rules.emplace(*given, query.types);
+    query.exclusions = exclusionRules(server().userPrefs().exclusions(), query.types);
     query.host = client_.get();
     query.isOnHold = [this](const ZRDPlugIn& plugIn) { return server().holdOnPlugIn(plugIn); };
     if (client_->bundle()) query.hostPlugInsPath = client_->bundle()->plugInsPath();
 
     // Before the candidates: it says of their records that they hold still, not of older ones.
     const auto untouched = server().services().workspace->untouchedBundles();
-    auto candidates = server().findPlugIns(query.rules).value_or(ZRDPlugInList());
+    auto candidates = server().findPlugIns(given).value_or(ZRDPlugInList());
     probes::discoverRaw(static_cast<unsigned int>(candidates.size()));
     MatchResult result(query.flags, candidates.size());
     std::size_t leftOut = 0;
     for (const auto& plugIn : candidates) {
+        // Nobody works for a host that is gone.
+        if (!client_->acceptWork()) return;
         if (firstClosedGate(*plugIn, query)) continue;
         std::optional<ZRError> error;
         auto draft = plugIn->draftForm(untouched, error);

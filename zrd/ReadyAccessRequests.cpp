@@ -17,13 +17,18 @@ namespace zorvan {
 
 using platform::Array;
 
+const HostRestriction& Transaction::hostRestriction() {
+    if (!hostRestriction_) hostRestriction_.emplace(*client_, server().services().types);
+    return *hostRestriction_;
+}
+
 bool Transaction::admitToReady(const ZRDPlugIn& plugIn) {
     std::optional<std::string> reason;
     if (server().holdOnPlugIn(plugIn)) {
         EVLOG_DEFAULT(ops(), "denied access to {} for plugin {}({}): the plug-in is on hold",
                       client_->pid(), plugIn.identifier(), pub(plugIn.uuid()));
         reason = "the plug-in is on hold";
-    } else if (!plugIn.isData() && (reason = plugIn.allowForClient(*client_))) {
+    } else if (!plugIn.isData() && (reason = plugIn.allowForClient(*client_, hostRestriction()))) {
         EVLOG_DEFAULT(ops(), "denied access to {} for plugin {}({}): {}", client_->pid(),
                       plugIn.identifier(), pub(plugIn.uuid()), pub(*reason));
     }

@@ -4,10 +4,9 @@
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
-#include "platform/system/Files.h"
-#include "platform/values/Utf8.h"
 #include "platform/values/Value.h"
 #include "zrd/Probes.h"
+#include "zrd/RequestPaths.h"
 #include "zrd/ZRDLumClient.h"
 #include "zrd/ZRDPlugIn.h"
 #include "zrd/ZRDServer.h"
@@ -19,14 +18,24 @@ using platform::Value;
 
 namespace {
 
-/// A resolved path of this many bytes or more counts as not resolved.
-constexpr std::size_t kMaxResolvedPath = 1024;
+std::shared_ptr<RequestPaths> pathsOf(const platform::Message& request) {
+    const Value* type = request.find(message::kRequest);
+    if (!type || !type->string()) return nullptr;
+    const std::string& name = *type->string();
+    const Value* tokens = request.find(message::kUuids);
+    const bool isLock = name == request::kLock && !(tokens && tokens->array());
+    if (name != request::kAdd && name != request::kRemove && !isLock) return nullptr;
+    const Value* paths = request.find(message::kPaths);
+    if (!paths || !paths->array() || paths->array()->empty()) return nullptr;
+    return std::make_shared<RequestPaths>(*paths->array());
+}
 
 }  // namespace
 
 Transaction::Transaction(platform::Message request, std::shared_ptr<ZRDLumClient> client)
     : client_(std::move(client)),
       request_(std::move(request)),
+      paths_(pathsOf(request_)),
       reply_(platform::Message::replyTo(request_)) {}
 
 ZRDServer& Transaction::server() const {
@@ -81,37 +90,37 @@ void Transaction::dispatch() {
     fail(kZRErrorInvalidRequest, "unrecognized request");
 }
 
-bool Transaction::marshalPaths(
-    const std::function<Walk(const std::string& path, bool resolved)>& callback) {
+const platform::Array* Transaction::requestedPaths() {
     const Value* paths = request_.find(message::kPaths);
-    if (!paths || !paths->array()) {
-        fail(kZRErrorInvalidRequest, "invalid request format");
-        return false;
-    }
-    for (const Value& element : *paths->array()) {
-        const std::string* path = element.string();
-        if (!path) {
-            fail(kZRErrorInvalidRequest, "invalid request format");
-            return false;
-        }
-        if (!path->starts_with('/')) {
-            fail(kZRErrorPath, fmt::format("absolute path required: {}", *path));
-            return false;
-        }
-        auto resolved = platform::canonicalPath(*path, kMaxResolvedPath);
-        // A reply could not carry other paths, and the registry has no bundles there.
-        if (resolved && !platform::isValidUtf8(*resolved)) resolved.reset();
-        if (callback(resolved ? *resolved : *path, resolved.has_value()) == Walk::Stop)
-            return false;
-    }
-    return true;
+    if (paths && paths->array()) return paths->array();
+    fail(kZRErrorInvalidRequest, "invalid request format");
+    return nullptr;
 }
 
-bool Transaction::processPaths(
-    const std::function<Walk(const std::string& path, bool resolved)>& callback) {
-    bool completed = marshalPaths(callback);
-    if (completed) done();
-    return completed;
+std::optional<Transaction::NamedPath> Transaction::namedPath(const platform::Array& paths,
+                                                             std::size_t index) {
+    const std::string* path = paths[index].string();
+    if (!path) {
+        fail(kZRErrorInvalidRequest, "invalid request format");
+        return std::nullopt;
+    }
+    if (!path->starts_with('/')) {
+        fail(kZRErrorPath, fmt::format("absolute path required: {}", *path));
+        return std::nullopt;
+    }
+    auto resolved = paths_->resolved(index);
+    if (!resolved) return NamedPath{*path, false};
+    return NamedPath{*std::move(resolved), true};
+}
+
+bool Transaction::marshalPaths(const std::function<Walk(const NamedPath&)>& callback) {
+    const platform::Array* paths = requestedPaths();
+    if (!paths) return false;
+    for (std::size_t i = 0; i < paths->size(); ++i) {
+        const auto path = namedPath(*paths, i);
+        if (!path || callback(*path) == Walk::Stop) return false;
+    }
+    return true;
 }
 
 bool Transaction::processUuidList(

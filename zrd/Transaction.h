@@ -4,27 +4,33 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
 #include "Zorvan/ZRError.h"
 #include "platform/lum/Message.h"
 #include "platform/lum/Origin.h"
+#include "zrd/HostRestriction.h"
 
 namespace zorvan {
 
+class RequestPaths;
 class ZRDLumClient;
 class ZRDPlugIn;
 class ZRDServer;
 struct HoldSubject;
 
 /// One request being served: the message, the reply being built for it, and who sent it. Made when
-/// the message arrives; everything else runs on the service queue, one transaction at a time. Every
-/// request gets exactly one reply: `done`, or one of the two `fail`, directly or through a walker
-/// that failed.
-class Transaction {
+/// the message arrives; everything else runs on the service queue, one transaction at a time (but
+/// others are served while one waits for the registry). Every request gets exactly one reply:
+/// `done`, or one of the two `fail`, directly or through a walker that failed.
+class Transaction : public std::enable_shared_from_this<Transaction> {
   public:
     Transaction(platform::Message request, std::shared_ptr<ZRDLumClient> client);
+
+    /// What has to be resolved before `dispatch`; null when the request reads no paths.
+    const std::shared_ptr<RequestPaths>& paths() const { return paths_; }
 
     /// Serves the request: checks its version and its client, then runs the handler of its type.
     void dispatch();
@@ -48,6 +54,8 @@ class Transaction {
     void bulkAnnotatePlugIns();
     void lockDownPlugIns();
 
+    /// Read when it is first asked for.
+    const HostRestriction& hostRestriction();
     /// Whether the host may have a plug-in made ready; otherwise the failure has been sent.
     bool admitToReady(const ZRDPlugIn& plugIn);
     void releaseHolds(const platform::Array& tokens);
@@ -64,12 +72,33 @@ class Transaction {
     /// Whether this client's origin may store a change, too; otherwise the failure has been sent.
     bool hasShareFor(const platform::Dictionary& change, const ZRDPlugIn& plugIn);
 
-    /// Visits "paths" in order: each element resolved to its canonical path (`resolved`), or as it
-    /// was sent when it cannot be. True when every element was visited and none answered `Stop`;
+    /// An element of "paths": its canonical path, or as it was sent when it cannot be resolved.
+    struct NamedPath {
+        std::string path;
+        bool resolved = false;
+    };
+    /// The request's "paths", and one of its elements; none when the failure has been sent.
+    const platform::Array* requestedPaths();
+    std::optional<NamedPath> namedPath(const platform::Array& paths, std::size_t index);
+    /// Visits "paths" in order. True when every element was visited and none answered `Stop`;
     /// otherwise the failure has been sent.
-    bool marshalPaths(const std::function<Walk(const std::string& path, bool resolved)>& callback);
-    /// The same, and sends the reply when every element was visited.
-    bool processPaths(const std::function<Walk(const std::string& path, bool resolved)>& callback);
+    bool marshalPaths(const std::function<Walk(const NamedPath&)>& callback);
+
+    /// What a request does to the registry at each of its paths.
+    struct RegistryChange {
+        Walk (Transaction::*prepare)(const NamedPath& path);
+        std::optional<ZRError> (Transaction::*make)(const std::string& path);
+        void (Transaction::*refuse)(const std::string& path);  // sends the failure
+    };
+    /// Visits "paths" in order from an element on, and sends the reply after the last one. The
+    /// change itself is waited for beside the service queue, and ends with the sender.
+    void processPaths(const RegistryChange& change, std::size_t from = 0);
+    Walk prepareAdding(const NamedPath& path);
+    std::optional<ZRError> add(const std::string& path);
+    void refuseAdding(const std::string& path);
+    Walk prepareRemoving(const NamedPath& path);
+    std::optional<ZRError> remove(const std::string& path);
+    void refuseRemoving(const std::string& path);
     /// Visits the plug-ins that "uuids" names, in order; answers as `marshalPaths`.
     bool processUuidList(const std::function<Walk(const std::shared_ptr<ZRDPlugIn>&)>& callback);
     /// Stores the plug-in's annotation, or an empty one, under "annotations".
@@ -89,7 +118,9 @@ class Transaction {
 
     const std::shared_ptr<ZRDLumClient> client_;
     const platform::Message request_;
+    const std::shared_ptr<RequestPaths> paths_;
     platform::Message reply_;
+    std::optional<HostRestriction> hostRestriction_;
     std::atomic<std::uint64_t> version_{0};
 };
 

@@ -5,6 +5,7 @@
 #include "Zorvan/LogHandles.h"
 #include "platform/sandbox/Sandbox.h"
 #include "zrd/Probes.h"
+#include "zrd/RequestPaths.h"
 #include "zrd/Transaction.h"
 #include "zrd/ZRDServer.h"
 
@@ -16,28 +17,21 @@ using platform::Value;
 
 namespace {
 
-/// Longer executable paths count as not found.
-constexpr std::size_t kMaxExecutablePath = 2048;
 constexpr std::uint32_t kRequestCountReportInterval = 1000;
 
 }  // namespace
 
 ZRDLumClient::ZRDLumClient(const std::shared_ptr<platform::Connection>& connection,
-                           std::shared_ptr<ZRDServer> server)
-    : connection_(connection), server_(std::move(server)) {}
+                           std::shared_ptr<ZRDServer> server, HostExecutable executable)
+    : connection_(connection), server_(std::move(server)), executable_(std::move(executable)) {}
 
 std::shared_ptr<ZRDLumClient> ZRDLumClient::initWithConnection(
-    const std::shared_ptr<platform::Connection>& connection, std::shared_ptr<ZRDServer> server) {
-    std::shared_ptr<ZRDLumClient> client(new ZRDLumClient(connection, std::move(server)));
-    const platform::AuditToken& token = connection->auditToken();
-    const auto& path = token.executablePath();
-    if (path && path->size() < kMaxExecutablePath) {
-        client->bundle_ = ZRBundle::initWithExecutablePath(*path);
-        client->path_ = *path;
-    }
-    EVLOG_DEBUG(ops(), "new client {} {}", client->pid(), client->path_);
+    const std::shared_ptr<platform::Connection>& connection, std::shared_ptr<ZRDServer> server,
+    HostExecutable executable) {
+    std::shared_ptr<ZRDLumClient> client(
+        new ZRDLumClient(connection, std::move(server), std::move(executable)));
+    EVLOG_DEBUG(ops(), "new client {} {}", client->pid(), client->path());
     probes::clientNew(client->pid());
-    client->task_ = client->server_->services().codeSigning->makeTask(token);
     connection->setContext(client);
     connection->setEventHandler(
         [client](const platform::ConnectionEvent& event) { client->handleEvent(event); });
@@ -78,6 +72,27 @@ void ZRDLumClient::handleEvent(const platform::ConnectionEvent& event) {
 void ZRDLumClient::receive(const Message& message) {
     if (probes::requestInputEnabled()) probes::requestInput(pid(), describe(message).c_str());
     auto transaction = std::make_shared<Transaction>(message, shared_from_this());
+    if (transaction->paths()) return resolvePaths(transaction);
+    submit(std::move(transaction));
+}
+
+/// Its next request comes only after this one, so that it is the only one to wait.
+void ZRDLumClient::resolvePaths(const std::shared_ptr<Transaction>& transaction) {
+    auto client = shared_from_this();
+    const auto token = auditToken();
+    if (!token) return;  // nobody is there to be answered
+    server_->services().looks->look(
+        platform::Origin::of(*token),
+        [client, paths = transaction->paths()](platform::PeerLooks::Pace& pace) {
+            paths->resolve(pace, [&] { return client->acceptWork(); });
+        },
+        [client, transaction](bool, std::size_t resolved) {
+            transaction->paths()->settle(resolved);
+            client->submit(transaction);
+        });
+}
+
+void ZRDLumClient::submit(std::shared_ptr<Transaction> transaction) {
     server_->submitWork([client = shared_from_this(), transaction = std::move(transaction)] {
         client->countRequest();
         transaction->dispatch();
@@ -105,7 +120,7 @@ void ZRDLumClient::dead() {
 }
 
 std::optional<Value> ZRDLumClient::entitlementValueForKey(const std::string& name) const {
-    auto answer = task_->entitlement(name);
+    auto answer = executable_.task->entitlement(name);
     if (answer.error) EVLOG_ERROR(ops(), "error retrieving entitlements for client {}", pid());
     return answer.value;
 }
@@ -130,7 +145,7 @@ std::string ZRDLumClient::description() const {
     auto connection = connection_.lock();
     if (!connection) return fmt::format("<ZRDLumClient {} NO CONNECTION>", address);
     return fmt::format("<ZRDLumClient {} con={} pid={} path={}>", address,
-                       connection->description(), connection->pid(), path_);
+                       connection->description(), connection->pid(), path());
 }
 
 }  // namespace zorvan

@@ -7,11 +7,12 @@
 #include <string>
 
 #include "platform/lum/Connection.h"
-#include "platform/services/CodeSigning.h"
+#include "zrd/HostExecutable.h"
 #include "zrd/HostProcess.h"
 
 namespace zorvan {
 
+class Transaction;
 class ZRDServer;
 
 /// One connected host. Turns each message of its connection into a `Transaction` on the service
@@ -21,14 +22,16 @@ class ZRDServer;
 /// weakly.
 class ZRDLumClient final : public HostProcess, public std::enable_shared_from_this<ZRDLumClient> {
   public:
-    /// Makes the record of an accepted connection and resumes the connection. On the queue "lum".
+    /// Makes the record of an accepted connection, whose peer's executable has been looked at, and
+    /// resumes the connection. On the queue "lum".
     static std::shared_ptr<ZRDLumClient> initWithConnection(
-        const std::shared_ptr<platform::Connection>& connection, std::shared_ptr<ZRDServer> server);
+        const std::shared_ptr<platform::Connection>& connection, std::shared_ptr<ZRDServer> server,
+        HostExecutable executable);
 
     pid_t pid() const override;
     std::optional<platform::AuditToken> auditToken() const override;
-    const std::string& path() const override { return path_; }
-    const std::shared_ptr<ZRBundle>& bundle() const override { return bundle_; }
+    const std::string& path() const override { return executable_.path; }
+    const std::shared_ptr<ZRBundle>& bundle() const override { return executable_.bundle; }
     std::optional<platform::Value> entitlementValueForKey(const std::string& name) const override;
     bool hasEntitlement(const std::string& name) const override;
 
@@ -44,7 +47,7 @@ class ZRDLumClient final : public HostProcess, public std::enable_shared_from_th
     /// Null when the connection is gone.
     std::shared_ptr<platform::Connection> connection() const { return connection_.lock(); }
     const std::shared_ptr<ZRDServer>& server() const { return server_; }
-    platform::CodeSigningTask& task() const { return *task_; }
+    platform::CodeSigningTask& task() const { return *executable_.task; }
     /// Requests received so far. On the service queue only.
     std::uint32_t requestCount() const { return requestCount_; }
     void setRequestCount(std::uint32_t count) { requestCount_ = count; }
@@ -53,11 +56,13 @@ class ZRDLumClient final : public HostProcess, public std::enable_shared_from_th
 
   private:
     ZRDLumClient(const std::shared_ptr<platform::Connection>& connection,
-                 std::shared_ptr<ZRDServer> server);
+                 std::shared_ptr<ZRDServer> server, HostExecutable executable);
 
     // On the connection's event delivery.
     void handleEvent(const platform::ConnectionEvent& event);
     void receive(const platform::Message& message);
+    void resolvePaths(const std::shared_ptr<Transaction>& transaction);
+    void submit(std::shared_ptr<Transaction> transaction);
     void dying();
     void dead();
     // On the service queue.
@@ -66,9 +71,7 @@ class ZRDLumClient final : public HostProcess, public std::enable_shared_from_th
     std::atomic<bool> acceptWork_{true};
     const std::weak_ptr<platform::Connection> connection_;
     const std::shared_ptr<ZRDServer> server_;
-    std::string path_;
-    std::shared_ptr<ZRBundle> bundle_;
-    std::unique_ptr<platform::CodeSigningTask> task_;
+    const HostExecutable executable_;
     std::uint32_t requestCount_ = 0;
 };
 

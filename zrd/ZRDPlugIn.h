@@ -15,7 +15,10 @@
 namespace zorvan {
 
 class HostProcess;
+class HostRestriction;
 struct PlugInContext;
+class RulePattern;
+class RuleSet;
 
 /// The daemon's record of one installed plug-in, tied to the registry's record of it, which answers
 /// the dictionary lookups and the names. Made by the database on its queue, then shared: everything
@@ -80,19 +83,26 @@ class ZRDPlugIn final : public ZRPlugInCore {
     static platform::Dictionary prunedInfoDictionaryFor(const platform::Dictionary& dictionary);
 
     // Matching. Reads annotations: not from inside the database's queue.
-    /// Whether every rule holds; no rules hold always.
+    /// Whether every rule holds.
+    bool match(const RuleSet& rules) const;
+    /// The same for rules that are asked once; no rules hold always.
     bool match(const platform::Dictionary* rules) const;
     /// Whether one rule holds.
+    bool matchKey(const std::string& key, const RulePattern& pattern) const;
     bool matchKey(const std::string& key, const platform::Value& pattern) const;
 
     // Admission.
     /// Why the host may not use this plug-in; none: it may.
     std::optional<std::string> allowForClient(const HostProcess& host) const;
+    /// The same with the host's restriction, for who asks about many plug-ins.
+    std::optional<std::string> allowForClient(const HostProcess& host,
+                                              const HostRestriction& restriction) const;
     // Enabling. On the service queue.
     /// Tells the launcher that the host may start this plug-in, and how. The error says why not.
     std::optional<ZRError> enableForClient(const HostProcess& host) const;
-    /// A token for each named resource of the bundle ("." is the bundle), under its name; those for
-    /// which there is none are left out, with a log line. `resources` is a text or a list.
+    /// A token for each named resource of the bundle ("." is the bundle), under its name, up to 64
+    /// of them; those for which there is none are left out, with a log line. `resources` is a text
+    /// or a list.
     platform::Dictionary issueResourceExtensions(const platform::Value& resources) const;
     /// Adds the tokens for what the plug-in shares with hosts. Whether they are good for as long as
     /// this record, and its bundle in its place.
@@ -117,9 +127,6 @@ class ZRDPlugIn final : public ZRPlugInCore {
     const char* sandboxProfile() const;
     platform::Dictionary containerEnvironment() const;
     platform::Dictionary launchService() const;
-    bool matchValue(const platform::Value& value, const platform::Value& patterns) const;
-    bool matchText(const std::string& value, const std::string& pattern) const;
-    bool matchDictionary(const platform::Value& value, const platform::Dictionary& pattern) const;
 
     std::optional<std::string> cachedName(std::optional<std::string>& cache,
                                           const std::optional<std::string>& registered) const;

@@ -6,6 +6,7 @@
 #include "Zorvan/LogHandles.h"
 #include "platform/services/Consent.h"
 #include "zrd/HostProcess.h"
+#include "zrd/HostRestriction.h"
 #include "zrd/PlugInContext.h"
 #include "zrd/ZRDPlugIn.h"
 
@@ -14,13 +15,13 @@ namespace zorvan {
 using platform::Value;
 
 std::optional<std::string> ZRDPlugIn::allowForClient(const HostProcess& host) const {
+    return allowForClient(host, HostRestriction(host, context_->types));
+}
+
+std::optional<std::string> ZRDPlugIn::allowForClient(const HostProcess& host,
+                                                     const HostRestriction& restriction) const {
     // The host's own restriction is judged before what the plug-in demands of it.
-    if (auto restriction = host.entitlementValueForKey(entitlement::kAllowedPlugIns)) {
-        if (!restriction->dictionary()) return "invalid host restriction entitlement";
-        if (!match(restriction->dictionary())) {
-            return "the host's plug-in entitlement does not allow this plug-in";
-        }
-    }
+    if (auto refusal = restriction.refusal(*this)) return refusal;
     if (!hostEntitlement_) return std::nullopt;
     // A demand that names no entitlement cannot be met by anybody.
     if (!hostEntitlement_->string() || !host.hasEntitlement(*hostEntitlement_->string())) {

@@ -4,6 +4,8 @@
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
+#include <string_view>
+#include <unordered_set>
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
@@ -29,6 +31,9 @@ namespace {
 constexpr std::string_view kKeyboardService = "com.orbel.keyboard-service";
 constexpr std::string_view kFilterDataService = "com.orbel.netvane.filter-data";
 constexpr std::string_view kPreviewService = "com.orbel.glimse.extension.preview";
+
+/// The tokens for what a plug-in shares are issued anew for each answer that it is in.
+constexpr std::size_t kMaxResources = 64;
 
 bool isText(const Value* value, std::string_view text) {
     return value && value->string() && *value->string() == text;
@@ -126,9 +131,10 @@ Dictionary ZRDPlugIn::issueResourceExtensions(const Value& resources) const {
     const Value* end = resources.array() ? resources.array()->end() : &resources + 1;
     const platform::KnownDirectory bundle = bundleDirectory();
     Dictionary extensions;
+    std::unordered_set<std::string_view> known;
     for (const Value* element = begin; element != end; ++element) {
         const std::string* name = element->string();
-        if (!name) continue;
+        if (!name || known.size() == kMaxResources || !known.insert(*name).second) continue;
         auto token = context_->sandbox->issueReadExtension(bundle, *name);
         if (token) {
             extensions.set(*name, *std::move(token));

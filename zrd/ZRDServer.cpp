@@ -4,6 +4,7 @@
 
 #include "Zorvan/LogHandles.h"
 #include "platform/threads/RunLoop.h"
+#include "zrd/HostExecutable.h"
 #include "zrd/ZRDLumClient.h"
 
 namespace zorvan {
@@ -31,7 +32,10 @@ void reportTermination(platform::Launcher::Status status) {
 }  // namespace
 
 ZRDServer::ZRDServer(const platform::Services& services)
-    : ZRDatabase(services), lumQueue_("lum", *services.mainLoop), mainQueue_("service") {}
+    : ZRDatabase(services),
+      lumQueue_("lum", *services.mainLoop),
+      registrations_("registration"),
+      mainQueue_("service") {}
 
 ZRDServer::~ZRDServer() = default;
 
@@ -48,7 +52,7 @@ std::shared_ptr<ZRDServer> ZRDServer::initForService(const std::string& serviceN
     server->setDelegate(server);
     server->service_->setEventHandler(
         [weak = std::weak_ptr(server)](const std::shared_ptr<platform::Connection>& connection) {
-            if (auto self = weak.lock()) ZRDLumClient::initWithConnection(connection, self);
+            if (auto self = weak.lock()) self->admit(connection);
         });
     server->userPrefs_ = std::make_unique<ZRDUserPrefs>(server->services().directories);
     // From here on what the scan announces finds a complete server.
@@ -65,6 +69,16 @@ bool ZRDServer::listen(const std::string& serviceName) {
     }
     service_ = std::move(*listener);
     return true;
+}
+
+/// Nothing is heard of the connection before: it is resumed once its record is there.
+void ZRDServer::admit(const std::shared_ptr<platform::Connection>& connection) {
+    HostExecutable::find(connection->auditToken(), services().codeSigning, *services().looks,
+                         [weak = weak_from_this(), connection](HostExecutable executable) {
+                             if (auto self = weak.lock())
+                                 ZRDLumClient::initWithConnection(connection, self,
+                                                                  std::move(executable));
+                         });
 }
 
 std::shared_ptr<ZRDServer> ZRDServer::server() {

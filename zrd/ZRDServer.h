@@ -20,7 +20,9 @@ namespace zorvan {
 /// on the queue "service", one after another.
 ///
 /// Made on the main thread, whose run loop it uses, and shared with its clients.
-class ZRDServer final : public ZRDatabase, public ZRDatabaseDelegate {
+class ZRDServer final : public ZRDatabase,
+                        public ZRDatabaseDelegate,
+                        public std::enable_shared_from_this<ZRDServer> {
   public:
     /// The server of a service, listening but not yet accepting. `databasePath` is the annotation
     /// file's, or none for the default place. Null when there is no registry or the service's name
@@ -55,6 +57,8 @@ class ZRDServer final : public ZRDatabase, public ZRDatabaseDelegate {
 
     /// Runs `work` on the service queue, after all work submitted before. From any thread.
     void submitWork(std::function<void()> work) { mainQueue_.async(std::move(work)); }
+    /// The same beside the service queue, for work that waits for the registry.
+    void submitRegistration(std::function<void()> work) { registrations_.async(std::move(work)); }
 
     std::uint32_t verbose() const { return verbose_; }
     void setVerbose(std::uint32_t count) { verbose_ = count; }
@@ -73,6 +77,7 @@ class ZRDServer final : public ZRDatabase, public ZRDatabaseDelegate {
 
     explicit ZRDServer(const platform::Services& services);
     bool listen(const std::string& serviceName);
+    void admit(const std::shared_ptr<platform::Connection>& connection);
 
     std::atomic<std::uint32_t> verbose_{0};
     platform::SerialQueue lumQueue_;
@@ -81,7 +86,8 @@ class ZRDServer final : public ZRDatabase, public ZRDatabaseDelegate {
     HoldList holds_;  // guarded by syncQueue_
     std::unique_ptr<platform::Listener> service_;
     std::unique_ptr<ZRDUserPrefs> userPrefs_;
-    // The last member: it goes first, and the work that still waits in it uses the others.
+    // The last members: they go first, and the work that still waits in them uses the others.
+    platform::SerialQueue registrations_;
     platform::SerialQueue mainQueue_;
 };
 

@@ -6,6 +6,7 @@
 #include <optional>
 #include <string>
 #include <unordered_map>
+#include <unordered_set>
 #include <vector>
 
 #include "Zorvan/ZRError.h"
@@ -110,7 +111,7 @@ class ZRDatabase : public AnnotationReader, public platform::WorkspaceObserver {
     void autoElect(const ZRDPlugIn& plugIn);
 
     std::optional<platform::TDPlugInProxyList> candidates(const platform::Dictionary* query);
-    bool electionAdmits(const std::vector<std::string>& patterns,
+    bool electionAdmits(const std::unordered_set<std::string>& patterns,
                         const std::optional<std::string>& identifier,
                         const platform::Dictionary& entitlements);
 

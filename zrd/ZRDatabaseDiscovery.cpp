@@ -73,24 +73,24 @@ std::optional<std::string> electionPattern(const Value& pattern) {
 }
 
 /// The elections that a query admits, or none when it does not narrow by election.
-std::optional<std::vector<std::string>> electionFilter(const Dictionary& query) {
+std::optional<std::unordered_set<std::string>> electionFilter(const Dictionary& query) {
     const Value* election = query.find(rule::kUserElection);
     if (!election) return std::nullopt;
     const platform::Array* several = election->array();
     const Value* begin = several ? several->begin() : election;
     const Value* end = several ? several->end() : election + 1;
-    std::vector<std::string> patterns;
+    std::unordered_set<std::string> patterns;
     for (const Value* pattern = begin; pattern != end; ++pattern) {
         auto usable = electionPattern(*pattern);
         if (!usable) return std::nullopt;
-        patterns.push_back(*std::move(usable));
+        patterns.insert(*std::move(usable));
     }
     return patterns;
 }
 
 }  // namespace
 
-bool ZRDatabase::electionAdmits(const std::vector<std::string>& patterns,
+bool ZRDatabase::electionAdmits(const std::unordered_set<std::string>& patterns,
                                 const std::optional<std::string>& identifier,
                                 const Dictionary& entitlements) {
     const Value* replaced = entitlements.find(entitlement::kReplacePlugIn);
@@ -106,7 +106,7 @@ bool ZRDatabase::electionAdmits(const std::vector<std::string>& patterns,
         stored = autoElect && autoElect->isNumber() && !platform::equalsFalse(*autoElect) ? 1 : 0;
     }
     std::string text = std::to_string(static_cast<std::uint8_t>(*stored));
-    bool kept = std::ranges::find(patterns, text) != patterns.end();
+    bool kept = patterns.contains(text);
     EVLOG_DEBUG(ops(), "td filter {} -> {}", key, kept ? 1 : 0);
     return kept;
 }

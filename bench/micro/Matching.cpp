@@ -6,6 +6,7 @@
 #include "bench/InfoPlist.h"
 #include "platform/plist/PropertyList.h"
 #include "zrd/PlugInContext.h"
+#include "zrd/RuleSet.h"
 #include "zrd/ZRDPlugIn.h"
 
 namespace {
@@ -32,8 +33,9 @@ void matchTwoRules(benchmark::State& state) {
         {"ExampleCategory", platform::Array{"category-0", "category-1"}},
         {"ExampleSupportsPreview", true},
     };
-    if (!candidate->match(&rules)) return state.SkipWithError("no match");
-    for (auto _ : state) benchmark::DoNotOptimize(candidate->match(&rules));
+    const zorvan::RuleSet set(rules, nullptr);
+    if (!candidate->match(set)) return state.SkipWithError("no match");
+    for (auto _ : state) benchmark::DoNotOptimize(candidate->match(set));
 }
 BENCHMARK(matchTwoRules);
 

@@ -13,6 +13,7 @@
 #include <cstdint>
 #include <cstdlib>
 #include <ctime>
+#include <mutex>
 #include <string_view>
 #include <utility>
 
@@ -83,26 +84,38 @@ std::optional<FileId> fileAt(int directory, const char* path) {
     return FileId{status.stx_dev_major, status.stx_dev_minor, status.stx_ino};
 }
 
-std::optional<std::string> readExecutable(int procDirectory) {
+/// What a process runs, as the kernel has it: nothing is looked up on the way to that.
+struct Executable {
+    FileId file;
+    std::string path;
+};
+
+std::optional<Executable> readExecutable(int procDirectory) {
     char path[PATH_MAX];
     const auto running = fileAt(procDirectory, "exe");
     if (!running) return std::nullopt;
     const ssize_t length = readlinkat(procDirectory, "exe", path, sizeof path);
     if (length <= 0 || length == sizeof path || path[0] != '/') return std::nullopt;
-    std::string result(path, static_cast<std::size_t>(length));
-    // Also no match: the path of another mount namespace, and "/x (deleted)".
-    if (fileAt(AT_FDCWD, result.c_str()) != running) return std::nullopt;
-    return result;
+    return Executable{*running, std::string(path, static_cast<std::size_t>(length))};
 }
 
 }  // namespace
 
 struct AuditToken::State {
-    pid_t pid;
-    uid_t uid;
-    UniqueFd pidFd;
-    UniqueFd proc;
-    std::optional<std::string> executable;
+    State(pid_t number, uid_t user, UniqueFd pidDescriptor, UniqueFd directory)
+        : pid(number),
+          uid(user),
+          pidFd(std::move(pidDescriptor)),
+          proc(std::move(directory)),
+          running(readExecutable(proc.get())) {}
+
+    const pid_t pid;
+    const uid_t uid;
+    const UniqueFd pidFd;
+    const UniqueFd proc;
+    const std::optional<Executable> running;
+    mutable std::once_flag looked;  // what follows does not change any more afterwards
+    mutable std::optional<std::string> executable;
 };
 
 std::optional<AuditToken> AuditToken::ofPeer(int socket) {
@@ -129,18 +142,16 @@ std::optional<AuditToken> AuditToken::ofPeer(int socket) {
         if (!started || *started > accepted) return std::nullopt;
     }
 
-    auto executable = readExecutable(proc.get());
-    return AuditToken(std::make_shared<const State>(
-        State{peer.pid, peer.uid, std::move(pidFd), std::move(proc), std::move(executable)}));
+    return AuditToken(
+        std::make_shared<const State>(peer.pid, peer.uid, std::move(pidFd), std::move(proc)));
 }
 
 std::optional<AuditToken> AuditToken::ofSelf() {
     UniqueFd pidFd = openPidFd(getpid());
     UniqueFd proc = openProc(getpid());
     if (!pidFd || !proc) return std::nullopt;
-    auto executable = readExecutable(proc.get());
-    return AuditToken(std::make_shared<const State>(
-        State{getpid(), geteuid(), std::move(pidFd), std::move(proc), std::move(executable)}));
+    return AuditToken(
+        std::make_shared<const State>(getpid(), geteuid(), std::move(pidFd), std::move(proc)));
 }
 
 pid_t AuditToken::pid() const {
@@ -156,7 +167,13 @@ int AuditToken::procDirectory() const {
     return state_->proc.get();
 }
 const std::optional<std::string>& AuditToken::executablePath() const {
-    return state_->executable;
+    const State& state = *state_;
+    std::call_once(state.looked, [&state] {
+        // Also no match: the path of another mount namespace, and "/x (deleted)".
+        if (state.running && fileAt(AT_FDCWD, state.running->path.c_str()) == state.running->file)
+            state.executable = state.running->path;
+    });
+    return state.executable;
 }
 
 }  // namespace platform

@@ -14,7 +14,7 @@ class AuditToken {
   public:
     /// The process that connected the other end of `socket` (borrowed, AF_UNIX). Reads, in the
     /// order that pins them to one process: its credentials, a pidfd, its /proc directory, and
-    /// through that its executable. None when the process is gone already or cannot be told for
+    /// through that which file it runs. None when the process is gone already or cannot be told for
     /// sure (on kernels without SO_PEERPIDFD: when it has not started before the connection was
     /// accepted).
     static std::optional<AuditToken> ofPeer(int socket);
@@ -29,8 +29,8 @@ class AuditToken {
     int procDirectory() const;
 
     /// Where the executable lies, when the path that the process runs from names, here, the very
-    /// file (device and inode) that it runs; otherwise, or when it cannot be read, none. Read when
-    /// the token was made.
+    /// file (device and inode) that it ran when the token was made; otherwise, or when that could
+    /// not be read, none. Looked at by the first call, which may hang with the file system.
     const std::optional<std::string>& executablePath() const;
 
   private:

@@ -1,6 +1,6 @@
+#include <algorithm>
+#include <bit>
 #include <cstdint>
-#include <optional>
-#include <vector>
 
 #include "platform/services/Types.h"
 
@@ -8,75 +8,65 @@ namespace platform {
 
 namespace {
 
-// Nobody means a rule or an offer beyond these. Each type of the offer is compared with each one of
-// the rule at most once, so that an evaluation costs at most their product in questions.
+// Nobody means a rule or an offer beyond these.
 constexpr std::size_t kMaxTypesOfRule = 256;
 constexpr std::size_t kMaxItems = 4096;
 constexpr std::size_t kMaxTypesOfItem = 256;
 constexpr std::size_t kMaxTypesOfOffer = 16384;
-
-struct Limit {
-    const std::string& type;
-    std::int64_t most;
-    std::int64_t items = 0;
-};
-
-/// None when the rule has another shape, or lists too many types.
-std::optional<std::vector<Limit>> limitsOf(const Dictionary& rule) {
-    if (rule.size() > kMaxTypesOfRule) return std::nullopt;
-    std::vector<Limit> limits;
-    limits.reserve(rule.size());
-    for (const auto& [type, most] : rule) {
-        const std::optional<std::int64_t> count = most.numberAsInteger();
-        if (!count || *count < 0) return std::nullopt;
-        limits.push_back({type, *count});
-    }
-    return limits;
-}
-
-/// The types of an offered item; null when it has another shape, or too many of them.
-const Array* typesOf(const Value& item) {
-    const Dictionary* dictionary = item.dictionary();
-    const Value* value = dictionary ? dictionary->find("types") : nullptr;
-    const Array* types = value ? value->array() : nullptr;
-    if (!types || types->size() > kMaxTypesOfItem) return nullptr;
-    for (const Value& type : *types)
-        if (!type.string()) return nullptr;
-    return types;
-}
-
-/// Counts an item for every limit that one of its types falls under. False when there is none, or
-/// when a limit is exceeded.
-bool countItem(const Array& itemTypes, std::vector<Limit>& limits, Types& types) {
-    bool counted = false;
-    for (Limit& limit : limits) {
-        for (const Value& type : itemTypes) {
-            if (!types.conforms(*type.string(), limit.type)) continue;
-            if (++limit.items > limit.most) return false;
-            counted = true;
-            break;
-        }
-    }
-    return counted;
-}
+constexpr std::size_t kBits = 64;
 
 }  // namespace
 
-bool evaluateActivationRule(const Value& rule, const Dictionary& offer, Types& types) {
-    if (equalsTrue(rule)) return true;
-    const Dictionary* dictionary = rule.dictionary();
-    if (!dictionary) return false;
-    std::optional<std::vector<Limit>> limits = limitsOf(*dictionary);
+ActivationOffer::ActivationOffer(const Dictionary& offer, Types& types) : types_(types) {
     const Value* list = offer.find("items");
     const Array* items = list ? list->array() : nullptr;
-    if (!limits || !items || items->empty() || items->size() > kMaxItems) return false;
-    std::size_t offered = 0;
-    for (const Value& item : *items) {
-        const Array* itemTypes = typesOf(item);
-        if (!itemTypes || (offered += itemTypes->size()) > kMaxTypesOfOffer) return false;
-        if (!countItem(*itemTypes, *limits, types)) return false;
+    if (!items || items->size() > kMaxItems) return;
+    std::size_t typesLeft = kMaxTypesOfOffer;
+    count_ = items->size();
+    for (std::size_t i = 0; i < items->size(); ++i) {
+        if (addItem((*items)[i], i, typesLeft)) continue;
+        count_ = 0;
+        return;
+    }
+}
+
+/// False for an item of another shape, or with too many types.
+bool ActivationOffer::addItem(const Value& item, std::size_t number, std::size_t& typesLeft) {
+    const Dictionary* dictionary = item.dictionary();
+    const Value* value = dictionary ? dictionary->find("types") : nullptr;
+    const Array* types = value ? value->array() : nullptr;
+    if (!types || types->size() > std::min(kMaxTypesOfItem, typesLeft)) return false;
+    typesLeft -= types->size();
+    for (const Value& type : *types) {
+        if (!type.string()) return false;
+        for (std::string& name : types_.lineage(*type.string())) {
+            Items& items = conforming_[std::move(name)];
+            items.resize((count_ + kBits - 1) / kBits);
+            items[number / kBits] |= std::uint64_t{1} << number % kBits;
+        }
     }
     return true;
+}
+
+bool ActivationOffer::isAcceptedBy(const Value& rule) const {
+    if (equalsTrue(rule)) return true;
+    const Dictionary* limits = rule.dictionary();
+    if (!limits || limits->size() > kMaxTypesOfRule || count_ == 0) return false;
+    const auto countOf = [](const Items& items) {
+        std::int64_t count = 0;
+        for (std::uint64_t bits : items) count += std::popcount(bits);
+        return count;
+    };
+    Items listed((count_ + kBits - 1) / kBits);
+    for (const auto& [type, value] : *limits) {
+        const std::optional<std::int64_t> most = value.numberAsInteger();
+        if (!most || *most < 0) return false;
+        const auto found = conforming_.find(types_.name(type));
+        if (found == conforming_.end()) continue;
+        if (countOf(found->second) > *most) return false;
+        for (std::size_t i = 0; i < listed.size(); ++i) listed[i] |= found->second[i];
+    }
+    return countOf(listed) == static_cast<std::int64_t>(count_);
 }
 
 }  // namespace platform

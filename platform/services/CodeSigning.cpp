@@ -6,8 +6,8 @@
 #include <fcntl.h>
 #include <atomic>
 #include <cerrno>
-#include <mutex>
 #include <string_view>
+#include <utility>
 
 #include "platform/log/OpsLog.h"
 #include "platform/plist/PropertyList.h"
@@ -68,10 +68,10 @@ Result<Entitlements> readEntitlements(const std::string& executable) {
 
 class FileTask : public CodeSigningTask {
   public:
-    explicit FileTask(const AuditToken& token) : token_(token) {}
+    explicit FileTask(const AuditToken& token) { read(token); }
+    explicit FileTask(Error error) : error_(std::move(error)) {}
 
     Answer entitlement(const std::string& name) override {
-        std::call_once(read_, [this] { read(); });
         if (error_) {
             // Every candidate of every discovery asks: the failure is told once.
             auto error = isTold_.exchange(true) ? std::nullopt : error_;
@@ -83,24 +83,24 @@ class FileTask : public CodeSigningTask {
     }
 
   private:
-    void read() {
-        const std::optional<std::string>& executable = token_.executablePath();
+    void read(const AuditToken& token) {
+        const std::optional<std::string>& executable = token.executablePath();
         if (!executable) return;
         Result<Entitlements> entitlements = readEntitlements(*executable);
         if (!entitlements) {
             error_ = entitlements.error();
-            EVLOG_ERROR(ops(), "cannot read entitlements of process {}: {}", token_.pid(),
+            EVLOG_ERROR(ops(), "cannot read entitlements of process {}: {}", token.pid(),
                         pub(*error_));
             return;
         }
         values_ = std::move(entitlements->values);
         if (values_.empty()) return;
-        const bool sandboxed = isSandboxed(token_);
+        const bool sandboxed = isSandboxed(token);
         trusted_ = entitlements->trust >= (sandboxed ? FileTrust::Root : FileTrust::User);
         if (!trusted_)
             EVLOG_INFO(ops(), "entitlements of process {} do not count: others may write {}",
-                       token_.pid(), pub(entitlements->weakest));
-        mayHoldPrivate_ = !isConfined(token_);
+                       token.pid(), pub(entitlements->weakest));
+        mayHoldPrivate_ = !isConfined(token);
     }
 
     bool holds(std::string_view name) const {
@@ -108,9 +108,8 @@ class FileTask : public CodeSigningTask {
         return trusted_ && (mayHoldPrivate_ || !name.starts_with(kPrivatePrefix));
     }
 
-    const AuditToken token_;
     std::atomic<bool> isTold_ = false;
-    std::once_flag read_;  // what follows does not change any more afterwards
+    // What follows does not change any more once it is made.
     std::optional<Error> error_;
     Dictionary values_;
     bool trusted_ = false;
@@ -128,6 +127,10 @@ class FileCodeSigning : public CodeSigning {
 
 std::unique_ptr<CodeSigning> makeFileCodeSigning() {
     return std::make_unique<FileCodeSigning>();
+}
+
+std::unique_ptr<CodeSigningTask> makeUnreadableTask() {
+    return std::make_unique<FileTask>(Error::posix(ETIMEDOUT, "entitlements"));
 }
 
 }  // namespace platform

@@ -26,12 +26,13 @@ class CodeSigningTask {
 class CodeSigning {
   public:
     virtual ~CodeSigning() = default;
+    /// Reads what is asked for later: may hang with the file system of the process's executable.
     virtual std::unique_ptr<CodeSigningTask> makeTask(const AuditToken& token) = 0;
 };
 
 /// Entitlements from files. A process's are those of `Entitlements.plist` of the bundle around its
 /// executable, or of `<executable>.entitlements` beside an executable that lies in no bundle; read
-/// once, at the task's first query.
+/// when the task is made.
 ///
 /// The file is trusted when it and every directory above it are owned by root or by this user and
 /// writable by nobody else (a sticky directory passes); for a sandboxed process, only when all are
@@ -44,5 +45,9 @@ class CodeSigning {
 /// file may have meant to set, then has a value that is no restriction, so that everything is
 /// denied.
 std::unique_ptr<CodeSigning> makeFileCodeSigning();
+
+/// The task of a process whose entitlements could not be read in time: as of one with a file that
+/// cannot be read.
+std::unique_ptr<CodeSigningTask> makeUnreadableTask();
 
 }  // namespace platform

@@ -63,23 +63,21 @@ struct Hierarchy {
         return alias != aliases.end() ? alias->second : type;
     }
 
-    /// Whether a walk from `start` towards the ancestors meets `goal`. Files may hold cycles, so
-    /// each type is walked once.
-    bool descends(const std::string& start, const std::string& goal) const {
-        std::unordered_set<std::string_view> seen{start};
-        std::vector<std::string_view> open{start};
-        while (!open.empty()) {
-            const std::string type(open.back());
-            open.pop_back();
-            if (type == goal || (goal == kAnyText && type.starts_with("text/"))) return true;
-            const auto found = parents.find(type);
+    /// A type and what a walk from it towards the ancestors meets. Files may hold cycles, so each
+    /// type is walked once.
+    std::vector<std::string> ancestry(const std::string& start) const {
+        std::vector<std::string> met{start};
+        std::unordered_set<std::string> seen{start};
+        const auto meet = [&](const std::string& type) {
+            if (seen.insert(type).second) met.push_back(type);
+        };
+        for (std::size_t i = 0; i < met.size(); ++i) {
+            if (met[i].starts_with("text/")) meet(kAnyText);
+            const auto found = parents.find(met[i]);
             if (found == parents.end()) continue;
-            for (const std::string& parent : found->second) {
-                const std::string_view next = canonical(parent);
-                if (seen.insert(next).second) open.push_back(next);
-            }
+            for (const std::string& parent : found->second) meet(canonical(parent));
         }
-        return false;
+        return met;
     }
 };
 
@@ -90,13 +88,18 @@ class MimeTypes : public Types {
         for (const std::string& folder : directories.dataDirs) folders_.push_back(folder + "/mime");
     }
 
-    bool conforms(const std::string& type, const std::string& ancestor) override {
+    std::string name(const std::string& type) override {
+        return hierarchy()->canonical(lowerCase(type));
+    }
+
+    std::vector<std::string> lineage(const std::string& type) override {
         const std::shared_ptr<const Hierarchy> known = hierarchy();
         const std::string start = known->canonical(lowerCase(type));
-        const std::string goal = known->canonical(lowerCase(ancestor));
-        if (start == goal) return true;
-        if (goal == kAnyContent) return !start.starts_with("inode/");
-        return known->descends(start, goal);
+        std::vector<std::string> names = known->ancestry(start);
+        if (start == kAnyContent) return names;
+        std::erase(names, kAnyContent);
+        if (!start.starts_with("inode/")) names.emplace_back(kAnyContent);
+        return names;
     }
 
   private:
@@ -138,6 +141,11 @@ class MimeTypes : public Types {
 };
 
 }  // namespace
+
+bool Types::conforms(const std::string& type, const std::string& ancestor) {
+    const auto names = lineage(type);
+    return std::ranges::find(names, name(ancestor)) != names.end();
+}
 
 std::unique_ptr<Types> makeMimeTypes(const Directories& directories) {
     return std::make_unique<MimeTypes>(directories);

@@ -19,12 +19,14 @@ TEST(CompareVersionString, OrdersDigitRunsByValueAndTheRestByByte) {
              {"2.0", "2.0.1", -1},
              {"1.0a", "1.0A", 1},
              {"01.002", "1.2", 0},
+             {"000", "0", 0},
              {"1.x", "1.10", 1},
              {"18446744073709551616", "18446744073709551615", 1},
              {"a", "\xC3\xA4", -1},
          }) {
         EXPECT_EQ(compareVersionString(receiver, other), order) << receiver << " / " << other;
         EXPECT_EQ(compareVersionString(other, receiver), -order) << other << " / " << receiver;
+        EXPECT_EQ(canonicalVersionString(receiver) == canonicalVersionString(other), order == 0);
     }
 }
 

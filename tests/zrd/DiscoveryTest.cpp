@@ -20,7 +20,7 @@ using testing::IsEmpty;
 class GatesTest : public testing::Test {
   protected:
     std::string closed(const platform::TDPlugInProxyRef& proxy) {
-        query_.rules = &rules_;
+        query_.rules.emplace(rules_, nullptr);
         query_.host = &host_;
         query_.isOnHold = [this](const ZRDPlugIn&) { return isOnHold_; };
         const CandidateGate* gate = firstClosedGate(*world_.record(proxy), query_);
@@ -38,7 +38,8 @@ TEST_F(GatesTest, ACandidateMeetsThemInOrderUnlessAllAreAskedFor) {
     // Fails at every gate; what is mended below opens one after another.
     auto proxy = makeProxy("com.a", {}, {{"Dedicated", true}, {"VXExtensionHostEntitlement", "e"}});
     rules_ = {{"VXExtensionIdentifier", "com.b"}};
-    query_.exclusions = {Dictionary{{"Top", "other"}}, Dictionary{{"Top", "top"}}};
+    for (const char* top : {"other", "top"})
+        query_.exclusions.emplace_back(Dictionary{{"Top", top}}, nullptr);
     query_.hostPlugInsPath = "/Apps/Other.app/PlugIns";
     query_.flags = ZRDiscoverSystemOnly;
     auto data = makeProxy("com.a", {}, {{"Dedicated", true}});

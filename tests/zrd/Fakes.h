@@ -1,6 +1,8 @@
 #pragma once
 
 #include <algorithm>
+#include <atomic>
+#include <functional>
 #include <map>
 #include <memory>
 #include <optional>
@@ -31,10 +33,11 @@ struct FakeAnnotations final : AnnotationReader {
 };
 
 struct FakeTypes final : platform::Types {
-    bool conforms(const std::string& type, const std::string& ancestor) override {
-        return type == ancestor || parents.contains({type, ancestor});
+    std::string name(const std::string& type) override { return type; }
+    std::vector<std::string> lineage(const std::string& type) override {
+        if (type == "png") return {"png", "image"};
+        return {type};
     }
-    std::set<std::pair<std::string, std::string>> parents{{"png", "image"}};
 };
 
 struct FakeConsent final : platform::Consent {
@@ -92,10 +95,12 @@ struct FakeSandbox final : platform::Sandbox {
     platform::Result<std::string> issueReadExtension(const platform::KnownDirectory& bundle,
                                                      const std::string& resource) override {
         const std::string path = resource == "." ? bundle.path : bundle.path + "/" + resource;
+        if (onIssue) onIssue();
         if (unreadable.contains(path)) return platform::Error::posix(EACCES, path);
         return "token " + std::to_string(++issued) + " " + path;
     }
     std::set<std::string> unreadable;
+    std::function<void()> onIssue;
     int issued = 0;
     bool sandboxed = false;
 };
@@ -209,6 +214,7 @@ struct FakeWorkspace final : platform::Workspace {
     List installed;
     std::set<std::string> refused;
     std::vector<std::string> changes;
+    std::function<void()> onChange;
     platform::WorkspaceObserver* observer = nullptr;
     bool active = false, queryFails = false, lostContainers = false;
     std::vector<std::string> restored;
@@ -223,6 +229,7 @@ struct FakeWorkspace final : platform::Workspace {
     std::optional<platform::Error> change(const char* verb, const std::string& path,
                                           platform::Requester requester) {
         changes.push_back(verb + path);
+        if (onChange) onChange();
         if (requester == platform::Requester::Confined || refused.contains(path))
             return platform::Error{"test", 1, "refused"};
         return std::nullopt;
@@ -281,7 +288,10 @@ struct FakeConnection final : platform::Connection {
     void setContext(std::shared_ptr<void> value) override { context = std::move(value); }
     void setEventHandler(EventHandler value) override { handler = std::move(value); }
     void resume() override { resumed = true; }
-    void send(const platform::Message& reply) override { sent.push_back(reply); }
+    void send(const platform::Message& reply) override {
+        sent.push_back(reply);
+        isAnswered = true;
+    }
     std::string description() const override { return "fake"; }
 
     void deliver(const platform::ConnectionEvent& event) {
@@ -296,6 +306,7 @@ struct FakeConnection final : platform::Connection {
     EventHandler handler;
     bool resumed = false;
     std::vector<platform::Message> sent;
+    std::atomic<bool> isAnswered = false;
 };
 
 }  // namespace zorvan

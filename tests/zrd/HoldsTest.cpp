@@ -159,10 +159,10 @@ TEST_F(HoldsTest, ADyingClientGivesItsHoldsBack) {
     release(std::move(unknown));
     EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(1));
     auto other = std::make_shared<FakeConnection>();
-    ZRDLumClient::initWithConnection(other, server_);
+    connect(other);
     other->deliver(platform::Message(
         {{"request", "lock"}, {"version", 3}, {"flags", ZRHoldPlugIns}, {"paths", Array{b_}}}));
-    drain();
+    answer(*other);
     posts();
     LogLines log;
     auto survivor = client().shared_from_this();

@@ -161,7 +161,8 @@ TEST(Enabling, TheProfileFollowsTheExtensionPointAndTheUsersConsent) {
 TEST(Enabling, OnlyWhatHasATokenIsShared) {
     FakeWorld world;
     auto proxy = makeProxy(
-        "com.a", {}, {{"Shared", Array{"in", 7, "../out", "none"}}, {"VXExtensionProtocol", "P"}});
+        "com.a", {},
+        {{"Shared", Array{"in", 7, "../out", "none", "in"}}, {"VXExtensionProtocol", "P"}});
     proxy->bundlePath = "/Apps/Host.app/PlugIns/a.plugin";
     const std::string path = *proxy->bundlePath;
     world.sandbox->unreadable = {path + "/none", path + "/../out"};
@@ -171,6 +172,10 @@ TEST(Enabling, OnlyWhatHasATokenIsShared) {
     const Dictionary& extensions = *form.find("extensions")->dictionary();
     EXPECT_EQ(extensions.size(), 1u);
     EXPECT_TRUE(extensions.contains("in"));
+    EXPECT_EQ(world.sandbox->issued, 1) << "a name counts once";
+    Array names;
+    for (int i = 0; i < 100; ++i) names.append(std::to_string(i));
+    EXPECT_EQ(world.record(proxy)->issueResourceExtensions(names).size(), 64u);
     EXPECT_THAT(log.take(), Contains("ops I: failed to make extension for " + path +
                                      "/../out in plug-in at " + path + ": Permission denied"));
     auto single = makeProxy("com.a", {}, {{"Shared", "in"}, {"VXExtensionProtocol", "P"}});

@@ -11,6 +11,7 @@ namespace {
 using platform::ConnectionError;
 using platform::Message;
 using testing::Contains;
+using namespace std::chrono_literals;
 using testing::ElementsAre;
 using testing::HasSubstr;
 using testing::IsEmpty;
@@ -137,11 +138,22 @@ TEST_F(TransactionTest, MatchAnswersForms) {
 }
 
 TEST_F(TransactionTest, BadRulesAndForbiddenFlagsAreRefusedBeforeAnyQuery) {
+    const auto refusal4 = error(4, "invalid request format (bad rules dictionary)");
     for (Value rules :
-         {Value(Array{}), Value("text"), Value(Dictionary{{"k", platform::Uuid::random()}})}) {
-        EXPECT_EQ(ask({{"request", "match"}, {"rules", rules}}),
-                  error(4, "invalid request format (bad rules dictionary)"));
-    }
+         {Value(Array{}), Value("text"), Value(Dictionary{{"k", platform::Uuid::random()}})})
+        EXPECT_EQ(ask({{"request", "match"}, {"rules", rules}}), refusal4);
+    // What would cost others too much time: rules, values in them, and bytes.
+    const auto isRefused = [&](std::size_t keys, std::size_t values, std::size_t bytes) {
+        Dictionary rules{{"k", Array(std::vector<Value>(values - 1 - keys, 1))},
+                         {"l", std::string(bytes - 2 - (keys - 2) * 2, 'x')}};
+        for (std::size_t i = 2; i < keys; ++i) rules.set(std::to_string(i + 8), true);
+        return ask({{"request", "match"}, {"rules", rules}}) == refusal4;
+    };
+    EXPECT_FALSE(isRefused(64, 4096, 65536));
+    EXPECT_TRUE(isRefused(65, 4096, 65536));
+    EXPECT_TRUE(isRefused(64, 4097, 65536));
+    EXPECT_TRUE(isRefused(64, 4096, 65537));
+    workspace_->queries = 0;
     const Dictionary all{{"request", "match"}, {"flags", 0x200}};
     const Dictionary refusal = error(11, "unauthorized discovery flag (ZRDiscoverAll)");
     EXPECT_EQ(ask(all), refusal);
@@ -150,6 +162,46 @@ TEST_F(TransactionTest, BadRulesAndForbiddenFlagsAreRefusedBeforeAnyQuery) {
     sandbox_->sandboxed = true;
     EXPECT_EQ(ask(all), refusal);
     EXPECT_EQ(workspace_->queries, 0);
+}
+
+TEST_F(TransactionTest, WhatWaitsForTheRegistryHoldsUpItsSenderAlone) {
+    const std::string path = directory_.makeDirectory("plug-in");
+    std::promise<void> go;
+    workspace_->onChange = [blocked = go.get_future().share()] { blocked.wait(); };
+    deliver(Message({{"request", "add"}, {"version", 3}, {"paths", Array{path, path}}}));
+    auto other = std::make_shared<FakeConnection>();
+    connect(other);
+    for (const Value& paths : {Value(Array{}), Value(Array{"/none"})}) {
+        other->deliver(Message({{"request", "lock"}, {"version", 3}, {"paths", paths}}));
+        EXPECT_EQ(answer(*other).contains("errorcode"), !paths.array()->empty());
+    }
+    EXPECT_FALSE(connection_->isAnswered);
+    go.set_value();
+    EXPECT_EQ(answer(*connection_), Dictionary());
+    EXPECT_EQ(workspace_->changes.size(), 2u);
+    // Nobody adds what is left for a sender that is gone.
+    std::promise<void> changed, idle;
+    workspace_->onChange = [&] {
+        client().setAcceptWork(false);
+        changed.set_value();
+    };
+    deliver(Message({{"request", "add"}, {"version", 3}, {"paths", Array{path, path}}}));
+    for (auto first = changed.get_future(); first.wait_for(0s) != std::future_status::ready;)
+        services_.mainLoop->runOnce(1ms);
+    server_->submitRegistration([&] { idle.set_value(); });
+    idle.get_future().wait();
+    drain();
+    other->deliver(ConnectionError{ConnectionError::Kind::Invalid, ""});
+    EXPECT_EQ(workspace_->changes.size(), 3u);
+}
+
+TEST_F(TransactionTest, NobodyMatchesForASenderThatIsGone) {
+    workspace_->installed = {makeProxy("com.a"), makeProxy("com.b"), makeProxy("com.c")};
+    sandbox_->onIssue = [this] { client().setAcceptWork(false); };
+    deliver(Message({{"request", "match"}, {"version", 3}}));
+    drain();
+    EXPECT_EQ(sandbox_->issued, 1);
+    EXPECT_THAT(connection_->sent, IsEmpty());
 }
 
 TEST_F(TransactionTest, QueuedRequestsOfADeadClientAreDropped) {

@@ -24,6 +24,7 @@ class TransactionTest : public testing::Test {
         services_.directories.stateHome = directory_.path("state");
         services_.directories.configHome = directory_.path("config");
         services_.mainLoop = std::make_shared<platform::RunLoop>();
+        services_.looks = std::make_shared<platform::PeerLooks>(*services_.mainLoop);
         services_.workspace = workspace_;
         services_.codeSigning = codeSigning_;
         services_.sandbox = sandbox_;
@@ -33,7 +34,7 @@ class TransactionTest : public testing::Test {
         server_ = ZRDServer::initForService("zrd", std::nullopt, services_);
         ASSERT_TRUE(server_);
         server_->setCacheLimit(100);
-        ZRDLumClient::initWithConnection(connection_, server_);
+        connect(connection_);
         ASSERT_TRUE(connection_->resumed && workspace_->active);
     }
     void TearDown() override {
@@ -41,6 +42,10 @@ class TransactionTest : public testing::Test {
         drain();
     }
 
+    std::shared_ptr<ZRDLumClient> connect(const std::shared_ptr<FakeConnection>& connection) {
+        return ZRDLumClient::initWithConnection(
+            connection, server_, HostExecutable::of(connection->token, *codeSigning_));
+    }
     void deliver(const platform::ConnectionEvent& event) { connection_->deliver(event); }
     /// Waits for everything that has been submitted.
     void drain() {
@@ -51,11 +56,16 @@ class TransactionTest : public testing::Test {
     Dictionary ask(Dictionary contents) {
         if (!contents.contains("version")) contents.set("version", 3);
         deliver(platform::Message(std::move(contents)));
-        drain();
-        EXPECT_EQ(connection_->sent.size(), 1u);
-        Dictionary reply = connection_->sent.back().contents();
-        connection_->sent.clear();
-        return reply;
+        return answer(*connection_);
+    }
+    /// The one reply to what was delivered.
+    Dictionary answer(FakeConnection& connection) {
+        for (drain(); !connection.isAnswered; drain())
+            services_.mainLoop->runOnce(std::chrono::milliseconds(1));
+        connection.isAnswered = false;
+        const auto sent = std::exchange(connection.sent, {});
+        EXPECT_EQ(sent.size(), 1u);
+        return sent.back().contents();
     }
     static Dictionary error(int code, const std::string& text) {
         return {{"errorcode", code}, {"error", text}};

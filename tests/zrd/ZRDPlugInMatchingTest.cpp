@@ -1,8 +1,11 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <chrono>
+
 #include "tests/Zorvan/LogLines.h"
 #include "tests/zrd/Fakes.h"
+#include "zrd/RuleSet.h"
 
 namespace zorvan {
 
@@ -68,6 +71,13 @@ TEST_F(MatchingTest, EveryOperatorKeyFormAndPatternShape) {
         {"Name", Array{"x", "abc"}, true}, {"Name", Array{}, false}, {"Name", Array{true}, false},
         {"List", Array{"x", "a"}, true}, {"List", Array{"x", 7}, false}, {"Name", 2, false},
         {"Two", "2", false}, {"Two", 2, false}, {"Rule", "image", false}, {"Two", Array{2}, false},
+        // Many alternatives, which are looked up, and bounds, of which the widest counts.
+        {"V", Array{"a", "b", "c", "d", "=01.010"}, true}, {"V", Array{"a", "b", "c", "d", "1.1"}, false},
+        {"List", Array{"x", "y", "z", "0", "=b"}, true}, {"Blank", Array{"a", "b", "c", "d", "="}, true},
+        {"V", Array{"<1.2", "<=1.10", "<1"}, true}, {"V", Array{"<1.2", "<1.10"}, false},
+        {"V", Array{">3", ">=1.10"}, true}, {"V", Array{">=2", ">1.10"}, false},
+        {"V", Array{"<>1.10", "<>01.10"}, false}, {"V", Array{"<>1.10", "<>1.9"}, true},
+        {"Kind", Array{"?UT-IS:png", "?x"}, true}, {"Type", Array{"?UT-CONFORMS:a", "?UT-CONFORMS:image"}, true},
         // Activation rules.
         {"Rule", offer, true}, {"Yes", offer, true}, {"No", offer, false}, {"Name", offer, false},
         // Key forms.
@@ -84,6 +94,17 @@ TEST_F(MatchingTest, EveryOperatorKeyFormAndPatternShape) {
     for (const auto& [key, pattern, holds] : cases) {
         EXPECT_EQ(plugIn->matchKey(key, pattern), holds) << key << " / " << describe(pattern);
     }
+}
+
+TEST_F(MatchingTest, CostDoesNotGrowWithTheNumberOfAlternatives) {
+    std::vector<Value> elements, alternatives;
+    for (int i = 0; i < 1000; ++i) elements.emplace_back("element-" + std::to_string(i));
+    for (int i = 0; i < 4000; ++i) alternatives.emplace_back("other-" + std::to_string(i));
+    auto plugIn = world_.record(makeProxy("com.b", {{"Many", Array(elements)}}));
+    const RuleSet rules({{"Many", Array(alternatives)}}, nullptr);
+    const auto start = std::chrono::steady_clock::now();
+    for (int i = 0; i < 100; ++i) EXPECT_FALSE(plugIn->match(rules));
+    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(2));
 }
 
 TEST_F(MatchingTest, AllRulesMustHold) {

@@ -120,14 +120,16 @@ TEST(ActivationRule, CountsConformingItemsOfWellFormedOffers) {
         {twoTexts, offer({Dictionary{{"types", "text/csv"}}}), false},
     };
     for (const Case& c : cases)
-        EXPECT_EQ(evaluateActivationRule(c.rule, c.offer, *types), c.accepted)
+        EXPECT_EQ(ActivationOffer(c.offer, *types).isAcceptedBy(c.rule), c.accepted)
             << describe(c.rule) << " " << describe(c.offer);
 }
 
 TEST(ActivationRule, RefusesWhatWouldTakeTooLong) {
     class : public Types {
       public:
-        bool conforms(const std::string&, const std::string&) override { return true; }
+        std::string name(const std::string&) override { return ++questions, "any"; }
+        std::vector<std::string> lineage(const std::string&) override { return {"any"}; }
+        int questions = 0;
     } types;
     const auto accepts = [&types](std::size_t listed, std::size_t items, std::size_t typesOfItem) {
         Dictionary rule;
@@ -135,9 +137,11 @@ TEST(ActivationRule, RefusesWhatWouldTakeTooLong) {
         const Value item =
             Dictionary{{"types", Array(std::vector<Value>(typesOfItem, Value("a/b")))}};
         const Array all(std::vector<Value>(items, item));
-        return evaluateActivationRule(rule, {{"items", all}}, types);
+        types.questions = 0;
+        return ActivationOffer({{"items", all}}, types).isAcceptedBy(rule);
     };
     EXPECT_TRUE(accepts(256, 4096, 4));
+    EXPECT_EQ(types.questions, 256) << "however much is offered";
     EXPECT_FALSE(accepts(256, 4096, 5));
     EXPECT_FALSE(accepts(257, 1, 1));
     EXPECT_FALSE(accepts(1, 4097, 1));

@@ -1,0 +1,67 @@
+#pragma once
+
+#include <cstddef>
+#include <memory>
+#include <optional>
+#include <string>
+#include <variant>
+#include <vector>
+
+#include "platform/services/Types.h"
+#include "platform/values/Value.h"
+#include "zrd/TextPatterns.h"
+
+namespace zorvan {
+
+/// The pattern of a rule, read once to be asked of many values. Used by one thread at a time.
+class RulePattern {
+  public:
+    /// `types` may be null while the pattern does not speak of types.
+    RulePattern(const platform::Value& pattern, const std::shared_ptr<platform::Types>& types);
+
+    /// Whether it holds for a property's value; null: there is none. Of a list so many elements are
+    /// looked at.
+    bool matches(const platform::Value* value) const;
+    static constexpr std::size_t kMaxElements = 1024;
+
+  private:
+    struct Present {};
+    struct Absent {};
+    struct Never {};
+    struct Offer {
+        platform::Dictionary dictionary;  // for the log
+        std::shared_ptr<const platform::ActivationOffer> offer;
+    };
+    using Content = std::variant<Present, Absent, Never, Offer, TextPatterns>;
+
+    static Content read(const platform::Value& pattern,
+                        const std::shared_ptr<platform::Types>& types);
+
+    Content content_;
+};
+
+/// Rules, read once to be asked of many plug-ins. Used by one thread at a time.
+class RuleSet {
+  public:
+    struct Rule {
+        std::string key;
+        RulePattern pattern;
+    };
+
+    /// Whether rules may be asked of all plug-ins while everybody waits: each rule costs a look at
+    /// each plug-in, and reading them costs their bytes.
+    static bool isAffordable(const platform::Dictionary& rules);
+    static constexpr std::size_t kMaxRules = 64;
+    static constexpr std::size_t kMaxValues = 4096;      // those inside others included
+    static constexpr std::size_t kMaxBytes = 64u << 10;  // of keys, strings and data
+
+    RuleSet(const platform::Dictionary& rules, const std::shared_ptr<platform::Types>& types);
+
+    /// In the order of their keys.
+    const std::vector<Rule>& rules() const { return rules_; }
+
+  private:
+    std::vector<Rule> rules_;
+};
+
+}  // namespace zorvan
