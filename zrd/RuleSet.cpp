@@ -40,17 +40,30 @@ RulePattern::Content RulePattern::read(const Value& pattern,
     if (platform::equalsFalse(pattern)) return Absent();
     if (const Dictionary* offer = pattern.dictionary())
         return Offer{*offer, std::make_shared<platform::ActivationOffer>(*offer, *types)};
-    TextPatterns texts(types);
-    if (const std::string* text = pattern.string()) {
-        texts.add(*text);
-    } else if (const Array* alternatives = pattern.array()) {
+    if (!pattern.string() && !pattern.array()) return Never();
+    Texts texts{TextPatterns(types), std::nullopt};
+    std::vector<std::string> given;
+    bool areKnown = true;
+    const Array alternatives = pattern.array() ? *pattern.array() : Array{pattern};
+    for (const Value& alternative : alternatives) {
         // What is no text matches nothing.
-        for (const Value& alternative : *alternatives)
-            if (alternative.string()) texts.add(*alternative.string());
-    } else {
-        return Never();
+        if (!alternative.string()) continue;
+        areKnown = texts.patterns.add(*alternative.string()) && areKnown;
+        given.push_back(*alternative.string());
     }
+    if (!areKnown) texts.told = Told{std::move(given), types};
     return texts;
+}
+
+bool RulePattern::holds(const Texts& texts, const std::string& text) {
+    if (!texts.told || texts.told->walks == 0) return texts.patterns.matches(text);
+    --texts.told->walks;
+    return std::ranges::any_of(texts.told->patterns, [&](const std::string& pattern) {
+        TextPatterns alone(texts.told->types);
+        if (alone.add(pattern)) return alone.matches(text);
+        EVLOG_INFO(ops(), "unrecognized match operator:{}", pattern);
+        return false;
+    });
 }
 
 bool RulePattern::matches(const Value* value) const {
@@ -62,14 +75,14 @@ bool RulePattern::matches(const Value* value) const {
                     *value);
         return offer->offer->isAcceptedBy(*value);
     }
-    const auto* texts = std::get_if<TextPatterns>(&content_);
+    const auto* texts = std::get_if<Texts>(&content_);
     if (!texts) return false;
-    if (const std::string* text = value->string()) return texts->matches(*text);
+    if (const std::string* text = value->string()) return holds(*texts, *text);
     const Array* elements = value->array();
     if (!elements) return false;
     const Value* end = elements->begin() + std::min(elements->size(), kMaxElements);
     return std::any_of(elements->begin(), end, [&](const Value& element) {
-        return element.string() && texts->matches(*element.string());
+        return element.string() && holds(*texts, *element.string());
     });
 }
 

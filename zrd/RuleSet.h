@@ -32,10 +32,22 @@ class RulePattern {
         platform::Dictionary dictionary;  // for the log
         std::shared_ptr<const platform::ActivationOffer> offer;
     };
-    using Content = std::variant<Present, Absent, Never, Offer, TextPatterns>;
+    /// Patterns with an operator that does not exist among them: who meets it is told, every time,
+    /// which takes a walk over them. So many walks are made.
+    struct Told {
+        std::vector<std::string> patterns;
+        std::shared_ptr<platform::Types> types;
+        std::size_t walks = 256;
+    };
+    struct Texts {
+        TextPatterns patterns;
+        mutable std::optional<Told> told;
+    };
+    using Content = std::variant<Present, Absent, Never, Offer, Texts>;
 
     static Content read(const platform::Value& pattern,
                         const std::shared_ptr<platform::Types>& types);
+    static bool holds(const Texts& texts, const std::string& text);
 
     Content content_;
 };

@@ -4,7 +4,6 @@
 #include <utility>
 
 #include "Zorvan/Helpers.h"
-#include "Zorvan/LogHandles.h"
 #include "platform/services/Types.h"
 
 namespace zorvan {
@@ -28,7 +27,7 @@ void widen(std::optional<std::string>& bound, std::string operand, int sign) {
 
 }  // namespace
 
-void TextPatterns::add(const std::string& pattern) {
+bool TextPatterns::add(const std::string& pattern) {
     if (!pattern.starts_with('?')) {
         const std::string_view* prefix = std::ranges::find_if(
             kOperators, [&](std::string_view candidate) { return pattern.starts_with(candidate); });
@@ -39,8 +38,9 @@ void TextPatterns::add(const std::string& pattern) {
         for (std::string& name : types_->lineage(pattern.substr(kIsOperator.size())))
             descendants_.insert(std::move(name));
     } else {
-        unknown_.push_back(pattern);
+        return false;
     }
+    return true;
 }
 
 void TextPatterns::addComparison(std::string_view prefix, std::string operand) {
@@ -64,9 +64,7 @@ void TextPatterns::addComparison(std::string_view prefix, std::string operand) {
 }
 
 bool TextPatterns::matches(const std::string& text) const {
-    if (takesAny_ || isEqual(text) || isOrdered(text) || hasType(text)) return true;
-    tellUnknown();
-    return false;
+    return takesAny_ || isEqual(text) || isOrdered(text) || hasType(text);
 }
 
 bool TextPatterns::isEqual(const std::string& text) const {
@@ -92,12 +90,6 @@ bool TextPatterns::hasType(const std::string& text) const {
     return std::ranges::any_of(types_->lineage(text), [this](const std::string& name) {
         return ancestors_.contains(name);
     });
-}
-
-void TextPatterns::tellUnknown() const {
-    for (const std::string& pattern : unknown_)
-        EVLOG_INFO(ops(), "unrecognized match operator:{}", pattern);
-    unknown_.clear();
 }
 
 }  // namespace zorvan

@@ -22,9 +22,10 @@ class TextPatterns {
     /// `types` may be null while no pattern speaks of types.
     explicit TextPatterns(std::shared_ptr<platform::Types> types) : types_(std::move(types)) {}
 
-    void add(const std::string& pattern);
+    /// False for a pattern whose operator does not exist: it holds never.
+    bool add(const std::string& pattern);
 
-    /// Whether one of them holds. Operators that do not exist hold never, and are logged once.
+    /// Whether one of them holds.
     bool matches(const std::string& text) const;
 
   private:
@@ -32,7 +33,6 @@ class TextPatterns {
     bool isEqual(const std::string& text) const;
     bool isOrdered(const std::string& text) const;
     bool hasType(const std::string& text) const;
-    void tellUnknown() const;
 
     std::shared_ptr<platform::Types> types_;
     std::vector<std::string> equal_;              // each once
@@ -42,7 +42,6 @@ class TextPatterns {
     bool takesAny_ = false;  // every text differs from one of two different ones
     std::unordered_set<std::string> ancestors_;    // names of types that the text may descend from
     std::unordered_set<std::string> descendants_;  // and of those that it may be an ancestor of
-    mutable std::vector<std::string> unknown_;     // not yet told of
 };
 
 }  // namespace zorvan

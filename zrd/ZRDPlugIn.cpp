@@ -139,7 +139,7 @@ void ZRDPlugIn::setLocalizedContainingName(std::optional<std::string> value) {
 }
 
 std::optional<ZRDPlugIn::Draft> ZRDPlugIn::draftForm(const platform::UntouchedBundles& untouched,
-                                                    std::optional<ZRError>& error) const {
+                                                     std::optional<ZRError>& error) const {
     std::optional<Dictionary> form;
     std::uint64_t nameChanges = 0;
     {

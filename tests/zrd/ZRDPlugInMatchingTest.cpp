@@ -121,6 +121,12 @@ TEST_F(MatchingTest, UnknownOperatorsNeverMatchAndAreLogged) {
     EXPECT_FALSE(plugIn->matchKey("Name", "?UT-is:abc"));
     EXPECT_THAT(log.take(), ElementsAre("ops I: unrecognized match operator:?",
                                         "ops I: unrecognized match operator:?UT-is:abc"));
+    // Those that are met before one that holds, once for each text.
+    const RuleSet rules({{"List", Array{"?y", "b", "?z"}}}, nullptr);
+    for (int i = 0; i < 2; ++i) EXPECT_TRUE(plugIn->match(rules));
+    const std::string y = "ops I: unrecognized match operator:?y";
+    const std::string z = "ops I: unrecognized match operator:?z";
+    EXPECT_THAT(log.take(), ElementsAre(y, z, y, y, z, y));
 }
 
 TEST_F(MatchingTest, AMissingApplicationFailsEveryPattern) {
