@@ -70,6 +70,7 @@ struct Listener::State : std::enable_shared_from_this<Listener::State> {
     SerialQueue& queue;
     lum::ServiceSocket socket;
     const lum::PeerConnection::Common common;
+    Pool& pool = connectionPool();
     EventHandler handler;
     std::optional<RunLoop::Watch> watch;  // since `resume`
     // To be closed at the end. Those that are gone are dropped when the list is full.
@@ -154,7 +155,7 @@ void Listener::State::admit(UniqueFd connected) {
 /// None, with a line the first time, when those of the peer's origin have their part already.
 std::optional<Pool::Share> Listener::State::drawFor(const AuditToken& token) {
     const Origin origin = Origin::of(token);
-    auto share = connectionPool().draw(origin);
+    auto share = pool.draw(origin);
     if (share) {
         refused.erase(origin);
     } else {
@@ -164,7 +165,7 @@ std::optional<Pool::Share> Listener::State::drawFor(const AuditToken& token) {
         EVLOG_ERROR(ops(),
                     "client {} is not let in: there are too many connections, or it and those it "
                     "belongs with have too many, {} are the most",
-                    token.pid(), connectionPool().quarter());
+                    token.pid(), pool.quarter());
     }
     return share;
 }
