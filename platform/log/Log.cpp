@@ -74,6 +74,7 @@ struct Handles {
     std::mutex mutex;  // guards `byName`, changes of the handles' levels, and `capturing`
     std::map<std::pair<std::string, std::string>, std::unique_ptr<Log>> byName;
     bool capturing = false;
+    std::atomic<bool> hidesFromCapture = false;
 
     std::mutex captureMutex;  // guards `sink`; held while it runs. Never taken under `mutex`
     LogCapture::Sink sink;
@@ -192,7 +193,9 @@ const Log& Log::defaultHandle() {
 }
 
 const char* Log::privateMask() const {
-    return destination().hidesPrivate && !isCaptured() ? "<private>" : nullptr;
+    const bool hides =
+        isCaptured() ? handles().hidesFromCapture.load() : destination().hidesPrivate;
+    return hides ? "<private>" : nullptr;
 }
 
 void Log::writeLine(LogLevel level, const std::string& text) const {
@@ -208,8 +211,9 @@ void Log::writeLine(LogLevel level, const std::string& text) const {
     writeToStandardError(category_, level, text);
 }
 
-LogCapture::LogCapture(Sink sink) {
+LogCapture::LogCapture(Sink sink, Private arguments) {
     Handles& all = handles();
+    all.hidesFromCapture = arguments == Private::Hidden;
     {
         std::lock_guard lock(all.captureMutex);
         all.sink = std::move(sink);

@@ -146,13 +146,14 @@ class Log {
 };
 
 /// For tests: while it lives, every line of every handle is also given to `sink`, whatever the
-/// levels say; arguments are shown in full. At most one at a time. `sink` runs on the writing
-/// thread, one call at a time.
+/// levels say. At most one at a time. `sink` runs on the writing thread, one call at a time.
 class LogCapture {
   public:
+    /// What it is given for private arguments: all of them, or "<private>", as the journal is.
+    enum class Private { Shown, Hidden };
     using Sink =
         std::function<void(const std::string& category, LogLevel level, const std::string& text)>;
-    explicit LogCapture(Sink sink);
+    explicit LogCapture(Sink sink, Private arguments = Private::Shown);
     LogCapture(const LogCapture&) = delete;
     ~LogCapture();
 };

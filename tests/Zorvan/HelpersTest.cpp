@@ -23,6 +23,8 @@ TEST(CompareVersionString, OrdersDigitRunsByValueAndTheRestByByte) {
              {"1.x", "1.10", 1},
              {"18446744073709551616", "18446744073709551615", 1},
              {"a", "\xC3\xA4", -1},
+             {"\xD9\xA1", "234", 1},  // another script's digit
+             {"\xEF\xBD\x81", "\xF0\x90\x80\x80", -1},
          }) {
         EXPECT_EQ(compareVersionString(receiver, other), order) << receiver << " / " << other;
         EXPECT_EQ(compareVersionString(other, receiver), -order) << other << " / " << receiver;

@@ -12,6 +12,10 @@ namespace zorvan {
 /// Gathers the log while it lives: "<category> <level>: <text>", levels as D, I, - and E.
 class LogLines {
   public:
+    using Private = platform::LogCapture::Private;
+    explicit LogLines(Private arguments = Private::Shown)
+        : capture_([this](const auto&... line) { add(line...); }, arguments) {}
+
     /// What has been logged since the last call.
     std::vector<std::string> take() {
         std::lock_guard lock(mutex_);
@@ -26,8 +30,7 @@ class LogLines {
 
     std::mutex mutex_;  // guards lines_
     std::vector<std::string> lines_;
-    platform::LogCapture capture_{
-        [this](const auto& category, auto level, const auto& text) { add(category, level, text); }};
+    platform::LogCapture capture_;
 };
 
 }  // namespace zorvan

@@ -83,9 +83,10 @@ class ClientTest : public testing::Test {
     }
 
     /// The request that the service saw, without the keys that all requests have.
-    template <class Operation>
-    Dictionary sent(const char* type, Operation&& operation) {
-        Reply reply = replyOf(std::forward<Operation>(operation));
+    template <class Operation, class... Arguments>
+    Dictionary sent(const char* type, Operation operation, const Arguments&... arguments) {
+        Reply reply = replyOf(
+            [&](auto done) { std::invoke(operation, *client_, arguments..., std::move(done)); });
         const auto* message = std::get_if<Message>(&reply);
         if (!message) return {{"lost", describe(std::get<ConnectionError>(reply))}};
         Dictionary request = *message->find("sent")->dictionary();
@@ -104,49 +105,29 @@ class ClientTest : public testing::Test {
 };
 
 TEST_F(ClientTest, BuildsEachRequest) {
-    using Callback = ZRDaemonClient::ReplyCallback;
-    ZRDaemonClient& client = *client_;
-    Uuid a = Uuid::random(), b = Uuid::random();
-    Dictionary options{{"key", Array{1, "text", true}}};
+    using Client = ZRDaemonClient;
+    const Uuid a = Uuid::random(), b = Uuid::random();
+    const Dictionary options{{"key", Array{1, "text", true}}};
+    const std::vector<std::string> places{"/a", "/b"};
+    const std::vector<Uuid> both{b, a}, none;
     const Value paths = Array{"/a", "/b"}, uuids = Array{b, a};
-
-    EXPECT_EQ(sent("add",
-                   [&](Callback done) {
-                       client.addPlugIns({"/a", "/b"}, done);
-                   }),
-              (Dictionary{{"paths", paths}}));
-    EXPECT_EQ(sent("remove",
-                   [&](Callback done) {
-                       client.removePlugIns({"/a", "/b"}, done);
-                   }),
-              (Dictionary{{"paths", paths}}));
-    EXPECT_EQ(sent("bulk", [&](Callback done) { client.bulkPlugins(UINT64_MAX, done); }),
-              (Dictionary{{"flags", UINT64_MAX}}));
-    EXPECT_EQ(sent("ready",
-                   [&](Callback done) {
-                       client.readyPlugIns({b, a}, 1, done);
-                   }),
+    EXPECT_EQ(sent("add", &Client::addPlugIns, places), (Dictionary{{"paths", paths}}));
+    EXPECT_EQ(sent("remove", &Client::removePlugIns, places), (Dictionary{{"paths", paths}}));
+    EXPECT_EQ(sent("bulk", &Client::bulkPlugins, UINT64_MAX), (Dictionary{{"flags", UINT64_MAX}}));
+    EXPECT_EQ(sent("ready", &Client::readyPlugIns, both, 1),
               (Dictionary{{"flags", 1}, {"uuids", uuids}}));
-    EXPECT_EQ(sent("access", [&](Callback done) { client.accessPlugIns({}, 0, done); }),
+    EXPECT_EQ(sent("access", &Client::accessPlugIns, none, 0),
               (Dictionary{{"flags", 0}, {"uuids", Array{}}}));
-    EXPECT_EQ(sent("match", [&](Callback done) { client.matchPlugIns(options, 5, done); }),
+    EXPECT_EQ(sent("match", &Client::matchPlugIns, options, 5),
               (Dictionary{{"flags", 5}, {"rules", options}}));
-    EXPECT_EQ(sent("annotate",
-                   [&](Callback done) {
-                       client.setPluginAnnotations({b, a}, options, done);
-                   }),
+    EXPECT_EQ(sent("annotate", &Client::setPluginAnnotations, both, options),
               (Dictionary{{"annotations", options}, {"uuids", uuids}}));
-    EXPECT_EQ(sent("bulk-annotate",
-                   [&](Callback done) { client.bulkSetPluginAnnotations(options, done); }),
+    EXPECT_EQ(sent("bulk-annotate", &Client::bulkSetPluginAnnotations, options),
               (Dictionary{{"annotations", options}}));
-    EXPECT_EQ(sent("lock",
-                   [&](Callback done) {
-                       client.holdPlugins({"/a", "/b"}, 2, done);
-                   }),
+    EXPECT_EQ(sent("lock", &Client::holdPlugins, places, 2),
               (Dictionary{{"flags", 2}, {"paths", paths}}));
-    client.setProtocolVersion(2);
-    EXPECT_EQ(sent("lock", [&](Callback done) { client.releaseHold(a, done); }),
-              (Dictionary{{"uuids", Array{a}}}));
+    client_->setProtocolVersion(2);
+    EXPECT_EQ(sent("lock", &Client::releaseHold, a), (Dictionary{{"uuids", Array{a}}}));
 }
 
 TEST_F(ClientTest, UnpacksPropertyListsInTheCurrentVersionOnly) {
@@ -178,15 +159,27 @@ TEST_F(ClientTest, WhatTheDaemonMustRefuseCostsThatRequestAndNothingElse) {
         EXPECT_EQ(error->code, kZRErrorInvalidRequest);
         EXPECT_THAT(*error->description, testing::StartsWith("request not sent: "));
     }
-    EXPECT_EQ(sent("bulk", [&](auto done) { client_->bulkPlugins(0, done); }),
-              (Dictionary{{"flags", 0}}));
+    EXPECT_EQ(sent("bulk", &ZRDaemonClient::bulkPlugins, 0), (Dictionary{{"flags", 0}}));
 }
 
 TEST_F(ClientTest, MayBeReleasedInACallback) {
-    std::promise<void> answered;
-    client_->bulkPlugins(0, [client = client_, &answered](const Reply&) { answered.set_value(); });
-    client_.reset();
-    answered.get_future().wait();
+    std::promise<void> sent, released;
+    client_->bulkPlugins(0, [&](const Reply&) {
+        sent.get_future().wait();
+        client_.reset();  // the last reference, on the client's own queue
+        released.set_value();
+    });
+    sent.set_value();
+    released.get_future().wait();
+}
+
+TEST_F(ClientTest, HearsOfItsServicesEndAlsoAfterIt) {
+    for (bool isOver : {false, true}) {
+        std::promise<void> heard;
+        client_->setEndHandler([&] { heard.set_value(); });
+        if (!isOver) queue_.async([this] { listener_.reset(); });
+        heard.get_future().wait();
+    }
 }
 
 TEST_F(ClientTest, AnswersEveryRequestWithAnErrorWithoutAService) {

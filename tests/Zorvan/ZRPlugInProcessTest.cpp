@@ -103,6 +103,9 @@ TEST_F(PlugInProcess, AHostUsesAPlugInThatIsBusyMeanwhile) {
     process->takeConnection();
     EXPECT_EQ(process->wait(), 5);
     EXPECT_EQ(ended.get_future().get(), 5);
+    std::promise<std::optional<int>> known;
+    process->setEndHandler([&](std::optional<int> status) { known.set_value(status); });
+    EXPECT_EQ(known.get_future().get(), 5);
     EXPECT_EQ(busy(), 0u);
     process->terminate();
 }

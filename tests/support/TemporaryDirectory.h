@@ -50,6 +50,14 @@ class TemporaryDirectory {
         return path(relative);
     }
 
+    /// A path of exactly so many bytes, for something in a directory that is there.
+    std::string pathOfLength(std::size_t length) const {
+        std::string directory = path_;
+        while (length - directory.size() > 250) directory += "/" + std::string(200, 'd');
+        std::filesystem::create_directories(directory);
+        return directory + "/" + std::string(length - directory.size() - 1, 'x');
+    }
+
   private:
     std::string path_;
 };

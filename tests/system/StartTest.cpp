@@ -4,6 +4,8 @@
 
 #include <csignal>
 #include <filesystem>
+#include <iterator>
+#include <sstream>
 
 #include "platform/plist/PropertyList.h"
 #include "tests/system/SystemTest.h"
@@ -15,6 +17,11 @@ namespace {
 using testing::ElementsAre;
 using testing::IsEmpty;
 using namespace std::string_literals;
+
+std::vector<std::string> words(const char* text) {
+    std::istringstream stream(text);
+    return {std::istream_iterator<std::string>(stream), {}};
+}
 
 class Start : public SystemTest {
   protected:
@@ -71,6 +78,21 @@ TEST_F(Start, NobodyHasToReadWhatItWrites) {
     zrd_ = daemon("export ZR_LOG=info; exec " ZRD_PROGRAM " -v");
     ::close(ends[1]);
     EXPECT_TRUE(waitUntil([&] { return !zrd_->isRunning() || RawClient(socket_).isConnected(); }));
+}
+
+TEST_F(Start, AnExecutableWithTooLongAPathIsNotKnown) {
+    ::setenv("ZR_LOG", "ops=debug", 1);
+    start();
+    for (std::size_t length : {2047, 2048}) {
+        const std::string program = home_.pathOfLength(length);
+        std::filesystem::create_hard_link(zrctlProgram_, program);
+        auto host = spawn(program.c_str(), {"match"});
+        EXPECT_EQ(host->wait(), 1) << "there is nothing to be found";
+        const std::string line = "new client " + std::to_string(host->pid()) + ' ';
+        EXPECT_EQ(zrd_->errLines(line), 1u);
+        EXPECT_EQ(zrd_->errLines(line + '/'), length < 2048 ? 1u : 0u);
+    }
+    ::unsetenv("ZR_LOG");
 }
 
 TEST_F(Start, AJournalOutOfReachLosesNoLines) {
@@ -150,41 +172,26 @@ TEST_F(Start, DamagedBundlesAreLeftOutWithOneLineEach) {
 
 TEST_F(Start, ValuesOfWrongTypesHarmNobody) {
     const Dictionary plain = info("plain");
-    const char* topLevel[] = {"QFBundleIdentifier",
-                              "QFBundleVersion",
-                              "QFBundleName",
-                              "QFBundleDisplayName",
-                              "QFBundleExecutable",
-                              "VXExtension",
-                              "Zorvan",
-                              "QFBundleInfoPlistURL",
-                              "VXExtensionIdentifier",
-                              "VXOriginalIdentifier",
-                              "QFBundleShortVersionString"};
-    const char* plugIn[] = {"VXExtensionAttributes",
-                            "VXExtensionPointIdentifier",
-                            "VXExtensionProtocol",
-                            "PrincipalClass",
-                            "EmbeddedCode",
-                            "Dedicated",
-                            "PassProxy",
-                            "HubProtocolVersion",
-                            "Shared",
-                            "VXExtensionHostEntitlement",
-                            "VXExtensionIdentifier",
-                            "Multiple"};
+    const auto topLevel = words(
+        "QFBundleIdentifier QFBundleVersion QFBundleName QFBundleDisplayName QFBundleExecutable "
+        "VXExtension Zorvan QFBundleInfoPlistURL VXExtensionIdentifier VXOriginalIdentifier "
+        "QFBundleShortVersionString");
+    const auto plugIn = words(
+        "VXExtensionAttributes VXExtensionPointIdentifier VXExtensionProtocol PrincipalClass "
+        "EmbeddedCode Dedicated PassProxy HubProtocolVersion Shared VXExtensionHostEntitlement "
+        "VXExtensionIdentifier Multiple");
     const Value odd[] = {-7, true, Array{Dictionary{{"k", 1}}}, Dictionary{{"k", "v"}}};
     int number = 0;
     auto write = [&](const Dictionary& infoPlist, const Dictionary& entitlements = {}) {
         writePlugIn(plugInPath("Odd", std::to_string(++number)), infoPlist, entitlements);
     };
     for (const Value& value : odd) {
-        for (const char* key : topLevel) {
+        for (const std::string& key : topLevel) {
             Dictionary damaged = info("top" + std::to_string(number));
             damaged.set(key, value);
             write(damaged);
         }
-        for (const char* key : plugIn) {
+        for (const std::string& key : plugIn) {
             Dictionary damaged = info("in" + std::to_string(number));
             Dictionary inner = *damaged.find("VXExtension")->dictionary();
             inner.set(key, value);
@@ -203,7 +210,7 @@ TEST_F(Start, ValuesOfWrongTypesHarmNobody) {
     EXPECT_EQ(all->wait(), 0) << all->err();
     EXPECT_THAT(match({{"VXExtensionContainingApp", home_.path(kApps + "A.app"s)}}),
                 ElementsAre("good 1"));
-    for (const char* key : plugIn) match({{key, Dictionary{{"items", 1}}}});
+    for (const std::string& key : plugIn) match({{key, Dictionary{{"items", 1}}}});
 }
 
 TEST_F(Start, DamagedFilesOfItsOwnAreReplaced) {

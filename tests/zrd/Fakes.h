@@ -12,8 +12,10 @@
 #include <vector>
 
 #include "platform/Services.h"
+#include "platform/log/Log.h"
 #include "platform/lum/Connection.h"
 #include "platform/threads/SerialQueue.h"
+#include "tests/zrd/ProbeTrace.h"
 #include "zrd/HostProcess.h"
 #include "zrd/PlugInContext.h"
 #include "zrd/ZRDPlugIn.h"
@@ -118,6 +120,7 @@ struct FakeLauncher final : platform::Launcher {
     }
     std::set<std::string> takenBack;
     std::unique_ptr<WorkMarker> beginOutstandingWork() override {
+        if (atNewWork) std::exchange(atNewWork, nullptr)();
         struct Marker final : WorkMarker {
             explicit Marker(int& value) : count(value) { ++count; }
             ~Marker() override { --count; }
@@ -128,6 +131,7 @@ struct FakeLauncher final : platform::Launcher {
     std::vector<std::pair<std::string, Dictionary>> granted;
     std::vector<platform::ExternalService> services;
     std::set<std::string> refused;
+    std::function<void()> atNewWork;  // once
     int markers = 0;
     void terminatePlugInInstances(const std::string& identifier, const std::string& version,
                                   const platform::KnownDirectory& bundle,
@@ -283,12 +287,16 @@ struct FakeNotifications final : platform::Notifications {
 
 /// A connection from this process; the test delivers its events and reads what was sent.
 struct FakeConnection final : platform::Connection {
-    pid_t pid() const override { return token.pid(); }
+    pid_t pid() const override {
+        if (whenAsked) std::exchange(whenAsked, nullptr)();
+        return id;
+    }
     const platform::AuditToken& auditToken() const override { return token; }
     void setContext(std::shared_ptr<void> value) override { context = std::move(value); }
     void setEventHandler(EventHandler value) override { handler = std::move(value); }
     void resume() override { resumed = true; }
     void send(const platform::Message& reply) override {
+        if (ProbeTrace::enablesGuarded) EVLOG_DEBUG(platform::Log::make("test", "peer"), "reply");
         sent.push_back(reply);
         isAnswered = true;
     }
@@ -302,6 +310,8 @@ struct FakeConnection final : platform::Connection {
     }
 
     platform::AuditToken token = platform::AuditToken::ofSelf().value();
+    pid_t id = token.pid();
+    mutable std::function<void()> whenAsked;  // once, for its process id
     std::shared_ptr<void> context;
     EventHandler handler;
     bool resumed = false;

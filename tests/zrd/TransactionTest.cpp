@@ -30,8 +30,7 @@ TEST_F(TransactionTest, VersionAndTypeAreJudgedInThisOrder) {
     EXPECT_EQ(ask({{"request", "Add"}}), error(4, "unrecognized request"));
     LogLines log;
     EXPECT_EQ(ask({{"request", "bulk"}, {"version", 2}, {"flags", 0x1000000FFu}}), Dictionary());
-    EXPECT_THAT(log.take(),
-                ElementsAre(HasSubstr("requested bulk"), "ops I: bulk options 0xff not supported"));
+    EXPECT_THAT(log.take(), Contains("ops I: bulk options 0xff not supported"));
 }
 
 TEST_F(TransactionTest, PathsAreWalkedUpToTheFirstFailure) {
@@ -41,6 +40,8 @@ TEST_F(TransactionTest, PathsAreWalkedUpToTheFirstFailure) {
     const std::string odd = directory_.path("odd");  // leads to a name that no reply can carry
     std::filesystem::create_directory_symlink(directory_.makeDirectory("\xff"), odd);
     workspace_->refused = {refused, gone};
+    const std::string longest = directory_.pathOfLength(1023), beyond = longest + "x";
+    for (const auto& path : {longest, beyond}) std::filesystem::create_directory(path);
     struct Case {
         const char* type;
         Value paths;
@@ -58,6 +59,10 @@ TEST_F(TransactionTest, PathsAreWalkedUpToTheFirstFailure) {
         {"add", Array{""}, error(9, "absolute path required: "), {}},
         {"add", Array{real, gone}, error(9, "invalid plugin path: " + gone), {"add " + real}},
         {"add", Array{odd}, error(9, "invalid plugin path: " + odd), {}},
+        {"add",
+         Array{longest, beyond},
+         error(9, "invalid plugin path: " + beyond),
+         {"add " + longest}},
         {"add",
          Array{real, refused, link},
          error(2, "unable to register plug-in at " + refused),
@@ -94,17 +99,13 @@ TEST_F(TransactionTest, TheRegistryLearnsThatAConfinedHostAsks) {
 
 TEST_F(TransactionTest, RemovingNeedsTheManagersEntitlement) {
     const Dictionary request{{"request", "remove"}, {"paths", Array{"/x"}}};
+    const Dictionary refusal = error(11, "caller lacks entitlement for this operation");
     for (Dictionary held : {Dictionary(), Dictionary{{entitlement::kManager, 0}}}) {
         codeSigning_->entitlements = held;
-        LogLines log;
-        EXPECT_EQ(ask(request), error(11, "caller lacks entitlement for this operation"));
-        EXPECT_THAT(log.take(), Contains(HasSubstr("default -: refused request from pid=")));
+        EXPECT_EQ(ask(request), refusal);
     }
     codeSigning_->error = platform::Error{"POSIX", 5, "unreadable"};
-    LogLines log;
-    EXPECT_EQ(ask(request), error(11, "caller lacks entitlement for this operation"));
-    EXPECT_THAT(log.take(),
-                Contains(HasSubstr("ops E: error retrieving entitlements for client ")));
+    EXPECT_EQ(ask(request), refusal);
     EXPECT_THAT(workspace_->changes, IsEmpty());
 }
 
@@ -115,13 +116,8 @@ TEST_F(TransactionTest, MatchAnswersForms) {
     versionless->infoPlist =
         Dictionary{{"VXExtension", Dictionary{{"VXExtensionAttributes", Dictionary()}}}};
     workspace_->installed.push_back(versionless);
-    LogLines log;
     EXPECT_THAT(match({}), ElementsAre("com.a", "com.b"));
     EXPECT_EQ(sandbox_->issued, 2) << "who loses gets no tokens";
-    auto lines = log.take();
-    EXPECT_THAT(lines, Contains(HasSubstr("ops E: failed to export matching plug-in " +
-                                          versionless->plugInUuid.string())));
-    EXPECT_THAT(lines, Contains("ops I: match returned 2 plug-ins"));
     EXPECT_THAT(match({{"rules", Dictionary{{"Color", "red"}}}}), ElementsAre("com.a"));
     EXPECT_THAT(match({{"rules", Dictionary{{"Color", "blue"}}}}), IsEmpty());
     EXPECT_EQ(ask({{"request", "match"}, {"version", 2}}), Dictionary());
@@ -154,14 +150,15 @@ TEST_F(TransactionTest, BadRulesAndForbiddenFlagsAreRefusedBeforeAnyQuery) {
     EXPECT_TRUE(isRefused(64, 4097, 65536));
     EXPECT_TRUE(isRefused(64, 4096, 65537));
     workspace_->queries = 0;
-    const Dictionary all{{"request", "match"}, {"flags", 0x200}};
+    const Dictionary all{{"request", "match"}, {"flags", 0x200}, {"rules", Dictionary{{"k", "v"}}}};
     const Dictionary refusal = error(11, "unauthorized discovery flag (ZRDiscoverAll)");
     EXPECT_EQ(ask(all), refusal);
+    EXPECT_EQ(workspace_->queries, 0);
     codeSigning_->entitlements = {{entitlement::kManager, true}};
     EXPECT_TRUE(ask(all).contains("matches"));
     sandbox_->sandboxed = true;
     EXPECT_EQ(ask(all), refusal);
-    EXPECT_EQ(workspace_->queries, 0);
+    EXPECT_EQ(workspace_->queries, 1);
 }
 
 TEST_F(TransactionTest, WhatWaitsForTheRegistryHoldsUpItsSenderAlone) {
@@ -208,19 +205,15 @@ TEST_F(TransactionTest, QueuedRequestsOfADeadClientAreDropped) {
     std::promise<void> go;
     server_->submitWork([blocked = go.get_future().share()] { blocked.wait(); });
     deliver(Message({{"request", "bulk"}, {"version", 3}}));
-    LogLines log;
     deliver(ConnectionError{ConnectionError::Kind::TerminationImminent, ""});
     EXPECT_TRUE(client().acceptWork());
     deliver(ConnectionError{ConnectionError::Kind::Invalid, ""});
     go.set_value();
     drain();
     EXPECT_THAT(connection_->sent, IsEmpty());
-    const std::string pid = std::to_string(connection_->pid());
-    EXPECT_THAT(log.take(), ElementsAre("ops D: client " + pid + " termination imminent",
-                                        "ops D: client " + pid + " is dead"));
 }
 
-TEST_F(TransactionTest, ClientsCountTheirRequestsAndReportOddEvents) {
+TEST_F(TransactionTest, ClientsCountTheirRequestsAndDescribeThemselves) {
     EXPECT_EQ(client().pid(), getpid());
     client().setRequestCount(998);
     LogLines log;
@@ -229,11 +222,6 @@ TEST_F(TransactionTest, ClientsCountTheirRequestsAndReportOddEvents) {
     EXPECT_EQ(std::ranges::count(lines, "ops D: client " + std::to_string(getpid()) +
                                             " used 1000 requests so far"),
               1);
-    deliver(platform::UnknownObject{"[1, 2]"});
-    deliver(ConnectionError{ConnectionError::Kind::Interrupted, "gone"});
-    EXPECT_THAT(log.take(), ElementsAre(HasSubstr("ops E: unexpected message: [1, 2] from: "),
-                                        HasSubstr("ops E: unexpected error type from lum: ")));
-
     EXPECT_THAT(client().description(), HasSubstr(" con=fake pid="));
     auto survivor = std::static_pointer_cast<ZRDLumClient>(connection_->context);
     deliver(ConnectionError{ConnectionError::Kind::Invalid, ""});

@@ -31,6 +31,8 @@ class TransactionTest : public testing::Test {
         services_.launcher = launcher_;
         services_.assertions = assertions_;
         services_.notifications = notifications_;
+        services_.consent = std::make_shared<FakeConsent>();
+        services_.types = std::make_shared<FakeTypes>();
         server_ = ZRDServer::initForService("zrd", std::nullopt, services_);
         ASSERT_TRUE(server_);
         server_->setCacheLimit(100);

@@ -12,6 +12,7 @@
 #include "tests/Zorvan/LogLines.h"
 #include "tests/support/TemporaryDirectory.h"
 #include "tests/zrd/Fakes.h"
+#include "tests/zrd/ProbeTrace.h"
 
 namespace zorvan {
 
@@ -70,11 +71,14 @@ TEST_F(AnnotationStoreTest, WhatCannotBeLoadedIsReportedOnceAndReplacedByTheFirs
     };
     for (const auto& [bytes, reason] : cases) {
         directory_.write("Annotations", bytes);
-        LogLines log;
+        LogLines log(LogLines::Private::Hidden);
+        const ProbeTrace trace;
         open();
         EXPECT_THAT(
             log.take(),
             ElementsAre(
+                StartsWith(*reason == 'P' ? "probe D: db-load PropertyList "
+                                          : "probe D: db-load Zorvan 7"),
                 AllOf(StartsWith("ops E: unable to load annotation database:" + path_ + " error:"),
                       HasSubstr(reason), HasSubstr(" (resetting)"))));
         EXPECT_THAT(store_->annotations(), IsEmpty());
@@ -88,9 +92,10 @@ TEST_F(AnnotationStoreTest, WhatCannotBeLoadedIsReportedOnceAndReplacedByTheFirs
 
 TEST_F(AnnotationStoreTest, AMissingFileIsAnEmptyStore) {
     LogLines log;
+    const ProbeTrace trace;
     open();
     EXPECT_THAT(store_->annotations(), IsEmpty());
-    EXPECT_THAT(log.take(), IsEmpty());
+    EXPECT_THAT(log.take(), ElementsAre("probe D: db-load POSIX 2"));
     EXPECT_FALSE(std::filesystem::exists(path_));
 }
 
@@ -103,6 +108,17 @@ TEST_F(AnnotationStoreTest, ReadsBinaryAndWritesXml) {
     open();
     EXPECT_EQ(store_->annotations(),
               (Dictionary{{"a", Dictionary{{"election", 1}}}, {"b", Dictionary()}}));
+
+    // A control character, which the text could not give back.
+    std::string unstorable(kBinary);
+    unstorable[unstorable.find("Qa") + 1] = '\x01';
+    directory_.write("Annotations", unstorable);
+    LogLines log(LogLines::Private::Hidden);
+    open();
+    EXPECT_THAT(store_->annotations(), IsEmpty());
+    EXPECT_THAT(log.take(), ElementsAre("ops E: leaving out an annotation that cannot be stored: "
+                                        "<private> in " +
+                                        path_));
 }
 
 TEST_F(AnnotationStoreTest, ChangesMergeAndNoneRemoves) {
@@ -156,13 +172,13 @@ TEST_F(AnnotationStoreTest, WhatIsWrittenPieceByPieceIsWhatWouldBeWrittenAtOnce)
 
 TEST_F(AnnotationStoreTest, AFailedSaveKeepsTheChangeForTheNextOne) {
     directory_.makeDirectory("Annotations");  // nothing can be written in its place
-    LogLines log;
+    LogLines log(LogLines::Private::Hidden);
     open();
     log.take();
     auto a = plugIn("a");
     store_->setAnnotation(Dictionary{{"election", 1}}, *a);
-    EXPECT_THAT(log.take(),
-                ElementsAre(StartsWith("ops E: unable to save annotations:" + path_ + " error:")));
+    EXPECT_THAT(log.take(), ElementsAre(StartsWith("ops E: unable to save annotations:" + path_ +
+                                                   " error:" + path_)));
     std::filesystem::remove(path_);
     store_->setAnnotation(Dictionary(), *plugIn("b"));
     EXPECT_TRUE(root().find("data")->dictionary()->contains("a"));
@@ -198,7 +214,8 @@ TEST_F(AnnotationStoreTest, TheDefaultPlaceIsMadePrivateAndItsLackStopsTheDaemon
         }
     };
     EXPECT_THAT(inconsistency(""), HasSubstr("unable to locate user directory: errno "));
-    EXPECT_THAT(inconsistency("/" + std::string(1100, 'x')), HasSubstr("unable to locate"));
+    EXPECT_THAT(inconsistency("/" + std::string(1022, 'x')), HasSubstr("unable to locate"));
+    EXPECT_THAT(inconsistency("/" + std::string(1021, 'x')), StartsWith("unable to create"));
     EXPECT_THAT(inconsistency(directory_.write("file", "")),
                 StartsWith("unable to create plugin annotations directory:"));
 }

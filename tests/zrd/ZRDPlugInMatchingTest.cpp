@@ -22,20 +22,23 @@ class MatchingTest : public testing::Test {
 
     FakeWorld world_;
     std::shared_ptr<platform::TDPlugInProxy> proxy_ =
-        makeProxy("com.a", {{"V", "1.10"},
-                            {"Name", "abc"},
-                            {"Blank", ""},
-                            {"Yes", true},
-                            {"No", false},
-                            {"Zero", 0.0},
-                            {"Two", 2},
-                            {"List", Array{7, "a", "b"}},
-                            {"None", Array{}},
-                            {"Type", "png"},
-                            {"Kind", "image"},
-                            {"Rule", Dictionary{{"image", 2}}},
-                            {"on", "attribute"},
-                            {"off", "attribute"}});
+        makeProxy("com.a",
+                  {{"V", "1.10"},
+                   {"Name", "abc"},
+                   {"Blank", ""},
+                   {"Yes", true},
+                   {"No", false},
+                   {"Zero", 0.0},
+                   {"Two", 2},
+                   {"List", Array{7, "a", "b"}},
+                   {"None", Array{}},
+                   {"Type", "png"},
+                   {"Kind", "image"},
+                   {"Rule", Dictionary{{"image", 2}}},
+                   {"on", "attribute"},
+                   {"off", "attribute"},
+                   {"VXExtensionPointIdentifier", "attribute"}},
+                  {{"VXExtensionPointIdentifier", "plug-in"}});
 };
 
 TEST_F(MatchingTest, EveryOperatorKeyFormAndPatternShape) {
@@ -89,6 +92,8 @@ TEST_F(MatchingTest, EveryOperatorKeyFormAndPatternShape) {
         {"VXExtensionContainingApp", "/Apps/Host.app", true},
         {"VXExtensionContainingApp", false, false}, {"Top", "top", true},
         {"VXUserElection", "0", true}, {"VXUserElection", false, false},
+        {"VXExtensionPointIdentifier", "attribute", true},
+        {"VXExtensionPointIdentifier", "plug-in", false},
     };
     // clang-format on
     for (const auto& [key, pattern, holds] : cases) {

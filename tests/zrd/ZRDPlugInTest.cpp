@@ -24,6 +24,7 @@ class ZRDPlugInTest : public testing::Test {
 TEST_F(ZRDPlugInTest, TakesItsFactsFromTheRegistry) {
     auto proxy = makeProxy("com.a", {{"Color", "red"}}, {{"Key", 3}});
     proxy->registrationDate = {-1.9};
+    proxy->originalIdentifier = "com.original";
     proxy->onSystemPartition = true;
     proxy->entitlements = Dictionary{{"zero", 0}, {"no", "NO"}, {"off", false}};
     auto plugIn = world_.record(proxy);
@@ -31,7 +32,10 @@ TEST_F(ZRDPlugInTest, TakesItsFactsFromTheRegistry) {
     EXPECT_EQ(plugIn->uuid(), proxy->plugInUuid);
     EXPECT_EQ(plugIn->containingPath(), "/Apps/Host.app");
     EXPECT_EQ(plugIn->localizedContainingName(), "Host");
+    EXPECT_EQ(plugIn->originalIdentifier(), "com.original");
     EXPECT_EQ(plugIn->lastModified(), -1);
+    proxy->registrationDate = {2147483648.0};
+    EXPECT_EQ(world_.record(proxy)->lastModified(), INT32_MAX);
     EXPECT_TRUE(plugIn->onSystemVolume());
     EXPECT_EQ(*plugIn->attribute("Color"), Value("red"));
     EXPECT_EQ(*plugIn->pluginKey("Key"), Value(3));
@@ -45,6 +49,29 @@ TEST_F(ZRDPlugInTest, TakesItsFactsFromTheRegistry) {
     EXPECT_EQ(plugIn->localizedName(), "Mine");
     plugIn->setLocalizedContainingName(std::nullopt);
     EXPECT_EQ(plugIn->localizedContainingName(), "Host");
+}
+
+TEST_F(ZRDPlugInTest, AFormHasTheNamesAsTheyAreNow) {
+    const auto plugIn = world_.record(makeProxy("com.a"));
+    using platform::UntouchedBundles;
+    const UntouchedBundles all(std::make_shared<UntouchedBundles::Paths>());
+    const auto name = [&](const char* key) {
+        std::optional<ZRError> error;
+        const auto form = plugIn->completedForm(*plugIn->draftForm(all, error));
+        const Value* found = form.find(key);
+        return found ? describe(*found) : "none";
+    };
+    // One name changes while a form is made.
+    bool isFirst = true;
+    world_.sandbox->onIssue = [&] {
+        if (std::exchange(isFirst, false)) plugIn->setLocalizedName("Name");
+    };
+    EXPECT_EQ(name("localizedDisplayName"), "none");
+    EXPECT_EQ(name("localizedDisplayName"), "Name");
+    plugIn->setLocalizedShortName("N");
+    EXPECT_EQ(name("localizedShortName"), "N");
+    plugIn->setLocalizedContainingName("App");
+    EXPECT_EQ(name("localizedContainingDisplayName"), "App");
 }
 
 TEST_F(ZRDPlugInTest, HubProtocolVersionIsDeclaredOrTellsTheOldStyle) {
@@ -78,10 +105,17 @@ TEST_F(ZRDPlugInTest, RefusesWhatIsMisconfiguredAndSaysWhy) {
                 HasSubstr("missing identifier in plug-in at /Apps/"));
     EXPECT_EQ(refusal([](Proxy& proxy) { proxy.infoPlist = Dictionary(); }),
               "ops I: ignoring mis-configured plug-in at /Apps/Host.app/PlugIns/"
-              "com.a.appex: missing \"VXExtensionAttributes\" key");
-    EXPECT_THAT(refusal([](Proxy& proxy) { proxy.dataContainerPath.reset(); }),
-                HasSubstr("this plug-in has no sandbox data container"));
-    EXPECT_THAT(refusal([](Proxy& proxy) { proxy.containingApplication.reset(); }),
+              "com.a.appex: missing \"VXExtensionAttributes\" key in Info.plist or SDK");
+    for (bool inside : {true, false})
+        EXPECT_THAT(refusal([inside](Proxy& proxy) {
+                        proxy.dataContainerPath.reset();
+                        if (!inside) proxy.containingApplication.reset();
+                    }),
+                    HasSubstr("this plug-in has no sandbox data container"));
+    EXPECT_THAT(refusal([](Proxy& proxy) {
+                    proxy.containingApplication.reset();
+                    proxy.bundlePath = "/Systems/a.appex";
+                }),
                 HasSubstr("plug-ins outside containing apps must be in /System"));
     EXPECT_EQ(refusal([](Proxy& proxy) {
                   proxy.containingApplication.reset();

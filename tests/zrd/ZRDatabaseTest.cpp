@@ -137,16 +137,8 @@ TEST_F(ZRDatabaseTest, SkipsRecordsThatCannotBeUsed) {
     install("lost")->bundlePath.reset();
     install("half")->containingApplication = makeApplication("/Apps/Half.app", true);
     install("bad")->dataContainerPath.reset();
-    LogLines log;
     EXPECT_THAT(find({}), ElementsAre("good"));
     EXPECT_EQ(workspace_->queries, 0);
-    EXPECT_THAT(log.take(), ElementsAre(HasSubstr("td D: 5 installedPlugins: "),
-                                        AllOf(HasSubstr("ops I: skipping td proxy "),
-                                              HasSubstr("with nil bundleURL")),
-                                        AllOf(HasSubstr("ops I: skipping td proxy "),
-                                              HasSubstr("because its app is a placeholder")),
-                                        HasSubstr("ignoring mis-configured plug-in"),
-                                        "ops D: TD reported 1 plug-ins (cache 0/1)"));
     workspace_->queryFails = true;
     const Dictionary query{{"K", "v"}};
     EXPECT_FALSE(database_->findPlugIns(&query));

@@ -18,7 +18,7 @@ std::string describe(const Named& named) {
     return "<" + named.name + ">";
 }
 
-TEST(Log, ACaptureSeesEveryLevelInFull) {
+TEST(Log, ACaptureSeesEveryLevel) {
     const Log& log = Log::make("test", "category");
     EXPECT_EQ(&log, &Log::make("test", "category"));
     EXPECT_NE(&log, &Log::make("other", "category"));
@@ -29,20 +29,25 @@ TEST(Log, ACaptureSeesEveryLevelInFull) {
     auto argument = [&] { return ++evaluated; };
     EVLOG_DEBUG(log, "unseen {}", argument());
     EXPECT_EQ(evaluated, 0);
+    const auto sink = [&](const std::string& category, LogLevel level, const std::string& text) {
+        lines.push_back(fmt::format("{} {} {}", category, static_cast<int>(level), text));
+    };
+    const Named named{"n"};
     {
-        LogCapture capture(
-            [&](const std::string& category, LogLevel level, const std::string& text) {
-                lines.push_back(fmt::format("{} {} {}", category, static_cast<int>(level), text));
-            });
+        const LogCapture capture(sink);
         std::optional<Named> none;
-        const Named named{"n"};
         EVLOG_DEBUG(log, "{} {} {}", argument(), std::string("s"), pub("p"));
         EVLOG_INFO(Log::make("test", "later"), "{} {} {} {}", Named{"a\n"}, none, &named, pub(1.5));
         EVLOG_DEBUG(log, "{:x} {} {}", 255u, static_cast<const char*>(nullptr), Value(true));
     }
     EVLOG_DEBUG(log, "unseen {}", argument());
+    {
+        const LogCapture capture(sink, LogCapture::Private::Hidden);
+        EVLOG_ERROR(log, "{} {} {} {}", 1, "s", named, pub(named));
+    }
     EXPECT_EQ(lines, (std::vector<std::string>{"category 0 1 s p", "later 1 <a\\n> (null) <n> 1.5",
-                                               "category 0 ff (null) true"}));
+                                               "category 0 ff (null) true",
+                                               "category 3 1 <private> <private> <n>"}));
     EXPECT_EQ(evaluated, 1);
 }
 

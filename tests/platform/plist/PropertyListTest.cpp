@@ -7,6 +7,7 @@
 #include <cmath>
 #include <fstream>
 #include <limits>
+#include <sstream>
 
 namespace platform {
 namespace {
@@ -272,43 +273,21 @@ TEST(PropertyList, RefusesBadXml) {
 }
 
 TEST(PropertyList, RefusesXmlThatTheParserWouldReadAsSomethingElse) {
-    for (const char* text : {
-             "<integer>abc</integer>",
-             "<integer>7x</integer>",
-             "<integer/>",
-             "<integer>010</integer>",
-             "<integer>- 1</integer>",
-             "<integer>-9223372036854775809</integer>",
-             "<integer>18446744073709551616</integer>",
-             "<integer>1<!-- -->2</integer>",
-             "<real>x</real>",
-             "<real>+-1</real>",
-             "<real>1,5</real>",
-             "<real>1e999</real>",
-             "<date>rubbish</date>",
-             "<date>2001-02-29T00:00:00Z</date>",
-             "<date>2001-257-01T00:00:00Z</date>",
-             "<date>2001-01-01T00:00:00</date>",
-             "<date>2001-01-01T00:00:00Z0</date>",
-             "<data>!!?</data>",
-             "<data>AAA</data>",
-             "<data>AA=A</data>",
-             "<data>====</data>",
-             "<true>x</true>",
-             "<string>a</strings>",
-             "<string>a<b/></string>",
-             "<array>text</array>",
-             "<array><key>a</key></array>",
-             "<key>a</key>",
-             "<dict><key>a</key></dict>",
-             "<dict><key>a</key><key>b</key><true/></dict>",
-             "<dict><key>a</key><true/><true/></dict>",
-             "<dict><key>a</key><true/><key>a</key><true/></dict>",
-             "<dict><key>a</key><true/><key>&#97;</key><true/></dict>",
-             "<true/><true/>",
-             "<plist><true/></plist>",
-             "</plist><plist><true/>",
-         }) {
+    std::istringstream items(
+        "<integer>abc</integer>|<integer>7x</integer>|<integer/>|<integer>010</integer>|"
+        "<integer>- 1</integer>|<integer>-9223372036854775809</integer>|"
+        "<integer>18446744073709551616</integer>|<integer>1<!-- -->2</integer>|<real>x</real>|"
+        "<real>+-1</real>|<real>1,5</real>|<real>1e999</real>|<date>rubbish</date>|"
+        "<date>2001-02-29T00:00:00Z</date>|<date>2001-257-01T00:00:00Z</date>|"
+        "<date>2001-01-01T00:00:00</date>|<date>2001-01-01T00:00:00Z0</date>|<data>!!?</data>|"
+        "<data>AAA</data>|<data>AA=A</data>|<data>====</data>|<true>x</true>|"
+        "<string>a</strings>|<string>a<b/></string>|<array>text</array>|"
+        "<array><key>a</key></array>|<key>a</key>|<dict><key>a</key></dict>|"
+        "<dict><key>a</key><key>b</key><true/></dict>|<dict><key>a</key><true/><true/></dict>|"
+        "<dict><key>a</key><true/><key>a</key><true/></dict>|"
+        "<dict><key>a</key><true/><key>&#97;</key><true/></dict>|<true/><true/>|"
+        "<plist><true/></plist>|</plist><plist><true/>");
+    for (std::string text; std::getline(items, text, '|');) {
         auto value = parsePropertyList(xml(text));
         EXPECT_FALSE(value) << text << " is " << describe(*value);
     }

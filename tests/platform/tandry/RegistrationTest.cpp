@@ -12,7 +12,7 @@ namespace {
 namespace fs = std::filesystem;
 
 TEST_F(RegistryTest, RegistersByPathAcrossRestarts) {
-    const std::string loose = addPlugIn("opt/Loose.appex", "loose");
+    const std::string loose = addPlugIn("opt/App.appex", "loose");
     const std::string app = addApplication("opt/App.app");
     const std::string inside = addPlugIn("opt/App.app/PlugIns/A.appex", "a");
     addPlugIn("opt/App.app/PlugIns/B.appex", "b");

@@ -15,27 +15,16 @@ TEST(Value, NumbersCompareByValueAndOnlyWithNumbers) {
         Value a, b;
         bool equal;
     };
-    for (const auto& [a, b, equal] : {
-             Case{true, 1, true},
-             Case{false, 0.0, true},
-             Case{true, 2, false},
-             Case{-1, UINT64_MAX, false},
-             Case{UINT64_MAX, 0x1p64, false},
-             Case{INT64_MAX, 0x1p63, false},  // rounding the integer would make them equal
-             Case{std::uint64_t{1} << 63, 0x1p63, true},
-             Case{INT64_MIN, -0x1p63, true},
-             Case{std::uint64_t{1} << 63, above, false},
-             Case{1, 1.5, false},
-             Case{0, std::nan(""), false},
-             Case{1, "1", false},
-             Case{0, Array(), false},
-             Case{Date{1}, 1, false},
-             Case{"a", "a", true},
-             Case{Data("a"), "a", false},
-             Case{Array{1, true}, Array{true, 1.0}, true},
-             Case{Packed(Value(1)), Packed(Value(true)), true},
-             Case{Packed(Value(1)), 1, false},
-         }) {
+    for (const auto& [a, b, equal] :
+         {Case{true, 1, true}, Case{false, 0.0, true}, Case{true, 2, false},
+          Case{-1, UINT64_MAX, false}, Case{UINT64_MAX, 0x1p64, false},
+          Case{INT64_MAX, 0x1p63, false},  // rounding the integer would make them equal
+          Case{std::uint64_t{1} << 63, 0x1p63, true}, Case{INT64_MIN, -0x1p63, true},
+          Case{std::uint64_t{1} << 63, above, false}, Case{1, 1.5, false},
+          Case{0, std::nan(""), false}, Case{1, "1", false}, Case{0, Array(), false},
+          Case{Date{1}, 1, false}, Case{"a", "a", true}, Case{Data("a"), "a", false},
+          Case{Array{1, true}, Array{true, 1.0}, true},
+          Case{Packed(Value(1)), Packed(Value(true)), true}, Case{Packed(Value(1)), 1, false}}) {
         EXPECT_EQ(a == b, equal) << describe(a) << " / " << describe(b);
         EXPECT_EQ(b == a, equal) << describe(b) << " / " << describe(a);
     }
