@@ -18,6 +18,6 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         return std::string();
     }();
     fuzz::home().write(file.substr(fuzz::home().path().size() + 1), fuzz::text(data, size));
-    fuzz::require(assertions->busyInstancesForBundleIdentifiers({"com.fuzz"}).size() == 1);
+    fuzz::require(assertions->busyInstancesForBundleIdentifiers({"com.fuzz"}, "/P").size() == 1);
     return 0;
 }

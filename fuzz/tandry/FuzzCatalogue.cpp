@@ -22,7 +22,7 @@ struct Table {
     std::size_t columns;
 };
 constexpr Table kTables[] = {
-    {"applications", 5}, {"plugins", 17}, {"registrations", 1}, {"forgotten", 4}, {"refusals", 5}};
+    {"applications", 5}, {"plugins", 17}, {"registrations", 1}, {"forgotten", 4}, {"refusals", 6}};
 
 /// Rows have the sums of what they hold by then.
 constexpr const char* kSumUp =
