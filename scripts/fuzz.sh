@@ -42,10 +42,16 @@ run() {
     tried=$(sed -n 's/^stat::number_of_executed_units: *//p' "$out/log/$name")
     if [ "$fault" = none ]; then
         llvm-profdata merge -sparse -o "$out/log/$name.profile" "$out/log/$name.profraw"
-        local attacked
-        mapfile -t attacked < <(sed -n 's|^// Covers: ||p' "$source" | tr ' ' '\n' | sed "s|^|$PWD/|")
-        reached=$(llvm-cov report "$out/fuzz/fuzz_$name" -instr-profile="$out/log/$name.profile" \
-            "${attacked[@]}" | awk '/^TOTAL/ { print $10 }')
+        # The report names files by the ends of their paths.
+        reached=$(llvm-cov report "$out/fuzz/fuzz_$name" -instr-profile="$out/log/$name.profile" |
+            awk -v attacked="$(sed -n 's|^// Covers: ||p' "$source" | tr '\n' ' ')" '
+                BEGIN { count = split(attacked, names, " ") }
+                { for (i = 1; i <= count; ++i)
+                      if (names[i] == $1 || substr(names[i], length(names[i]) - length($1)) == "/" $1) {
+                          lines += $8
+                          missed += $9
+                      } }
+                END { printf "%.1f%%", lines ? 100 * (lines - missed) / lines : 0 }')
     fi
     printf '%-16s %10s %8s   %s\n' "$name" "${tried:--}" "$reached" "$fault" | tee "$out/log/$name.result"
 }

@@ -26,7 +26,7 @@ void exportIt(const PlugInEntry& entry, const TDApplicationProxyRef& application
     const auto plugIn = world.record(entry.record);
     if (!plugIn || plugIn->diagnose()) return;
     std::optional<zorvan::ZRError> error;
-    const auto form = plugIn->form(error);
+    const auto form = plugIn->form({}, error);
     if (!form) return;
     fuzz::require(isPropertyList(Value(*form)));
     std::string bytes;
