@@ -26,8 +26,9 @@ void exportIt(const PlugInEntry& entry, const TDApplicationProxyRef& application
     const auto plugIn = world.record(entry.record);
     if (!plugIn || plugIn->diagnose()) return;
     std::optional<zorvan::ZRError> error;
-    const auto form = plugIn->form({}, error);
-    if (!form) return;
+    auto draft = plugIn->draftForm({}, error);
+    if (!draft) return;
+    const std::optional form = plugIn->completedForm(*std::move(draft));
     fuzz::require(isPropertyList(Value(*form)));
     std::string bytes;
     encodeCbor(*form, bytes);

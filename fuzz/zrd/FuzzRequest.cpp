@@ -1,8 +1,7 @@
-// Requests of one client after another, as they come out of their frames. Each gets one reply, or
-// none when it has been cut off.
+// Requests of one client after another, as they come out of their frames. Each gets one reply.
 // Covers: zrd/Transaction.cpp zrd/MatchRequest.cpp zrd/AnnotationRequests.cpp zrd/LockRequest.cpp
 // Covers: zrd/ReadyAccessRequests.cpp zrd/RegistrationRequests.cpp zrd/MatchResult.cpp
-// Covers: zrd/CandidateGates.cpp
+// Covers: zrd/CandidateGates.cpp zrd/RequestPaths.cpp
 
 #include <future>
 
@@ -49,6 +48,11 @@ struct World {
         reached.get_future().wait();
     }
 
+    void awaitAnswer(zorvan::FakeConnection& connection) const {
+        for (drain(); !connection.isAnswered.exchange(false); drain())
+            services.mainLoop->runOnce(std::chrono::milliseconds(1));
+    }
+
     std::shared_ptr<zorvan::FakeWorkspace> workspace = std::make_shared<zorvan::FakeWorkspace>();
     std::shared_ptr<zorvan::FakeCodeSigning> codeSigning =
         std::make_shared<zorvan::FakeCodeSigning>();
@@ -61,7 +65,9 @@ struct World {
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
     static const World world;
     const auto connection = std::make_shared<zorvan::FakeConnection>();
-    zorvan::ZRDLumClient::initWithConnection(connection, world.server);
+    zorvan::ZRDLumClient::initWithConnection(
+        connection, world.server,
+        zorvan::HostExecutable::of(connection->token, *world.codeSigning));
     std::size_t requests = 0;
     for (const std::string_view part : fuzz::parts(fuzz::text(data, size), 4)) {
         const auto payload = std::make_shared<const std::string>(part);
@@ -70,6 +76,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         if (!message) continue;
         ++requests;
         connection->deliver(*message);
+        world.awaitAnswer(*connection);
     }
     world.drain();
     fuzz::require(connection->sent.size() == requests);

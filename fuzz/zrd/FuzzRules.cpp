@@ -1,6 +1,6 @@
 // Rules that a host sends: they hold when each of them holds, and the registry's index leaves out
 // nothing that they fit.
-// Covers: zrd/ZRDPlugInMatching.cpp Zorvan/Helpers.cpp
+// Covers: zrd/ZRDPlugInMatching.cpp zrd/RuleSet.cpp zrd/TextPatterns.cpp Zorvan/Helpers.cpp
 
 #include <algorithm>
 
