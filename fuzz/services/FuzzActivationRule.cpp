@@ -2,6 +2,8 @@
 // what was accepted before.
 // Covers: platform/services/ActivationRule.cpp
 
+#include <algorithm>
+
 #include "fuzz/Support.h"
 #include "platform/services/Types.h"
 #include "platform/values/Cbor.h"
@@ -10,9 +12,14 @@ using namespace platform;
 
 namespace {
 
+/// Every type descends from what it begins with.
 struct Prefixes final : Types {
-    bool conforms(const std::string& type, const std::string& ancestor) override {
-        return type.starts_with(ancestor);
+    std::string name(const std::string& type) override { return type; }
+    std::vector<std::string> lineage(const std::string& type) override {
+        std::vector<std::string> names;
+        for (std::size_t size = 0; size <= std::min<std::size_t>(type.size(), 32); ++size)
+            names.push_back(type.substr(0, size));
+        return names;
     }
 };
 
@@ -34,9 +41,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     const Array* both = value ? value->array() : nullptr;
     if (!both || both->size() != 2 || !(*both)[1].dictionary()) return 0;
     const Value& rule = (*both)[0];
-    const Dictionary& offer = *(*both)[1].dictionary();
-    const bool accepted = evaluateActivationRule(rule, offer, types);
-    if (accepted && rule.dictionary())
-        fuzz::require(evaluateActivationRule(wider(*rule.dictionary()), offer, types));
+    const ActivationOffer offer(*(*both)[1].dictionary(), types);
+    const bool accepted = offer.isAcceptedBy(rule);
+    if (accepted && rule.dictionary()) fuzz::require(offer.isAcceptedBy(wider(*rule.dictionary())));
     return 0;
 }
