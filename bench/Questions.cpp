@@ -15,7 +15,9 @@ namespace {
 using platform::Dictionary;
 using platform::Value;
 
-/// Every request has the same serial: only one waits at a time on a connection.
+}  // namespace
+
+// Every request has the same serial: only one waits at a time on a connection.
 std::string requestFrame(const Dictionary& body) {
     constexpr std::uint64_t kRequestKind = 0;
     constexpr std::uint64_t kSerial = 1;
@@ -26,6 +28,8 @@ std::string requestFrame(const Dictionary& body) {
     platform::encodeCbor(body, payload);
     return frameOf(payload);
 }
+
+namespace {
 
 std::string matchRequest(const Dictionary& rules) {
     return requestFrame({{zorvan::message::kRequest, zorvan::request::kMatch},
@@ -40,6 +44,8 @@ Question question(std::string key, std::string pattern, std::size_t answers) {
     return {std::move(key), std::move(pattern), answers, std::move(rules), std::move(frame)};
 }
 
+}  // namespace
+
 Dictionary bodyOf(std::string_view frame) {
     auto payload = std::make_shared<const std::string>(frame.substr(kFrameHead));
     const platform::Result<Value> item = platform::decodeCbor(std::move(payload));
@@ -52,6 +58,8 @@ Dictionary bodyOf(std::string_view frame) {
     }
     return *body;
 }
+
+namespace {
 
 const Value* attributeOf(const Value& form, const std::string& key) {
     const Dictionary* plugIn = form.dictionary();

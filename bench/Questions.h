@@ -24,6 +24,11 @@ struct Question {
     static Question ofAll(std::size_t answers);
 };
 
+/// A request with the message `body`, as a frame.
+std::string requestFrame(const platform::Dictionary& body);
+/// The message in a reply frame. Throws a `Failure` with its text when it is an error, or no reply.
+platform::Dictionary bodyOf(std::string_view frame);
+
 /// The request that does nothing ("bulk"), as a frame.
 std::string smallRequest();
 

@@ -7,7 +7,7 @@ packages=(
     cmake ninja-build g++ clang clang-format clang-tidy ccache pkg-config git ca-certificates
     libplist-dev libcbor-dev libssl-dev libsqlite3-dev libasio-dev libsystemd-dev uuid-dev
     libfmt-dev systemtap-sdt-dev libseccomp-dev libcli11-dev nlohmann-json3-dev libgtest-dev libgmock-dev
-    libbenchmark-dev libclang-rt-dev shared-mime-info bubblewrap passt systemd util-linux
+    libbenchmark-dev libclang-rt-dev llvm shared-mime-info bubblewrap passt strace systemd util-linux
     dpkg-dev make
 )
 

@@ -3,10 +3,8 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 
-#include <array>
 #include <optional>
-
-#include "platform/system/UniqueFd.h"
+#include <string>
 
 namespace platform {
 
@@ -17,9 +15,6 @@ struct NamespaceId {
     ino_t inode;
     bool operator==(const NamespaceId&) const = default;
 };
-
-constexpr std::array<NamespaceKind, 4> kKinds{NamespaceKind::User, NamespaceKind::Mount,
-                                              NamespaceKind::Pid, NamespaceKind::Network};
 
 const char* linkName(NamespaceKind kind) {
     switch (kind) {
@@ -35,29 +30,20 @@ const char* linkName(NamespaceKind kind) {
     return "ns/pid";
 }
 
-std::optional<NamespaceId> readId(int procDirectory, NamespaceKind kind) {
+std::optional<NamespaceId> readId(int procDirectory, const std::string& link) {
     struct stat status;
-    if (::fstatat(procDirectory, linkName(kind), &status, 0) != 0) return std::nullopt;
+    if (::fstatat(procDirectory, link.c_str(), &status, 0) != 0) return std::nullopt;
     return NamespaceId{status.st_dev, status.st_ino};
-}
-
-/// This process's namespaces, which it never leaves.
-const std::array<std::optional<NamespaceId>, kKinds.size()>& ownIds() {
-    static const auto ids = [] {
-        std::array<std::optional<NamespaceId>, kKinds.size()> result;
-        const UniqueFd self(::open("/proc/self", O_PATH | O_DIRECTORY | O_CLOEXEC));
-        for (NamespaceKind kind : kKinds)
-            result[static_cast<std::size_t>(kind)] = readId(self.get(), kind);
-        return result;
-    }();
-    return ids;
 }
 
 }  // namespace
 
 bool sharesNamespace(const AuditToken& token, NamespaceKind kind) {
-    const std::optional<NamespaceId> id = readId(token.procDirectory(), kind);
-    return id && id == ownIds()[static_cast<std::size_t>(kind)];
+    const std::string link = linkName(kind);
+    const std::optional<NamespaceId> id = readId(token.procDirectory(), link);
+    // Ours is looked at each time: a look that fails once, for want of memory, must not count for
+    // as long as this process lives. It takes no descriptor, of which others may leave none.
+    return id && id == readId(AT_FDCWD, "/proc/self/" + link);
 }
 
 }  // namespace platform

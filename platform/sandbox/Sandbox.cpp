@@ -47,10 +47,10 @@ Bonds bondsOf(const AuditToken& token) {
     return bondsOf(token.procDirectory(), {true, true});
 }
 
-const Bonds& ownBonds() {
-    static const Bonds own = bondsOf(
-        UniqueFd(::open("/proc/self", O_PATH | O_DIRECTORY | O_CLOEXEC)).get(), {false, false});
-    return own;
+/// Looked at each time: a look that fails once must not count for as long as this process lives.
+Bonds ownBonds() {
+    const UniqueFd self(::open("/proc/self", O_PATH | O_DIRECTORY | O_CLOEXEC));
+    return bondsOf(self.get(), {false, false});
 }
 
 /// Also true when the root of the process cannot be looked into.

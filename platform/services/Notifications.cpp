@@ -40,6 +40,15 @@ std::optional<Error> replaceFile(const std::string& folder, const std::string& n
     return Error::posix(failure, path);
 }
 
+/// 0 without a file, or when it is damaged. Errors: those of `readFile`.
+Result<std::uint64_t> postsIn(const std::string& path) {
+    std::uint64_t count = 0;
+    const Result<std::string> text = readFile(path, 64);
+    if (!text && !isMissingFile(text.error()) && text.error().code != EFBIG) return text.error();
+    if (text) std::from_chars(text->data(), text->data() + text->size(), count);
+    return count;
+}
+
 class FileNotifications final : public Notifications {
   public:
     explicit FileNotifications(const Directories& directories)
@@ -72,10 +81,10 @@ class FileNotifications final : public Notifications {
             unwritten += counted_.extract(name).mapped();
         }
         std::optional<Error> error = makeDirectories(folder_, 0700);
-        if (!error) {
-            const std::uint64_t before = notificationPosts(joinPath(folder_, name));
-            error = replaceFile(folder_, name, std::to_string(before + unwritten));
-        }
+        const Result<std::uint64_t> before = postsIn(joinPath(folder_, name));
+        // Without knowing the count, a new one might be the one that is there.
+        if (!error && !before) error = before.error();
+        if (!error) error = replaceFile(folder_, name, std::to_string(*before + unwritten));
         if (!error) unwritten = 0;
         if (error) EVLOG_ERROR(ops(), "cannot post notification {}: {}", pub(name), pub(*error));
     }
@@ -98,10 +107,8 @@ std::string notificationFolder(const Directories& directories) {
 }
 
 std::uint64_t notificationPosts(const std::string& path) {
-    std::uint64_t count = 0;
-    if (const Result<std::string> text = readFile(path, 64))
-        std::from_chars(text->data(), text->data() + text->size(), count);
-    return count;
+    const Result<std::uint64_t> posts = postsIn(path);
+    return posts ? *posts : 0;
 }
 
 }  // namespace platform

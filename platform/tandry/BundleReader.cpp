@@ -196,6 +196,7 @@ bool BundleReader::appendStamp(const BundleFolder& folder, std::string_view file
                                std::string& stamps) {
     scratch_.assign(folder.name).append("/").append(file);
     const FileStamp stamp = FileStamp::of(folder.dirfd, scratch_.c_str());
+    note(stamp);
     stamp.appendTo(stamps);
     return stamp.exists();
 }
@@ -238,7 +239,9 @@ bool BundleReader::areApplicationStampsLike(std::string_view a, std::string_view
 }
 
 void BundleReader::appendFixedStamps(const BundleFolder& folder, std::string& stamps) {
-    FileIdentity::at(folder.dirfd, folder.name.c_str()).appendTo(stamps);
+    const FileIdentity identity = FileIdentity::at(folder.dirfd, folder.name.c_str());
+    isUnsure_ = isUnsure_ || identity == FileIdentity();
+    identity.appendTo(stamps);
     appendStamp(folder, kInfoPlist, stamps);
     appendStamp(folder, kEntitlements, stamps);
     appendLocalizedStamp(folder, stamps);
@@ -247,8 +250,11 @@ void BundleReader::appendFixedStamps(const BundleFolder& folder, std::string& st
 const std::string& BundleReader::sdkStamps(const std::string& sdk) {
     auto [entry, isNew] = sdkStamps_.try_emplace(sdk);
     if (isNew)
-        for (const std::string& file : sdks_.candidateFiles(sdk))
-            FileStamp::of(file).appendTo(entry->second);
+        for (const std::string& file : sdks_.candidateFiles(sdk)) {
+            const FileStamp stamp = FileStamp::of(file);
+            note(stamp);
+            stamp.appendTo(entry->second);
+        }
     return entry->second;
 }
 
@@ -267,6 +273,17 @@ Fingerprint BundleReader::refreshed(const BundleFolder& folder, Fingerprint prin
     appendFixedStamps(folder, print.stamps);
     appendNamedStamps(folder, print, print.stamps);
     return print;
+}
+
+Fingerprint BundleReader::toRemember(const BundleFolder& folder, const Fingerprint& print) {
+    isUnsure_ = false;
+    sdkStamps_.erase(print.sdk);
+    Fingerprint fresh = refreshed(folder, print);
+    return isUnsure_ ? print : fresh;
+}
+
+void BundleReader::note(const FileStamp& stamp) {
+    isUnsure_ = isUnsure_ || !(stamp.exists() || stamp.isMissing());
 }
 
 BundleReader::Reading BundleReader::readPlugIn(const BundleFolder& place, bool withDigest) {

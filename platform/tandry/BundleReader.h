@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "platform/services/SdkDictionaries.h"
+#include "platform/system/FileStamp.h"
 #include "platform/tandry/DiskWorkspace.h"
 #include "platform/tandry/RegistryState.h"
 
@@ -59,6 +60,9 @@ class BundleReader {
     bool isLike(const Fingerprint& a, const Fingerprint& b) const;
     /// `print` with the stamps that the bundle's files have now.
     Fingerprint refreshed(const BundleFolder& folder, Fingerprint print);
+    /// The same, or `print` itself while something cannot be looked at: for all that is known then,
+    /// it is as it was.
+    Fingerprint toRemember(const BundleFolder& folder, const Fingerprint& print);
 
     /// Reads a plug-in bundle: an Info.plist with a "VXExtension" dictionary and an identifier.
     /// `withDigest` says that the executable is read in any case.
@@ -79,6 +83,8 @@ class BundleReader {
     ApplicationReading readApplication(const BundleFolder& place);
 
   private:
+    /// Remembers when a look at a file has failed.
+    void note(const FileStamp& stamp);
     bool appendStamp(const BundleFolder& folder, std::string_view file, std::string& stamps);
     void appendLocalizedStamp(const BundleFolder& folder, std::string& stamps);
     void appendFixedStamps(const BundleFolder& folder, std::string& stamps);
@@ -100,6 +106,7 @@ class BundleReader {
     std::string languageText_;  // each ended by a NUL
     std::map<std::string, std::string> sdkStamps_;
     std::string scratch_;
+    bool isUnsure_ = false;  // something could not be looked at
 };
 
 }  // namespace platform::tandry

@@ -63,6 +63,7 @@ std::optional<PlugInEntry> plugInOf(const SqliteStatement& row, const RegistrySt
     entry.dictionaries = std::make_shared<const std::string>(row.bytes(16));
     if (entry.infoPlistSize > entry.dictionaries->size()) return std::nullopt;
     if (!record->plugInIdentifier) return std::nullopt;
+    if (!entry.points.empty() && entry.points.back() != '\0') return std::nullopt;
     entry.record = std::move(record);
     entry.attachDictionaries();
     return entry;

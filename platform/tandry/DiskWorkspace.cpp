@@ -372,7 +372,7 @@ bool DiskWorkspace::forgetWithin(const std::string& path, RegistryChanges& chang
     forEachWithin(state_.plugIns, path, [&](auto entry) {
         changes.uninstalled.push_back(entry->second.record);
         BundleFolder folder(entry->first);
-        state_.forgotten[entry->first] = {reader_.refreshed(folder, entry->second.print)};
+        state_.forgotten[entry->first] = {reader_.toRemember(folder, entry->second.print)};
         changes.forgotten.insert(entry->first);
         state_.plugIns.erase(entry);
     });
