@@ -84,7 +84,8 @@ int limitUserNamespace(const UniqueFd& userNamespace) {
 std::string KeeperOrder::encode() const {
     const auto count = static_cast<std::uint32_t>(targets.size());
     std::string bytes(reinterpret_cast<const char*>(&count), sizeof count);
-    bytes.append(reinterpret_cast<const char*>(targets.data()), count * sizeof(int));
+    if (count > 0)
+        bytes.append(reinterpret_cast<const char*>(targets.data()), count * sizeof(int));
     for (const std::string& word : words) bytes.append(word).push_back('\0');
     return bytes;
 }
@@ -97,7 +98,7 @@ std::optional<KeeperOrder> KeeperOrder::decode(std::string_view bytes) {
     bytes.remove_prefix(sizeof count);
     if (count > Parcel::kMostDescriptors || bytes.size() < count * sizeof(int)) return std::nullopt;
     order.targets.resize(count);
-    std::memcpy(order.targets.data(), bytes.data(), count * sizeof(int));
+    if (count > 0) std::memcpy(order.targets.data(), bytes.data(), count * sizeof(int));
     bytes.remove_prefix(count * sizeof(int));
     for (std::size_t end = 0; (end = bytes.find('\0')) != bytes.npos; bytes.remove_prefix(end + 1))
         order.words.emplace_back(bytes.substr(0, end));
