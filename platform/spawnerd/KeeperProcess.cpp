@@ -84,8 +84,7 @@ int limitUserNamespace(const UniqueFd& userNamespace) {
 std::string KeeperOrder::encode() const {
     const auto count = static_cast<std::uint32_t>(targets.size());
     std::string bytes(reinterpret_cast<const char*>(&count), sizeof count);
-    if (count > 0)
-        bytes.append(reinterpret_cast<const char*>(targets.data()), count * sizeof(int));
+    if (count > 0) bytes.append(reinterpret_cast<const char*>(targets.data()), count * sizeof(int));
     for (const std::string& word : words) bytes.append(word).push_back('\0');
     return bytes;
 }

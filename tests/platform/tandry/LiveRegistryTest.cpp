@@ -206,19 +206,21 @@ TEST_F(LiveRegistryTest, WhatCannotBeReadJustNowStaysAndIsReadLater) {
         writePlist(apps + bundle + "/Localized.plist",
                    {{"de", Dictionary{{"QFBundleDisplayName", "Anna"}}}});
     fs::remove_all(at(apps + "A.app/PlugIns/B.appex"));
+    std::vector<std::string> told;
+    bool isSame = true;
     {
         // One more at a time, until there are enough to see into the folder, but not into its
-        // files.
+        // files. Sanitizers need some as well when expectations are judged, which is later.
         FewDescriptors few;
-        std::vector<std::string> told;
         for (std::size_t count = 0; told.empty() && count < FewDescriptors::kMost; ++count) {
             few.allow(count);
             static_cast<void>(registerPlugIn(files.path(apps + "A.app")));
             told = recorder.take();
-            EXPECT_EQ(plugIn("a")->plugInUuid, uuid) << count;
+            isSame = isSame && plugIn("a")->plugInUuid == uuid;
         }
-        EXPECT_THAT(told, ElementsAre("-b"));
     }
+    EXPECT_TRUE(isSame);
+    EXPECT_THAT(told, ElementsAre("-b"));
     ::unsetenv("LC_ALL");
     // The application's names may be read in one walk, the plug-in's in the next.
     ASSERT_TRUE(recorder.waitUntil([&] {
