@@ -22,7 +22,8 @@ namespace platform {
 struct Services {
     Directories directories;
     std::shared_ptr<RunLoop> mainLoop;
-    std::shared_ptr<PeerLooks> looks;       // on that loop
+    std::shared_ptr<PeerLooks> looks;       // at hosts' executables, on that loop
+    std::shared_ptr<PeerLooks> pathLooks;   // at what they name, so that it is in nobody's way
     std::shared_ptr<SdkDictionaries> sdks;  // used by the registry, so it goes after it
     std::shared_ptr<Workspace> workspace;   // null when the registry could not be opened
     std::shared_ptr<CodeSigning> codeSigning;

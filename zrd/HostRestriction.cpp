@@ -6,12 +6,19 @@
 
 namespace zorvan {
 
+namespace {
+
+/// Entitlements are files that the user installed.
+constexpr std::size_t kTimes = 4;
+
+}  // namespace
+
 HostRestriction::HostRestriction(const HostProcess& host,
                                  const std::shared_ptr<platform::Types>& types) {
     const auto value = host.entitlementValueForKey(entitlement::kAllowedPlugIns);
     if (!value) return;
     const platform::Dictionary* rules = value->dictionary();
-    isInvalid_ = !rules || !RuleSet::isAffordable(*rules);
+    isInvalid_ = !rules || !RuleSet::isAffordable(*rules, kTimes);
     if (!isInvalid_) rules_.emplace(*rules, types);
 }
 

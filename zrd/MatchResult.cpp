@@ -56,6 +56,7 @@ bool MatchResult::admit(const ZRDPlugIn& plugIn) {
     constexpr std::uint64_t kKeepAll = ZRDiscoverVersions | ZRDiscoverDuplicates;
     // Where the one that is admitted is put.
     place_ = &byIdentifier_[plugIn.identifier()];
+    beaten_.reset();
     if ((flags_ & kKeepAll) == kKeepAll) return true;
     for (std::size_t index : *place_) {
         Accepted& rival = accepted_[index];
@@ -63,15 +64,24 @@ bool MatchResult::admit(const ZRDPlugIn& plugIn) {
         int order = compareVersions(plugIn.version(), rival.form.find(form::kVersion));
         if ((flags_ & ZRDiscoverVersions) && order != 0) continue;
         rival.displaced = wins(plugIn, rival.form, order);
-        if (rival.displaced) bytes_ -= rival.bytes;
-        return rival.displaced;
+        if (!rival.displaced) return false;
+        bytes_ -= rival.bytes;
+        beaten_ = index;
+        return true;
     }
     return true;
 }
 
 bool MatchResult::append(std::shared_ptr<ZRDPlugIn> plugIn, Dictionary form) {
     const std::size_t bytes = encodedSize(form) + kMarks;
-    if (bytes_ + bytes > platform::lum::kMaxReplyPayload - kFrame) return false;
+    if (bytes_ + bytes > platform::lum::kMaxReplyPayload - kFrame) {
+        // Better the one that it would have beaten than neither.
+        if (beaten_) {
+            accepted_[*beaten_].displaced = false;
+            bytes_ += accepted_[*beaten_].bytes;
+        }
+        return false;
+    }
     bytes_ += bytes;
     std::size_t index = accepted_.size();
     place_->push_back(index);

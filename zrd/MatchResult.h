@@ -3,6 +3,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <unordered_map>
@@ -53,7 +54,8 @@ class MatchResult {
     std::vector<Accepted> accepted_;
     std::size_t bytes_ = 0;  // of the accepted forms that were not displaced
     std::unordered_map<std::string_view, Indexes> byIdentifier_;  // keys of accepted plug-ins
-    Indexes* place_ = nullptr;  // of the plug-in that was admitted last
+    Indexes* place_ = nullptr;           // of the plug-in that was admitted last
+    std::optional<std::size_t> beaten_;  // by it
     /// Who replaces an identifier. It stays so when it is displaced itself.
     std::unordered_map<std::string, std::size_t> replacers_;
 };

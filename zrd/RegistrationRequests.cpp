@@ -32,7 +32,7 @@ void Transaction::processPaths(const RegistryChange& change, std::size_t from) {
             // Handed on, so that nothing of the request goes on this thread.
             server.submitWork([self = std::move(self), path, change, from, isRefused] {
                 if (isRefused) return (self.get()->*change.refuse)(path);
-                if (self->client_->acceptWork()) self->processPaths(change, from + 1);
+                self->processPaths(change, from + 1);
             });
         });
 }

@@ -80,15 +80,15 @@ bool RulePattern::matches(const Value* value) const {
     if (const std::string* text = value->string()) return holds(*texts, *text);
     const Array* elements = value->array();
     if (!elements) return false;
-    const Value* end = elements->begin() + std::min(elements->size(), kMaxElements);
-    return std::any_of(elements->begin(), end, [&](const Value& element) {
+    return std::ranges::any_of(*elements, [&](const Value& element) {
         return element.string() && holds(*texts, *element.string());
     });
 }
 
-bool RuleSet::isAffordable(const Dictionary& rules) {
-    std::size_t bytes = kMaxBytes;
-    return rules.size() <= kMaxRules && platform::countValues(rules, kMaxValues) <= kMaxValues &&
+bool RuleSet::isAffordable(const Dictionary& rules, std::size_t times) {
+    std::size_t bytes = times * kMaxBytes;
+    const std::size_t values = times * kMaxValues;
+    return rules.size() <= times * kMaxRules && platform::countValues(rules, values) <= values &&
            takeBytes(rules, bytes);
 }
 

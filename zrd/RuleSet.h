@@ -19,10 +19,8 @@ class RulePattern {
     /// `types` may be null while the pattern does not speak of types.
     RulePattern(const platform::Value& pattern, const std::shared_ptr<platform::Types>& types);
 
-    /// Whether it holds for a property's value; null: there is none. Of a list so many elements are
-    /// looked at.
+    /// Whether it holds for a property's value; null: there is none.
     bool matches(const platform::Value* value) const;
-    static constexpr std::size_t kMaxElements = 1024;
 
   private:
     struct Present {};
@@ -62,10 +60,11 @@ class RuleSet {
 
     /// Whether rules may be asked of all plug-ins while everybody waits: each rule costs a look at
     /// each plug-in, and reading them costs their bytes.
-    static bool isAffordable(const platform::Dictionary& rules);
+    /// `times` as much may be asked of what is not every stranger's to send.
+    static bool isAffordable(const platform::Dictionary& rules, std::size_t times = 1);
     static constexpr std::size_t kMaxRules = 64;
-    static constexpr std::size_t kMaxValues = 4096;      // those inside others included
-    static constexpr std::size_t kMaxBytes = 64u << 10;  // of keys, strings and data
+    static constexpr std::size_t kMaxValues = 4096;       // those inside others included
+    static constexpr std::size_t kMaxBytes = 256u << 10;  // of keys, strings and data
 
     RuleSet(const platform::Dictionary& rules, const std::shared_ptr<platform::Types>& types);
 

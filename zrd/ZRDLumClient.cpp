@@ -81,7 +81,7 @@ void ZRDLumClient::resolvePaths(const std::shared_ptr<Transaction>& transaction)
     auto client = shared_from_this();
     const auto token = auditToken();
     if (!token) return;  // nobody is there to be answered
-    server_->services().looks->look(
+    server_->services().pathLooks->look(
         platform::Origin::of(*token),
         [client, paths = transaction->paths()](platform::PeerLooks::Pace& pace) {
             paths->resolve(pace, [&] { return client->acceptWork(); });

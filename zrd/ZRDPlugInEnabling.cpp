@@ -112,13 +112,12 @@ std::optional<ZRError> ZRDPlugIn::enableForClient(const HostProcess& host) const
                                             tdproxy_->dataContainerPath.value_or("")};
     const ZRError unable = ZRErrorWithFormat(
         kZRErrorInvalidRequest, "unable to enable plug-in {}({})", identifier(), uuid().string());
-    if (const auto error = context_->workspace->restoreContainer(*tdproxy_)) {
-        EVLOG_ERROR(ops(), "cannot restore the data container of plug-in {}({}): {}", identifier(),
-                    pub(uuid()), pub(*error));
-        return unable;
-    }
     const auto token = host.auditToken();
-    int failure = token ? context_->launcher->addExternalService(*token, service, overlay) : ESRCH;
+    int failure = ESRCH;
+    if (const auto error = context_->workspace->restoreContainer(*tdproxy_))
+        failure = error->code;
+    else if (token)
+        failure = context_->launcher->addExternalService(*token, service, overlay);
     if (failure == 0) return std::nullopt;
     EVLOG_ERROR(ops(),
                 "spawnerd error {} trying to allow {} {} to use plug-in {}({}) uuid={} at {}",
@@ -134,7 +133,12 @@ Dictionary ZRDPlugIn::issueResourceExtensions(const Value& resources) const {
     std::unordered_set<std::string_view> known;
     for (const Value* element = begin; element != end; ++element) {
         const std::string* name = element->string();
-        if (!name || known.size() == kMaxResources || !known.insert(*name).second) continue;
+        if (!name || known.contains(*name)) continue;
+        if (known.size() == kMaxResources) {
+            EVLOG_INFO(ops(), "plug-in at {} shares more than {} resources", path(), kMaxResources);
+            break;
+        }
+        known.insert(*name);
         auto token = context_->sandbox->issueReadExtension(bundle, *name);
         if (token) {
             extensions.set(*name, *std::move(token));

@@ -33,6 +33,7 @@ platform::Services diskServices(const std::string& serviceName,
     services.launcher = platform::makeLauncher(services.directories, serviceName, services.mainLoop,
                                                limits(services.directories));
     services.looks = std::make_shared<platform::PeerLooks>(*services.mainLoop);
+    services.pathLooks = std::make_shared<platform::PeerLooks>(*services.mainLoop);
     services.codeSigning = platform::makeFileCodeSigning();
     services.sandbox =
         platform::makeKernelSandbox(services.directories, serviceName, *services.mainLoop);

@@ -2,6 +2,7 @@
 
 #include <poll.h>
 #include <signal.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -19,6 +20,9 @@ namespace {
 
 constexpr std::size_t kMaxInfo = 4096;
 constexpr int kPatience = 1000;  // milliseconds
+/// Of the program that connects an instance: it takes one for each flow, and a port of the
+/// machine's for each port that a datagram has come from.
+constexpr rlimit kNetworkDescriptors{2048, 2048};
 constexpr std::string_view kFirstProcess = "\"child-pid\":";
 
 void sendKill(const UniqueFd& pidFd) {
@@ -145,6 +149,7 @@ void Instance::connect(const Result<SandboxNamespaces>& namespaces) {
     network_ = std::move(*network);
     // What it takes counts as the instance's, and ends with it.
     group_.add(network_->pid());
+    ::prlimit(network_->pid(), RLIMIT_NOFILE, &kNetworkDescriptors, nullptr);
 }
 
 void Instance::connected(const std::optional<Error>& error) {

@@ -143,7 +143,14 @@ bool KeeperProcess::obey() {
             : start(*order, parcel->descriptors, pidFd);
     const int borrowed = pidFd.get();
     const std::string_view bytes(reinterpret_cast<const char*>(&answer), sizeof answer);
-    return !Parcel::send(socket_.get(), bytes, std::span(&borrowed, pidFd ? 1 : 0));
+    const auto failure = Parcel::send(socket_.get(), bytes, std::span(&borrowed, pidFd ? 1 : 0));
+    if (!failure) return true;
+    if (failure->code == EPIPE || failure->code == ECONNRESET) return false;
+    // Nobody would know of it.
+    if (pidFd) ::syscall(SYS_pidfd_send_signal, pidFd.get(), SIGKILL, nullptr, 0);
+    const KeeperAnswer instead{.error = failure->code, .pid = -1};
+    return !Parcel::send(socket_.get(), {reinterpret_cast<const char*>(&instead), sizeof instead},
+                         {});
 }
 
 KeeperAnswer KeeperProcess::start(const KeeperOrder& order, std::vector<UniqueFd>& descriptors,

@@ -62,6 +62,11 @@ Result<SandboxedProcess> SandboxedProcess::spawn(const Keeper& keeper, const std
     const UniqueFd null(::open("/dev/null", O_RDONLY | O_CLOEXEC));
     if (!file || !filter || !null || !info.open() || !gate.open() || !output.open())
         return Error::posix(errno, "cannot start " + program);
+    // bubblewrap takes the end of the gate's pipe for a word to go on: so it holds the pipe open
+    // itself, and what nobody lets through stays before it.
+    const UniqueFd gateEnd(::open(("/proc/self/fd/" + std::to_string(gate.readEnd.get())).c_str(),
+                                  O_RDWR | O_CLOEXEC));
+    if (!gateEnd) return Error::posix(errno, "cannot start " + program);
     Keeper::Order order{.words = {program, "--args", std::to_string(kArgumentsFd), "--info-fd",
                                   std::to_string(kInfoFd), "--block-fd", std::to_string(kGateFd),
                                   "--seccomp", std::to_string(kFilterFd), "--"},
@@ -71,7 +76,7 @@ Result<SandboxedProcess> SandboxedProcess::spawn(const Keeper& keeper, const std
                                         {connection.get(), kConnectionDescriptor},
                                         {file.get(), kArgumentsFd},
                                         {info.writeEnd.get(), kInfoFd},
-                                        {gate.readEnd.get(), kGateFd},
+                                        {gateEnd.get(), kGateFd},
                                         {filter.get(), kFilterFd}}};
     order.words.insert(order.words.end(), command.begin(), command.end());
     for (int number = kFirstSetupDescriptor; const UniqueFd& descriptor : setup.descriptors)

@@ -62,6 +62,11 @@ constexpr std::uint32_t kHoldingUp[] = {F_SETLEASE, F_NOTIFY};
 /// have none. Resolvers ask it which kinds of addresses there are, and without it try them all.
 constexpr std::uint32_t kFamilies[] = {AF_UNSPEC, AF_UNIX, AF_INET, AF_INET6};
 
+/// Of Unix sockets: senders that wait for a full queue of datagrams can have more descriptors on
+/// their way than a user may have, and then nobody of the user's passes any.
+constexpr std::uint32_t kPiling[] = {SOCK_DGRAM, SOCK_RAW};
+constexpr std::uint32_t kSocketTypes = 0xf;
+
 /// The question which one is set. Others change how memory is laid out, or what is executable.
 constexpr std::uint32_t kPersonalities[] = {0xffffffff};
 
@@ -87,6 +92,9 @@ class Rules {
     }
     void refuseFlag(const char* call, unsigned argument, std::uint32_t flag) {
         refuseBits(call, argument, flag, flag);
+    }
+    void refusePair(const char* call, std::uint32_t first, scmp_arg_cmp second) {
+        add(call, kNo, {scmp_arg_cmp{0, SCMP_CMP_MASKED_EQ, kAllBits, first}, second});
     }
     /// Rules only say what is refused. A value that is not allowed agrees with an allowed one down
     /// to some bit and not in that one: so each rule names a bit, and what is above it.
@@ -155,7 +163,12 @@ Result<std::string> compile() {
     for (const std::uint32_t request : kTyping) rules.refuseValue("ioctl", 1, request);
     for (const char* call : {"fcntl", "fcntl64"})
         for (const std::uint32_t command : kHoldingUp) rules.refuseValue(call, 1, command);
-    for (const char* call : {"socket", "socketpair"}) rules.refuseOthers(call, 0, kFamilies);
+    for (const char* call : {"socket", "socketpair"}) {
+        rules.refuseOthers(call, 0, kFamilies);
+        for (const std::uint32_t type : kPiling)
+            rules.refusePair(call, AF_UNIX,
+                             scmp_arg_cmp{1, SCMP_CMP_MASKED_EQ, kSocketTypes, type});
+    }
     rules.refuseOthers("personality", 0, kPersonalities);
     return rules.compile();
 }

@@ -265,18 +265,25 @@ void DiskWorkspace::makeContainers() {
 
 /// What goes is hidden before its observers hear of it, so that what they drop is not built again;
 /// the catalogue changes after them. What comes is stored before anybody sees it, so that it is
-/// there after a crash as well. Before the first time nobody can have seen what goes, and
-/// observers, who may look up, come last. The error says why nothing was stored.
+/// there after a crash as well; a record that takes another's place takes it at once, so that
+/// nobody finds neither. Before the first time nobody can have seen what goes, and observers, who
+/// may look up, come last. The error says why nothing was stored.
 std::optional<Error> DiskWorkspace::apply(const RegistryChanges& changes) {
     // What had no room may find it where something went.
     const bool mayFit = !changes.uninstalled.empty() && lacksRoom();
     gatherer_->walkEnded(scanner_.isComplete() && !mayFit);
-    const bool isFirst = !published_;
-    if (!isFirst) withdraw(changes.uninstalled);
+    // Those that go, then those that others replace.
+    TDPlugInProxyList going = changes.uninstalled;
+    const auto replaced = std::ranges::stable_partition(going, [this](const auto& record) {
+        return published_ && !state_.plugIns.contains(record->bundlePath.value_or(""));
+    });
+    const TDPlugInProxyList later(replaced.begin(), replaced.end());
+    going.erase(replaced.begin(), replaced.end());
+    withdraw(going);
     std::optional<Error> error = catalogue_->save(state_, changes);
     if (changes.records()) publish(changes);
     published();
-    if (isFirst) announceGoing(changes.uninstalled);
+    announceGoing(later);
     if (!changes.installed.empty())
         for (WorkspaceObserver* observer : observers_)
             observer->pluginsDidInstall(changes.installed);

@@ -152,8 +152,14 @@ TEST_F(HostilePlugIn, IsRefusedArgumentsOfOtherSystemCalls) {
             EXPECT_EQ(call(SYS_personality, {persona | high}), "EPERM") << persona;
     }
     EXPECT_EQ(call(SYS_personality, {0xffffffff}), "ok") << "the question";
-    for (const std::uint64_t family : {AF_UNIX, AF_INET, AF_INET6})
+    for (const std::uint64_t family : {AF_INET, AF_INET6})
         EXPECT_EQ(call(SYS_socket, {family, SOCK_DGRAM}), "ok") << family;
+    EXPECT_EQ(call(SYS_socket, {AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC}), "ok");
+    EXPECT_EQ(call(SYS_socket, {AF_UNIX, SOCK_SEQPACKET}), "ok");
+    for (const std::uint64_t type : {SOCK_DGRAM | SOCK_CLOEXEC, SOCK_RAW | SOCK_NONBLOCK}) {
+        EXPECT_EQ(call(SYS_socket, {AF_UNIX, type}), "EPERM") << type;
+        EXPECT_EQ(call(SYS_socketpair, {AF_UNIX, type}), "EPERM") << type;
+    }
     EXPECT_EQ(call(SYS_ioctl, {0, TIOCGWINSZ}), "ENOTTY");
 }
 

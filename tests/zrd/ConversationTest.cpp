@@ -210,7 +210,7 @@ ops -: denied access to 7 for plugin <private>(refused): the host does not have 
 )");
     workspace_->lostContainers = true;
     EXPECT_THAT(said("ready", {{"uuids", Array{used->plugInUuid}}}), testing::EndsWith(R"(
-ops E: cannot restore the data container of plug-in <private>(used): /: No space left on device (POSIX 28)
+ops E: spawnerd error 28 trying to allow 7 <private> to use plug-in <private>(<private>) uuid=used at <private>
 )"));
     assertions_->reports = {{"com.bundle", Dictionary()},
                             {"com.bundle", {{platform::kAssertionBundleIdentifier, "com.bundle"}}}};

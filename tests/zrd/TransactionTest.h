@@ -24,7 +24,8 @@ class TransactionTest : public testing::Test {
         services_.directories.stateHome = directory_.path("state");
         services_.directories.configHome = directory_.path("config");
         services_.mainLoop = std::make_shared<platform::RunLoop>();
-        services_.looks = std::make_shared<platform::PeerLooks>(*services_.mainLoop);
+        services_.looks = services_.pathLooks =
+            std::make_shared<platform::PeerLooks>(*services_.mainLoop);
         services_.workspace = workspace_;
         services_.codeSigning = codeSigning_;
         services_.sandbox = sandbox_;
