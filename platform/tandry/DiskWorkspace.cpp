@@ -274,11 +274,12 @@ std::optional<Error> DiskWorkspace::apply(const RegistryChanges& changes) {
     gatherer_->walkEnded(scanner_.isComplete() && !mayFit);
     // Those that go, then those that others replace.
     TDPlugInProxyList going = changes.uninstalled;
-    const auto replaced = std::ranges::stable_partition(going, [this](const auto& record) {
-        return published_ && !state_.plugIns.contains(record->bundlePath.value_or(""));
-    });
-    const TDPlugInProxyList later(replaced.begin(), replaced.end());
-    going.erase(replaced.begin(), replaced.end());
+    const auto replaced =
+        std::stable_partition(going.begin(), going.end(), [this](const auto& record) {
+            return published_ && !state_.plugIns.contains(record->bundlePath.value_or(""));
+        });
+    const TDPlugInProxyList later(replaced, going.end());
+    going.erase(replaced, going.end());
     withdraw(going);
     std::optional<Error> error = catalogue_->save(state_, changes);
     if (changes.records()) publish(changes);
