@@ -1,6 +1,7 @@
 // A file system that does not answer, which everybody can have who mounts one of his own.
 
 #include <fcntl.h>
+#include <sched.h>
 #include <sys/mount.h>
 #include <unistd.h>
 
@@ -23,6 +24,10 @@ class HungFileSystem : public SystemTest {
         home_.makeDirectory("hung");
         if (::geteuid() != 0 || ::access("/dev/fuse", R_OK | W_OK) != 0)
             GTEST_SKIP() << "only root mounts what does not answer";
+        // Others look at the mounts as well.
+        if (::unshare(CLONE_NEWNS) != 0 ||
+            ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0)
+            GTEST_SKIP() << "no mount namespaces";
         writePlugIn(plugInPath("A", "steady"), info("steady"));
         start();
     }
