@@ -34,8 +34,8 @@ void reportTermination(platform::Launcher::Status status) {
 ZRDServer::ZRDServer(const platform::Services& services)
     : ZRDatabase(services),
       lumQueue_("lum", *services.mainLoop),
-      registrations_("registration"),
-      mainQueue_("service") {}
+      mainQueue_("service"),
+      registrations_("registration") {}
 
 ZRDServer::~ZRDServer() = default;
 

@@ -87,8 +87,8 @@ class ZRDServer final : public ZRDatabase,
     std::unique_ptr<platform::Listener> service_;
     std::unique_ptr<ZRDUserPrefs> userPrefs_;
     // The last members: they go first, and the work that still waits in them uses the others.
-    platform::SerialQueue registrations_;
     platform::SerialQueue mainQueue_;
+    platform::SerialQueue registrations_;  // ends first: it hands on to the one before
 };
 
 }  // namespace zorvan
