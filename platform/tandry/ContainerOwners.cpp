@@ -30,7 +30,7 @@ constexpr const char* kContainers = "containers";
 std::string ownName(const ContainerClaim& claim, int number) {
     const std::string text =
         claim.identifier + '\0' + claim.place + '\0' + (number ? std::to_string(number) : "");
-    return "." + sha256Text(text);
+    return std::string(1, '.').append(sha256Text(text));
 }
 
 /// Names from the file become parts of paths.
