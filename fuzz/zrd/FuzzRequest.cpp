@@ -7,6 +7,7 @@
 
 #include "fuzz/Support.h"
 #include "platform/lum/Frame.h"
+#include "platform/lum/PeerLooks.h"
 #include "tests/zrd/Fakes.h"
 #include "zrd/ZRDLumClient.h"
 #include "zrd/ZRDServer.h"
@@ -20,6 +21,8 @@ struct World {
     World() {
         services.directories = fuzz::directories();
         services.mainLoop = std::make_shared<RunLoop>();
+        services.looks = services.pathLooks =
+            std::make_shared<platform::PeerLooks>(*services.mainLoop);
         services.workspace = workspace;
         services.codeSigning = codeSigning;
         services.sandbox = std::make_shared<zorvan::FakeSandbox>();
