@@ -59,8 +59,8 @@ class RuleSet {
     };
 
     /// Whether rules may be asked of all plug-ins while everybody waits: each rule costs a look at
-    /// each plug-in, and reading them costs their bytes.
-    /// `times` as much may be asked of what is not every stranger's to send.
+    /// each plug-in, and reading them costs their bytes. `times` as much may be asked of what is
+    /// not every stranger's to send.
     static bool isAffordable(const platform::Dictionary& rules, std::size_t times = 1);
     static constexpr std::size_t kMaxRules = 64;
     static constexpr std::size_t kMaxValues = 4096;       // those inside others included
