@@ -1,0 +1,71 @@
+// The end of a walk: what it has not met goes.
+
+#include <algorithm>
+#include <utility>
+
+#include "platform/system/Files.h"
+#include "platform/tandry/ApplicationScanner.h"
+
+namespace platform::tandry {
+
+bool ApplicationScanner::isAllMet(const std::string& scope) {
+    bool result = true;
+    auto look = [&](auto entry) { result = result && entry->second.pass == pass_; };
+    forEachWithin(state_.applications, scope, look);
+    forEachWithin(state_.plugIns, scope, look);
+    return result;
+}
+
+/// What was forgotten stays so while it cannot be looked at, be it unreadable or on a volume that
+/// is not mounted.
+bool ApplicationScanner::isUnreachable(const std::string& path) const {
+    return std::ranges::any_of(unreachable_,
+                               [&path](const auto& scope) { return isWithin(path, scope); });
+}
+
+/// Drops what lies within `scope` and was not met by this walk.
+void ApplicationScanner::dropUnmet(const std::string& scope) {
+    auto drop = [&](auto& map, auto note) {
+        forEachWithin(map, scope, [&](auto entry) {
+            if (entry->second.pass == pass_) return;
+            note(*entry);
+            map.erase(entry);
+        });
+    };
+    drop(state_.plugIns, [&](auto& entry) { changes_.uninstalled.push_back(entry.second.record); });
+    drop(state_.applications, [&](auto& entry) { changes_.applications.insert(entry.first); });
+    drop(state_.refusals, [&](auto& entry) { changes_.refusals.insert(entry.first); });
+    forEachWithin(state_.forgotten, scope, [&](auto entry) {
+        if (entry->second.pass == pass_ || isUnreachable(entry->first)) return;
+        changes_.forgotten.insert(entry->first);
+        state_.forgotten.erase(entry);
+    });
+    watch_.releaseUnmarked(scope);
+    complaints_.forgetUnmet(scope);
+}
+
+void ApplicationScanner::noteUnwatched(const std::string& scope) {
+    forEachWithin(unwatched_, scope, [this](auto path) { unwatched_.erase(path); });
+    std::string known;
+    forEachWithin(state_.plugIns, scope, [&](auto entry) {
+        if (watch_.seesExchangeOf(entry->first, known))
+            known = entry->first;
+        else
+            unwatched_.insert(entry->first);
+    });
+}
+
+RegistryChanges ApplicationScanner::finish(const Scopes& scopes) {
+    if (!isIncomplete_)
+        for (const std::string& scope : scopes) dropUnmet(scope);
+    else
+        // What the first walk could not reach is there all the same, and is to be seen now.
+        for (auto& [path, entry] : state_.plugIns)
+            if (entry.pass == 0) keep(entry);
+    watch_.endWalk();
+    for (const std::string& scope : scopes) noteUnwatched(scope);
+    containers_.saveOwners();
+    return std::exchange(changes_, {});
+}
+
+}  // namespace platform::tandry
