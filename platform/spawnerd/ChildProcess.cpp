@@ -74,6 +74,7 @@ void ChildProcess::begin(char* const argv[], int failure) const {
 
 Result<pid_t> ChildProcess::run(const std::vector<std::string>& words) const {
     std::vector<char*> argv;
+    argv.reserve(words.size() + 1);
     for (const std::string& word : words) argv.push_back(const_cast<char*>(word.c_str()));
     argv.push_back(nullptr);
     int ends[2];
