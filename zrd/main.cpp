@@ -29,14 +29,14 @@ platform::Services diskServices(const std::string& serviceName,
     platform::Services services;
     services.directories = platform::Directories::fromEnvironment();
     services.mainLoop = std::move(mainLoop);
-    // First, while there are no other threads.
+    // First, while there are no other threads: these fork.
     services.launcher = platform::makeLauncher(services.directories, serviceName, services.mainLoop,
                                                limits(services.directories));
+    services.sandbox =
+        platform::makeKernelSandbox(services.directories, serviceName, *services.mainLoop);
     services.looks = std::make_shared<platform::PeerLooks>(*services.mainLoop);
     services.pathLooks = std::make_shared<platform::PeerLooks>(*services.mainLoop);
     services.codeSigning = platform::makeFileCodeSigning();
-    services.sandbox =
-        platform::makeKernelSandbox(services.directories, serviceName, *services.mainLoop);
     services.assertions = platform::makeFileAssertions(services.directories);
     services.consent = platform::makeFileConsent(services.directories);
     services.notifications = platform::makeFileNotifications(services.directories);

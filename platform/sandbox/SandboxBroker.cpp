@@ -14,7 +14,7 @@
 #include "platform/lum/AuditToken.h"
 #include "platform/lum/Pool.h"
 #include "platform/lum/ServiceSocket.h"
-#include "platform/sandbox/MountChild.h"
+#include "platform/sandbox/MountProcess.h"
 #include "platform/system/Directories.h"
 #include "platform/system/UniqueFd.h"
 #include "platform/threads/RunLoop.h"
@@ -23,10 +23,10 @@ namespace platform {
 
 namespace {
 
-// A peer takes two descriptors and a child process.
+// A peer takes some descriptors and a child process.
 constexpr std::size_t kMostPeers = 32;
 constexpr int kMostAcceptedAtOnce = 32;
-// For a peer to say its token, and then for the child to answer: file systems may be slow.
+// For a peer to say its token, and then for the mount to be made: file systems may be slow.
 constexpr std::chrono::seconds kPatience{5};
 // For a peer to say its token when others wait to be let in.
 constexpr std::chrono::milliseconds kPatienceWhenFull{50};
@@ -42,8 +42,8 @@ struct Peer {
     RunLoop::Watch watch;
     RunLoop::Timer deadline;
     std::string received;
-    std::optional<MountChild> child;  // since it has sent a good token
-    std::optional<RunLoop::Watch> childWatch;
+    UniqueFd outcome;  // of its grant, since it has sent a good token
+    std::optional<RunLoop::Watch> outcomeWatch;
 
     Peer(RunLoop& loop, UniqueFd connected, pid_t process, std::optional<Pool::Share> drawn)
         : socket(std::move(connected)),
@@ -65,6 +65,7 @@ struct Peer {
 struct SandboxBroker::State {
     RunLoop& loop;
     const SandboxTokens tokens;
+    MountProcess mounts;
     lum::ServiceSocket socket;
     RunLoop::Watch watch{loop, socket.fd()};
     RunLoop::Timer pause{loop};
@@ -74,8 +75,9 @@ struct SandboxBroker::State {
 
     using Place = std::list<Peer>::iterator;
 
-    State(RunLoop& runLoop, const SandboxTokens& issued, lum::ServiceSocket listening)
-        : loop(runLoop), tokens(issued), socket(std::move(listening)) {
+    State(RunLoop& runLoop, const SandboxTokens& issued, MountProcess mounting,
+          lum::ServiceSocket listening)
+        : loop(runLoop), tokens(issued), mounts(std::move(mounting)), socket(std::move(listening)) {
         acceptOnceReadable();
     }
 
@@ -133,8 +135,8 @@ bool SandboxBroker::State::drawFor(int connected, std::optional<Pool::Share>& sh
 /// silent for longest goes, now or soon.
 bool SandboxBroker::State::makeRoom() {
     if (peers.size() < kMostPeers) return true;
-    const Place silent = std::find_if(peers.begin(), peers.end(),
-                                      [](const Peer& peer) { return !peer.child.has_value(); });
+    const Place silent =
+        std::find_if(peers.begin(), peers.end(), [](const Peer& peer) { return !peer.outcome; });
     if (silent == peers.end()) return false;
     const auto age =
         std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now() - silent->since);
@@ -173,19 +175,19 @@ void SandboxBroker::State::serve(Place peer, std::string_view token) {
         peer->refuse(EACCES);
         return drop(peer);
     }
-    auto child = MountChild::start(*file, peer->socket.get());
-    if (!child) {
-        peer->refuse(child.error().code);
+    auto outcome = mounts.grant(*file, peer->socket.get());
+    if (!outcome) {
+        peer->refuse(outcome.error().code);
         return drop(peer);
     }
-    peer->child.emplace(std::move(*child));
-    peer->childWatch.emplace(loop, peer->child->pidFd());
-    peer->childWatch->awaitReadable([this, peer] { finish(peer); });
-    peer->deadline.start(kPatience, [peer] { peer->child->kill(); });
+    peer->deadline.cancel();
+    peer->outcome = std::move(*outcome);
+    peer->outcomeWatch.emplace(loop, peer->outcome.get());
+    peer->outcomeWatch->awaitReadable([this, peer] { finish(peer); });
 }
 
 void SandboxBroker::State::finish(Place peer) {
-    if (const int errnum = peer->child->reap()) peer->refuse(errnum);
+    if (const int errnum = MountProcess::outcomeAt(peer->outcome)) peer->refuse(errnum);
     drop(peer);
 }
 
@@ -193,10 +195,12 @@ Result<std::unique_ptr<SandboxBroker>> SandboxBroker::make(const Directories& di
                                                            const std::string& serviceName,
                                                            const SandboxTokens& tokens,
                                                            RunLoop& loop) {
+    auto mounts = MountProcess::make(kPatience);
+    if (!mounts) return mounts.error();
     auto socket = lum::ServiceSocket::make(directories, sandboxServiceName(serviceName));
     if (!socket) return socket.error();
-    return std::unique_ptr<SandboxBroker>(
-        new SandboxBroker(std::make_unique<State>(loop, tokens, std::move(*socket))));
+    return std::unique_ptr<SandboxBroker>(new SandboxBroker(
+        std::make_unique<State>(loop, tokens, std::move(*mounts), std::move(*socket))));
 }
 
 SandboxBroker::SandboxBroker(std::unique_ptr<State> state) : state_(std::move(state)) {}

@@ -13,7 +13,7 @@
 
 #include "platform/log/OpsLog.h"
 #include "platform/lum/Listener.h"
-#include "platform/sandbox/MountChild.h"
+#include "platform/sandbox/MountProcess.h"
 #include "platform/sandbox/SandboxTokens.h"
 #include "platform/system/Directories.h"
 #include "platform/system/UniqueFd.h"
@@ -61,7 +61,7 @@ UniqueFd receiveAnswer(int socket) {
         std::memcpy(&received, CMSG_DATA(header), sizeof received);
     UniqueFd descriptor(received);
     const std::string_view answer(line, static_cast<std::size_t>(count));
-    if (descriptor && answer == MountChild::kGranted) return descriptor;
+    if (descriptor && answer == MountProcess::kGranted) return descriptor;
     errno = std::atoi(std::string(answer).c_str());
     if (errno == 0) errno = ECONNABORTED;
     return {};

@@ -9,7 +9,7 @@
 #include <cstring>
 
 #include "platform/spawnerd/KeeperProcess.h"
-#include "platform/spawnerd/Parcel.h"
+#include "platform/system/Parcel.h"
 
 namespace platform::spawnerd {
 

@@ -11,10 +11,13 @@
 #include "platform/system/Error.h"
 #include "platform/system/UniqueFd.h"
 
+namespace platform {
+struct Parcel;
+}
+
 namespace platform::spawnerd {
 
 struct KeeperOrder;
-struct Parcel;
 
 /// A process beside the daemon that is the parent of all that the launcher starts. It starts what
 /// it is told to, and says how that ended. When the daemon ends, however and at whatever moment, it

@@ -20,8 +20,8 @@
 #include <utility>
 
 #include "platform/spawnerd/ChildProcess.h"
-#include "platform/spawnerd/Parcel.h"
 #include "platform/system/Files.h"
+#include "platform/system/Parcel.h"
 
 namespace platform::spawnerd {
 

@@ -20,7 +20,7 @@
 #include <thread>
 #include <vector>
 
-#include "platform/sandbox/MountChild.h"
+#include "platform/sandbox/MountProcess.h"
 #include "platform/sandbox/Sandbox.h"
 #include "platform/sandbox/SandboxTokens.h"
 #include "platform/system/Files.h"
@@ -354,34 +354,38 @@ TEST_F(SandboxExtension, LeavesNothingBehind) {
     }
 }
 
-bool hangAfterFork = false;
-
-TEST_F(SandboxExtension, AChildThatHangsIsKilled) {
-    ASSERT_EQ(::pthread_atfork(nullptr, nullptr,
-                               [] {
-                                   while (hangAfterFork) ::pause();
-                               }),
-              0);
-    start();  // in a process with threads, as daemons are
+TEST_F(SandboxExtension, WhatTakesTooLongEndsAndAKilledProcessIsReplaced) {
     const auto tokens = SandboxTokens::make("test");
     const auto file = tokens->check(*tokens->issue(test::known(home_.path()), "."));
     int ends[2];
     ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends), 0);
     const UniqueFd mine(ends[0]), other(ends[1]);
-    hangAfterFork = true;
-    {
-        auto first = MountChild::start(*file, mine.get());
-        auto dropped = MountChild::start(*file, mine.get());
-        ASSERT_TRUE(first && dropped);
-        first->kill();
-        EXPECT_EQ(first->reap(), ETIMEDOUT);
-    }
-    hangAfterFork = false;
-    EXPECT_EQ(::waitpid(-1, nullptr, WNOHANG), -1) << "no child is left";
-    auto good = MountChild::start(*file, mine.get());
-    pollfd ended{good->pidFd(), POLLIN, 0};
-    EXPECT_EQ(::poll(&ended, 1, 20'000), 1);
-    EXPECT_EQ(good->reap(), 0);
+    auto process = MountProcess::make(std::chrono::seconds(1));
+    ASSERT_TRUE(process);
+    const auto outcomeOf = [&](const SandboxTokens::File& granted) {
+        const auto outcome = process->grant(granted, mine.get());
+        pollfd told{outcome ? outcome->get() : -1, POLLIN, 0};
+        EXPECT_EQ(::poll(&told, 1, 20'000), 1);
+        return MountProcess::outcomeAt(*outcome);
+    };
+    EXPECT_EQ(outcomeOf(*file), 0);
+    EXPECT_EQ(outcomeOf({file->path, {}}), ESTALE);
+    ::kill(process->pid(), SIGKILL);
+    EXPECT_EQ(::waitid(P_PID, static_cast<id_t>(process->pid()), nullptr, WEXITED | WNOWAIT), 0);
+    EXPECT_EQ(outcomeOf(*file), 0);
+
+    // What does not answer, where that can be had.
+    const UniqueFd fuse(::open("/dev/fuse", O_RDWR | O_CLOEXEC));
+    home_.makeDirectory("hung");
+    const std::string options =
+        "rootmode=40000,user_id=0,group_id=0,fd=" + std::to_string(fuse.get());
+    if (::unshare(CLONE_NEWNS) != 0 ||
+        ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+        ::mount("hung", home_.path("hung").c_str(), "fuse", 0, options.c_str()) != 0)
+        return;
+    process = MountProcess::make(std::chrono::seconds(1));  // it sees the mount
+    EXPECT_EQ(outcomeOf({home_.path("hung/a"), file->identity}), ETIMEDOUT);
+    ::umount2(home_.path("hung").c_str(), MNT_DETACH);
 }
 
 /// Runs in a child: inside a sandbox, or as another user.

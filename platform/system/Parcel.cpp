@@ -1,4 +1,4 @@
-#include "platform/spawnerd/Parcel.h"
+#include "platform/system/Parcel.h"
 
 #include <sys/socket.h>
 
@@ -6,11 +6,11 @@
 #include <cstring>
 #include <utility>
 
-namespace platform::spawnerd {
+namespace platform {
 
 namespace {
 
-constexpr const char* kText = "the process that keeps plug-ins";
+constexpr const char* kText = "a process of the daemon's";
 
 union Control {
     cmsghdr alignment;
@@ -77,4 +77,4 @@ std::optional<Error> Parcel::send(int socket, std::string_view bytes,
     return std::nullopt;
 }
 
-}  // namespace platform::spawnerd
+}  // namespace platform

@@ -9,7 +9,7 @@
 #include "platform/system/Error.h"
 #include "platform/system/UniqueFd.h"
 
-namespace platform::spawnerd {
+namespace platform {
 
 /// Bytes and descriptors that go together over a SOCK_SEQPACKET socket between processes that trust
 /// each other.
@@ -27,4 +27,4 @@ struct Parcel {
                                      std::span<const int> descriptors);
 };
 
-}  // namespace platform::spawnerd
+}  // namespace platform
