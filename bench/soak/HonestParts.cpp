@@ -111,9 +111,9 @@ Work come(const World& world) {
 
 const std::vector<Part>& honestParts() {
     static const std::vector<Part> parts{{"small requests", true, 1, beSmall},
-                                         {"asks and leaves", true, 2, ask},
-                                         {"starts plug-ins", true, 5, start},
-                                         {"holds", true, 10, hold},
+                                         {"asks and leaves", true, 10, ask},
+                                         {"starts plug-ins", true, 100, start},
+                                         {"holds", true, 20, hold},
                                          {"comes and goes", true, 200, come}};
     return parts;
 }

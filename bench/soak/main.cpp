@@ -49,9 +49,9 @@ std::vector<Played> play(const std::vector<const Part*>& parts, const World& wor
     return played;
 }
 
-std::vector<const Part*> everybody() {
+std::vector<const Part*> those(std::initializer_list<const std::vector<Part>*> kinds) {
     std::vector<const Part*> all;
-    for (const auto* parts : {&honestParts(), &hostileParts()})
+    for (const std::vector<Part>* parts : kinds)
         for (const Part& part : *parts) all.push_back(&part);
     return all;
 }
@@ -72,7 +72,8 @@ bool judge(const std::vector<Played>& played, double quiet) {
     const double attacked = played[0].tally.p99;
     return expect(attacked <= kMostSlower * quiet,
                   fmt::format(
-                      "p99 of a small request: {:.0f} µs alone, {:.0f} µs under attack ({:.1f} x)",
+                      "p99 of a small request: {:.0f} µs among honest clients, {:.0f} µs under "
+                      "attack ({:.1f} x)",
                       quiet, attacked, attacked / quiet)) &&
            good;
 }
@@ -84,18 +85,20 @@ bool soak(double minutes) {
     ::setenv("XDG_RUNTIME_DIR", world.runtimeDirectory().c_str(), 1);
     const Child daemon = world.startDaemon();
     waitForSocket(world.socketPath(), daemon);
-    play(everybody(), world, daemon, kWarmUpSeconds);
+    const auto everybody = those({&honestParts(), &hostileParts()});
+    play(everybody, world, daemon, kWarmUpSeconds);
     daemon.waitUntilIdle();
 
-    const Played alone = play({&honestParts()[0]}, world, daemon, kQuietSeconds)[0];
-    if (*alone.tally.failure) fail("a client alone: {}", alone.tally.failure);
+    // The other honest ones use the processors, too: what is asked is what the attack adds.
+    const Played quiet = play(those({&honestParts()}), world, daemon, kQuietSeconds)[0];
+    if (*quiet.tally.failure) fail("nobody attacks, and yet: {}", quiet.tally.failure);
     daemon.waitUntilIdle();
     const std::size_t descriptors = descriptorsOf(daemon);
     const double memory = daemon.residentMegabytes();
-    const auto played = play(everybody(), world, daemon, minutes * 60);
+    const auto played = play(everybody, world, daemon, minutes * 60);
     daemon.waitUntilIdle();
 
-    bool good = judge(played, alone.tally.p99);
+    bool good = judge(played, quiet.tally.p99);
     const std::size_t nowDescriptors = descriptorsOf(daemon);
     good = expect(nowDescriptors == descriptors,
                   fmt::format("descriptors: {} before, {} now", descriptors, nowDescriptors)) &&

@@ -1,13 +1,29 @@
 #include "platform/lum/Decoder.h"
 
+#include <sys/resource.h>
+
 #include <utility>
 
 namespace platform::lum {
 
+namespace {
+
+/// Who sends much waits rather than everybody else: where processors are few, the other threads go
+/// first.
+constexpr int kNice = 5;
+
+std::unique_ptr<SerialQueue> makeQueue() {
+    auto queue = std::make_unique<SerialQueue>("decoder");
+    queue->async([] { ::setpriority(PRIO_PROCESS, 0, kNice); });  // Linux: of this thread
+    return queue;
+}
+
+}  // namespace
+
 void Decoder::async(const Origin& origin, Work work) {
     std::lock_guard lock(mutex_);
     if (closed_) return;
-    if (!queue_) queue_ = std::make_unique<SerialQueue>("decoder");
+    if (!queue_) queue_ = makeQueue();
     auto& line = lines_[origin];
     if (line.empty()) turns_.push_back(origin);
     line.push_back(std::move(work));
