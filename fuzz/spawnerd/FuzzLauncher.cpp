@@ -38,7 +38,8 @@ struct Service {
         settle();
     }
     void settle() {
-        while (loop->poll() > 0) continue;
+        // What is looked at elsewhere comes back a little later.
+        while (loop->runOnce(std::chrono::milliseconds(1))) continue;
     }
 
     std::shared_ptr<RunLoop> loop = std::make_shared<RunLoop>();

@@ -124,6 +124,19 @@ Result<UniqueFd> openContainer(const Directories& directories, const std::string
     return container;
 }
 
+Result<GrantedPlaces> GrantedPlaces::open(const Grant& grant, const Directories& directories) {
+    GrantedPlaces places;
+    if (!grant.container.empty()) {
+        auto container = openContainer(directories, grant.container);
+        if (!container) return container.error();
+        places.container = std::move(*container);
+    }
+    auto bundle = grant.bundle.open();
+    if (!bundle) return bundle.error();
+    places.bundle = std::move(*bundle);
+    return places;
+}
+
 Result<Grant> Grant::make(const Directories& directories, const ExternalService& service,
                           const Dictionary& overlay) {
     const Result<UniqueFd> bundle = service.bundle.open();

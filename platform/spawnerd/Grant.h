@@ -45,6 +45,17 @@ struct Grant {
                               const Dictionary& overlay);
 };
 
+/// What a grant names, open (O_PATH): bound into a sandbox it is what was looked at, whatever
+/// happens to its name.
+struct GrantedPlaces {
+    UniqueFd bundle;
+    UniqueFd container;  // none when the plug-in has none
+
+    /// Both were checked when the grant was made, and may have been exchanged since. Hangs with
+    /// their file systems. Errors: those of `KnownDirectory::open` and `openContainer`.
+    static Result<GrantedPlaces> open(const Grant& grant, const Directories& directories);
+};
+
 /// Opens (O_PATH) a data container. Errors: the system's; EINVAL when the path is not one below
 /// this user's containers; EXDEV when it leads out of them, ELOOP or ENOTDIR for a symbolic link
 /// there, EPERM for a directory of somebody else.

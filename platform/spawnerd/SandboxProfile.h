@@ -17,6 +17,7 @@ struct Directories;
 namespace spawnerd {
 
 struct Grant;
+struct GrantedPlaces;
 
 /// A kind of sandbox that plug-ins run in.
 struct SandboxProfile {
@@ -42,17 +43,15 @@ struct Surroundings {
 /// What bubblewrap is started with.
 struct SandboxSetup {
     std::vector<std::string> arguments;  // up to the command
-    /// What the arguments bind by descriptor, so that it is what was looked at, whatever happens to
-    /// its name; numbered from `kFirstSetupDescriptor` on.
+    /// What the arguments bind by descriptor, numbered from `kFirstSetupDescriptor` on.
     std::vector<UniqueFd> descriptors;
 };
 
-/// The setup for a granted plug-in of the daemon of a service name. Everything that confines it is
-/// decided here; docs/bundles.md tells authors what they see. Errors: the bundle is not in its
-/// place any more (see `KnownDirectory::open`); the data container is not a directory of this
-/// user's own any more.
-Result<SandboxSetup> sandboxSetup(const Grant& grant, const Directories& directories,
-                                  const std::string& daemonService,
+/// The setup for a granted plug-in, with what its grant names, of the daemon of a service name.
+/// Everything that confines it is decided here; docs/bundles.md tells authors what they see. Error:
+/// the system's.
+Result<SandboxSetup> sandboxSetup(const Grant& grant, GrantedPlaces places,
+                                  const Directories& directories, const std::string& daemonService,
                                   const Surroundings& surroundings);
 
 }  // namespace spawnerd

@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <csignal>
 #include <utility>
 
 #include "platform/log/OpsLog.h"
@@ -38,6 +39,12 @@ Result<std::vector<std::string>> argumentsIn(const Message& message) {
         arguments.push_back(*text);
     }
     return arguments;
+}
+
+/// A plug-in that is not started is one that was never made ready, or is not ready any more.
+Error notReady(const std::string& executable) {
+    EVLOG_INFO(ops(), "refusing to start {}: it was not made ready for its host", executable);
+    return Error::posix(EPERM, "this process may not start " + executable);
 }
 
 template <class Asked>
@@ -85,6 +92,7 @@ SpawnService::SpawnService(Directories directories, std::string daemonService,
       programs_(std::move(programs)),
       keeper_(Keeper::make()),
       queue_("spawnerd", *loop_),
+      looks_(*loop_),
       pool_(kMaxInstances),
       shutDownTimer_(*loop_) {}
 
@@ -171,20 +179,52 @@ void SpawnService::start(const Host& host, const Asked& asked) {
     const auto arguments = argumentsIn(asked.message);
     if (!arguments) return refuse(asked, arguments.error());
     auto grant = host ? hosts_->grant(host, *executable) : nullptr;
-    if (!grant) {
-        EVLOG_INFO(ops(), "refusing to start {}: it was not made ready for its host", *executable);
-        return refuse(asked, Error::posix(EPERM, "this process may not start " + *executable));
-    }
+    if (!grant) return refuse(asked, notReady(*executable));
     auto share = drawFor(host);
     if (!share) return refuse(asked, share.error());
-    Running running;
+    const std::uint64_t id = ++lastId_;
+    Running& running = instances_[id];
     running.share = std::move(*share);
     running.host = host;
     running.grant = std::move(grant);
+    running.arguments = *arguments;
     running.starting = asked;
-    if (auto error = spawn(++lastId_, std::move(running), *arguments)) {
-        EVLOG_ERROR(ops(), "cannot start {}: {}", *executable, pub(*error));
-        refuse(asked, *error);
+    open(id);
+}
+
+void SpawnService::open(std::uint64_t id) {
+    const Running& running = instances_.at(id);
+    const auto& grant = running.grant;
+    auto places = std::make_shared<std::optional<Result<GrantedPlaces>>>();
+    looks_.look(
+        Origin::of(running.host->token),
+        [places, grant, &directories = directories_](PeerLooks::Pace&) {
+            places->emplace(GrantedPlaces::open(*grant, directories));
+        },
+        [places, grant, id, weak = weak_from_this()](bool isDone, std::size_t) {
+            auto self = weak.lock();
+            if (!self) return;
+            if (isDone) return self->opened(id, std::move(**places));
+            self->opened(id, Error::posix(ETIMEDOUT, grant->bundle.path));
+        });
+}
+
+void SpawnService::opened(std::uint64_t id, Result<GrantedPlaces> places) {
+    const auto found = instances_.find(id);
+    if (found == instances_.end()) return;  // it was ended meanwhile
+    Running& running = found->second;
+    // Without the connection over which it was asked for, nobody could ever speak to it.
+    if (running.starting->connection.expired()) return end(id);
+    auto grant = hosts_->grant(running.host, running.grant->executable);
+    if (!grant) return fail(id, notReady(running.grant->executable));
+    if (grant != running.grant) {
+        // It was made ready anew, perhaps in another place.
+        running.grant = std::move(grant);
+        return open(id);
+    }
+    if (auto error = places ? spawn(id, std::move(*places)) : places.error()) {
+        EVLOG_ERROR(ops(), "cannot start {}: {}", running.grant->executable, pub(*error));
+        fail(id, *error);
     }
 }
 
@@ -196,9 +236,9 @@ Allowance SpawnService::allowanceFor(const Running& running) const {
     return allowance;
 }
 
-std::optional<Error> SpawnService::spawn(std::uint64_t id, Running running,
-                                         const std::vector<std::string>& plugInArguments) {
+std::optional<Error> SpawnService::spawn(std::uint64_t id, GrantedPlaces places) {
     if (!keeper_) return keeper_.error();
+    Running& running = instances_.at(id);
     const Grant& grant = *running.grant;
     auto busyFolder = BusyFolder::make(directories_, grant.bundleIdentifier, grant.bundle.path);
     if (!busyFolder) return busyFolder.error();
@@ -208,7 +248,8 @@ std::optional<Error> SpawnService::spawn(std::uint64_t id, Running running,
     running.busyFolder.emplace(std::move(*busyFolder));
     auto group = groups_.make(id, allowance.limits);
     if (!group) return group.error();
-    const auto setup = sandboxSetup(grant, directories_, daemonService_, surroundings);
+    const auto setup =
+        sandboxSetup(grant, std::move(places), directories_, daemonService_, surroundings);
     if (!setup) return setup.error();
     int ends[2];
     if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) != 0)
@@ -217,14 +258,13 @@ std::optional<Error> SpawnService::spawn(std::uint64_t id, Running running,
     const UniqueFd plugInEnd(ends[1]);
 
     std::vector<std::string> command{grant.executable};
-    command.insert(command.end(), plugInArguments.begin(), plugInArguments.end());
+    command.insert(command.end(), running.arguments.begin(), running.arguments.end());
     auto process =
         SandboxedProcess::spawn(*keeper_, programs_.bubblewrap, *setup, command, plugInEnd);
     if (!process) return process.error();
     running.instance = std::make_unique<Instance>(
         *loop_, *keeper_, programs_.pasta, std::move(*process), grant.bundleIdentifier, allowance,
         std::move(*group), [this, id] { runs(id); }, [this, id](int status) { ended(id, status); });
-    instances_.emplace(id, std::move(running));
     return std::nullopt;
 }
 
@@ -233,7 +273,7 @@ void SpawnService::runs(std::uint64_t id) {
     EVLOG_INFO(ops(), "client {} has started plug-in {} as instance {}", running.host->token.pid(),
                running.grant->bundleIdentifier, id);
     // Without the connection over which it was asked for, nobody could ever speak to it.
-    if (running.starting->connection.expired()) return running.instance->kill();
+    if (running.starting->connection.expired()) return end(id);
     Message message = Message::replyTo(running.starting->message);
     message.set(kInstance, id);
     message.setDescriptor(std::move(running.connection));
@@ -259,27 +299,47 @@ void SpawnService::awaitEnd(const Host& host, const Asked& asked, bool kill) {
     Asked later{asked.connection, {}};
     later.message.setSerial(asked.message.serial());
     running.waiters.push_back([later](int status) { replyStatus(later, status); });
-    if (kill) running.instance->kill();
+    if (kill) end(*id);
+}
+
+std::vector<std::uint64_t> SpawnService::instancesWith(
+    const std::function<bool(const Running&)>& property) const {
+    std::vector<std::uint64_t> found;
+    for (const auto& [id, running] : instances_)
+        if (property(running)) found.push_back(id);
+    return found;
+}
+
+void SpawnService::end(std::uint64_t id) {
+    if (const auto& instance = instances_.at(id).instance) return instance->kill();
+    ended(id, 128 + SIGKILL);
+}
+
+void SpawnService::fail(std::uint64_t id, const Error& error) {
+    refuse(*std::exchange(instances_.at(id).starting, std::nullopt), error);
+    ended(id, 128 + SIGKILL);
 }
 
 void SpawnService::ended(std::uint64_t id, int status) {
     auto node = instances_.extract(id);
     Running& running = node.mapped();
-    EVLOG_INFO(ops(), "instance {} of plug-in {} has ended with status {}", id,
-               running.grant->bundleIdentifier, status);
     running.busyFolder.reset();
     if (running.starting)
         refuse(*running.starting, Error::posix(EIO, "the sandbox of " + running.grant->executable));
-    auto& last = running.host->ended;
-    last.emplace_back(id, status);
-    if (last.size() > kMaxEndedPerHost) last.pop_front();
+    if (running.instance) {
+        EVLOG_INFO(ops(), "instance {} of plug-in {} has ended with status {}", id,
+                   running.grant->bundleIdentifier, status);
+        auto& last = running.host->ended;
+        last.emplace_back(id, status);
+        if (last.size() > kMaxEndedPerHost) last.pop_front();
+    }
     for (const Waiter& waiter : running.waiters) waiter(status);
     if (shutDownDone_ && instances_.empty()) finishShutDown();
 }
 
 void SpawnService::hostDied(const Host& host) {
-    for (auto& [id, running] : instances_)
-        if (running.host == host) running.instance->kill();
+    for (const auto id : instancesWith([&](const Running& one) { return one.host == host; }))
+        end(id);
 }
 
 void SpawnService::terminate(const std::function<bool(const Grant&)>& which,
@@ -289,16 +349,16 @@ void SpawnService::terminate(const std::function<bool(const Grant&)>& which,
     queue_.async([weak = weak_from_this(), which, completion = std::move(completion)] {
         auto self = weak.lock();
         if (!self) return;
-        auto left = std::make_shared<std::size_t>(0);
-        for (auto& [id, running] : self->instances_) {
-            if (!which(*running.grant)) continue;
-            ++*left;
-            running.waiters.push_back([left, completion](int) {
+        const auto found =
+            self->instancesWith([&](const Running& one) { return which(*one.grant); });
+        if (found.empty()) return completion(false);
+        auto left = std::make_shared<std::size_t>(found.size());
+        for (const auto id : found) {
+            self->instances_.at(id).waiters.push_back([left, completion](int) {
                 if (--*left == 0) completion(true);
             });
-            running.instance->kill();
+            self->end(id);
         }
-        if (*left == 0) completion(false);
     });
 }
 
@@ -306,7 +366,7 @@ void SpawnService::shutDown(std::function<void()> completion) {
     queue_.assertCurrent();
     listener_.reset();
     shutDownDone_ = std::move(completion);
-    for (auto& [id, running] : instances_) running.instance->kill();
+    for (const auto id : instancesWith([](const Running&) { return true; })) end(id);
     if (instances_.empty()) return finishShutDown();
     shutDownTimer_.start(kShutDownPatience, [this] { finishShutDown(); });
 }

@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "platform/lum/Listener.h"
+#include "platform/lum/PeerLooks.h"
 #include "platform/lum/Pool.h"
 #include "platform/sandbox/BusyFolder.h"
 #include "platform/spawnerd/GrantedHosts.h"
@@ -72,11 +73,12 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     struct Running {
         Host host;
         std::shared_ptr<const Grant> grant;
+        std::vector<std::string> arguments;
         std::optional<Pool::Share> share;      // of the instances that there may be
         std::optional<BusyFolder> busyFolder;  // from its start on
         std::optional<Asked> starting;         // until it is answered
         UniqueFd connection;                   // the host's end, until then
-        std::unique_ptr<Instance> instance;
+        std::unique_ptr<Instance> instance;    // null while its places are being opened
         std::vector<Waiter> waiters;
     };
 
@@ -86,12 +88,20 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     void accept(const std::shared_ptr<Connection>& connection);
     void serve(const Host& host, const Asked& asked);
     void start(const Host& host, const Asked& asked);
-    std::optional<Error> spawn(std::uint64_t id, Running running,
-                               const std::vector<std::string>& plugInArguments);
+    /// Opens what the grant of an instance names, where only its host waits for it.
+    void open(std::uint64_t id);
+    void opened(std::uint64_t id, Result<GrantedPlaces> places);
+    std::optional<Error> spawn(std::uint64_t id, GrantedPlaces places);
     /// What the grant allows, as narrow as the host is.
     Allowance allowanceFor(const Running& running) const;
     void runs(std::uint64_t id);
     void awaitEnd(const Host& host, const Asked& asked, bool kill);
+    std::vector<std::uint64_t> instancesWith(
+        const std::function<bool(const Running&)>& property) const;
+    /// Ends an instance. One that was not started yet is gone at once.
+    void end(std::uint64_t id);
+    /// Refuses what was asked for, and forgets it.
+    void fail(std::uint64_t id, const Error& error);
     void ended(std::uint64_t id, int status);
     void hostDied(const Host& host);
     /// Draws from the instances that there may be; the error says that there are too many.
@@ -105,6 +115,7 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     const Programs programs_;
     const Result<Keeper> keeper_;  // parent of all instances, and so goes after them
     SerialQueue queue_;
+    PeerLooks looks_;
     std::shared_ptr<GrantedHosts> hosts_;  // set once, before this object is shared
     std::unique_ptr<Listener> listener_;
     InstanceGroups groups_;

@@ -47,7 +47,7 @@ class HungFileSystem : public SystemTest {
     }
     void expectService() {
         const auto start = std::chrono::steady_clock::now();
-        EXPECT_THAT(match(), ElementsAre("steady 1"));
+        EXPECT_THAT(match({{"VXExtensionIdentifier", "steady"}}), ElementsAre("steady 1"));
         EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(1));
     }
 
@@ -94,6 +94,36 @@ TEST_F(HungFileSystem, AHostOnItHoldsUpItselfAlone) {
     EXPECT_TRUE(waitUntil([&] { return host->out() != "ready"; }));
     EXPECT_THAT(host->out(), HasSubstr("matches")) << "it is served, if with nothing";
     EXPECT_EQ(zrd_->errLines("goes without bundle and entitlements"), 1u);
+}
+
+TEST_F(HungFileSystem, APlugInOnItHoldsUpWhoStartsItAlone) {
+    Dictionary plugIn = info("hung");
+    plugIn.set("QFBundleExecutable", "run");
+    const std::string bundle = writePlugIn("hung/H.app/PlugIns/hung.appex", plugIn);
+    std::filesystem::copy_file("/bin/true", bundle + "/run");
+    ASSERT_EQ(add({bundle}), "");
+    const auto found = forms({{"VXExtensionIdentifier", "hung"}});
+    const auto uuid = platform::Uuid::parse(*found.at(0).find("uuid")->string()).value();
+    ASSERT_EQ(
+        errorOf(ask([&](auto& client, auto& reply) { client.readyPlugIns({uuid}, 0, reply); })),
+        "");
+    hang();
+    const std::string service = socket_ + ".spawnerd";
+    const std::string request =
+        RawClient::request({{"request", "start"}, {"executable", bundle + "/run"}});
+    RawClient starting(service), ending(service);
+    starting.send(request);
+    for (int i = 0; i < 20; ++i) expectService();
+    // A number that it can only have guessed.
+    ending.send(RawClient::request({{"request", "terminate"}, {"instance", 1}}));
+    EXPECT_THAT(ending.receive(), HasSubstr("status"));
+    EXPECT_THAT(starting.receive(), HasSubstr("the sandbox of " + bundle));
+    { RawClient(service).send(request); }  // gone before it is answered
+    starting.send(request);
+    for (int i = 0; i < 20; ++i) expectService();
+    EXPECT_THAT(starting.receive(), HasSubstr(bundle + ": Connection timed out"));
+    EXPECT_EQ(zrd_->errLines("cannot start " + bundle), 1u);
+    starting.send(request);
 }
 
 }  // namespace

@@ -206,6 +206,7 @@ TEST_F(LauncherTest, AContainerThatLeadsElsewhereIsRefusedAlsoLater) {
     EXPECT_EQ(number(start(executable), kErrorCode), ENOTDIR);
     const std::string busy = directories.zorvanRuntime() + "/tenurd";
     std::filesystem::remove(place);
+    container("one");
     std::filesystem::remove_all(busy);
     std::filesystem::create_directories(busy);
     std::filesystem::create_directory_symlink(home.path(), busy + "/one");
@@ -273,6 +274,7 @@ TEST_F(LauncherTest, BadRequestsAreAnsweredAndTheConnectionGoesOn) {
     EXPECT_EQ(number(ask({{"request", "terminate"}, {"instance", 1}}), kErrorCode), ESRCH);
     EXPECT_EQ(number(start(executable, "text"), kErrorCode), EINVAL);
     EXPECT_EQ(number(start(executable, Array{1}), kErrorCode), EINVAL);
+    EXPECT_TRUE(start(executable, Array{"a\0b"s}).contents().empty()) << "it is not even sent";
     EXPECT_EQ(number(start(executable, Array{std::string(kMaxStringBytes + 1, 'x')}), kErrorCode),
               E2BIG);
     EXPECT_EQ(number(start(home.path("one.appex/other")), kErrorCode), EPERM);
