@@ -1,4 +1,5 @@
 #include <cstdlib>
+#include <functional>
 #include <utility>
 
 #include "Zorvan/Keys.h"
@@ -23,15 +24,17 @@ platform::LauncherSettings limits(const platform::Directories& directories) {
     };
 }
 
-/// The services of this machine. Without a registry the server cannot be constructed.
+/// The services of this machine. Without a registry the server cannot be constructed. `failed` is
+/// the launcher's.
 platform::Services diskServices(const std::string& serviceName,
-                                std::shared_ptr<platform::RunLoop> mainLoop) {
+                                std::shared_ptr<platform::RunLoop> mainLoop,
+                                std::function<void()> failed) {
     platform::Services services;
     services.directories = platform::Directories::fromEnvironment();
     services.mainLoop = std::move(mainLoop);
     // First, while there are no other threads: these fork.
     services.launcher = platform::makeLauncher(services.directories, serviceName, services.mainLoop,
-                                               limits(services.directories));
+                                               limits(services.directories), std::move(failed));
     services.sandbox =
         platform::makeKernelSandbox(services.directories, serviceName, *services.mainLoop);
     services.looks = std::make_shared<platform::PeerLooks>(*services.mainLoop);
@@ -64,10 +67,14 @@ int main(int argc, char* argv[]) {
     if (!options) return 2;
     const auto mainLoop = std::make_shared<platform::RunLoop>();
     platform::Services services;
+    int status = EXIT_SUCCESS;
+    const auto end = [&] { services.launcher->shutDown([&] { mainLoop->stop(); }); };
     // Before there are other threads; heard once the loop runs.
-    const platform::TerminationWatch termination(
-        *mainLoop, [&] { services.launcher->shutDown([&] { mainLoop->stop(); }); });
-    services = diskServices(options->serviceName, mainLoop);
+    const platform::TerminationWatch termination(*mainLoop, end);
+    services = diskServices(options->serviceName, mainLoop, [&] {
+        status = EXIT_FAILURE;  // for whoever starts the daemon anew
+        end();
+    });
     auto server =
         zorvan::ZRDServer::initForService(options->serviceName, options->databasePath, services);
     if (!server) {
@@ -82,5 +89,5 @@ int main(int argc, char* argv[]) {
     services.notifications->finish();
     // What is on disk is whole at any moment. A request that a slow disk holds up must not hold up
     // the end as well, so nothing else is waited for.
-    std::_Exit(EXIT_SUCCESS);
+    std::_Exit(status);
 }

@@ -45,7 +45,7 @@ struct Service {
     std::shared_ptr<RunLoop> loop = std::make_shared<RunLoop>();
     // There is no bubblewrap here: a start fails where a process would be made.
     std::shared_ptr<SpawnService> service = SpawnService::make(
-        fuzz::directories(), "zrd", loop, nullptr, {"/nonexistent", "/nonexistent"});
+        fuzz::directories(), "zrd", loop, nullptr, nullptr, {"/nonexistent", "/nonexistent"});
     std::string executable;
     const std::string socket = *lum::socketPath(fuzz::directories(), serviceNameFor("zrd"));
 };

@@ -2,7 +2,9 @@
 
 #include <fcntl.h>
 #include <sys/socket.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <csignal>
@@ -27,11 +29,17 @@ Result<Keeper> Keeper::make() {
     const int failure = errno;
     ::pthread_sigmask(SIG_SETMASK, &before, nullptr);
     if (pid < 0) return Error::posix(failure, "fork");
-    return Keeper(pid, std::move(ours));
+    UniqueFd pidFd(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
+    const int unwatched = pidFd ? 0 : errno;
+    Keeper keeper(pid, std::move(pidFd), std::move(ours));
+    if (unwatched != 0) return Error::posix(unwatched, "pidfd_open");
+    return keeper;
 }
 
 Keeper::Keeper(Keeper&& other) noexcept
-    : pid_(std::exchange(other.pid_, 0)), socket_(std::move(other.socket_)) {}
+    : pid_(std::exchange(other.pid_, 0)),
+      pidFd_(std::move(other.pidFd_)),
+      socket_(std::move(other.socket_)) {}
 
 Keeper::~Keeper() {
     if (pid_ == 0) return;

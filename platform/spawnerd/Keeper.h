@@ -49,6 +49,8 @@ class Keeper {
     ~Keeper();
 
     pid_t pid() const { return pid_; }
+    /// Readable once the process has ended. Borrows.
+    const UniqueFd& pidFd() const { return pidFd_; }
 
     /// Returns once the program runs. Error: the system's, also that it could not be run; EPIPE
     /// when the keeper is gone.
@@ -63,11 +65,13 @@ class Keeper {
     static std::optional<int> statusAt(const UniqueFd& end);
 
   private:
-    Keeper(pid_t pid, UniqueFd socket) : pid_(pid), socket_(std::move(socket)) {}
+    Keeper(pid_t pid, UniqueFd pidFd, UniqueFd socket)
+        : pid_(pid), pidFd_(std::move(pidFd)), socket_(std::move(socket)) {}
 
     Result<Parcel> ask(const KeeperOrder& order, std::span<const int> descriptors) const;
 
     pid_t pid_;  // 0 once moved from
+    UniqueFd pidFd_;
     UniqueFd socket_;
 };
 

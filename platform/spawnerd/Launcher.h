@@ -77,10 +77,13 @@ using LauncherSettings = std::function<std::optional<Value>(const std::string& k
 /// that it was told of, which ask for it on a service of its own (docs/protocol.md). It forks a
 /// process that its instances belong to, so it is best made before there are threads. It listens
 /// from the loop's first turn; when it cannot, an error line says so and nothing is ever started.
+/// `failed` is called on the loop, once, should that process end before the launcher: with it its
+/// instances have ended, and no more can be started. An error line has said so.
 ///
 /// It goes where `loop` runs or while it does not run, and takes its instances along.
 std::unique_ptr<Launcher> makeLauncher(const Directories& directories,
                                        const std::string& daemonService,
-                                       std::shared_ptr<RunLoop> loop, LauncherSettings settings);
+                                       std::shared_ptr<RunLoop> loop, LauncherSettings settings,
+                                       std::function<void()> failed);
 
 }  // namespace platform

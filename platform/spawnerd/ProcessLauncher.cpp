@@ -25,10 +25,10 @@ class CountedMarker final : public Launcher::WorkMarker {
 
 ProcessLauncher::ProcessLauncher(const Directories& directories, const std::string& daemonService,
                                  std::shared_ptr<RunLoop> loop, LauncherSettings settings,
-                                 Programs programs)
+                                 std::function<void()> failed, Programs programs)
     : outstanding_(std::make_shared<std::atomic<int>>(0)),
       service_(SpawnService::make(directories, daemonService, std::move(loop), std::move(settings),
-                                  std::move(programs))) {
+                                  std::move(failed), std::move(programs))) {
     // Not before the daemon runs: only then does its name, and so this one, belong to it.
     service_->queue().async([weak = std::weak_ptr(service_)] {
         if (auto service = weak.lock()) service->listen();
@@ -71,9 +71,10 @@ void ProcessLauncher::shutDown(std::function<void()> completion) {
 
 std::unique_ptr<Launcher> makeLauncher(const Directories& directories,
                                        const std::string& daemonService,
-                                       std::shared_ptr<RunLoop> loop, LauncherSettings settings) {
+                                       std::shared_ptr<RunLoop> loop, LauncherSettings settings,
+                                       std::function<void()> failed) {
     return std::make_unique<spawnerd::ProcessLauncher>(directories, daemonService, std::move(loop),
-                                                       std::move(settings));
+                                                       std::move(settings), std::move(failed));
 }
 
 }  // namespace platform

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <atomic>
+#include <functional>
 #include <memory>
 #include <string>
 
@@ -14,7 +15,7 @@ class ProcessLauncher final : public Launcher {
   public:
     ProcessLauncher(const Directories& directories, const std::string& daemonService,
                     std::shared_ptr<RunLoop> loop, LauncherSettings settings = nullptr,
-                    Programs programs = {});
+                    std::function<void()> failed = nullptr, Programs programs = {});
 
     int addExternalService(const AuditToken& host, const ExternalService& service,
                            const Dictionary& overlay) override;

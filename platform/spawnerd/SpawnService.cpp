@@ -1,5 +1,6 @@
 #include "platform/spawnerd/SpawnService.h"
 
+#include <poll.h>
 #include <sys/socket.h>
 
 #include <algorithm>
@@ -71,10 +72,11 @@ void replyStatus(const Asked& asked, int status) {
 
 std::shared_ptr<SpawnService> SpawnService::make(Directories directories, std::string daemonService,
                                                  std::shared_ptr<RunLoop> loop,
-                                                 LauncherSettings settings, Programs programs) {
+                                                 LauncherSettings settings,
+                                                 std::function<void()> failed, Programs programs) {
     std::shared_ptr<SpawnService> service(
         new SpawnService(std::move(directories), std::move(daemonService), std::move(loop),
-                         std::move(settings), std::move(programs)));
+                         std::move(settings), std::move(failed), std::move(programs)));
     service->hosts_ = std::make_shared<GrantedHosts>(
         service->queue_, [weak = std::weak_ptr(service)](const Host& host) {
             if (auto self = weak.lock()) self->hostDied(host);
@@ -84,11 +86,12 @@ std::shared_ptr<SpawnService> SpawnService::make(Directories directories, std::s
 
 SpawnService::SpawnService(Directories directories, std::string daemonService,
                            std::shared_ptr<RunLoop> loop, LauncherSettings settings,
-                           Programs programs)
+                           std::function<void()> failed, Programs programs)
     : directories_(std::move(directories)),
       daemonService_(std::move(daemonService)),
       loop_(std::move(loop)),
       settings_(std::move(settings)),
+      failed_(std::move(failed)),
       programs_(std::move(programs)),
       keeper_(Keeper::make()),
       queue_("spawnerd", *loop_),
@@ -116,6 +119,8 @@ void SpawnService::listen() {
         EVLOG_ERROR(ops(), "no plug-in will be started: {}", pub(keeper_.error()));
         return;
     }
+    keeperWatch_.emplace(*loop_, keeper_->pidFd().get());
+    watchKeeper();
     groups_ = InstanceGroups::find({::getpid(), keeper_->pid()});
     if (groups_.areThere())
         EVLOG_DEFAULT(ops(), "plug-ins are limited by groups of their own");
@@ -124,6 +129,15 @@ void SpawnService::listen() {
                       "plug-ins are limited by process, without a limit of memory{}: no group"
                       " of processes is delegated to this daemon",
                       pub(::geteuid() == 0 ? " or processes" : ""));
+}
+
+void SpawnService::watchKeeper() {
+    keeperWatch_->awaitReadable([this] {
+        pollfd state{keeper_->pidFd().get(), POLLIN, 0};
+        if (::poll(&state, 1, 0) <= 0) return watchKeeper();
+        EVLOG_ERROR(ops(), "the process that keeps plug-ins has ended, and they with it");
+        if (failed_) failed_();
+    });
 }
 
 int SpawnService::grant(const AuditToken& host, const ExternalService& service,

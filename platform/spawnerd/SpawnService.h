@@ -38,7 +38,8 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
   public:
     static std::shared_ptr<SpawnService> make(Directories directories, std::string daemonService,
                                               std::shared_ptr<RunLoop> loop,
-                                              LauncherSettings settings, Programs programs);
+                                              LauncherSettings settings,
+                                              std::function<void()> failed, Programs programs);
     SpawnService(const SpawnService&) = delete;
     /// Ends the instances. On the loop, or where it does not run.
     ~SpawnService();
@@ -83,8 +84,9 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     };
 
     SpawnService(Directories directories, std::string daemonService, std::shared_ptr<RunLoop> loop,
-                 LauncherSettings settings, Programs programs);
+                 LauncherSettings settings, std::function<void()> failed, Programs programs);
 
+    void watchKeeper();
     void accept(const std::shared_ptr<Connection>& connection);
     void serve(const Host& host, const Asked& asked);
     void start(const Host& host, const Asked& asked);
@@ -112,6 +114,7 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     const std::string daemonService_;
     const std::shared_ptr<RunLoop> loop_;
     const LauncherSettings settings_;
+    const std::function<void()> failed_;
     const Programs programs_;
     const Result<Keeper> keeper_;  // parent of all instances, and so goes after them
     SerialQueue queue_;
@@ -124,6 +127,7 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     std::map<std::uint64_t, Running> instances_;
     std::function<void()> shutDownDone_;  // while a shut-down waits for the instances
     RunLoop::Timer shutDownTimer_;
+    std::optional<RunLoop::Watch> keeperWatch_;
 };
 
 }  // namespace platform::spawnerd

@@ -2,6 +2,7 @@
 
 #include <cerrno>
 #include <csignal>
+#include <fstream>
 
 #include "tests/system/PlugInTest.h"
 
@@ -106,6 +107,25 @@ TEST_F(Hold, TheEndOfTheDaemonIsTheEndOfAllThatItStarted) {
         for (const char* suffix : {"", ".sandbox", ".spawnerd"})
             EXPECT_EQ(std::filesystem::exists(socket_ + suffix), signal == SIGKILL) << suffix;
     }
+}
+
+TEST_F(Hold, TheEndOfTheProcessThatKeepsPlugInsIsTheDaemonsToo) {
+    NEEDS_BUBBLEWRAP();
+    EXPECT_EQ(ready(uuid_), "");
+    const auto running = startPlugIn();
+    ASSERT_TRUE(running) << zrd_->err();
+    const std::string number = std::to_string(zrd_->pid());
+    std::ifstream children("/proc/" + number + "/task/" + number + "/children");
+    std::string child, name;
+    while (name != "zrd-keeper" && children >> child)
+        std::ifstream("/proc/" + child + "/comm") >> name;
+    ASSERT_EQ(name, "zrd-keeper");
+    ::kill(std::stoi(child), SIGKILL);
+    EXPECT_EQ(zrd_->wait(), 1);
+    EXPECT_EQ(zrd_->errLines("the process that keeps plug-ins has ended"), 1u);
+    EXPECT_TRUE(hasClosed(*running));
+    EXPECT_FALSE(std::filesystem::exists(socket_));
+    zrd_.reset();
 }
 
 }  // namespace

@@ -30,7 +30,7 @@ class LauncherTest : public lum::LumTest {
         launcher.reset();
         launcher.emplace(
             directories, "test", std::shared_ptr<RunLoop>(&loop, [](RunLoop*) {}),
-            [this](const auto& key) { return Value(*settings.find(key)); }, programs);
+            [this](const auto& key) { return Value(*settings.find(key)); }, nullptr, programs);
         loop.poll();
         connection.emplace(directories, "test.spawnerd", queue);
         connection->resume();
