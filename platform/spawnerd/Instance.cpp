@@ -121,7 +121,7 @@ void Instance::awaitInfo() {
     if (isDoomed_ || !first_) return kill();
     const auto namespaces = SandboxNamespaces::of(firstPid(), first_);
     if (!limit(namespaces)) return kill();
-    if (allowance_.network) return connect(namespaces);
+    if (allowance_.network) return connect(*namespaces);
     pass();
 }
 
@@ -130,20 +130,16 @@ pid_t Instance::firstPid() const {
 }
 
 bool Instance::limit(const Result<SandboxNamespaces>& namespaces) const {
-    const auto failure = namespaces ? keeper_.limit(namespaces->user) : namespaces.error();
-    if (failure)
-        EVLOG_ERROR(ops(), "cannot limit what plug-in {} uses of the user's: {}", name_,
-                    pub(*failure));
-    if (setProcessLimits(firstPid(), allowance_.limits) && group_.add(process_.child.pid) &&
-        group_.add(firstPid()))
-        return true;
-    EVLOG_ERROR(ops(), "cannot limit a plug-in: {}", pub(Error::posix(errno, name_)));
-    return false;
+    auto failure = namespaces ? keeper_.limit(namespaces->user) : namespaces.error();
+    if (!failure && !(setProcessLimits(firstPid(), allowance_.limits) &&
+                      group_.add(process_.child.pid) && group_.add(firstPid())))
+        failure = Error::posix(errno, name_);
+    if (failure) EVLOG_ERROR(ops(), "cannot limit plug-in {}: {}", name_, pub(*failure));
+    return !failure;
 }
 
-void Instance::connect(const Result<SandboxNamespaces>& namespaces) {
-    if (!namespaces) return connected(namespaces.error());
-    auto network = InstanceNetwork::connect(loop_, keeper_, pasta_, *namespaces,
+void Instance::connect(const SandboxNamespaces& namespaces) {
+    auto network = InstanceNetwork::connect(loop_, keeper_, pasta_, namespaces,
                                             [this](const auto& error) { connected(error); });
     if (!network) return connected(network.error());
     network_ = std::move(*network);

@@ -45,7 +45,7 @@ class Instance {
     /// Sets the limits on the sandbox's first process, which waits at the gate; false, with an
     /// error line, when that cannot be done.
     bool limit(const Result<SandboxNamespaces>& namespaces) const;
-    void connect(const Result<SandboxNamespaces>& namespaces);
+    void connect(const SandboxNamespaces& namespaces);
     void connected(const std::optional<Error>& error);
     void pass();
     void watchFirst();

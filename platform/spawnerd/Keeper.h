@@ -57,7 +57,7 @@ class Keeper {
     Result<Child> run(const Order& order) const;
 
     /// Bounds what the processes of a user namespace, one below this process's, may use of what the
-    /// kernel counts by user. Error: the system's; what the kernel does not count is no error.
+    /// kernel counts by user. Error: the system's; what this kernel does not count is none.
     std::optional<Error> limit(const UniqueFd& userNamespace) const;
 
     /// What a child's `end` has told: its exit status, or 128 and the number of the signal that

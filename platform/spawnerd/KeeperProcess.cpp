@@ -57,23 +57,35 @@ void endAll() {
     } while (::waitpid(-1, nullptr, 0) > 0);
 }
 
+/// A file of the kernel's, which shows each namespace its own, and what is written there.
+using Setting = std::pair<const char*, std::string_view>;
+
 /// What the kernel counts by user, with bounds that leave the user the greater part.
-constexpr std::pair<const char*, std::string_view> kUserLimits[] = {
+constexpr Setting kUserLimits[] = {
     {"/proc/sys/user/max_inotify_instances", "16"},
     {"/proc/sys/user/max_inotify_watches", "8192"},
 };
 
-/// In a child: who has entered a user namespace does not come back. Answers 0 or an errno.
-int limitUserNamespace(const UniqueFd& userNamespace) {
-    const pid_t pid = ::fork();
-    if (pid == 0) {
-        if (::setns(userNamespace.get(), CLONE_NEWUSER) != 0) ::_exit(errno);
-        for (const auto& [path, bound] : kUserLimits) {
-            const UniqueFd file(::open(path, O_WRONLY | O_CLOEXEC));
-            (void)!::write(file.get(), bound.data(), bound.size());
-        }
-        ::_exit(0);
+/// What the kernel does not have needs no bound. Answers 0 or an errno.
+int apply(std::span<const Setting> settings) {
+    for (const auto& [path, value] : settings) {
+        const UniqueFd file(::open(path, O_WRONLY | O_CLOEXEC));
+        if (!file && errno == ENOENT) continue;
+        if (!file || ::write(file.get(), value.data(), value.size()) < 0) return errno;
     }
+    return 0;
+}
+
+int enterAndLimit(const UniqueFd& userNamespace) {
+    if (::setns(userNamespace.get(), CLONE_NEWUSER) != 0) return errno;
+    return apply(kUserLimits);
+}
+
+/// In a child: who has entered a user namespace does not come back. Not by the library's fork, in
+/// which threads may be started: who has more than one cannot enter. Answers 0 or an errno.
+int limitUserNamespace(const UniqueFd& userNamespace) {
+    const auto pid = static_cast<pid_t>(::syscall(SYS_clone, SIGCHLD, 0, 0, 0, 0));
+    if (pid == 0) ::_exit(enterAndLimit(userNamespace));
     int status = 0;
     if (pid < 0 || ::waitpid(pid, &status, 0) != pid) return errno;
     return WIFEXITED(status) ? WEXITSTATUS(status) : EIO;
