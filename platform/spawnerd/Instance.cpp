@@ -130,7 +130,8 @@ pid_t Instance::firstPid() const {
 }
 
 bool Instance::limit(const Result<SandboxNamespaces>& namespaces) const {
-    auto failure = namespaces ? keeper_.limit(namespaces->user) : namespaces.error();
+    auto failure =
+        namespaces ? keeper_.limit(*namespaces, allowance_.network) : Error(namespaces.error());
     if (!failure && !(setProcessLimits(firstPid(), allowance_.limits) &&
                       group_.add(process_.child.pid) && group_.add(firstPid())))
         failure = Error::posix(errno, name_);

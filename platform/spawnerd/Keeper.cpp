@@ -11,6 +11,7 @@
 #include <cstring>
 
 #include "platform/spawnerd/KeeperProcess.h"
+#include "platform/spawnerd/SandboxNamespaces.h"
 #include "platform/system/Parcel.h"
 
 namespace platform::spawnerd {
@@ -84,9 +85,9 @@ Result<Keeper::Child> Keeper::run(const Order& order) const {
     return child;
 }
 
-std::optional<Error> Keeper::limit(const UniqueFd& userNamespace) const {
-    const int descriptor = userNamespace.get();
-    const Result<Parcel> answer = ask({}, std::span(&descriptor, 1));
+std::optional<Error> Keeper::limit(const SandboxNamespaces& namespaces, bool isConnected) const {
+    const int descriptors[] = {namespaces.user.get(), namespaces.network.get()};
+    const Result<Parcel> answer = ask({}, std::span(descriptors, isConnected ? 2 : 1));
     return answer ? std::nullopt : std::optional(answer.error());
 }
 

@@ -18,6 +18,7 @@ struct Parcel;
 namespace platform::spawnerd {
 
 struct KeeperOrder;
+struct SandboxNamespaces;
 
 /// A process beside the daemon that is the parent of all that the launcher starts. It starts what
 /// it is told to, and says how that ended. When the daemon ends, however and at whatever moment, it
@@ -56,9 +57,10 @@ class Keeper {
     /// when the keeper is gone.
     Result<Child> run(const Order& order) const;
 
-    /// Bounds what the processes of a user namespace, one below this process's, may use of what the
-    /// kernel counts by user. Error: the system's; what this kernel does not count is none.
-    std::optional<Error> limit(const UniqueFd& userNamespace) const;
+    /// Bounds what the processes of a sandbox may use of what the kernel counts by user, and, when
+    /// it is to be connected, which ports they may take. Error: the system's; what this kernel does
+    /// not count is none.
+    std::optional<Error> limit(const SandboxNamespaces& namespaces, bool isConnected) const;
 
     /// What a child's `end` has told: its exit status, or 128 and the number of the signal that
     /// ended it (SIGKILL for one that went with the keeper). None when there is nothing yet.

@@ -66,6 +66,15 @@ constexpr Setting kUserLimits[] = {
     {"/proc/sys/user/max_inotify_watches", "8192"},
 };
 
+/// The ports that a connected sandbox may take, and is given when it does not say which: what it
+/// sends from one goes out from the machine's port of that number. No service has one of these by
+/// assignment, and by default no client of the machine's is given one. The second may not exceed
+/// the beginning of the first.
+constexpr Setting kPorts[] = {
+    {"/proc/sys/net/ipv4/ip_local_port_range", "61000 65535"},
+    {"/proc/sys/net/ipv4/ip_unprivileged_port_start", "61000"},
+};
+
 /// What the kernel does not have needs no bound. Answers 0 or an errno.
 int apply(std::span<const Setting> settings) {
     for (const auto& [path, value] : settings) {
@@ -76,16 +85,19 @@ int apply(std::span<const Setting> settings) {
     return 0;
 }
 
-int enterAndLimit(const UniqueFd& userNamespace) {
-    if (::setns(userNamespace.get(), CLONE_NEWUSER) != 0) return errno;
-    return apply(kUserLimits);
+int enterAndLimit(std::span<const UniqueFd> namespaces) {
+    if (::setns(namespaces[0].get(), CLONE_NEWUSER) != 0) return errno;
+    const int error = apply(kUserLimits);
+    if (error != 0 || namespaces.size() == 1) return error;
+    if (::setns(namespaces[1].get(), CLONE_NEWNET) != 0) return errno;
+    return apply(kPorts);
 }
 
 /// In a child: who has entered a user namespace does not come back. Not by the library's fork, in
 /// which threads may be started: who has more than one cannot enter. Answers 0 or an errno.
-int limitUserNamespace(const UniqueFd& userNamespace) {
+int limit(std::span<const UniqueFd> namespaces) {
     const auto pid = static_cast<pid_t>(::syscall(SYS_clone, SIGCHLD, 0, 0, 0, 0));
-    if (pid == 0) ::_exit(enterAndLimit(userNamespace));
+    if (pid == 0) ::_exit(enterAndLimit(namespaces));
     int status = 0;
     if (pid < 0 || ::waitpid(pid, &status, 0) != pid) return errno;
     return WIFEXITED(status) ? WEXITSTATUS(status) : EIO;
@@ -147,12 +159,13 @@ void KeeperProcess::serve() {
 bool KeeperProcess::obey() {
     Result<Parcel> parcel = Parcel::receive(socket_.get());
     const auto order = parcel ? KeeperOrder::decode(parcel->bytes) : std::nullopt;
-    if (!order || parcel->descriptors.size() != order->targets.size() + 1) return false;
+    const std::size_t count = parcel ? parcel->descriptors.size() : 0;
+    if (!order || count == 0 || (!order->words.empty() && count != order->targets.size() + 1))
+        return false;
     UniqueFd pidFd;
-    const KeeperAnswer answer =
-        order->words.empty()
-            ? KeeperAnswer{.error = limitUserNamespace(parcel->descriptors.front()), .pid = -1}
-            : start(*order, parcel->descriptors, pidFd);
+    const KeeperAnswer answer = order->words.empty()
+                                    ? KeeperAnswer{.error = limit(parcel->descriptors), .pid = -1}
+                                    : start(*order, parcel->descriptors, pidFd);
     const int borrowed = pidFd.get();
     const std::string_view bytes(reinterpret_cast<const char*>(&answer), sizeof answer);
     const auto failure = Parcel::send(socket_.get(), bytes, std::span(&borrowed, pidFd ? 1 : 0));

@@ -15,7 +15,8 @@
 namespace platform::spawnerd {
 
 /// What goes to the keeper: a program to be started, with the pipe for its status first among the
-/// descriptors; without words, a user namespace to be limited, the one descriptor.
+/// descriptors; without words, a sandbox to be limited: its user namespace, and its network
+/// namespace behind that when it is to be connected.
 struct KeeperOrder {
     std::vector<int> targets;  // of the descriptors behind the first
     std::vector<std::string> words;

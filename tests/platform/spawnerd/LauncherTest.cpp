@@ -107,6 +107,20 @@ TEST_F(NetworkTest, AProgramThatFailsLeavesThePlugInWithoutOne) {
     EXPECT_EQ(errorLines("starts without a network"), 2u);
 }
 
+/// A datagram leaves from the machine's port of the number that it left the sandbox from.
+TEST_F(NetworkTest, TakesNoPortThatIsAServicesOrAClientsOfTheMachine) {
+    usePasta("echo $$ >&2\nexec sleep 1000");
+    const std::string executable =
+        plugIn("one",
+               "exec perl -MIO::Socket::INET -e '$, = \" \"; print map { "
+               "IO::Socket::INET->new(Proto => \"udp\", LocalPort => $_) ? \"yes\" : \"no\""
+               "} 53, 5353, 60999, 61000; print \"\", IO::Socket::INET->new(Proto => \"udp\","
+               "PeerAddr => \"127.0.0.1:9\")->sockport < 61000 ? \"low\" : \"high\"'");
+    EXPECT_EQ(start(executable), "no yes yes yes low") << "in there alone";
+    wantNetwork();
+    EXPECT_EQ(start(executable), "no no no yes high");
+}
+
 /// What listens on the machine's loopback interface, or without a name in the file system, is not
 /// there for a plug-in.
 TEST_F(NetworkTest, DoesNotLeadToTheMachineItself) {
