@@ -76,7 +76,7 @@ Instance::Instance(RunLoop& loop, const Keeper& keeper, std::string pasta, Sandb
 }
 
 Instance::~Instance() {
-    if (status_ && !first_) return;
+    if (status_ && !process_.info && !first_) return;
     takeInfoNow();
     sendKill(first_);
     if (!status_) sendKill(process_.child.pidFd);
@@ -118,7 +118,10 @@ void Instance::takeInfoNow() {
 void Instance::awaitInfo() {
     if (!readInfo()) return infoWatch_->awaitReadable([this] { awaitInfo(); });
     if (first_) watchFirst();
-    if (isDoomed_ || !first_) return kill();
+    if (isDoomed_ || !first_) {
+        kill();
+        return endedPartly();
+    }
     const auto namespaces = SandboxNamespaces::of(firstPid(), first_);
     if (!limit(namespaces)) return kill();
     if (allowance_.network) return connect(*namespaces);
@@ -181,18 +184,14 @@ void Instance::takeStatus() {
     status_ = Keeper::statusAt(process_.child.end);
     if (!status_) return endWatch_->awaitReadable([this] { takeStatus(); });
     endWatch_.reset();
-    // What it wrote before it ended is there; nobody else writes it.
-    if (process_.info) {
-        takeInfoNow();
-        if (first_) watchFirst();
-    }
     // What is left in the sandbox has lost what it was for.
     kill();
     endedPartly();
 }
 
+/// As long as something may come of `info`, there may be a first process.
 void Instance::endedPartly() {
-    if (!status_ || first_) return;
+    if (!status_ || process_.info || first_) return;
     network_.reset();
     output_.finish();
     // The last that is done: it may be the end of this object.

@@ -40,6 +40,7 @@ class Instance {
   private:
     /// Reads of `info` what is there; true once all is read that will be.
     bool readInfo();
+    /// The same, waiting for it: where nobody else waits any more.
     void takeInfoNow();
     void awaitInfo();
     /// Sets the limits on the sandbox's first process, which waits at the gate; false, with an

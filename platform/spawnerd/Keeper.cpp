@@ -51,11 +51,7 @@ Keeper::~Keeper() {
 }
 
 Result<Parcel> Keeper::ask(const KeeperOrder& order, std::span<const int> descriptors) const {
-    // A place for the descriptor that the answer may bring: what runs must not go unnoticed.
-    UniqueFd place(::fcntl(socket_.get(), F_DUPFD_CLOEXEC, 0));
-    if (!place) return Error::posix(errno, "the process that keeps plug-ins");
     if (auto error = Parcel::send(socket_.get(), order.encode(), descriptors)) return *error;
-    place.reset();
     Result<Parcel> answer = Parcel::receive(socket_.get());
     if (!answer) return answer;
     KeeperAnswer told{.error = EPROTO, .pid = -1};

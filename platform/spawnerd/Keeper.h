@@ -35,7 +35,8 @@ class Keeper {
         std::vector<std::string> words;                // the program's path, and its arguments
         std::vector<std::pair<int, int>> descriptors;  // borrowed, with their numbers in there
     };
-    /// A process that was started. It is a child of the keeper, not of this process.
+    /// A process that was started. It is a child of the keeper, not of this process. Once nobody
+    /// has `end`, the keeper ends it.
     struct Child {
         pid_t pid = -1;
         UniqueFd pidFd;

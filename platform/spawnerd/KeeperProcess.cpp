@@ -16,7 +16,7 @@
 #include <cstdio>
 #include <cstring>
 #include <memory>
-#include <span>
+#include <sstream>
 #include <utility>
 
 #include "platform/spawnerd/ChildProcess.h"
@@ -27,7 +27,7 @@ namespace platform::spawnerd {
 
 namespace {
 
-constexpr std::size_t kMostStat = 4096;
+constexpr std::size_t kMostStat = 4096, kMostChildren = 1u << 20;
 
 pid_t parentOf(int proc, const char* process) {
     const auto text = readFileAt(proc, std::string(process) + "/stat", kMostStat);
@@ -148,9 +148,12 @@ void KeeperProcess::main(int socket) {
 }
 
 void KeeperProcess::serve() {
+    std::vector<pollfd> states;
     for (;;) {
-        pollfd states[] = {{socket_.get(), POLLIN, 0}, {childSignals_.get(), POLLIN, 0}};
-        if (::poll(states, std::size(states), -1) < 0) continue;
+        states.assign({{socket_.get(), POLLIN, 0}, {childSignals_.get(), POLLIN, 0}});
+        for (const auto& [pid, end] : ends_) states.push_back({end.get(), 0, 0});
+        if (::poll(states.data(), states.size(), -1) < 0) continue;
+        endForgotten(std::span(states).subspan(2));
         if (states[1].revents != 0) reap();
         if (states[0].revents != 0 && !obey()) return;
     }
@@ -158,24 +161,28 @@ void KeeperProcess::serve() {
 
 bool KeeperProcess::obey() {
     Result<Parcel> parcel = Parcel::receive(socket_.get());
-    const auto order = parcel ? KeeperOrder::decode(parcel->bytes) : std::nullopt;
-    const std::size_t count = parcel ? parcel->descriptors.size() : 0;
-    if (!order || count == 0 || (!order->words.empty() && count != order->targets.size() + 1))
-        return false;
+    if (!parcel && parcel.error().code == EPIPE) return false;
     UniqueFd pidFd;
-    const KeeperAnswer answer = order->words.empty()
-                                    ? KeeperAnswer{.error = limit(parcel->descriptors), .pid = -1}
-                                    : start(*order, parcel->descriptors, pidFd);
+    const KeeperAnswer answer =
+        parcel ? answerTo(*parcel, pidFd) : KeeperAnswer{.error = parcel.error().code, .pid = -1};
     const int borrowed = pidFd.get();
     const std::string_view bytes(reinterpret_cast<const char*>(&answer), sizeof answer);
     const auto failure = Parcel::send(socket_.get(), bytes, std::span(&borrowed, pidFd ? 1 : 0));
     if (!failure) return true;
     if (failure->code == EPIPE || failure->code == ECONNRESET) return false;
-    // Nobody would know of it.
-    if (pidFd) ::syscall(SYS_pidfd_send_signal, pidFd.get(), SIGKILL, nullptr, 0);
+    // Whoever hears this waits for no child.
     const KeeperAnswer instead{.error = failure->code, .pid = -1};
     return !Parcel::send(socket_.get(), {reinterpret_cast<const char*>(&instead), sizeof instead},
                          {});
+}
+
+KeeperAnswer KeeperProcess::answerTo(Parcel& parcel, UniqueFd& pidFd) {
+    const auto order = KeeperOrder::decode(parcel.bytes);
+    const std::size_t count = parcel.descriptors.size();
+    if (!order || count == 0) return {.error = EPROTO, .pid = -1};
+    if (order->words.empty()) return {.error = limit(parcel.descriptors), .pid = -1};
+    if (count != order->targets.size() + 1) return {.error = EPROTO, .pid = -1};
+    return start(*order, parcel.descriptors, pidFd);
 }
 
 KeeperAnswer KeeperProcess::start(const KeeperOrder& order, std::vector<UniqueFd>& descriptors,
@@ -194,17 +201,36 @@ KeeperAnswer KeeperProcess::start(const KeeperOrder& order, std::vector<UniqueFd
     return {.error = error, .pid = *pid};
 }
 
+void KeeperProcess::endForgotten(std::span<const pollfd> states) {
+    for (auto state = states.begin(); auto& [pid, end] : ends_) {
+        if (((state++)->revents & POLLERR) == 0) continue;
+        ::kill(pid, SIGKILL);
+        end.reset();  // it is ended once, however long that takes
+    }
+}
+
 void KeeperProcess::reap() {
     signalfd_siginfo signal;
     while (::read(childSignals_.get(), &signal, sizeof signal) > 0) {
     }
     int status = 0;
+    const std::size_t before = ends_.size();
     for (pid_t pid = 0; (pid = ::waitpid(-1, &status, WNOHANG)) > 0;) {
         const auto found = ends_.find(pid);
         if (found == ends_.end()) continue;  // an orphan
         (void)!::write(found->second.get(), &status, sizeof status);
         ends_.erase(found);
     }
+    if (ends_.size() < before) endOrphans();
+}
+
+void KeeperProcess::endOrphans() {
+    const std::string self = std::to_string(::getpid());
+    const auto children = readFile("/proc/self/task/" + self + "/children", kMostChildren);
+    std::istringstream numbers(children ? *children : std::string());
+    // Only this process reaps them: until then their numbers are their own.
+    for (pid_t pid = 0; numbers >> pid;)
+        if (!ends_.contains(pid)) ::kill(pid, SIGKILL);
 }
 
 }  // namespace platform::spawnerd

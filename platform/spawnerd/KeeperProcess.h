@@ -1,9 +1,11 @@
 #pragma once
 
+#include <poll.h>
 #include <sys/types.h>
 
 #include <map>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -11,6 +13,10 @@
 
 #include "platform/system/Error.h"
 #include "platform/system/UniqueFd.h"
+
+namespace platform {
+struct Parcel;
+}
 
 namespace platform::spawnerd {
 
@@ -45,12 +51,19 @@ class KeeperProcess {
     void serve();
     /// One order; false when none will come any more.
     bool obey();
+    KeeperAnswer answerTo(Parcel& parcel, UniqueFd& pidFd);
     KeeperAnswer start(const KeeperOrder& order, std::vector<UniqueFd>& descriptors,
                        UniqueFd& pidFd);
+    /// Ends those whose end nobody waits for, by the states of `ends_`, in their order: whoever had
+    /// them started has failed at taking them over.
+    void endForgotten(std::span<const pollfd> states);
     void reap();
+    /// Ends what an ended child has left behind, which may be a sandbox whose ties to it were not
+    /// knotted yet.
+    void endOrphans();
 
     const UniqueFd socket_, childSignals_;
-    std::map<pid_t, UniqueFd> ends_;  // where to tell how a child ended
+    std::map<pid_t, UniqueFd> ends_;  // where to tell how a child ended; none for a forgotten one
 };
 
 }  // namespace platform::spawnerd

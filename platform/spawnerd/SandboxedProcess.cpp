@@ -55,7 +55,7 @@ Result<SandboxedProcess> SandboxedProcess::spawn(const Keeper& keeper, const std
                                                  const UniqueFd& connection) {
     if (::access(program.c_str(), X_OK) != 0)
         return Error::posix(errno, "cannot confine plug-ins without " + program);
-    const Result<std::string>& systemCalls = systemCallFilter();
+    const Result<std::string> systemCalls = systemCallFilter();
     if (!systemCalls) return systemCalls.error();
     Pipe info, gate, output;
     const UniqueFd file = fileOf(setup.arguments), filter = memoryFile(*systemCalls);

@@ -12,6 +12,7 @@
 #include <cstdint>
 #include <initializer_list>
 #include <memory>
+#include <mutex>
 #include <set>
 #include <span>
 #include <utility>
@@ -175,8 +176,15 @@ Result<std::string> compile() {
 
 }  // namespace
 
-const Result<std::string>& systemCallFilter() {
-    static const Result<std::string> filter = compile();
+Result<std::string> systemCallFilter() {
+    static std::mutex mutex;
+    static std::string filter;  // guarded by the mutex; empty until it could be compiled
+    const std::lock_guard lock(mutex);
+    if (filter.empty()) {
+        Result<std::string> compiled = compile();
+        if (!compiled) return compiled;
+        filter = std::move(*compiled);
+    }
     return filter;
 }
 

@@ -49,7 +49,9 @@ Result<Parcel> Parcel::receive(int socket) {
     if (count < 0) return Error::posix(errno, kText);
     parcel.descriptors = descriptorsOf(message);
     if (count == 0) return Error::posix(EPIPE, kText);
-    if (message.msg_flags & (MSG_TRUNC | MSG_CTRUNC)) return Error::posix(EMSGSIZE, kText);
+    // There is room for all that is ever sent: what is missing had no number to be had.
+    if (message.msg_flags & MSG_CTRUNC) return Error::posix(EMFILE, kText);
+    if (message.msg_flags & MSG_TRUNC) return Error::posix(EMSGSIZE, kText);
     parcel.bytes.resize(static_cast<std::size_t>(count));
     return parcel;
 }

@@ -20,7 +20,8 @@ struct Parcel {
     std::string bytes;
     std::vector<UniqueFd> descriptors;
 
-    /// The next one, waiting for it. Error: the system's; EPIPE once the other end is closed.
+    /// The next one, waiting for it. Error: the system's; EPIPE once the other end is closed,
+    /// EMFILE when its descriptors could not be taken.
     static Result<Parcel> receive(int socket);
     /// The descriptors are borrowed. Error: the system's; EMSGSIZE for what is beyond the bounds.
     static std::optional<Error> send(int socket, std::string_view bytes,

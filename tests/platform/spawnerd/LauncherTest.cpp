@@ -1,4 +1,6 @@
 #include <netinet/in.h>
+#include <poll.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 
@@ -308,6 +310,54 @@ TEST_F(LauncherTest, NothingRunsWithoutBubblewrap) {
     EXPECT_EQ(grant(executable), 0);
     EXPECT_EQ(number(start(executable), kErrorCode), EIO);
     EXPECT_FALSE(std::filesystem::exists(home.path("ran")));
+}
+
+/// At whatever point of the start there is no further descriptor.
+TEST_F(LauncherTest, AStartWithoutDescriptorsFailsAndLeavesNothing) {
+    const std::string executable = plugIn("one", "cat");
+    EXPECT_EQ(grant(executable), 0);
+    askAbout(kTerminate, start(executable));
+    const auto open = [] {
+        return std::distance(std::filesystem::directory_iterator("/proc/self/fd"), {});
+    };
+    const auto before = open();
+    rlimit usual{};
+    ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &usual), 0);
+    std::size_t failed = 0;
+    for (bool succeeded = false; !succeeded;) {
+        const rlimit narrow{before - 1 + failed, usual.rlim_max};
+        ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &narrow), 0);
+        const Message reply = start(executable);
+        ::setrlimit(RLIMIT_NOFILE, &usual);
+        succeeded = static_cast<bool>(reply.takeDescriptor());
+        if (number(reply, kInstance) > 0) askAbout(kTerminate, reply);
+        failed += succeeded ? 0 : 1;
+        ASSERT_LT(failed, 100u);
+        EXPECT_TRUE(stepUntil([&] { return processesWith(executable).empty(); })) << failed;
+        EXPECT_TRUE(stepUntil([&] { return open() == before; })) << failed;
+    }
+    EXPECT_GT(failed, 5u);
+}
+
+/// As after a failure between the start of a process and the word of it.
+TEST(KeeperTest, WhatNobodyWaitsForIsEndedWithWhatItLeavesBehind) {
+    const Result<Keeper> keeper = Keeper::make();
+    ASSERT_TRUE(keeper);
+    int ends[2];
+    ASSERT_EQ(::pipe2(ends, O_CLOEXEC), 0);
+    const UniqueFd readEnd(ends[0]);
+    UniqueFd writeEnd(ends[1]);
+    for (const char* script : {"sleep 1000", "sleep 1000 & exit"}) {
+        auto child = keeper->run(
+            {.words = {"/bin/sh", "-c", script}, .descriptors = {{writeEnd.get(), STDOUT_FILENO}}});
+        ASSERT_TRUE(child);
+        if (script == std::string("sleep 1000")) continue;
+        pollfd ended{child->end.get(), POLLIN, 0};
+        EXPECT_EQ(::poll(&ended, 1, 10000), 1);
+    }
+    writeEnd.reset();
+    pollfd state{readEnd.get(), 0, 0};
+    EXPECT_EQ(::poll(&state, 1, 10000), 1) << "somebody has the other end";
 }
 
 TEST_F(LauncherTest, AHostLearnsHowItsPlugInsEnd) {
