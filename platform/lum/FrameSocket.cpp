@@ -11,6 +11,12 @@ namespace platform::lum {
 
 namespace {
 
+/// The socket is not what it wants for: memory, or a place among the descriptors that the user may
+/// have on their way, which another process may have used up. No event tells of its end.
+bool isStarvation(int error) {
+    return error == ENOBUFS || error == ENOMEM || error == ETOOMANYREFS;
+}
+
 /// Room for the one descriptor that a message carries.
 struct DescriptorBuffer {
     alignas(cmsghdr) char bytes[CMSG_SPACE(sizeof(int))] = {};
@@ -42,6 +48,7 @@ UniqueFd descriptorIn(msghdr& message) {
 bool FrameSocket::write(Outgoing& frame, std::size_t most) {
     SliceList& bytes = frame.bytes;
     const std::size_t left = bytes.remaining() - std::min(bytes.remaining(), most);
+    starved_ = false;
     while (bytes.remaining() > left) {
         iovec vectors[64];
         msghdr message{};
@@ -57,7 +64,8 @@ bool FrameSocket::write(Outgoing& frame, std::size_t most) {
             bytes.consume(static_cast<std::size_t>(count));
             frame.descriptor.reset();
         } else if (errno != EINTR) {
-            broken_ = errno != EAGAIN && errno != ENOBUFS && errno != ENOMEM;
+            starved_ = isStarvation(errno);
+            broken_ = errno != EAGAIN && !starved_;
             return false;
         }
     }
@@ -73,7 +81,7 @@ FrameSocket::Sent FrameSocket::send(SliceList bytes, UniqueFd descriptor) {
     const std::size_t size = frame.bytes.size();
     unsent_.push_back(std::move(frame));
     held_ += size;
-    return {size, first};
+    return {size, first, first && starved_};
 }
 
 FrameSocket::Flushed FrameSocket::flush() {
@@ -95,7 +103,7 @@ FrameSocket::Flushed FrameSocket::flush() {
     }
     held_ -= freed;
     if (broken_) freed += dropUnsent();
-    return {written, freed, !unsent_.empty()};
+    return {written, freed, !unsent_.empty(), !unsent_.empty() && starved_};
 }
 
 std::size_t FrameSocket::dropUnsent() {

@@ -25,6 +25,7 @@ class FrameSocket {
     struct Sent {
         std::size_t kept = 0;        // bytes of frames that this call has added to `held`
         bool awaitWritable = false;  // somebody has to call `flush` once the socket is writable
+        bool isStarved = false;      // it may be writable and yet take nothing: call it later
     };
     /// Writes what the socket takes at once and keeps the frame while a rest of it is unsent. On a
     /// closed or broken socket the frame vanishes.
@@ -35,6 +36,7 @@ class FrameSocket {
         std::size_t written = 0;     // bytes that the socket took
         std::size_t freed = 0;       // bytes of frames that are held no more
         bool awaitWritable = false;  // more is left
+        bool isStarved = false;      // as above
     };
     /// Writes on, at most about a megabyte, so that a fast reader does not occupy the thread.
     Flushed flush();
@@ -79,6 +81,7 @@ class FrameSocket {
     UniqueFd socket_;
     std::deque<Outgoing> unsent_;  // guarded by mutex_
     bool broken_ = false;          // guarded by mutex_: the peer reads no more
+    bool starved_ = false;  // guarded by mutex_: the system lacks what the last write would take
     std::atomic<std::size_t> held_ = 0;
 };
 

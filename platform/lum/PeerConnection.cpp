@@ -3,12 +3,19 @@
 #include <fmt/format.h>
 
 #include <algorithm>
+#include <chrono>
 #include <utility>
 
 #include "platform/log/OpsLog.h"
 #include "platform/lum/Limits.h"
 
 namespace platform::lum {
+
+namespace {
+
+constexpr std::chrono::milliseconds kPauseWhileStarved{50};
+
+}  // namespace
 
 /// What a delivered request carries: its connection's turn and its place in the budgets, given back
 /// on whichever thread drops the request's last copy.
@@ -97,6 +104,12 @@ void PeerConnection::awaitWritable() {
     watch_->awaitWritable([this] { writable(); });
 }
 
+void PeerConnection::sendOn(bool isStarved) {
+    if (!isStarved) return awaitWritable();
+    if (!retry_) retry_.emplace(loop_);
+    retry_->start(kPauseWhileStarved, [this] { writable(); });
+}
+
 void PeerConnection::readable() {
     awaitsReadable_ = false;
     auto self = shared_from_this();
@@ -117,7 +130,7 @@ void PeerConnection::hungUp() {
 void PeerConnection::writable() {
     auto self = shared_from_this();
     const FrameSocket::Flushed flushed = socket_.flush();
-    if (flushed.awaitWritable) awaitWritable();
+    if (flushed.awaitWritable) sendOn(flushed.isStarved);
     peerReads_.progress(flushed.written);
     replies_->remove(flushed.freed);
     proceed();
@@ -290,10 +303,10 @@ void PeerConnection::send(const Message& reply) {
     if (sent.kept == 0) return;
     replies_->add(sent.kept);
     if (!sent.awaitWritable) return;
-    loop_.post([weak = weak_from_this()] {
+    loop_.post([weak = weak_from_this(), isStarved = sent.isStarved] {
         auto self = weak.lock();
         if (!self || !self->watch_) return;
-        self->awaitWritable();
+        self->sendOn(isStarved);
         self->noteExpectations();
     });
 }
@@ -324,6 +337,7 @@ void PeerConnection::becomeInvalid(const std::string& reason) {
     invalid_ = true;
     auto self = shared_from_this();
     watch_.reset();
+    retry_.reset();
     replies_->remove(socket_.close());
     replies_->stopWaiting();
     waiting_.clear();

@@ -85,6 +85,8 @@ class PeerConnection final : public Connection,
     void awaitHangup();
     void awaitReadable();
     void awaitWritable();
+    /// Has what is unsent sent, once the socket is writable, or, starved, after a while.
+    void sendOn(bool isStarved);
 
     std::shared_ptr<Turn> takeTurn();
     void endTurn();
@@ -108,6 +110,7 @@ class PeerConnection final : public Connection,
     FrameSocket socket_;  // its own mutex guards sending
     FrameReader reader_;
     std::optional<RunLoop::Watch> watch_;  // from `resume` to the invalid event
+    std::optional<RunLoop::Timer> retry_;  // from the first time that the socket was starved
     bool invalid_ = false;
     bool ended_ = false;  // the peer sends nothing more
     bool announcedEnd_ = false;

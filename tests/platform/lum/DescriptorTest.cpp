@@ -1,8 +1,12 @@
 // Descriptors that travel with replies.
 
 #include <fcntl.h>
+#include <linux/capability.h>
+#include <sys/resource.h>
+#include <sys/syscall.h>
 
 #include "platform/lum/ClientConnection.h"
+#include "platform/system/Parcel.h"
 #include "tests/platform/lum/LumFixture.h"
 
 namespace platform::lum {
@@ -71,6 +75,55 @@ TEST_F(DescriptorTest, WhoTakesNoneGetsNoMore) {
     bool answered = false;
     other.sendWithReply(Message({{"file", true}}), [&](const auto&) { answered = true; });
     EXPECT_TRUE(stepUntil([&] { return answered; }));
+}
+
+/// While it lives, the user has more descriptors on their way than this thread may add to, and none
+/// of the rights with which one may all the same.
+class ManyOnTheirWay {
+  public:
+    ManyOnTheirWay() {
+        ::syscall(SYS_capget, &header_, usual_);
+        const __user_cap_data_struct none[2] = {{0, usual_[0].permitted, 0},
+                                                {0, usual_[1].permitted, 0}};
+        ::syscall(SYS_capset, &header_, none);
+        ::getrlimit(RLIMIT_NOFILE, &limit_);
+        const rlimit narrow{200, limit_.rlim_max};
+        ::setrlimit(RLIMIT_NOFILE, &narrow);
+        EXPECT_EQ(::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends_), 0);
+        const std::vector<int> many(Parcel::kMostDescriptors, STDIN_FILENO);
+        for (int i = 0; i < 7; ++i) EXPECT_FALSE(Parcel::send(ends_[0], "x", many));
+    }
+    ~ManyOnTheirWay() {
+        for (const int end : ends_) ::close(end);
+        ::setrlimit(RLIMIT_NOFILE, &limit_);
+        ::syscall(SYS_capset, &header_, usual_);
+    }
+
+  private:
+    __user_cap_header_struct header_{_LINUX_CAPABILITY_VERSION_3, 0};
+    __user_cap_data_struct usual_[2] = {};
+    rlimit limit_{};
+    int ends_[2] = {-1, -1};
+};
+
+TEST_F(DescriptorTest, WhatMayNotGoNowGoesLater) {
+    ClientConnection client(directories, "test", queue);
+    client.resume();
+    UniqueFd file;
+    bool isAnswered = false;
+    {
+        const ManyOnTheirWay others;
+        client.sendWithReply(Message({{"file", true}}), [&](const ClientConnection::Reply& reply) {
+            isAnswered = true;
+            if (const auto* message = std::get_if<Message>(&reply))
+                file = message->takeDescriptor();
+        });
+        EXPECT_TRUE(stepUntil([&] { return served == 1; }));
+        for (int i = 0; i < 20; ++i) loop.runOnce(std::chrono::milliseconds(10));
+        EXPECT_FALSE(isAnswered);
+    }
+    EXPECT_TRUE(stepUntil([&] { return isAnswered; }));
+    EXPECT_TRUE(file);
 }
 
 }  // namespace
