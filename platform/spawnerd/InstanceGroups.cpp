@@ -13,6 +13,7 @@
 #include <string_view>
 
 #include "platform/system/Files.h"
+#include "platform/system/Process.h"
 
 namespace platform::spawnerd {
 
@@ -53,19 +54,22 @@ std::optional<std::string> placeIn(const std::string& membership) {
     return std::nullopt;
 }
 
-/// The numbers in a file of processes, ordered.
+/// The numbers in a file of processes.
 std::vector<pid_t> processesIn(const UniqueFd& folder) {
     const auto text = readFileAt(folder.get(), kProcesses, kMostBytes);
     std::istringstream numbers(text ? *text : std::string());
-    std::vector<pid_t> processes{std::istream_iterator<pid_t>(numbers), {}};
-    std::ranges::sort(processes);
-    return processes;
+    return {std::istream_iterator<pid_t>(numbers), {}};
 }
 
-bool isOursAlone(const UniqueFd& folder, const std::vector<pid_t>& own) {
+bool isOurs(pid_t process) {
+    return process == ::getpid() || parentOf(process) == ::getpid();
+}
+
+bool isOursAlone(const UniqueFd& folder, const std::vector<pid_t>& there) {
     const auto controllers = readFileAt(folder.get(), "cgroup.controllers", kMostBytes);
     return controllers && holdsWord(*controllers, "memory") && holdsWord(*controllers, "pids") &&
-           processesIn(folder) == own && ::faccessat(folder.get(), ".", W_OK, AT_EACCESS) == 0;
+           std::ranges::all_of(there, isOurs) &&
+           ::faccessat(folder.get(), ".", W_OK, AT_EACCESS) == 0;
 }
 
 bool moveTo(const UniqueFd& folder, const std::vector<pid_t>& processes) {
@@ -108,14 +112,13 @@ void InstanceGroup::kill() const {
     if (folder_) writeTo(folder_, "cgroup.kill", "1");
 }
 
-InstanceGroups InstanceGroups::find(std::vector<pid_t> own, const std::string& tree,
-                                    const std::string& membership) {
+InstanceGroups InstanceGroups::find(const std::string& tree, const std::string& membership) {
     InstanceGroups groups;
     const auto place = placeIn(membership);
     if (!place) return groups;
     const std::string path = tree + *place;
     const UniqueFd folder = openFolder(path);
-    std::ranges::sort(own);
+    const auto own = processesIn(folder);
     if (!folder || !isOursAlone(folder, own) || !divide(path, folder, own)) return groups;
     groups.path_ = path;
     removeInstances(path);

@@ -42,12 +42,12 @@ class InstanceGroup {
 class InstanceGroups {
   public:
     /// Takes the daemon's group into use when it has the unified tree's controllers of memory and
-    /// processes, is writable, and no others than the daemon's `own` processes are in it; these
-    /// then move to a group of their own in there, because groups have either processes or groups.
-    /// What an earlier daemon left there goes. Otherwise there are no groups, and nothing has
-    /// changed. `tree` is where the unified tree is mounted, `membership`
-    /// the file that says where in it this process is.
-    static InstanceGroups find(std::vector<pid_t> own, const std::string& tree = "/sys/fs/cgroup",
+    /// processes, is writable, and no others than this process and those that it has forked are in
+    /// it; these then move to a group of their own in there, because groups have either processes
+    /// or groups. What an earlier daemon left there goes. Otherwise there are no groups, and
+    /// nothing has changed. `tree` is where the unified tree is mounted, `membership` the file that
+    /// says where in it this process is.
+    static InstanceGroups find(const std::string& tree = "/sys/fs/cgroup",
                                const std::string& membership = "/proc/self/cgroup");
 
     bool areThere() const { return !path_.empty(); }

@@ -50,7 +50,6 @@ class Keeper {
     /// Ends it, and waits until nothing of what it has started is left.
     ~Keeper();
 
-    pid_t pid() const { return pid_; }
     /// Readable once the process has ended. Borrows.
     const UniqueFd& pidFd() const { return pidFd_; }
 

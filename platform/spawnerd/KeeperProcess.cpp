@@ -13,7 +13,6 @@
 #include <cerrno>
 #include <charconv>
 #include <csignal>
-#include <cstdio>
 #include <cstring>
 #include <memory>
 #include <sstream>
@@ -22,21 +21,13 @@
 #include "platform/spawnerd/ChildProcess.h"
 #include "platform/system/Files.h"
 #include "platform/system/Parcel.h"
+#include "platform/system/Process.h"
 
 namespace platform::spawnerd {
 
 namespace {
 
-constexpr std::size_t kMostStat = 4096, kMostChildren = 1u << 20;
-
-pid_t parentOf(int proc, const char* process) {
-    const auto text = readFileAt(proc, std::string(process) + "/stat", kMostStat);
-    // The name, in parentheses, may contain anything.
-    const std::size_t place = text ? text->rfind(')') : std::string::npos;
-    int parent = 0;
-    if (place != std::string::npos) std::sscanf(text->c_str() + place, ") %*c %d", &parent);
-    return parent;
-}
+constexpr std::size_t kMostChildren = 1u << 20;
 
 void killChildren() {
     const std::unique_ptr<DIR, int (*)(DIR*)> proc(::opendir("/proc"), &::closedir);
@@ -44,8 +35,7 @@ void killChildren() {
     while (const dirent* entry = ::readdir(proc.get())) {
         pid_t process = 0;
         std::from_chars(entry->d_name, entry->d_name + std::strlen(entry->d_name), process);
-        if (process > 0 && parentOf(::dirfd(proc.get()), entry->d_name) == ::getpid())
-            ::kill(process, SIGKILL);
+        if (process > 0 && parentOf(process) == ::getpid()) ::kill(process, SIGKILL);
     }
 }
 

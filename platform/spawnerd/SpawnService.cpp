@@ -121,7 +121,7 @@ void SpawnService::listen() {
     }
     keeperWatch_.emplace(*loop_, keeper_->pidFd().get());
     watchKeeper();
-    groups_ = InstanceGroups::find({::getpid(), keeper_->pid()});
+    groups_ = InstanceGroups::find();
     if (groups_.areThere())
         EVLOG_DEFAULT(ops(), "plug-ins are limited by groups of their own");
     else

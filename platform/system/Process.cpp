@@ -7,8 +7,22 @@
 #include <unistd.h>
 
 #include <csignal>
+#include <cstdio>
+#include <string>
+
+#include "platform/system/Files.h"
 
 namespace platform {
+
+pid_t parentOf(pid_t process) {
+    constexpr std::size_t kMostStat = 4096;
+    const auto text = readFile("/proc/" + std::to_string(process) + "/stat", kMostStat);
+    // The name, in parentheses, may contain anything.
+    const std::size_t place = text ? text->rfind(')') : std::string::npos;
+    int parent = 0;
+    if (place != std::string::npos) std::sscanf(text->c_str() + place, ") %*c %d", &parent);
+    return parent;
+}
 
 void openStandardDescriptors() {
     // The lowest free number is given out: one of these three until all are open.

@@ -1,6 +1,11 @@
 #pragma once
 
+#include <sys/types.h>
+
 namespace platform {
+
+/// The number of a process's parent; 0 when that cannot be told.
+pid_t parentOf(pid_t process);
 
 /// Opens /dev/null in place of standard input, output and error where they are closed: otherwise
 /// the first files opened would get their numbers, and what is written to a standard stream would

@@ -17,7 +17,7 @@ class Groups : public testing::Test {
   protected:
     Groups() {
         write("cgroup.controllers", "cpu memory pids\n");
-        write("cgroup.procs", "1\n" + self_ + "\n");
+        write("cgroup.procs", self_ + "\n");
         write("cgroup.subtree_control", "");
         write("daemon/cgroup.procs", "");
         for (const char* name : {"cgroup.procs", "cgroup.kill", "memory.max", "pids.max",
@@ -30,9 +30,7 @@ class Groups : public testing::Test {
     std::string read(const std::string& name) {
         return *readFile(tree_.path("user.slice/zrd.service/" + name), 1000);
     }
-    InstanceGroups find() {
-        return InstanceGroups::find({::getpid(), 1}, tree_.path(), membership_);
-    }
+    InstanceGroups find() { return InstanceGroups::find(tree_.path(), membership_); }
 
     const std::string self_ = std::to_string(::getpid());
     test::TemporaryDirectory tree_;
@@ -66,9 +64,9 @@ TEST_F(Groups, WhatIsNotDelegatedStaysAsItIs) {
         return !find().areThere() && read("daemon/cgroup.procs").empty() &&
                read("cgroup.subtree_control").empty();
     };
-    write("cgroup.procs", "1\n2\n" + self_ + "\n");
+    write("cgroup.procs", std::to_string(::getppid()) + "\n" + self_ + "\n");
     EXPECT_TRUE(refused()) << "others are there too";
-    write("cgroup.procs", self_ + "\n1\n");
+    write("cgroup.procs", self_ + "\n");
     write("cgroup.controllers", "cpu\n");
     EXPECT_TRUE(refused());
     tree_.write("membership", "4:memory:/user.slice/zrd.service\n");
