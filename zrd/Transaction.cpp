@@ -90,6 +90,19 @@ void Transaction::dispatch() {
     fail(kZRErrorInvalidRequest, "unrecognized request");
 }
 
+void Transaction::lookAtBundles(std::vector<platform::PlaceLooks::Look> looks,
+                                std::function<void(const std::vector<bool>& done)> then) {
+    if (looks.empty()) return then({});
+    server().services().bundleLooks->make(
+        std::move(looks),
+        [self = shared_from_this(), then = std::move(then)](const std::vector<bool>& done) mutable {
+            ZRDServer& server = self->server();
+            // Handed on, so that nothing of the request goes on this thread.
+            server.submitWork(
+                [self = std::move(self), then = std::move(then), done] { then(done); });
+        });
+}
+
 const platform::Array* Transaction::requestedPaths() {
     const Value* paths = request_.find(message::kPaths);
     if (paths && paths->array()) return paths->array();

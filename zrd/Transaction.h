@@ -11,15 +11,18 @@
 #include "Zorvan/ZRError.h"
 #include "platform/lum/Message.h"
 #include "platform/lum/Origin.h"
+#include "platform/lum/PlaceLooks.h"
 #include "zrd/HostRestriction.h"
 
 namespace zorvan {
 
+class MatchResult;
 class RequestPaths;
 class ZRDLumClient;
 class ZRDPlugIn;
 class ZRDServer;
 struct HoldSubject;
+struct ZRDPlugInDraft;
 
 /// One request being served: the message, the reply being built for it, and who sent it. Made when
 /// the message arrives; everything else runs on the service queue, one transaction at a time (but
@@ -54,10 +57,23 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void bulkAnnotatePlugIns();
     void lockDownPlugIns();
 
+    struct Matching;
+    void accept(const std::shared_ptr<ZRDPlugIn>& plugIn, ZRDPlugInDraft& draft,
+                Matching& matching);
+    void completeLateForms(const std::shared_ptr<Matching>& matching);
+    void answerMatch(MatchResult& result);
+
+    /// Has looks at bundles made, which their file systems may hold up, and goes on with which of
+    /// them are done: on the service queue, and at once when there are none. A look that hangs goes
+    /// on for as long, so it must not hold this object.
+    void lookAtBundles(std::vector<platform::PlaceLooks::Look> looks,
+                       std::function<void(const std::vector<bool>& done)> then);
+
     /// Read when it is first asked for.
     const HostRestriction& hostRestriction();
     /// Whether the host may have a plug-in made ready; otherwise the failure has been sent.
     bool admitToReady(const ZRDPlugIn& plugIn);
+    void enableWhenPrepared(std::vector<std::shared_ptr<ZRDPlugIn>> plugIns);
     void releaseHolds(const platform::Array& tokens);
     /// What "paths" names; false when the failure has been sent.
     bool collectPlugInsToHold(HoldSubject& subject);

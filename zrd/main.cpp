@@ -34,6 +34,7 @@ platform::Services diskServices(const std::string& serviceName,
                                                limits(services.directories));
     services.looks = std::make_shared<platform::PeerLooks>(*services.mainLoop);
     services.pathLooks = std::make_shared<platform::PeerLooks>(*services.mainLoop);
+    services.bundleLooks = std::make_shared<platform::PlaceLooks>(*services.mainLoop);
     services.codeSigning = platform::makeFileCodeSigning();
     services.sandbox =
         platform::makeKernelSandbox(services.directories, serviceName, *services.mainLoop);

@@ -165,7 +165,7 @@ std::optional<Pool::Share> Listener::State::drawFor(const AuditToken& token) {
         EVLOG_ERROR(ops(),
                     "client {} is not let in: there are too many connections, or it and those it "
                     "belongs with have too many, {} are the most",
-                    token.pid(), pool.quarter());
+                    token.pid(), pool.mostOfOne());
     }
     return share;
 }

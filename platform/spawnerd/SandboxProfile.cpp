@@ -139,8 +139,8 @@ const SandboxProfile* findSandboxProfile(std::string_view name) {
     return found == std::end(kProfiles) ? nullptr : &*found;
 }
 
-Result<SandboxSetup> sandboxSetup(const Grant& grant, const Directories& directories,
-                                  const std::string& daemonService,
+Result<SandboxSetup> sandboxSetup(const Grant& grant, UniqueFd bundle,
+                                  const Directories& directories, const std::string& daemonService,
                                   const Surroundings& surroundings) {
     SandboxSetup setup;
     Arguments& arguments = setup.arguments;
@@ -151,15 +151,13 @@ Result<SandboxSetup> sandboxSetup(const Grant& grant, const Directories& directo
     if (auto error = bindTokenBroker(arguments, directories, daemonService)) return *error;
     append(arguments, {"--ro-bind", surroundings.busyFolder,
                        BusyFolder::ofBundle(directories, grant.bundleIdentifier)});
-    // Both were checked when the grant was made, and may have been exchanged since.
+    // It was checked when the grant was made, and may have been exchanged since.
     if (!grant.container.empty()) {
         auto container = openContainer(directories, grant.container);
         if (!container) return container.error();
         bindDescriptor(setup, "--bind-fd", std::move(*container), grant.container);
     }
-    auto bundle = grant.bundle.open();
-    if (!bundle) return bundle.error();
-    bindDescriptor(setup, "--ro-bind-fd", std::move(*bundle), grant.bundle.path);
+    bindDescriptor(setup, "--ro-bind-fd", std::move(bundle), grant.bundle.path);
     append(arguments, {"--remount-ro", "/"});
     append(arguments, {"--chdir", grant.container.empty() ? "/" : grant.container});
     setEnvironment(arguments, grant, directories, daemonService);

@@ -47,12 +47,11 @@ struct SandboxSetup {
     std::vector<UniqueFd> descriptors;
 };
 
-/// The setup for a granted plug-in of the daemon of a service name. Everything that confines it is
-/// decided here; docs/bundles.md tells authors what they see. Errors: the bundle is not in its
-/// place any more (see `KnownDirectory::open`); the data container is not a directory of this
-/// user's own any more.
-Result<SandboxSetup> sandboxSetup(const Grant& grant, const Directories& directories,
-                                  const std::string& daemonService,
+/// The setup for a granted plug-in of the daemon of a service name, whose bundle was opened in its
+/// place. Everything that confines it is decided here; docs/bundles.md tells authors what they see.
+/// Error: the data container is not a directory of this user's own any more.
+Result<SandboxSetup> sandboxSetup(const Grant& grant, UniqueFd bundle,
+                                  const Directories& directories, const std::string& daemonService,
                                   const Surroundings& surroundings);
 
 }  // namespace spawnerd

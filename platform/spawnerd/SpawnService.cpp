@@ -86,6 +86,7 @@ SpawnService::SpawnService(Directories directories, std::string daemonService,
       keeper_(Keeper::make()),
       queue_("spawnerd", *loop_),
       pool_(kMaxInstances),
+      looks_(*loop_),
       shutDownTimer_(*loop_) {}
 
 SpawnService::~SpawnService() = default;
@@ -118,12 +119,8 @@ void SpawnService::listen() {
                       pub(::geteuid() == 0 ? " or processes" : ""));
 }
 
-int SpawnService::grant(const AuditToken& host, const ExternalService& service,
-                        const Dictionary& overlay) {
-    auto grant = Grant::make(directories_, service, overlay);
-    if (grant) return hosts_->add(host, std::move(*grant));
-    EVLOG_INFO(ops(), "{} cannot be started as a plug-in: {}", service.executable, grant.error());
-    return grant.error().code;
+int SpawnService::grant(const AuditToken& host, Grant grant) {
+    return hosts_->add(host, std::move(grant));
 }
 
 void SpawnService::takeBack(const std::string& bundlePath) {
@@ -152,13 +149,18 @@ void SpawnService::serve(const Host& host, const Asked& asked) {
     refuse(asked, Error::posix(ENOSYS, "unrecognized request"));
 }
 
-Result<Pool::Share> SpawnService::drawFor(const Host& host) {
+std::optional<Error> SpawnService::excess(const Host& host) const {
     const auto own = std::ranges::count_if(
         instances_, [&](const auto& entry) { return entry.second.host == host; });
     if (static_cast<std::size_t>(own) >= kMaxInstancesPerHost)
         return Error::posix(EAGAIN, "this process has started too many plug-ins");
     if (instances_.size() >= kMaxInstances)
         return Error::posix(EAGAIN, "too many plug-ins are running");
+    return std::nullopt;
+}
+
+Result<Pool::Share> SpawnService::drawFor(const Host& host) {
+    if (auto error = excess(host)) return *error;
     auto share = pool_.draw(Origin::of(host->token));
     if (!share)
         return Error::posix(EAGAIN, "those that this process belongs with run too many plug-ins");
@@ -177,15 +179,42 @@ void SpawnService::start(const Host& host, const Asked& asked) {
     }
     auto share = drawFor(host);
     if (!share) return refuse(asked, share.error());
-    Running running;
-    running.share = std::move(*share);
-    running.host = host;
-    running.grant = std::move(grant);
-    running.starting = asked;
-    if (auto error = spawn(++lastId_, std::move(running), *arguments)) {
-        EVLOG_ERROR(ops(), "cannot start {}: {}", *executable, pub(*error));
-        refuse(asked, *error);
-    }
+    const auto running = std::make_shared<Running>();
+    running->share = std::move(*share);
+    running->host = host;
+    running->grant = std::move(grant);
+    running->starting = asked;
+    openBundle(*running->grant, [this, running, arguments = *arguments](Result<UniqueFd> bundle) {
+        const std::string executable = running->grant->executable;
+        const Asked starting = *running->starting;
+        if (auto error = spawn(std::move(bundle), std::move(*running), arguments)) {
+            EVLOG_ERROR(ops(), "cannot start {}: {}", executable, pub(*error));
+            refuse(starting, *error);
+        }
+    });
+}
+
+/// Opens the bundle in its place, without holding up the loop if its file system has to be waited
+/// for. It was opened before, so that is rare.
+void SpawnService::openBundle(const Grant& grant, std::function<void(Result<UniqueFd>)> use) {
+    auto bundle = grant.bundle.open(Wait::Never);
+    if (bundle || bundle.error().code != EAGAIN) return use(std::move(bundle));
+    const auto opened = std::make_shared<Result<UniqueFd>>(UniqueFd());
+    looks_.make({{grant.bundle.path, [opened, place = grant.bundle] { *opened = place.open(); }}},
+                [weak = weak_from_this(), opened, path = grant.bundle.path,
+                 use = std::move(use)](const std::vector<bool>& done) {
+                    if (!weak.lock()) return;
+                    use(done[0] ? std::move(*opened) : Error::posix(ETIMEDOUT, path));
+                });
+}
+
+/// Whether what was asked for may still be started.
+std::optional<Error> SpawnService::whyNot(const Running& running) const {
+    const Host& host = running.host;
+    if (!listener_ || hosts_->find(host->token) != host ||
+        hosts_->grant(host, running.grant->executable) != running.grant)
+        return Error::posix(EPERM, "this process may not start " + running.grant->executable);
+    return excess(host);
 }
 
 Allowance SpawnService::allowanceFor(const Running& running) const {
@@ -196,9 +225,12 @@ Allowance SpawnService::allowanceFor(const Running& running) const {
     return allowance;
 }
 
-std::optional<Error> SpawnService::spawn(std::uint64_t id, Running running,
+std::optional<Error> SpawnService::spawn(Result<UniqueFd> bundle, Running running,
                                          const std::vector<std::string>& plugInArguments) {
+    if (!bundle) return bundle.error();
+    if (auto error = whyNot(running)) return error;
     if (!keeper_) return keeper_.error();
+    const std::uint64_t id = ++lastId_;
     const Grant& grant = *running.grant;
     auto busyFolder = BusyFolder::make(directories_, grant.bundleIdentifier, grant.bundle.path);
     if (!busyFolder) return busyFolder.error();
@@ -208,7 +240,8 @@ std::optional<Error> SpawnService::spawn(std::uint64_t id, Running running,
     running.busyFolder.emplace(std::move(*busyFolder));
     auto group = groups_.make(id, allowance.limits);
     if (!group) return group.error();
-    const auto setup = sandboxSetup(grant, directories_, daemonService_, surroundings);
+    const auto setup =
+        sandboxSetup(grant, std::move(*bundle), directories_, daemonService_, surroundings);
     if (!setup) return setup.error();
     int ends[2];
     if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) != 0)

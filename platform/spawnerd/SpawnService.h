@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "platform/lum/Listener.h"
+#include "platform/lum/PlaceLooks.h"
 #include "platform/lum/Pool.h"
 #include "platform/sandbox/BusyFolder.h"
 #include "platform/spawnerd/GrantedHosts.h"
@@ -45,8 +46,8 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     /// Begins to listen; an error line when that cannot be done.
     void listen();
 
-    /// As `Launcher::addExternalService`. From any thread.
-    int grant(const AuditToken& host, const ExternalService& service, const Dictionary& overlay);
+    /// As `Launcher::grantExternalService`. From any thread.
+    int grant(const AuditToken& host, Grant grant);
     /// As `Launcher::removeExternalServices`. From any thread.
     void takeBack(const std::string& bundlePath);
     /// As `Launcher::terminatePlugInInstances`, for the grants for which `which` holds and what was
@@ -86,7 +87,9 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     void accept(const std::shared_ptr<Connection>& connection);
     void serve(const Host& host, const Asked& asked);
     void start(const Host& host, const Asked& asked);
-    std::optional<Error> spawn(std::uint64_t id, Running running,
+    void openBundle(const Grant& grant, std::function<void(Result<UniqueFd>)> use);
+    std::optional<Error> whyNot(const Running& running) const;
+    std::optional<Error> spawn(Result<UniqueFd> bundle, Running running,
                                const std::vector<std::string>& plugInArguments);
     /// What the grant allows, as narrow as the host is.
     Allowance allowanceFor(const Running& running) const;
@@ -94,6 +97,8 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     void awaitEnd(const Host& host, const Asked& asked, bool kill);
     void ended(std::uint64_t id, int status);
     void hostDied(const Host& host);
+    /// Why there may not be one more instance of a host; none when there may.
+    std::optional<Error> excess(const Host& host) const;
     /// Draws from the instances that there may be; the error says that there are too many.
     Result<Pool::Share> drawFor(const Host& host);
     void finishShutDown();
@@ -110,6 +115,7 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     InstanceGroups groups_;
     std::uint64_t lastId_ = 0;
     Pool pool_;
+    PlaceLooks looks_;  // at bundles
     std::map<std::uint64_t, Running> instances_;
     std::function<void()> shutDownDone_;  // while a shut-down waits for the instances
     RunLoop::Timer shutDownTimer_;

@@ -115,7 +115,7 @@ TEST_F(HoldsTest, WhatComesToAHeldPlaceIsHeld) {
     EXPECT_NE(comes(1, "Empty.app/com.b.appex"), held);
 
     Array places;
-    for (std::size_t i = 0; i <= server_->holdPool().quarter(); ++i)
+    for (std::size_t i = 0; i <= server_->holdPool().mostOfOne(); ++i)
         places.append(directory_.makeDirectory("places/" + std::to_string(i)));
     EXPECT_EQ(lock(ZRHoldApplications, places), error(11, "too many holds"));
 }
