@@ -81,6 +81,8 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     bool areIdle(const std::vector<std::shared_ptr<ZRDPlugIn>>& plugIns);
     void takeHold(HoldSubject subject);
 
+    /// Changes the plug-in's annotation for this client; saved with the others before the reply.
+    void annotate(const platform::Dictionary& change, const ZRDPlugIn& plugIn);
     /// The request's "annotations"; null when they cannot be stored, and the failure has been sent.
     const platform::Dictionary* requestedAnnotations();
     /// Whether the store has room for a change; otherwise the failure has been sent.
@@ -117,6 +119,8 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void refuseRemoving(const std::string& path);
     /// Visits the plug-ins that "uuids" names, in order; answers as `marshalPaths`.
     bool processUuidList(const std::function<Walk(const std::shared_ptr<ZRDPlugIn>&)>& callback);
+    /// Sends the failure of "uuids" that are no list of UUIDs, or too many; answers false.
+    bool failForBadUuids();
     /// Stores the plug-in's annotation, or an empty one, under "annotations".
     void addAnnotationForPlugIn(const ZRDPlugIn& plugIn, platform::Dictionary& in) const;
 
@@ -137,6 +141,7 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     const std::shared_ptr<RequestPaths> paths_;
     platform::Message reply_;
     std::optional<HostRestriction> hostRestriction_;
+    bool hasUnsavedAnnotations_ = false;
     std::atomic<std::uint64_t> version_{0};
 };
 

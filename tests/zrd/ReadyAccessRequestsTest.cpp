@@ -2,6 +2,7 @@
 #include <filesystem>
 
 #include "Zorvan/Keys.h"
+#include "platform/lum/Limits.h"
 #include "tests/support/KnownDirectory.h"
 #include "tests/zrd/TransactionTest.h"
 #include "zrd/ZRDPlugInSignature.h"
@@ -64,6 +65,19 @@ TEST_F(ReadyAccessTest, WhatIsHeldWhileItIsLookedAtIsNotEnabled) {
     EXPECT_EQ(ask("ready", {0, 3}),
               error(11, "access to plugin com.a denied: the plug-in is on hold"));
     EXPECT_THAT(launcher_->granted, IsEmpty());
+}
+
+TEST_F(ReadyAccessTest, ListsHaveAnEnd) {
+    const Array uuids(std::vector<Value>(platform::lum::kMaxListed + 1, platform::Uuid::random()));
+    for (const char* request : {"ready", "access", "annotate", "lock"})
+        EXPECT_EQ(TransactionTest::ask({{"request", request},
+                                        {"uuids", uuids},
+                                        {"annotations", Dictionary{{"election", 1}}}}),
+                  error(4, "invalid request (bad uuid array)"));
+    const Array paths(std::vector<Value>(uuids.size(), "/"));
+    for (const char* request : {"add", "lock"})
+        EXPECT_EQ(TransactionTest::ask({{"request", request}, {"paths", paths}}),
+                  error(4, "invalid request format"));
 }
 
 TEST_F(ReadyAccessTest, AccessGivesOneTokenForEach) {
