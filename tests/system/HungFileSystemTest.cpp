@@ -128,6 +128,16 @@ TEST_F(HungFileSystem, ARegisteredBundleOnItHoldsUpWhoAsksForItAlone) {
     // Nobody waits for what is known not to answer.
     for (int i = 0; i < 3; ++i)
         expectQuick([&] { EXPECT_THAT(match(), ElementsAre("far 1", "steady 1")); });
+    // The registry goes on, and so does a new start.
+    EXPECT_THAT(add({home_.path("hung/H.app")}), HasSubstr("invalid plugin path"));
+    writePlugIn(plugInPath("B", "new"), info("new"));
+    EXPECT_TRUE(waitUntil([&] { return match({{"VXExtensionIdentifier", "new"}}).size() == 1; }));
+    std::filesystem::remove_all(home_.path(plugInPath("B", "new")));
+    EXPECT_TRUE(waitUntil([&] { return match({{"VXExtensionIdentifier", "new"}}).empty(); }));
+    stop(SIGTERM);
+    start();
+    EXPECT_THAT(match(), ElementsAre("far 1", "steady 1"));
+    expectQuick([&] { EXPECT_EQ(add({home_.path(plugInPath("A", "steady"))}), ""); });
     fuse_.reset();
     ASSERT_EQ(::umount2(hung_.c_str(), MNT_DETACH), 0);
     EXPECT_TRUE(waitUntil([&] { return ready(uuid).empty(); }));
