@@ -5,6 +5,7 @@
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
+#include "platform/lum/Limits.h"
 #include "platform/system/Directories.h"
 #include "platform/values/Cbor.h"
 
@@ -62,6 +63,20 @@ platform::Array arrayOf(const std::vector<std::string>& texts) {
     return platform::Array(std::vector<Value>(texts.begin(), texts.end()));
 }
 
+/// Whether one of the lists that the daemon bounds is longer than it takes.
+bool hasTooLongList(const Message& message) {
+    const auto isTooLong = [&](const char* key) {
+        const Value* list = message.find(key);
+        return list && list->array() && list->array()->size() > platform::lum::kMaxListed;
+    };
+    const Value* type = message.find(message::kRequest);
+    const Value* all = message.find(message::kAnnotations);
+    const bool isBulk = type && type->string() && *type->string() == request::kBulkAnnotate;
+    return isTooLong(message::kUuids) || isTooLong(message::kPaths) ||
+           (isBulk && all && all->dictionary() &&
+            all->dictionary()->size() > platform::lum::kMaxListed);
+}
+
 std::string describeReply(const ZRDaemonClient::Reply& reply) {
     return std::visit([](const auto& received) { return describe(received); }, reply);
 }
@@ -87,6 +102,12 @@ void ZRDaemonClient::setUuids(Message& message, const std::vector<Uuid>& uuids) 
 
 void ZRDaemonClient::send(Message message, ReplyCallback reply) {
     EVLOG_DEBUG(traffic(), "request: {}", message);
+    if (hasTooLongList(message)) {
+        const ConnectionError refused{ConnectionError::Kind::Refused, "it has too long a list"};
+        return replyQueue_.async([reply = std::move(reply), refused] {
+            if (reply) reply(Reply(refused));
+        });
+    }
     zrd_->sendWithReply(std::move(message), [reply = std::move(reply)](const Reply& received) {
         EVLOG_DEBUG(traffic(), "reply: {}", describeReply(received));
         if (reply) reply(received);

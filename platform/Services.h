@@ -3,6 +3,7 @@
 #include <memory>
 
 #include "platform/lum/PeerLooks.h"
+#include "platform/lum/PlaceLooks.h"
 #include "platform/sandbox/Sandbox.h"
 #include "platform/services/Assertions.h"
 #include "platform/services/CodeSigning.h"
@@ -22,10 +23,11 @@ namespace platform {
 struct Services {
     Directories directories;
     std::shared_ptr<RunLoop> mainLoop;
-    std::shared_ptr<PeerLooks> looks;       // at hosts' executables, on that loop
-    std::shared_ptr<PeerLooks> pathLooks;   // at what they name, so that it is in nobody's way
-    std::shared_ptr<SdkDictionaries> sdks;  // used by the registry, so it goes after it
-    std::shared_ptr<Workspace> workspace;   // null when the registry could not be opened
+    std::shared_ptr<PeerLooks> looks;         // at hosts' executables, on that loop
+    std::shared_ptr<PeerLooks> pathLooks;     // at what they name, so that it is in nobody's way
+    std::shared_ptr<PlaceLooks> bundleLooks;  // at registered bundles, on that loop
+    std::shared_ptr<SdkDictionaries> sdks;    // used by the registry, so it goes after it
+    std::shared_ptr<Workspace> workspace;     // null when the registry could not be opened
     std::shared_ptr<CodeSigning> codeSigning;
     std::shared_ptr<Sandbox> sandbox;
     std::shared_ptr<Assertions> assertions;

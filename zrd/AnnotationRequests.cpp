@@ -5,6 +5,7 @@
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
+#include "platform/lum/Limits.h"
 #include "platform/values/Value.h"
 #include "zrd/Transaction.h"
 #include "zrd/ZRDLumClient.h"
@@ -47,6 +48,11 @@ bool Transaction::hasShareFor(const Dictionary& change, const ZRDPlugIn& plugIn)
     return false;
 }
 
+void Transaction::annotate(const Dictionary& change, const ZRDPlugIn& plugIn) {
+    hasUnsavedAnnotations_ = true;
+    server().changeAnnotation(change, plugIn, origin());
+}
+
 void Transaction::annotatePlugIns() {
     const Dictionary* annotations = requestedAnnotations();
     if (!annotations) return;
@@ -66,7 +72,7 @@ void Transaction::annotatePlugIns() {
     }
     if (change.empty()) return done();
 
-    // A plug-in named again has the change already. Everybody waits for each change to be stored.
+    // A plug-in named again has the change already.
     std::unordered_set<platform::Uuid> changed;
     bool completed = processUuidList([&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
         if (!changed.insert(plugIn->uuid()).second) return Walk::Continue;
@@ -78,7 +84,7 @@ void Transaction::annotatePlugIns() {
             EVLOG_INFO(ops(), "client {} plug-in {}({}) election := {}", client_->pid(),
                        plugIn->identifier(), pub(plugIn->uuid()), *election);
         }
-        server().setAnnotation(change, *plugIn, origin());
+        annotate(change, *plugIn);
         return Walk::Continue;
     });
     if (!completed) return;
@@ -90,8 +96,10 @@ void Transaction::bulkAnnotatePlugIns() {
     const Dictionary* annotations = requestedAnnotations();
     if (!annotations) return;
     EVLOG_DEBUG(ops(), "bulk change requested for {} plug-ins", annotations->size());
-    // A UUID can be spelt in many ways, and each change is a sync of the disk: of the entries for
-    // one plug-in only the last is applied, which would replace what those before it had set.
+    if (annotations->size() > platform::lum::kMaxListed)
+        return fail(kZRErrorInvalidRequest, "invalid request format (bad annotations dictionary)");
+    // A UUID can be spelt in many ways: of the entries for one plug-in only the last is applied,
+    // which would replace what those before it had set.
     std::unordered_map<platform::Uuid, const Value*> lastOf;
     for (const auto& [key, value] : *annotations) {
         if (auto uuid = platform::Uuid::parse(key)) lastOf[*uuid] = &value;
@@ -110,7 +118,7 @@ void Transaction::bulkAnnotatePlugIns() {
         if (!hasRoomFor(change, *plugIn)) return;
         EVLOG_DEBUG(ops(), "client {} bulk plug-in {}({}) annotation change: {}", client_->pid(),
                     plugIn->identifier(), pub(plugIn->uuid()), value);
-        server().setAnnotation(change, *plugIn, origin());
+        annotate(change, *plugIn);
     }
     server().notifyAnnotationChange();
     done();

@@ -14,6 +14,11 @@ namespace zorvan {
 /// the origin that set its "extension" last, and to nobody when that was before this daemon began.
 /// One origin may have a quarter of the room that there is for hosts' data.
 ///
+/// Numbers of sessions and namespaces are given out again. Whoever comes to have that of an origin
+/// that has gone takes over what it has stored: it may then store less, never more than a quarter,
+/// until it replaces that or the daemon starts anew, and the user's elections find room all the
+/// same. To forget an origin at its end would let everybody begin a new quarter by connecting anew.
+///
 /// Owned and used by the annotation store.
 class AnnotationShares {
   public:

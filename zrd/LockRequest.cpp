@@ -7,6 +7,7 @@
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
+#include "platform/lum/Limits.h"
 #include "zrd/Transaction.h"
 #include "zrd/ZRDLumClient.h"
 #include "zrd/ZRDPlugIn.h"
@@ -41,8 +42,9 @@ void Transaction::lockDownPlugIns() {
 }
 
 void Transaction::releaseHolds(const Array& tokens) {
+    if (tokens.size() > platform::lum::kMaxListed) return static_cast<void>(failForBadUuids());
     for (const Value& element : tokens) {
-        // What is no token releases nothing: this never fails.
+        // What is no token releases nothing.
         if (auto token = element.uuid()) server().unholdToken(*token);
     }
     done();

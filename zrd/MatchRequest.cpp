@@ -36,6 +36,22 @@ std::vector<RuleSet> exclusionRules(const std::optional<Value>& stored,
 
 }  // namespace
 
+/// What a match has found, while it waits for tokens.
+struct Transaction::Matching {
+    /// An accepted form that has none yet.
+    struct Late {
+        std::size_t number;  // in the result
+        std::shared_ptr<ZRDPlugIn> plugIn;
+        ZRDPlugIn::Draft draft;
+    };
+
+    Matching(std::uint64_t flags, std::size_t expected) : result(flags, expected) {}
+
+    MatchResult result;
+    std::size_t leftOut = 0;
+    std::vector<Late> late;
+};
+
 void Transaction::matchPlugIns() {
     const Value* rules = request_.find(message::kRules);
     if (rules && !areRules(*rules)) {
@@ -59,8 +75,7 @@ void Transaction::matchPlugIns() {
     const auto untouched = server().services().workspace->untouchedBundles();
     auto candidates = server().findPlugIns(given).value_or(ZRDPlugInList());
     probes::discoverRaw(static_cast<unsigned int>(candidates.size()));
-    MatchResult result(query.flags, candidates.size());
-    std::size_t leftOut = 0;
+    const auto matching = std::make_shared<Matching>(query.flags, candidates.size());
     for (const auto& plugIn : candidates) {
         // Nobody works for a host that is gone.
         if (!client_->acceptWork()) return;
@@ -71,14 +86,60 @@ void Transaction::matchPlugIns() {
             EVLOG_ERROR(ops(), "failed to export matching plug-in {}: {}", pub(plugIn->uuid()),
                         pub(*error));
         }
-        if (!draft || !result.admit(*plugIn)) continue;
-        // Only who has won is given tokens.
-        Dictionary form = plugIn->completedForm(*std::move(draft));
-        addAnnotationForPlugIn(*plugIn, form);
-        if (!result.append(plugIn, std::move(form))) ++leftOut;
+        if (draft && matching->result.admit(*plugIn)) accept(plugIn, *draft, *matching);
     }
-    if (leftOut != 0)
-        EVLOG_ERROR(ops(), "leaving {} plug-ins out of a match that no reply can hold", leftOut);
+    if (matching->leftOut != 0)
+        EVLOG_ERROR(ops(), "leaving {} plug-ins out of a match that no reply can hold",
+                    matching->leftOut);
+    completeLateForms(matching);
+}
+
+/// Only who has won is given tokens.
+void Transaction::accept(const std::shared_ptr<ZRDPlugIn>& plugIn, ZRDPlugInDraft& draft,
+                         Matching& matching) {
+    auto form = plugIn->completedForm(draft, platform::Wait::Never);
+    const bool isLate = !form;
+    if (isLate) {
+        form = draft.form;
+        form->set(form::kExtensions, Dictionary());
+    }
+    addAnnotationForPlugIn(*plugIn, *form);
+    if (!matching.result.append(plugIn, *std::move(form)))
+        ++matching.leftOut;
+    else if (isLate)
+        matching.late.push_back({matching.result.lastAccepted(), plugIn, std::move(draft)});
+}
+
+/// Gives tokens to those whose file systems have to be asked, beside the service queue.
+void Transaction::completeLateForms(const std::shared_ptr<Matching>& matching) {
+    std::erase_if(matching->late,
+                  [&](const auto& late) { return !matching->result.stands(late.number); });
+    const auto forms = std::make_shared<std::vector<Dictionary>>(matching->late.size());
+    std::vector<platform::PlaceLooks::Look> looks;
+    for (std::size_t i = 0; i < forms->size(); ++i) {
+        const auto& late = matching->late[i];
+        looks.push_back(
+            {late.plugIn->path(), [plugIn = late.plugIn, draft = late.draft, forms, i]() mutable {
+                 (*forms)[i] = *plugIn->completedForm(draft, platform::Wait::Allowed);
+             }});
+    }
+    lookAtBundles(std::move(looks), [this, matching, forms](const std::vector<bool>& done) {
+        for (std::size_t i = 0; i < done.size(); ++i) {
+            const auto& late = matching->late[i];
+            if (!done[i]) {
+                EVLOG_INFO(ops(),
+                           "no extensions for plug-in at {}: its file system does not answer",
+                           late.plugIn->path());
+                continue;
+            }
+            addAnnotationForPlugIn(*late.plugIn, (*forms)[i]);
+            matching->result.replace(late.number, std::move((*forms)[i]));
+        }
+        answerMatch(matching->result);
+    });
+}
+
+void Transaction::answerMatch(MatchResult& result) {
     result.linkOverrides();
     EVLOG_INFO(ops(), "match returned {} plug-ins", result.size());
     if (auto matches =

@@ -30,6 +30,13 @@ class MatchResult {
     /// Accepts the form of the plug-in that was admitted last, unless one reply cannot hold it with
     /// the others: then the answer is false.
     bool append(std::shared_ptr<ZRDPlugIn> plugIn, platform::Dictionary form);
+    /// The number of the form that was accepted last.
+    std::size_t lastAccepted() const { return accepted_.size() - 1; }
+    /// Whether an accepted form still stands, by its number.
+    bool stands(std::size_t number) const { return !accepted_[number].displaced; }
+    /// Puts another form of the same plug-in into the place of an accepted one, unless one reply
+    /// cannot hold it with the others.
+    void replace(std::size_t number, platform::Dictionary form);
     /// Sets "overrider" on the form of each replaced plug-in and "overriding" on its replacer's.
     void linkOverrides();
 

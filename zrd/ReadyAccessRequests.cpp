@@ -2,6 +2,7 @@
 
 #include <fmt/format.h>
 
+#include <cerrno>
 #include <unordered_set>
 
 #include "Zorvan/Keys.h"
@@ -48,31 +49,87 @@ void Transaction::readyPlugIns() {
         return Walk::Continue;
     });
     if (!completed) return;
-    std::optional<ZRError> firstFailure;
-    for (const auto& plugIn : toEnable) {
-        auto failure = plugIn->enableForClient(*client_);
-        if (failure && !firstFailure) firstFailure = std::move(failure);
-    }
-    if (firstFailure) return fail(kZRErrorInvalidRequest, *firstFailure);
-    done();
+    enableWhenPrepared(std::move(toEnable));
 }
 
+void Transaction::enableWhenPrepared(std::vector<std::shared_ptr<ZRDPlugIn>> plugIns) {
+    using Preparation = ZRDPlugIn::Preparation;
+    const auto prepared = std::make_shared<std::vector<Preparation>>(plugIns.size());
+    std::vector<platform::PlaceLooks::Look> looks;
+    for (std::size_t i = 0; i < plugIns.size(); ++i)
+        looks.push_back({plugIns[i]->path(), [plugIn = plugIns[i], client = client_, prepared, i] {
+                             (*prepared)[i] = plugIn->prepareForClient(*client);
+                         }});
+    lookAtBundles(std::move(looks), [this, plugIns = std::move(plugIns),
+                                     prepared](const std::vector<bool>& done) {
+        // Since they were looked at they may have been held, or gone.
+        for (const auto& plugIn : plugIns) {
+            if (!server().findPlugIn(plugIn->uuid()))
+                return fail(kZRErrorInvalidRequest, "no such plugin (uuid not found)");
+            if (!admitToReady(*plugIn)) return;
+        }
+        const Preparation tooLate{.service = nullptr, .failure = ETIMEDOUT};
+        std::optional<ZRError> firstFailure;
+        for (std::size_t i = 0; i < plugIns.size(); ++i) {
+            auto failure =
+                plugIns[i]->enableForClient(*client_, done[i] ? (*prepared)[i] : tooLate);
+            if (failure && !firstFailure) firstFailure = std::move(failure);
+        }
+        if (firstFailure) return fail(kZRErrorInvalidRequest, *firstFailure);
+        this->done();
+    });
+}
+
+namespace {
+
+/// Read access to a bundle that is asked for.
+struct Access {
+    std::shared_ptr<ZRDPlugIn> plugIn;
+    platform::Result<std::string> token;
+};
+
+}  // namespace
+
 void Transaction::accessPlugIns() {
-    Array tokens;
+    const auto sandbox = server().services().sandbox;
+    const auto accesses = std::make_shared<std::vector<Access>>();
+    const auto failAt = [this](const ZRDPlugIn& plugIn, int code) {
+        fail(kZRErrorInvalidRequest,
+             fmt::format("cannot create extension to {}: {}", plugIn.path(), code));
+    };
+    std::vector<std::size_t> late;
     bool completed = processUuidList([&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
         auto token =
-            server().services().sandbox->issueReadExtension(plugIn->bundleDirectory(), ".");
-        if (!token) {
-            fail(kZRErrorInvalidRequest, fmt::format("cannot create extension to {}: {}",
-                                                     plugIn->path(), token.error().code));
+            sandbox->issueReadExtension(plugIn->bundleDirectory(), ".", platform::Wait::Never);
+        const bool isLate = !token && token.error().code == EAGAIN;
+        if (!token && !isLate) {
+            failAt(*plugIn, token.error().code);
             return Walk::Stop;
         }
-        tokens.append(*std::move(token));
+        if (isLate) late.push_back(accesses->size());
+        accesses->push_back({plugIn, std::move(token)});
         return Walk::Continue;
     });
     if (!completed) return;
-    reply_.set(message::kExtensions, std::move(tokens));
-    done();
+    std::vector<platform::PlaceLooks::Look> looks;
+    looks.reserve(late.size());
+    for (const std::size_t index : late)
+        looks.push_back({(*accesses)[index].plugIn->path(), [sandbox, accesses, index] {
+                             Access& access = (*accesses)[index];
+                             access.token = sandbox->issueReadExtension(
+                                 access.plugIn->bundleDirectory(), ".", platform::Wait::Allowed);
+                         }});
+    lookAtBundles(std::move(looks), [=, this](const std::vector<bool>& done) {
+        for (std::size_t i = 0; i < done.size(); ++i) {
+            const Access& access = (*accesses)[late[i]];
+            if (!done[i]) return failAt(*access.plugIn, ETIMEDOUT);
+            if (!access.token) return failAt(*access.plugIn, access.token.error().code);
+        }
+        Array tokens;
+        for (Access& access : *accesses) tokens.append(*std::move(access.token));
+        reply_.set(message::kExtensions, std::move(tokens));
+        this->done();
+    });
 }
 
 }  // namespace zorvan

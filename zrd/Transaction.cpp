@@ -2,8 +2,11 @@
 
 #include <fmt/format.h>
 
+#include <utility>
+
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
+#include "platform/lum/Limits.h"
 #include "platform/values/Value.h"
 #include "zrd/Probes.h"
 #include "zrd/RequestPaths.h"
@@ -18,6 +21,10 @@ using platform::Value;
 
 namespace {
 
+bool isTooLong(const platform::Array& list) {
+    return list.size() > platform::lum::kMaxListed;
+}
+
 std::shared_ptr<RequestPaths> pathsOf(const platform::Message& request) {
     const Value* type = request.find(message::kRequest);
     if (!type || !type->string()) return nullptr;
@@ -26,7 +33,8 @@ std::shared_ptr<RequestPaths> pathsOf(const platform::Message& request) {
     const bool isLock = name == request::kLock && !(tokens && tokens->array());
     if (name != request::kAdd && name != request::kRemove && !isLock) return nullptr;
     const Value* paths = request.find(message::kPaths);
-    if (!paths || !paths->array() || paths->array()->empty()) return nullptr;
+    if (!paths || !paths->array() || paths->array()->empty() || isTooLong(*paths->array()))
+        return nullptr;
     return std::make_shared<RequestPaths>(*paths->array());
 }
 
@@ -90,9 +98,22 @@ void Transaction::dispatch() {
     fail(kZRErrorInvalidRequest, "unrecognized request");
 }
 
+void Transaction::lookAtBundles(std::vector<platform::PlaceLooks::Look> looks,
+                                std::function<void(const std::vector<bool>& done)> then) {
+    if (looks.empty()) return then({});
+    server().services().bundleLooks->make(
+        std::move(looks),
+        [self = shared_from_this(), then = std::move(then)](const std::vector<bool>& done) mutable {
+            ZRDServer& server = self->server();
+            // Handed on, so that nothing of the request goes on this thread.
+            server.submitWork(
+                [self = std::move(self), then = std::move(then), done] { then(done); });
+        });
+}
+
 const platform::Array* Transaction::requestedPaths() {
     const Value* paths = request_.find(message::kPaths);
-    if (paths && paths->array()) return paths->array();
+    if (paths && paths->array() && !isTooLong(*paths->array())) return paths->array();
     fail(kZRErrorInvalidRequest, "invalid request format");
     return nullptr;
 }
@@ -130,12 +151,10 @@ bool Transaction::processUuidList(
         fail(kZRErrorInvalidRequest, "invalid request format (uuid)");
         return false;
     }
+    if (isTooLong(*uuids->array())) return failForBadUuids();
     for (const Value& element : *uuids->array()) {
         auto uuid = element.uuid();
-        if (!uuid) {
-            fail(kZRErrorInvalidRequest, "invalid request (bad uuid array)");
-            return false;
-        }
+        if (!uuid) return failForBadUuids();
         auto plugIn = server().findPlugIn(*uuid);
         if (!plugIn) {
             fail(kZRErrorInvalidRequest, "no such plugin (uuid not found)");
@@ -146,6 +165,11 @@ bool Transaction::processUuidList(
     return true;
 }
 
+bool Transaction::failForBadUuids() {
+    fail(kZRErrorInvalidRequest, "invalid request (bad uuid array)");
+    return false;
+}
+
 void Transaction::addAnnotationForPlugIn(const ZRDPlugIn& plugIn, Dictionary& in) const {
     // A form has an empty annotation from its record: left as it is, it keeps its encoded bytes.
     if (auto annotation = server().annotationForPlugIn(plugIn))
@@ -153,6 +177,8 @@ void Transaction::addAnnotationForPlugIn(const ZRDPlugIn& plugIn, Dictionary& in
 }
 
 void Transaction::done() {
+    // What was changed is on the disk before anybody is told.
+    if (std::exchange(hasUnsavedAnnotations_, false)) server().saveAnnotations();
     if (probes::requestOutputEnabled()) {
         probes::requestOutput(client_->pid(), describe(reply_).c_str());
     }

@@ -11,15 +11,18 @@
 #include "Zorvan/ZRError.h"
 #include "platform/lum/Message.h"
 #include "platform/lum/Origin.h"
+#include "platform/lum/PlaceLooks.h"
 #include "zrd/HostRestriction.h"
 
 namespace zorvan {
 
+class MatchResult;
 class RequestPaths;
 class ZRDLumClient;
 class ZRDPlugIn;
 class ZRDServer;
 struct HoldSubject;
+struct ZRDPlugInDraft;
 
 /// One request being served: the message, the reply being built for it, and who sent it. Made when
 /// the message arrives; everything else runs on the service queue, one transaction at a time (but
@@ -54,10 +57,23 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void bulkAnnotatePlugIns();
     void lockDownPlugIns();
 
+    struct Matching;
+    void accept(const std::shared_ptr<ZRDPlugIn>& plugIn, ZRDPlugInDraft& draft,
+                Matching& matching);
+    void completeLateForms(const std::shared_ptr<Matching>& matching);
+    void answerMatch(MatchResult& result);
+
+    /// Has looks at bundles made, which their file systems may hold up, and goes on with which of
+    /// them are done: on the service queue, and at once when there are none. A look that hangs goes
+    /// on for as long, so it must not hold this object.
+    void lookAtBundles(std::vector<platform::PlaceLooks::Look> looks,
+                       std::function<void(const std::vector<bool>& done)> then);
+
     /// Read when it is first asked for.
     const HostRestriction& hostRestriction();
     /// Whether the host may have a plug-in made ready; otherwise the failure has been sent.
     bool admitToReady(const ZRDPlugIn& plugIn);
+    void enableWhenPrepared(std::vector<std::shared_ptr<ZRDPlugIn>> plugIns);
     void releaseHolds(const platform::Array& tokens);
     /// What "paths" names; false when the failure has been sent.
     bool collectPlugInsToHold(HoldSubject& subject);
@@ -65,6 +81,8 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     bool areIdle(const std::vector<std::shared_ptr<ZRDPlugIn>>& plugIns);
     void takeHold(HoldSubject subject);
 
+    /// Changes the plug-in's annotation for this client; saved with the others before the reply.
+    void annotate(const platform::Dictionary& change, const ZRDPlugIn& plugIn);
     /// The request's "annotations"; null when they cannot be stored, and the failure has been sent.
     const platform::Dictionary* requestedAnnotations();
     /// Whether the store has room for a change; otherwise the failure has been sent.
@@ -101,6 +119,8 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void refuseRemoving(const std::string& path);
     /// Visits the plug-ins that "uuids" names, in order; answers as `marshalPaths`.
     bool processUuidList(const std::function<Walk(const std::shared_ptr<ZRDPlugIn>&)>& callback);
+    /// Sends the failure of "uuids" that are no list of UUIDs, or too many; answers false.
+    bool failForBadUuids();
     /// Stores the plug-in's annotation, or an empty one, under "annotations".
     void addAnnotationForPlugIn(const ZRDPlugIn& plugIn, platform::Dictionary& in) const;
 
@@ -121,6 +141,7 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     const std::shared_ptr<RequestPaths> paths_;
     platform::Message reply_;
     std::optional<HostRestriction> hostRestriction_;
+    bool hasUnsavedAnnotations_ = false;
     std::atomic<std::uint64_t> version_{0};
 };
 

@@ -153,6 +153,13 @@ bool ZRDAnnotationStore::hasShareFor(const Dictionary& annotation, const ZRDPlug
 void ZRDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,
                                        const ZRDPlugIn& plugIn,
                                        const std::optional<platform::Origin>& origin) {
+    changeAnnotation(annotation, plugIn, origin);
+    save();
+}
+
+void ZRDAnnotationStore::changeAnnotation(const std::optional<Dictionary>& annotation,
+                                          const ZRDPlugIn& plugIn,
+                                          const std::optional<platform::Origin>& origin) {
     const std::string& key = plugIn.annotationKey();
     std::optional<platform::PropertyListCost> cost;
     if (const Value* current = annotations_.find(key)) cost_ -= costOf(key, *current);
@@ -167,6 +174,9 @@ void ZRDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotati
     }
     shares_.changed(key, cost);
     text_.changed(key);
+}
+
+void ZRDAnnotationStore::save() {
     if (auto error = saveDb()) {
         EVLOG_ERROR(ops(), "unable to save annotations:{} error:{}", pub(annotationsURL_),
                     pub(*error));

@@ -57,6 +57,11 @@ class ZRDAnnotationStore {
                        const ZRDPlugIn& plugIn,
                        const std::optional<platform::Origin>& origin = std::nullopt);
 
+    /// The same without saving, for who changes many; and what saves them.
+    void changeAnnotation(const std::optional<platform::Dictionary>& annotation,
+                          const ZRDPlugIn& plugIn, const std::optional<platform::Origin>& origin);
+    void save();
+
     /// Each answers what went wrong, or none.
     std::optional<ZRError> loadDb();
     std::optional<ZRError> saveDb();

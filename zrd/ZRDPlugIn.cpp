@@ -149,16 +149,19 @@ std::optional<ZRDPlugIn::Draft> ZRDPlugIn::draftForm(const platform::UntouchedBu
     }
     // The only token of a form that is kept is that for the bundle itself.
     if (form && (!isAppExtension() || untouched.contains(path()) ||
-                 platform::isInPlace(path(), tdproxy_->bundleIdentity)))
+                 bundleDirectory().open(platform::Wait::Never)))
         return Draft{*std::move(form), true, nameChanges};
     form = exportForm(error);
     if (!form) return std::nullopt;
     return Draft{*std::move(form), false, nameChanges};
 }
 
-Dictionary ZRDPlugIn::completedForm(Draft draft) const {
+std::optional<Dictionary> ZRDPlugIn::completedForm(Draft& draft, platform::Wait wait) const {
+    if (draft.isComplete) return std::move(draft.form);
+    const Augmented augmented = augmentForm(draft.form, wait);
+    if (augmented == Augmented::NotYet) return std::nullopt;
     // Tokens that could not be issued now may be another time, and others may go stale.
-    if (draft.isComplete || !augmentForm(draft.form)) return std::move(draft.form);
+    if (augmented == Augmented::ForNow) return std::move(draft.form);
     platform::keepCborEncoded(draft.form);
     std::lock_guard lock(mutex_);
     if (draft.nameChanges == nameChanges_) form_ = draft.form;

@@ -8,6 +8,7 @@
 #include <string>
 
 #include "Zorvan/ZRPlugInCore.h"
+#include "platform/spawnerd/Launcher.h"
 #include "platform/system/KnownDirectory.h"
 #include "platform/tandry/TDPlugInProxy.h"
 #include "platform/tandry/UntouchedBundles.h"
@@ -19,6 +20,13 @@ class HostRestriction;
 struct PlugInContext;
 class RulePattern;
 class RuleSet;
+
+/// A form on its way into an answer: as `exportForm` makes it, or complete already.
+struct ZRDPlugInDraft {
+    platform::Dictionary form;
+    bool isComplete = false;
+    std::uint64_t nameChanges = 0;  // that the form takes in
+};
 
 /// The daemon's record of one installed plug-in, tied to the registry's record of it, which answers
 /// the dictionary lookups and the names. Made by the database on its queue, then shared: everything
@@ -52,12 +60,7 @@ class ZRDPlugIn final : public ZRPlugInCore {
     /// around what is not part of the system.
     std::optional<ZRError> diagnose() const override;
 
-    /// A form on its way into an answer: as `exportForm` makes it, or complete already.
-    struct Draft {
-        platform::Dictionary form;
-        bool isComplete = false;
-        std::uint64_t nameChanges = 0;  // that the form takes in
-    };
+    using Draft = ZRDPlugInDraft;
     /// The record's form, without tokens unless it was completed before. An error: there is none,
     /// as with `exportForm`.
     std::optional<Draft> draftForm(const platform::UntouchedBundles& untouched,
@@ -65,8 +68,9 @@ class ZRDPlugIn final : public ZRPlugInCore {
     /// The form with what `augmentForm` adds. Unless its tokens may go stale, it is encoded at the
     /// first call and shared from then on, as long as the bundle that it has a token for is in its
     /// place, which `draftForm` looks at unless it is one of `untouched`; setting a name makes it
-    /// afresh.
-    platform::Dictionary completedForm(Draft draft) const;
+    /// afresh. None, and the draft as it was, when that would have to wait for the bundle's file
+    /// system, and may not.
+    std::optional<platform::Dictionary> completedForm(Draft& draft, platform::Wait wait) const;
 
     /// The plug-in's value for an entitlement, or null.
     const platform::Value* valueForEntitlement(std::string_view name) const;
@@ -97,16 +101,30 @@ class ZRDPlugIn final : public ZRPlugInCore {
     /// The same with the host's restriction, for who asks about many plug-ins.
     std::optional<std::string> allowForClient(const HostProcess& host,
                                               const HostRestriction& restriction) const;
-    // Enabling. On the service queue.
-    /// Tells the launcher that the host may start this plug-in, and how. The error says why not.
-    std::optional<ZRError> enableForClient(const HostProcess& host) const;
+    // Enabling.
+    /// What a host needs to start this plug-in, as the bundle is now, or why it cannot.
+    struct Preparation {
+        std::shared_ptr<const platform::CheckedService> service;  // null when the launcher refuses
+        int failure = 0;                                          // the launcher's, then
+        std::optional<ZRError> error{};  // when the launcher was not even asked
+    };
+    /// Prepares the start by a host. Waits for the bundle's file system, so not on the service
+    /// queue.
+    Preparation prepareForClient(const HostProcess& host) const;
+    /// Tells the launcher that the host may start this plug-in, as it was prepared. The error says
+    /// why not.
+    std::optional<ZRError> enableForClient(const HostProcess& host,
+                                           const Preparation& preparation) const;
     /// A token for each named resource of the bundle ("." is the bundle), under its name, up to 64
     /// of them; those for which there is none are left out, with a log line. `resources` is a text
-    /// or a list.
-    platform::Dictionary issueResourceExtensions(const platform::Value& resources) const;
-    /// Adds the tokens for what the plug-in shares with hosts. Whether they are good for as long as
-    /// this record, and its bundle in its place.
-    bool augmentForm(platform::Dictionary& form) const;
+    /// or a list. None when one would have to wait for the bundle's file system, and may not.
+    std::optional<platform::Dictionary> issueResourceExtensions(const platform::Value& resources,
+                                                                platform::Wait wait) const;
+    /// What comes of `augmentForm`.
+    enum class Augmented { ForGood, ForNow, NotYet };
+    /// Adds the tokens for what the plug-in shares with hosts: for as long as this record, and its
+    /// bundle in its place; for this answer alone; or not, as it would have to wait.
+    Augmented augmentForm(platform::Dictionary& form, platform::Wait wait) const;
     /// What a busy running instance says of itself, or none.
     std::optional<platform::Dictionary> checkBusy() const;
 

@@ -93,7 +93,7 @@ Dictionary ZRDPlugIn::launchService() const {
     return service;
 }
 
-std::optional<ZRError> ZRDPlugIn::enableForClient(const HostProcess& host) const {
+ZRDPlugIn::Preparation ZRDPlugIn::prepareForClient(const HostProcess& host) const {
     const Dictionary overlay{{overlay::kService, launchService()},
                              {overlay::kPackageType, overlay::kLumPackage}};
     EVLOG_DEFAULT(ops(), "allowing host {} {} to use plug-in {}({}) uuid={} at {}", host.pid(),
@@ -103,29 +103,40 @@ std::optional<ZRError> ZRDPlugIn::enableForClient(const HostProcess& host) const
     if (!executable) {
         EVLOG_ERROR(ops(), "failed to obtain execPath for plug-in {}({}) bundle={}", identifier(),
                     pub(uuid()), bundle.get());
-        return ZRErrorWithFormat(kZRErrorInvalidRequest,
-                                 "cannot obtain executable path for plug-in {}({})", identifier(),
-                                 uuid().string());
+        return {.service = nullptr,
+                .error = ZRErrorWithFormat(kZRErrorInvalidRequest,
+                                           "cannot obtain executable path for plug-in {}({})",
+                                           identifier(), uuid().string())};
     }
     EVLOG_DEBUG(ops(), "activation overlay={}", overlay);
     const platform::ExternalService service{*executable, bundleDirectory(),
                                             tdproxy_->dataContainerPath.value_or("")};
-    const ZRError unable = ZRErrorWithFormat(
-        kZRErrorInvalidRequest, "unable to enable plug-in {}({})", identifier(), uuid().string());
-    const auto token = host.auditToken();
-    int failure = ESRCH;
     if (const auto error = context_->workspace->restoreContainer(*tdproxy_))
-        failure = error->code;
-    else if (token)
-        failure = context_->launcher->addExternalService(*token, service, overlay);
+        return {.service = nullptr, .failure = error->code};
+    auto checked = context_->launcher->checkExternalService(service, overlay);
+    if (!checked) return {.service = nullptr, .failure = checked.error().code};
+    return {.service = *std::move(checked)};
+}
+
+std::optional<ZRError> ZRDPlugIn::enableForClient(const HostProcess& host,
+                                                  const Preparation& preparation) const {
+    if (preparation.error) return preparation.error;
+    int failure = preparation.failure;
+    if (preparation.service) {
+        const auto token = host.auditToken();
+        failure =
+            token ? context_->launcher->grantExternalService(*token, preparation.service) : ESRCH;
+    }
     if (failure == 0) return std::nullopt;
     EVLOG_ERROR(ops(),
                 "spawnerd error {} trying to allow {} {} to use plug-in {}({}) uuid={} at {}",
                 failure, host.pid(), host.path(), identifier(), version(), pub(uuid()), path());
-    return unable;
+    return ZRErrorWithFormat(kZRErrorInvalidRequest, "unable to enable plug-in {}({})",
+                             identifier(), uuid().string());
 }
 
-Dictionary ZRDPlugIn::issueResourceExtensions(const Value& resources) const {
+std::optional<Dictionary> ZRDPlugIn::issueResourceExtensions(const Value& resources,
+                                                             platform::Wait wait) const {
     const Value* begin = resources.array() ? resources.array()->begin() : &resources;
     const Value* end = resources.array() ? resources.array()->end() : &resources + 1;
     const platform::KnownDirectory bundle = bundleDirectory();
@@ -139,9 +150,11 @@ Dictionary ZRDPlugIn::issueResourceExtensions(const Value& resources) const {
             break;
         }
         known.insert(*name);
-        auto token = context_->sandbox->issueReadExtension(bundle, *name);
+        auto token = context_->sandbox->issueReadExtension(bundle, *name, wait);
         if (token) {
             extensions.set(*name, *std::move(token));
+        } else if (wait == platform::Wait::Never && token.error().code == EAGAIN) {
+            return std::nullopt;
         } else {
             const std::string location = *name == "." ? path() : platform::joinPath(path(), *name);
             EVLOG_INFO(ops(), "failed to make extension for {} in plug-in at {}: {}", location,
@@ -151,16 +164,18 @@ Dictionary ZRDPlugIn::issueResourceExtensions(const Value& resources) const {
     return extensions;
 }
 
-bool ZRDPlugIn::augmentForm(Dictionary& form) const {
+ZRDPlugIn::Augmented ZRDPlugIn::augmentForm(Dictionary& form, platform::Wait wait) const {
     static const Value bundleItself = Array{"."};
     const Value* resources = isAppExtension() ? &bundleItself : pluginKey(key::kShared);
-    if (!resources) return true;
-    const Dictionary extensions = issueResourceExtensions(*resources);
-    form.set(form::kExtensions, extensions);
+    if (!resources) return Augmented::ForGood;
+    const auto extensions = issueResourceExtensions(*resources, wait);
+    if (!extensions) return Augmented::NotYet;
+    form.set(form::kExtensions, *extensions);
     // Another bundle is another record, and whether it is in its place is asked before the form is
     // used again. What lies in it may be exchanged without that, and then a token for what was
     // there grants nothing any more.
-    return resources == &bundleItself && !extensions.empty();
+    const bool isForGood = resources == &bundleItself && !extensions->empty();
+    return isForGood ? Augmented::ForGood : Augmented::ForNow;
 }
 
 }  // namespace zorvan

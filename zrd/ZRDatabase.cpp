@@ -129,6 +129,15 @@ std::optional<ZRError> ZRDatabase::setAnnotation(const std::optional<Dictionary>
     return std::nullopt;
 }
 
+void ZRDatabase::changeAnnotation(const Dictionary& annotation, const ZRDPlugIn& plugIn,
+                                  const platform::Origin& origin) {
+    sync_.sync([&] { annotations_->changeAnnotation(annotation, plugIn, origin); });
+}
+
+void ZRDatabase::saveAnnotations() {
+    sync_.sync([&] { annotations_->save(); });
+}
+
 void ZRDatabase::notifyAnnotationChange() {
     services_.notifications->post(kAnnotationChangeNotification);
 }

@@ -87,6 +87,10 @@ class ZRDatabase : public AnnotationReader, public platform::WorkspaceObserver {
     std::optional<ZRError> setAnnotation(
         const std::optional<platform::Dictionary>& annotation, const ZRDPlugIn& plugIn,
         const std::optional<platform::Origin>& origin = std::nullopt);
+    /// The same for one of many, which are saved together, once, by `saveAnnotations`.
+    void changeAnnotation(const platform::Dictionary& annotation, const ZRDPlugIn& plugIn,
+                          const platform::Origin& origin);
+    void saveAnnotations();
     /// Tells whoever listens that annotations, and with them match results, have changed.
     void notifyAnnotationChange();
 

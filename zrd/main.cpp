@@ -39,6 +39,7 @@ platform::Services diskServices(const std::string& serviceName,
         platform::makeKernelSandbox(services.directories, serviceName, *services.mainLoop);
     services.looks = std::make_shared<platform::PeerLooks>(*services.mainLoop);
     services.pathLooks = std::make_shared<platform::PeerLooks>(*services.mainLoop);
+    services.bundleLooks = std::make_shared<platform::PlaceLooks>(*services.mainLoop);
     services.codeSigning = platform::makeFileCodeSigning();
     services.assertions = platform::makeFileAssertions(services.directories);
     services.consent = platform::makeFileConsent(services.directories);

@@ -36,7 +36,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     fuzz::require(grant->environment.size() <= kMaxStrings);
     const Surroundings surroundings{.allowance = allowanceFor(*grant, settings),
                                     .busyFolder = fuzz::home().makeDirectory("busy")};
-    const auto setup = sandboxSetup(*grant, directories, "zrd", surroundings);
+    const auto setup = sandboxSetup(*grant, {}, directories, "zrd", surroundings);
     fuzz::require(bool(setup));
     for (const std::string& argument : setup->arguments)
         fuzz::require(argument.find('\0') == argument.npos);

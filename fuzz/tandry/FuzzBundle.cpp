@@ -28,7 +28,7 @@ void exportIt(const PlugInEntry& entry, const TDApplicationProxyRef& application
     std::optional<zorvan::ZRError> error;
     auto draft = plugIn->draftForm({}, error);
     if (!draft) return;
-    const std::optional form = plugIn->completedForm(*std::move(draft));
+    const auto form = plugIn->completedForm(*draft, Wait::Allowed);
     fuzz::require(isPropertyList(Value(*form)));
     std::string bytes;
     encodeCbor(*form, bytes);

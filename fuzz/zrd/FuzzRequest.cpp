@@ -23,6 +23,7 @@ struct World {
         services.mainLoop = std::make_shared<RunLoop>();
         services.looks = services.pathLooks =
             std::make_shared<platform::PeerLooks>(*services.mainLoop);
+        services.bundleLooks = std::make_shared<platform::PlaceLooks>(*services.mainLoop);
         services.workspace = workspace;
         services.codeSigning = codeSigning;
         services.sandbox = std::make_shared<zorvan::FakeSandbox>();

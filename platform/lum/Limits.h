@@ -13,6 +13,10 @@ inline constexpr std::size_t kMaxReplyPayload = 256u << 20;
 /// byte that is enough to encode it.
 inline constexpr std::size_t kMaxRequestValues = 1u << 18;
 
+/// Most elements of a list in a request that stand for something each ("uuids", "paths", and the
+/// entries of "annotations" in "bulk-annotate"): each costs up to 20 µs while everybody waits.
+inline constexpr std::size_t kMaxListed = 4096;
+
 /// A request with a larger payload is decoded on a thread of its own: so many values take longer
 /// than others should wait for.
 inline constexpr std::size_t kMaxDecodedAtOnce = 16u << 10;

@@ -9,7 +9,6 @@
 #include <chrono>
 #include <climits>
 #include <optional>
-#include <set>
 #include <system_error>
 #include <utility>
 #include <vector>
@@ -31,7 +30,7 @@ namespace {
 constexpr std::chrono::milliseconds kPauseAfterFailure{100};
 // Accepted at once; then the loop's other work has its turn.
 constexpr int kMostAcceptedAtOnce = 32;
-constexpr std::size_t kMostRefused = 1024;
+constexpr std::chrono::seconds kBetweenRefusalLines{10};
 
 bool isExhaustion(int errnum) {
     return errnum == EMFILE || errnum == ENFILE || errnum == ENOBUFS || errnum == ENOMEM;
@@ -78,8 +77,9 @@ struct Listener::State : std::enable_shared_from_this<Listener::State> {
     RunLoop::Timer pause;
     bool failing = false;  // accepting has failed, and hosts have waited since then
     bool closed = false;
-    UniqueFd undecided;        // accepted when no descriptors were left to look at its peer
-    std::set<Origin> refused;  // and told so in the log, until one of theirs is let in again
+    UniqueFd undecided;       // accepted when no descriptors were left to look at its peer
+    std::size_t refused = 0;  // by the pool, since the log was told
+    std::chrono::steady_clock::time_point nextRefusalLine{};
 
     State(SerialQueue& eventQueue, lum::ServiceSocket serviceSocket)
         : queue(eventQueue),
@@ -152,21 +152,19 @@ void Listener::State::admit(UniqueFd connected) {
     handler(std::move(connection));
 }
 
-/// None, with a line the first time, when those of the peer's origin have their part already.
+/// None when those of the peer's origin have their part already. With a line at times: whoever
+/// connects again and again, and from ever new origins, does not fill the log.
 std::optional<Pool::Share> Listener::State::drawFor(const AuditToken& token) {
-    const Origin origin = Origin::of(token);
-    auto share = pool.draw(origin);
-    if (share) {
-        refused.erase(origin);
-    } else {
-        // Who comes from ever new origins shall not make this grow.
-        if (refused.size() >= kMostRefused) refused.clear();
-        if (!refused.insert(origin).second) return share;
-        EVLOG_ERROR(ops(),
-                    "client {} is not let in: there are too many connections, or it and those it "
-                    "belongs with have too many, {} are the most",
-                    token.pid(), pool.quarter());
-    }
+    auto share = pool.draw(Origin::of(token));
+    if (share) return share;
+    ++refused;
+    const auto now = std::chrono::steady_clock::now();
+    if (now < nextRefusalLine) return share;
+    nextRefusalLine = now + kBetweenRefusalLines;
+    EVLOG_ERROR(ops(),
+                "client {} is not let in: there are too many connections, or it and those it "
+                "belongs with have too many, {} are the most ({} refused since the last such line)",
+                token.pid(), pool.mostOfOne(), std::exchange(refused, 0));
     return share;
 }
 

@@ -238,16 +238,22 @@ void PeerConnection::deliver(std::shared_ptr<const std::string> payload,
     decoding_ = true;
     const Origin& origin = share_.origin();
     common_.decoder->async(
-        origin, [weak = weak_from_this(), decoder = common_.decoder, origin, &loop = loop_,
-                 payload = std::move(payload), turn = std::move(turn)]() mutable {
+        origin, [weak = weak_from_this(), decoder = common_.decoder, origin, pid = pid(),
+                 &loop = loop_, payload = std::move(payload), turn = std::move(turn)]() mutable {
             auto decoded = std::make_shared<Decoded>();
             decoded->turn = std::move(turn);
             decoded->payload = decodePayload(std::move(payload), FrameKind::Request);
             if (auto* message = std::get_if<Message>(&decoded->payload))
                 decoded->turn->freeLater(std::move(decoder), origin, message->contents());
-            loop.post([weak = std::move(weak), decoded = std::move(decoded)] {
+            loop.post([weak = std::move(weak), pid, decoded = std::move(decoded)] {
                 auto self = weak.lock();
-                if (!self || self->invalid_) return;
+                if (!self || self->invalid_) {
+                    // Who is gone is none the less told of.
+                    if (const auto* error = std::get_if<Error>(&decoded->payload))
+                        EVLOG_ERROR(ops(), "client {} has gone, and left what is no request: {}",
+                                    pid, pub(error->text));
+                    return;
+                }
                 self->decoding_ = false;
                 self->handOver(std::move(*decoded));
                 self->proceed();

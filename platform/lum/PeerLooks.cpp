@@ -41,7 +41,8 @@ using JobRef = std::shared_ptr<Job>;
 }  // namespace
 
 struct PeerLooks::State : std::enable_shared_from_this<PeerLooks::State> {
-    State(RunLoop& runLoop, std::chrono::milliseconds time) : loop(runLoop), patience(time) {}
+    State(RunLoop& runLoop, std::chrono::milliseconds time, std::size_t mostOfOne)
+        : loop(runLoop), patience(time), pool(kMostThreads, mostOfOne) {}
 
     void begin(const JobRef& job);
     bool tryStart(const JobRef& job);
@@ -56,7 +57,7 @@ struct PeerLooks::State : std::enable_shared_from_this<PeerLooks::State> {
     RunLoop& loop;
     const std::chrono::milliseconds patience;
     // Of the loop:
-    Pool pool{kMostThreads};
+    Pool pool;
     std::map<Origin, std::deque<JobRef>> lines;  // who waits for a thread; none is empty
     std::vector<std::thread> threads;
 
@@ -164,8 +165,8 @@ void PeerLooks::State::close() {
     lines.clear();
 }
 
-PeerLooks::PeerLooks(RunLoop& loop, std::chrono::milliseconds patience)
-    : state_(std::make_shared<State>(loop, patience)) {}
+PeerLooks::PeerLooks(RunLoop& loop, std::chrono::milliseconds patience, std::size_t mostOfOne)
+    : state_(std::make_shared<State>(loop, patience, mostOfOne)) {}
 
 PeerLooks::~PeerLooks() {
     state_->close();

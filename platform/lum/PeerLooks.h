@@ -14,8 +14,8 @@ class RunLoop;
 
 /// Looks, for peers, at what they can let hang: a file system need not answer, and a thread that
 /// waits for it cannot be called back. Each look has a thread from a small pool, which grows while
-/// threads hang; the looks of one origin have a quarter of it at the most, and wait in their own
-/// line for more.
+/// threads hang; the looks of one origin have a quarter of it at the most, or fewer, and wait in
+/// their own line for more.
 ///
 /// Used on its run loop, which must outlive it. Its end waits for the looks that run.
 class PeerLooks {
@@ -42,7 +42,8 @@ class PeerLooks {
     static constexpr std::chrono::milliseconds kPatience{2000};
     static constexpr std::size_t kMostThreads = 32;
 
-    explicit PeerLooks(RunLoop& loop, std::chrono::milliseconds patience = kPatience);
+    explicit PeerLooks(RunLoop& loop, std::chrono::milliseconds patience = kPatience,
+                       std::size_t mostOfOne = kMostThreads / 4);
     PeerLooks(const PeerLooks&) = delete;
     ~PeerLooks();
 

@@ -82,9 +82,9 @@ class KernelSandbox : public Sandbox {
     bool isConfined(const AuditToken& token) override { return platform::isConfined(token); }
 
     Result<std::string> issueReadExtension(const KnownDirectory& bundle,
-                                           const std::string& resource) override {
+                                           const std::string& resource, Wait wait) override {
         if (!broker_) return broker_.error();
-        return tokens_->issue(bundle, resource);
+        return tokens_->issue(bundle, resource, wait);
     }
 
   private:

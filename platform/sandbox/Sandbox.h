@@ -5,6 +5,7 @@
 
 #include "platform/lum/AuditToken.h"
 #include "platform/system/Error.h"
+#include "platform/system/OpenBeneath.h"
 
 namespace platform {
 
@@ -28,9 +29,10 @@ class Sandbox {
     /// as long as this service, and as long as that very file lies at its path. Error: the
     /// system's, in the domain "POSIX"; ESTALE, ELOOP, ENOTDIR, ... when the bundle's path leads to
     /// another directory, or through a symbolic link; EACCES when the name leads out of the bundle;
-    /// EINVAL for what is neither a file nor a directory. From any thread.
+    /// EINVAL for what is neither a file nor a directory; EAGAIN when that would have to wait for
+    /// the bundle's file system and may not. From any thread.
     virtual Result<std::string> issueReadExtension(const KnownDirectory& bundle,
-                                                   const std::string& resource) = 0;
+                                                   const std::string& resource, Wait wait) = 0;
 };
 
 /// Whether a process runs in a sandbox: its user, mount or pid namespace differs from ours or

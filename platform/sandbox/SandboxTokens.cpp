@@ -90,19 +90,22 @@ bool liesIn(std::string_view path, std::string_view directory) {
 
 /// What a name leads to in a bundle. It may be moved out of there while it is looked at: it still
 /// is what was in the bundle, but its new place is not the bundle's to share.
-Result<SandboxTokens::File> lookUp(const KnownDirectory& bundle, const std::string& resource) {
-    const Result<UniqueFd> directory = bundle.open();
+Result<SandboxTokens::File> lookUp(const KnownDirectory& bundle, const std::string& resource,
+                                   Wait wait) {
+    const Result<UniqueFd> directory = bundle.open(wait);
     if (!directory) return directory.error();
     const std::string name = joinPath(bundle.path, resource);
-    const Result<UniqueFd> file = openBeneath(directory->get(), joinPath(".", resource), O_PATH);
+    const Result<UniqueFd> file =
+        openBeneath(directory->get(), joinPath(".", resource), O_PATH, wait);
     if (!file) return Error::posix(leadsOutside(file.error()) ? EACCES : file.error().code, name);
-    struct stat status {};
-    if (::fstat(file->get(), &status) != 0) return Error::posix(errno, name);
-    if (!S_ISREG(status.st_mode) && !S_ISDIR(status.st_mode)) return Error::posix(EINVAL, name);
+    mode_t type = 0;
+    const auto identity = FileIdentity::ofOpen(file->get(), &type);
+    if (!identity) return Error::posix(errno, name);
+    if (!S_ISREG(type) && !S_ISDIR(type)) return Error::posix(EINVAL, name);
     Result<std::string> path = pathOf(*file);
     if (!path) return path.error();
     if (!liesIn(*path, bundle.path)) return Error::posix(EACCES, name);
-    return SandboxTokens::File{std::move(*path), FileIdentity::of(status)};
+    return SandboxTokens::File{std::move(*path), *identity};
 }
 
 }  // namespace
@@ -127,9 +130,9 @@ std::string SandboxTokens::macOf(std::string_view text) const {
     return hex({reinterpret_cast<const char*>(mac.data()), size});
 }
 
-Result<std::string> SandboxTokens::issue(const KnownDirectory& bundle,
-                                         const std::string& resource) const {
-    const Result<File> file = lookUp(bundle, resource);
+Result<std::string> SandboxTokens::issue(const KnownDirectory& bundle, const std::string& resource,
+                                         Wait wait) const {
+    const Result<File> file = lookUp(bundle, resource, wait);
     if (!file) return file.error();
     const auto nonce = randomBytes(kNonceBytes);
     if (!nonce) return Error::posix(EIO, "random numbers");

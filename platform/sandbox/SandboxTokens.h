@@ -7,6 +7,7 @@
 
 #include "platform/system/Error.h"
 #include "platform/system/FileIdentity.h"
+#include "platform/system/OpenBeneath.h"
 
 namespace platform {
 
@@ -40,7 +41,8 @@ class SandboxTokens {
     /// bundle itself. What is looked at is opened once, and is what the token names. Errors: those
     /// of `KnownDirectory::open`, and the system's; EACCES when the name leads out of the bundle,
     /// EINVAL when something else is there.
-    Result<std::string> issue(const KnownDirectory& bundle, const std::string& resource) const;
+    Result<std::string> issue(const KnownDirectory& bundle, const std::string& resource,
+                              Wait wait = Wait::Allowed) const;
     /// What a token names, if it was issued here and is unchanged; else none.
     std::optional<File> check(std::string_view token) const;
 

@@ -1,44 +1,22 @@
 #include "platform/services/Notifications.h"
 
-#include <fcntl.h>
-#include <stdlib.h>
-
 #include <cerrno>
 #include <charconv>
 #include <chrono>
-#include <cstdio>
 #include <future>
 #include <map>
 #include <mutex>
 #include <optional>
+#include <set>
 
 #include "platform/log/OpsLog.h"
 #include "platform/system/Directories.h"
 #include "platform/system/Files.h"
-#include "platform/system/UniqueFd.h"
 #include "platform/threads/SerialQueue.h"
 
 namespace platform {
 
 namespace {
-
-/// Replaces a file by rename, like `writeFileAtomically`, but without the syncs: counts live in
-/// memory-backed runtime state and mean nothing after a crash.
-std::optional<Error> replaceFile(const std::string& folder, const std::string& name,
-                                 const std::string& bytes) {
-    std::string temporary = joinPath(folder, ".post-XXXXXX");
-    const UniqueFd file(::mkostemp(temporary.data(), O_CLOEXEC));
-    if (!file) return Error::posix(errno, temporary);
-    const std::string path = joinPath(folder, name);
-    const ssize_t written = ::write(file.get(), bytes.data(), bytes.size());
-    int failure = written < 0 ? errno : ENOSPC;
-    if (written == static_cast<ssize_t>(bytes.size())) {
-        if (::rename(temporary.c_str(), path.c_str()) == 0) return std::nullopt;
-        failure = errno;
-    }
-    ::unlink(temporary.c_str());
-    return Error::posix(failure, path);
-}
 
 /// 0 without a file, or when it is damaged. Errors: those of `readFile`.
 Result<std::uint64_t> postsIn(const std::string& path) {
@@ -81,18 +59,24 @@ class FileNotifications final : public Notifications {
             unwritten += counted_.extract(name).mapped();
         }
         std::optional<Error> error = makeDirectories(folder_, 0700);
-        const Result<std::uint64_t> before = postsIn(joinPath(folder_, name));
+        const std::string path = joinPath(folder_, name);
+        if (swept_.insert(name).second) removeLeftovers(path);
+        const Result<std::uint64_t> before = postsIn(path);
         // Without knowing the count, a new one might be the one that is there.
         if (!error && !before) error = before.error();
-        if (!error) error = replaceFile(folder_, name, std::to_string(*before + unwritten));
+        // Counts mean nothing after a crash of the machine.
+        if (!error)
+            error = writeFileAtomically(path, std::to_string(*before + unwritten), Sync::No);
         if (!error) unwritten = 0;
         if (error) EVLOG_ERROR(ops(), "cannot post notification {}: {}", pub(name), pub(*error));
     }
 
     const std::string folder_;
     std::mutex mutex_;
-    std::map<std::string, std::uint64_t> counted_;    // since the writer looked; guarded by mutex_
-    std::map<std::string, std::uint64_t> unwritten_;  // the writer's: those, and what failed
+    std::map<std::string, std::uint64_t> counted_;  // since the writer looked; guarded by mutex_
+    // The writer's:
+    std::map<std::string, std::uint64_t> unwritten_;  // those, and what failed
+    std::set<std::string> swept_;                     // names without leftovers of crashes
     SerialQueue writer_{"notifications"};  // the last member: what it still does uses the others
 };
 

@@ -23,7 +23,8 @@ class Notifications {
 
 /// Notifications as files: <runtime>/zorvan/notify/<name> holds the count of posts so far in
 /// decimal. A thread of its own rewrites it, by rename, once for all posts that came meanwhile;
-/// those that cannot be written are written with the next ones. Its end writes what is left.
+/// those that cannot be written are written with the next ones. Its end writes what is left; what a
+/// killed process has counted alone is lost, and what it has left behind is removed by the next.
 std::unique_ptr<Notifications> makeFileNotifications(const Directories& directories);
 
 /// The folder of the files: <runtime>/zorvan/notify.

@@ -22,6 +22,12 @@ struct ExternalService {
     std::string container;  // the path of the plug-in's data container; empty when it has none
 };
 
+/// A service that a launcher has looked at and found fit to be started. Immutable.
+class CheckedService {
+  public:
+    virtual ~CheckedService() = default;
+};
+
 /// Starts plug-ins and knows the instances that run.
 class Launcher {
   public:
@@ -33,18 +39,28 @@ class Launcher {
 
     virtual ~Launcher() = default;
 
-    /// Lets a process start an executable as a service, under the settings of an activation
-    /// overlay: {"LUMService": {…}, "QFBundlePackageType": "LUM!"}. Holds for that very process and
-    /// as long as it lives, and for that very bundle: an instance is started only while the
-    /// bundle's path leads to it. The last overlay for an executable counts. Answers 0, or the
-    /// number of a system error: ESTALE, ELOOP, ENOTDIR, ... the bundle is not in its place;
-    /// ENOENT, EACCES, EXDEV, ... the executable does not exist, cannot be run or lies outside the
-    /// bundle; EINVAL the overlay is no good, or the bundle has no identifier; E2BIG its
-    /// environment is too large; ENOTDIR, EPERM or EINVAL the data container is no directory of
-    /// this user's own below the containers; ESRCH the process is gone; ENOSPC it has too many such
-    /// rights. From any thread.
-    virtual int addExternalService(const AuditToken& host, const ExternalService& service,
-                                   const Dictionary& overlay) = 0;
+    /// Looks at an executable that is to be started as a service, under the settings of an
+    /// activation overlay: {"LUMService": {…}, "QFBundlePackageType": "LUM!"}. Reads the bundle,
+    /// and so waits for its file system. Errors, all "POSIX": ESTALE, ELOOP, ENOTDIR, ... the
+    /// bundle is not in its place; ENOENT, EACCES, EXDEV, ... the executable does not exist, cannot
+    /// be run or lies outside the bundle; EINVAL the overlay is no good, or the bundle has no
+    /// identifier; E2BIG its environment is too large; ENOTDIR, EPERM or EINVAL the data container
+    /// is no directory of this user's own below the containers. From any thread.
+    virtual Result<std::shared_ptr<const CheckedService>> checkExternalService(
+        const ExternalService& service, const Dictionary& overlay) = 0;
+    /// Lets a process start what this launcher has looked at. Holds for that very process and as
+    /// long as it lives, and for that very bundle: an instance is started only while the bundle's
+    /// path leads to it. The last one for an executable counts. Answers 0, or the number of a
+    /// system error: ESRCH the process is gone; ENOSPC it has too many such rights. Waits for
+    /// nobody. From any thread.
+    virtual int grantExternalService(const AuditToken& host,
+                                     const std::shared_ptr<const CheckedService>& service) = 0;
+    /// Both, one after the other; answers 0, or the error's number.
+    int addExternalService(const AuditToken& host, const ExternalService& service,
+                           const Dictionary& overlay) {
+        const auto checked = checkExternalService(service, overlay);
+        return checked ? grantExternalService(host, *checked) : checked.error().code;
+    }
     /// Takes back what lets hosts start the executables of a bundle, by its canonical path. From
     /// then on none is started unless it is added anew; instances that run go on. From any thread.
     virtual void removeExternalServices(const std::string& bundlePath) = 0;

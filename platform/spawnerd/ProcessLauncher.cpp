@@ -2,6 +2,7 @@
 
 #include <utility>
 
+#include "platform/log/OpsLog.h"
 #include "platform/threads/SerialQueue.h"
 
 namespace platform {
@@ -21,12 +22,18 @@ class CountedMarker final : public Launcher::WorkMarker {
     const std::shared_ptr<std::atomic<int>> count_;
 };
 
+struct Checked final : CheckedService {
+    explicit Checked(Grant made) : grant(std::move(made)) {}
+    const Grant grant;
+};
+
 }  // namespace
 
 ProcessLauncher::ProcessLauncher(const Directories& directories, const std::string& daemonService,
                                  std::shared_ptr<RunLoop> loop, LauncherSettings settings,
                                  std::function<void()> failed, Programs programs)
-    : outstanding_(std::make_shared<std::atomic<int>>(0)),
+    : directories_(directories),
+      outstanding_(std::make_shared<std::atomic<int>>(0)),
       service_(SpawnService::make(directories, daemonService, std::move(loop), std::move(settings),
                                   std::move(failed), std::move(programs))) {
     // Not before the daemon runs: only then does its name, and so this one, belong to it.
@@ -35,9 +42,17 @@ ProcessLauncher::ProcessLauncher(const Directories& directories, const std::stri
     });
 }
 
-int ProcessLauncher::addExternalService(const AuditToken& host, const ExternalService& service,
-                                        const Dictionary& overlay) {
-    return service_->grant(host, service, overlay);
+Result<std::shared_ptr<const CheckedService>> ProcessLauncher::checkExternalService(
+    const ExternalService& service, const Dictionary& overlay) {
+    auto grant = Grant::make(directories_, service, overlay);
+    if (grant) return std::shared_ptr<const CheckedService>(new Checked(*std::move(grant)));
+    EVLOG_INFO(ops(), "{} cannot be started as a plug-in: {}", service.executable, grant.error());
+    return grant.error();
+}
+
+int ProcessLauncher::grantExternalService(const AuditToken& host,
+                                          const std::shared_ptr<const CheckedService>& service) {
+    return service_->grant(host, static_cast<const Checked&>(*service).grant);
 }
 
 void ProcessLauncher::removeExternalServices(const std::string& bundlePath) {

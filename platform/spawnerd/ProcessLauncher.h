@@ -17,8 +17,10 @@ class ProcessLauncher final : public Launcher {
                     std::shared_ptr<RunLoop> loop, LauncherSettings settings = nullptr,
                     std::function<void()> failed = nullptr, Programs programs = {});
 
-    int addExternalService(const AuditToken& host, const ExternalService& service,
-                           const Dictionary& overlay) override;
+    Result<std::shared_ptr<const CheckedService>> checkExternalService(
+        const ExternalService& service, const Dictionary& overlay) override;
+    int grantExternalService(const AuditToken& host,
+                             const std::shared_ptr<const CheckedService>& service) override;
     void removeExternalServices(const std::string& bundlePath) override;
     std::unique_ptr<WorkMarker> beginOutstandingWork() override;
     void terminatePlugInInstances(const std::string& bundleIdentifier,
@@ -30,6 +32,7 @@ class ProcessLauncher final : public Launcher {
     int outstandingWork() const { return *outstanding_; }
 
   private:
+    const Directories directories_;
     const std::shared_ptr<std::atomic<int>> outstanding_;
     const std::shared_ptr<SpawnService> service_;
 };

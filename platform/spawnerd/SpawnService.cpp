@@ -140,12 +140,8 @@ void SpawnService::watchKeeper() {
     });
 }
 
-int SpawnService::grant(const AuditToken& host, const ExternalService& service,
-                        const Dictionary& overlay) {
-    auto grant = Grant::make(directories_, service, overlay);
-    if (grant) return hosts_->add(host, std::move(*grant));
-    EVLOG_INFO(ops(), "{} cannot be started as a plug-in: {}", service.executable, grant.error());
-    return grant.error().code;
+int SpawnService::grant(const AuditToken& host, Grant grant) {
+    return hosts_->add(host, std::move(grant));
 }
 
 void SpawnService::takeBack(const std::string& bundlePath) {
@@ -212,7 +208,7 @@ void SpawnService::open(std::uint64_t id) {
     auto places = std::make_shared<std::optional<Result<GrantedPlaces>>>();
     looks_.look(
         Origin::of(running.host->token),
-        [places, grant, &directories = directories_](PeerLooks::Pace&) {
+        [places, grant, directories = directories_](PeerLooks::Pace&) {
             places->emplace(GrantedPlaces::open(*grant, directories));
         },
         [places, grant, id, weak = weak_from_this()](bool isDone, std::size_t) {

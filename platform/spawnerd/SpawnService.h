@@ -47,8 +47,8 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     /// Begins to listen; an error line when that cannot be done.
     void listen();
 
-    /// As `Launcher::addExternalService`. From any thread.
-    int grant(const AuditToken& host, const ExternalService& service, const Dictionary& overlay);
+    /// As `Launcher::grantExternalService`. From any thread.
+    int grant(const AuditToken& host, Grant grant);
     /// As `Launcher::removeExternalServices`. From any thread.
     void takeBack(const std::string& bundlePath);
     /// As `Launcher::terminatePlugInInstances`, for the grants for which `which` holds and what was

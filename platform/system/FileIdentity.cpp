@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
 
 #include <array>
 #include <cstdint>
@@ -23,6 +24,14 @@ FileIdentity FileIdentity::at(int dirfd, const char* path) {
     struct stat status;
     if (::fstatat(dirfd, path, &status, AT_SYMLINK_NOFOLLOW) != 0) return {};
     return of(status);
+}
+
+std::optional<FileIdentity> FileIdentity::ofOpen(int fd, mode_t* type) {
+    struct statx status;
+    if (::statx(fd, "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC, STATX_TYPE | STATX_INO, &status) != 0)
+        return std::nullopt;
+    if (type) *type = status.stx_mode & S_IFMT;
+    return FileIdentity{::makedev(status.stx_dev_major, status.stx_dev_minor), status.stx_ino};
 }
 
 void FileIdentity::appendTo(std::string& bytes) const {

@@ -3,6 +3,7 @@
 #include <sys/types.h>
 
 #include <cstddef>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -20,6 +21,10 @@ struct FileIdentity {
     /// What lies at a path, itself when it is a symbolic link; all 0 when that cannot be told. A
     /// relative path starts at the directory `dirfd` (borrowed, or AT_FDCWD).
     static FileIdentity at(int dirfd, const char* path);
+
+    /// What is open, and its type as in the mode of `stat`. Neither changes, so its file system is
+    /// not asked, and nobody waits for it. None, with errno, on failure.
+    static std::optional<FileIdentity> ofOpen(int fd, mode_t* type = nullptr);
 
     /// Bytes of a stored identity.
     static constexpr std::size_t kStoredSize = 16;

@@ -113,14 +113,14 @@ class TemporaryFile {
 
     int setMode(mode_t mode) { return ::fchmod(fd_.get(), mode) == 0 ? 0 : errno; }
 
-    int write(std::string_view bytes) {
+    int write(std::string_view bytes, Sync sync) {
         while (!bytes.empty()) {
             ssize_t count = ::write(fd_.get(), bytes.data(), bytes.size());
             if (count < 0 && errno == EINTR) continue;
             if (count < 0) return errno;
             bytes.remove_prefix(static_cast<std::size_t>(count));
         }
-        return ::fsync(fd_.get()) == 0 ? 0 : errno;
+        return sync == Sync::No || ::fsync(fd_.get()) == 0 ? 0 : errno;
     }
 
     int rename(const char* name) {
@@ -159,7 +159,7 @@ class TemporaryFile {
     UniqueFd fd_;
 };
 
-int replaceIn(int dirfd, const char* name, std::string_view bytes) {
+int replaceIn(int dirfd, const char* name, std::string_view bytes, Sync sync) {
     struct stat existing {};
     bool exists = ::fstatat(dirfd, name, &existing, AT_SYMLINK_NOFOLLOW) == 0;
     if (!exists && errno != ENOENT) return errno;
@@ -168,10 +168,10 @@ int replaceIn(int dirfd, const char* name, std::string_view bytes) {
     TemporaryFile file(dirfd, name);
     int failure = file.create();
     if (!failure && exists) failure = file.setMode(existing.st_mode & 07777);
-    if (!failure) failure = file.write(bytes);
+    if (!failure) failure = file.write(bytes, sync);
     if (!failure) failure = file.rename(name);
     // The rename itself is durable only once the directory is.
-    if (!failure && ::fsync(dirfd) != 0) failure = errno;
+    if (!failure && sync == Sync::Yes && ::fsync(dirfd) != 0) failure = errno;
     return failure;
 }
 
@@ -207,7 +207,8 @@ Result<std::string> readFileBeneath(int dirfd, const std::string& name, std::siz
     return readRegular(*fd, limit, name);
 }
 
-std::optional<Error> writeFileAtomically(const std::string& path, std::string_view bytes) {
+std::optional<Error> writeFileAtomically(const std::string& path, std::string_view bytes,
+                                         Sync sync) {
     if (hasNul(path)) return Error::posix(EINVAL, path);
     auto target = followLinks(path);
     if (!target) return target.error();
@@ -217,7 +218,7 @@ std::optional<Error> writeFileAtomically(const std::string& path, std::string_vi
 
     UniqueFd dirfd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (!dirfd) return Error::posix(errno, path);
-    if (int failure = replaceIn(dirfd.get(), name.c_str(), bytes))
+    if (int failure = replaceIn(dirfd.get(), name.c_str(), bytes, sync))
         return Error::posix(failure, path);
     return std::nullopt;
 }

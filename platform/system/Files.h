@@ -28,8 +28,11 @@ Result<std::string> readFileBeneath(int dirfd, const std::string& name, std::siz
 /// without such files one of its own, see `removeLeftovers`); no other file is touched. A new file
 /// gets mode 0600; an existing one keeps its mode. A symbolic link stays, and the file that it
 /// leads to is replaced. None on success. Errors: the system's; EINVAL when something other than a
-/// regular file is there.
-std::optional<Error> writeFileAtomically(const std::string& path, std::string_view bytes);
+/// regular file is there. Without the sync, what means nothing after a crash of the machine is
+/// replaced sooner.
+enum class Sync { Yes, No };
+std::optional<Error> writeFileAtomically(const std::string& path, std::string_view bytes,
+                                         Sync sync = Sync::Yes);
 
 /// Removes what writing this very file has left beside it when it was interrupted by a crash.
 /// Nobody else's files are touched: such a file bears a name of ours that follows from the name at

@@ -19,11 +19,11 @@ namespace {
 /// who does that all the time is answered in the end.
 constexpr int kMostAttempts = 64;
 
-int openResolving(int dirfd, const std::string& path, int flags, std::uint64_t resolve) {
+int openResolving(int dirfd, const std::string& path, int flags, std::uint64_t resolve, Wait wait) {
     open_how how{};
     how.flags = static_cast<std::uint64_t>(flags | O_CLOEXEC);
-    how.resolve = resolve;
-    for (int attempt = 0;; ++attempt) {
+    how.resolve = resolve | (wait == Wait::Never ? RESOLVE_CACHED : 0);
+    for (int attempt = wait == Wait::Never ? kMostAttempts : 0;; ++attempt) {
         const long fd = ::syscall(SYS_openat2, dirfd, path.c_str(), &how, sizeof how);
         const bool isDisturbed = fd < 0 && (errno == EAGAIN || errno == EINTR);
         if (!isDisturbed || attempt == kMostAttempts) return static_cast<int>(fd);
@@ -61,6 +61,14 @@ int openByComponents(int start, std::string_view rest, int flags, int linkError)
     }
 }
 
+/// Whether the kernel knows too little for `openResolving`: then it takes several steps.
+bool mustTakeSteps(int fd, Wait wait) {
+    if (fd >= 0 || wait == Wait::Allowed) return fd < 0 && errno == ENOSYS;
+    // One that knows no openings without waiting says that it does not know the flag.
+    if (errno == ENOSYS || errno == EINVAL) errno = EAGAIN;
+    return false;
+}
+
 Result<UniqueFd> opened(int fd, const std::string& path) {
     if (fd < 0) return Error::posix(errno, path);
     return UniqueFd(fd);
@@ -68,22 +76,22 @@ Result<UniqueFd> opened(int fd, const std::string& path) {
 
 }  // namespace
 
-Result<UniqueFd> openBeneath(int dirfd, const std::string& path, int flags) {
+Result<UniqueFd> openBeneath(int dirfd, const std::string& path, int flags, Wait wait) {
     if (path.find('\0') != std::string::npos) return Error::posix(EINVAL, path);
-    int fd = openResolving(dirfd, path, flags, RESOLVE_BENEATH | RESOLVE_NO_MAGICLINKS);
-    if (fd < 0 && errno == ENOSYS) {
+    int fd = openResolving(dirfd, path, flags, RESOLVE_BENEATH | RESOLVE_NO_MAGICLINKS, wait);
+    if (mustTakeSteps(fd, wait)) {
         if (path.starts_with('/')) return Error::posix(EXDEV, path);
         fd = openByComponents(dirfd, path, flags, EXDEV);
     }
     return opened(fd, path);
 }
 
-Result<UniqueFd> openWithoutLinks(int dirfd, const std::string& path, int flags) {
+Result<UniqueFd> openWithoutLinks(int dirfd, const std::string& path, int flags, Wait wait) {
     if (path.find('\0') != std::string::npos) return Error::posix(EINVAL, path);
     const bool isAbsolute = path.starts_with('/');
-    int fd =
-        openResolving(dirfd, path, flags, RESOLVE_NO_SYMLINKS | (isAbsolute ? 0 : RESOLVE_BENEATH));
-    if (fd < 0 && errno == ENOSYS) {
+    int fd = openResolving(dirfd, path, flags,
+                           RESOLVE_NO_SYMLINKS | (isAbsolute ? 0 : RESOLVE_BENEATH), wait);
+    if (mustTakeSteps(fd, wait)) {
         const UniqueFd root(isAbsolute ? ::open("/", O_PATH | O_CLOEXEC) : -1);
         fd = openByComponents(root ? root.get() : dirfd, path, flags, ELOOP);
     }

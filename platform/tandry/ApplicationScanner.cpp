@@ -54,7 +54,7 @@ std::string ApplicationScanner::applicationAbove(std::string_view path) {
     return {};
 }
 
-bool ApplicationScanner::isHeld(const std::string& path) const {
+bool ApplicationScanner::isHeld(const std::string& path) {
     std::string_view application = path;
     if (!isApplication(path)) {
         std::string_view folder = parentPath(path);
@@ -63,7 +63,7 @@ bool ApplicationScanner::isHeld(const std::string& path) const {
     }
     return isApplication(application) &&
            std::ranges::any_of(folders_.applications, [&](const auto& folder) {
-               return canonicalPath(folder) == parentPath(application);
+               return places_.answers(folder) && canonicalPath(folder) == parentPath(application);
            });
 }
 
@@ -74,6 +74,7 @@ void ApplicationScanner::begin(bool overEverything) {
     unreachable_.clear();
     reader_.beginPass();
     watch_.beginWalk(overEverything);
+    places_.beginWalk();
     untrusted_.beginWalk();
     containers_.beginWalk();
     complaints_.beginWalk();
@@ -102,8 +103,10 @@ RegistryChanges ApplicationScanner::scanPath(const std::string& path, bool& hasP
 }
 
 RegistryChanges ApplicationScanner::scanTouched(const Scopes& scopes) {
+    places_.beginWalk();
     auto isNamed = [this](const std::string& path) {
-        return (state_.registrations.contains(path) || isHeld(path)) && isSelfContained(path);
+        return places_.answers(path) && (state_.registrations.contains(path) || isHeld(path)) &&
+               isSelfContained(path);
     };
     if (!std::ranges::all_of(scopes, isNamed)) return scanAll();
     begin(false);
@@ -151,16 +154,42 @@ void ApplicationScanner::visitAll() {
             watch_.markContents(*canonical, {});
     }
     for (const std::string& folder : folders_.applications) {
+        if (!places_.answers(folder)) {
+            // Links may lead there by another name.
+            if (!folderPaths_.contains(folder)) isIncomplete_ = true;
+            keepUnseen(folderPaths_.try_emplace(folder, folder).first->second);
+            continue;
+        }
         watch_.markWay(folder);
         if (std::optional<std::string> canonical = canonicalPath(folder))
-            visitFolder(*canonical);
+            visitFolder(folderPaths_[folder] = *canonical);
         else
             unreachable_.push_back(folder);
     }
     for (const std::string& path : state_.registrations) visitRegistration(path);
 }
 
+/// What lies within a path does not answer: all that is known there stays as it is, until a walk
+/// that comes later.
+void ApplicationScanner::keepUnseen(const std::string& path) {
+    hasTransientFailure_ = true;
+    unreachable_.push_back(path);
+    complaints_.add(path, "nothing is known of what does not answer:", path);
+    forEachWithin(state_.plugIns, path, [this](auto entry) { keep(entry->second); });
+    forEachWithin(state_.applications, path,
+                  [this](auto entry) { entry->second.pass = entry->second.plugInsPass = pass_; });
+    forEachWithin(state_.refusals, path, [this](auto entry) { entry->second.pass = pass_; });
+}
+
+/// Whether what lies at a path can be looked at; otherwise it has been kept as it was.
+bool ApplicationScanner::canSee(const std::string& path) {
+    const bool result = places_.answers(path);
+    if (!result) keepUnseen(path);
+    return result;
+}
+
 void ApplicationScanner::visitRegistration(const std::string& path) {
+    if (!canSee(path)) return;
     watch_.markWay(path);
     if (canonicalPath(path) == path) {
         visitPath(path);
@@ -173,7 +202,7 @@ void ApplicationScanner::visitRegistration(const std::string& path) {
 void ApplicationScanner::visitFolder(const std::string& folder) {
     if (isUntrusted(folder, "applications")) return;
     watch_.markEntries(folder, kApplicationSuffix);
-    Result<FolderEntries> found = FolderEntries::read(folder, watch_, complaints_);
+    Result<FolderEntries> found = FolderEntries::read(folder, watch_, places_, complaints_);
     if (!found) {
         complaints_.add(folder, "cannot look for applications:", found.error().text);
         unreachable_.push_back(folder);
@@ -182,6 +211,7 @@ void ApplicationScanner::visitFolder(const std::string& folder) {
         return;
     }
     for (const std::string& target : found->nowhere) unreachable_.push_back(target);
+    for (const std::string& target : found->unseen) keepUnseen(target);
     for (const auto& [name, target] : found->entries) {
         if (!isApplication(name)) continue;
         const std::string entry = joinPath(folder, name);
@@ -211,11 +241,12 @@ void ApplicationScanner::visitApplication(const std::string& path) {
     // Two links may lead to one application.
     auto known = state_.applications.find(path);
     if (known != state_.applications.end() && known->second.plugInsPass == pass_) return;
+    if (!canSee(path)) return;
     if (isUntrusted(path, "an application")) return;
     watch_.markContents(path, path);
     std::string folder = joinPath(path, kPlugIns);
     std::error_code ignored;
-    if (std::filesystem::is_symlink(folder, ignored)) {
+    if (places_.answers(folder) && std::filesystem::is_symlink(folder, ignored)) {
         watch_.markWay(folder);
         std::string target = canonicalPath(folder).value_or(folder);
         noteLink(folder, target);
@@ -227,8 +258,15 @@ void ApplicationScanner::visitApplication(const std::string& path) {
 
 /// An application that cannot be looked into is not known.
 void ApplicationScanner::visitPlugIns(const std::string& application, const std::string& folder) {
+    if (!canSee(folder)) {
+        unreachable_.push_back(application);
+        if (!state_.applications.contains(application)) return;
+        static_cast<void>(applicationAt(application));
+        state_.applications[application].plugInsPass = pass_;
+        return;
+    }
     watch_.markContents(folder, application);
-    Result<FolderEntries> found = FolderEntries::read(folder, watch_, complaints_);
+    Result<FolderEntries> found = FolderEntries::read(folder, watch_, places_, complaints_);
     if (!found && !isMissing(found.error())) {
         complaints_.add(folder, "cannot look for plug-ins:", found.error().text);
         if (changes_.refusal.empty()) changes_.refusal = found.error().text;
@@ -240,6 +278,7 @@ void ApplicationScanner::visitPlugIns(const std::string& application, const std:
     state_.applications[application].plugInsPass = pass_;
     if (!found) return;
     for (const std::string& target : found->nowhere) unreachable_.push_back(target);
+    for (const std::string& target : found->unseen) keepUnseen(target);
     const bool isInside = isWithin(folder, application);
     for (const auto& [name, target] : found->entries)
         if (!target.empty()) {
@@ -366,6 +405,7 @@ bool ApplicationScanner::isSame(PlugInEntry& known, const PlugInEntry& read) {
 void ApplicationScanner::visitPlugIn(const BundleFolder& folder,
                                      const TDApplicationProxyRef& application,
                                      const std::string& scope) {
+    if (!canSee(folder.path)) return;
     if (isUntrusted(folder.path, "a plug-in")) return;
     watch_.markContents(folder.path, scope);
     auto found = state_.plugIns.find(folder.path);

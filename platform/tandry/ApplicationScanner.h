@@ -1,5 +1,6 @@
 #pragma once
 
+#include <map>
 #include <string>
 #include <vector>
 
@@ -8,6 +9,7 @@
 #include "platform/tandry/DataContainers.h"
 #include "platform/tandry/DictionaryRoom.h"
 #include "platform/tandry/FolderWatch.h"
+#include "platform/tandry/ForeignPlaces.h"
 #include "platform/tandry/RegistryState.h"
 #include "platform/tandry/UntrustedPlaces.h"
 
@@ -43,9 +45,12 @@ class ApplicationScanner {
     /// The paths of plug-ins whose exchange for another directory the watch would not show at once.
     const std::set<std::string>& unwatched() const { return unwatched_; }
 
+    /// Where somebody else has to be waited for.
+    ForeignPlaces& places() { return places_; }
+
     /// Whether an application folder holds the plug-in or application at a path, so that a walk
     /// would find it by itself.
-    bool isHeld(const std::string& path) const;
+    bool isHeld(const std::string& path);
 
     /// The canonical path of the nearest application above a bundle; empty when there is none.
     static std::string applicationAbove(std::string_view path);
@@ -54,6 +59,8 @@ class ApplicationScanner {
   private:
     void begin(bool overEverything);
     void visitAll();
+    void keepUnseen(const std::string& path);
+    bool canSee(const std::string& path);
     void visitFolder(const std::string& folder);
     void visitRegistration(const std::string& path);
     bool visitScope(const std::string& path);
@@ -90,7 +97,9 @@ class ApplicationScanner {
     FolderWatch& watch_;
     UntrustedPlaces& untrusted_;
     Folders folders_;
+    ForeignPlaces places_;
     Complaints complaints_;
+    std::map<std::string, std::string> folderPaths_;  // canonical ones, when they were last seen
     std::set<std::string> links_;  // links to bundles since the last walk over everything, and
                                    // what they lead to
     std::set<std::string> unwatched_;

@@ -48,7 +48,7 @@ void ApplicationScanner::noteUnwatched(const std::string& scope) {
     forEachWithin(unwatched_, scope, [this](auto path) { unwatched_.erase(path); });
     std::string known;
     forEachWithin(state_.plugIns, scope, [&](auto entry) {
-        if (watch_.seesExchangeOf(entry->first, known))
+        if (places_.answers(entry->first) && watch_.seesExchangeOf(entry->first, known))
             known = entry->first;
         else
             unwatched_.insert(entry->first);

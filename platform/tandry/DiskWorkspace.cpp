@@ -343,6 +343,8 @@ std::optional<Error> DiskWorkspace::unregisterPlugIn(const std::string& bundlePa
 }
 
 std::optional<Error> DiskWorkspace::registerOnQueue(const std::string& bundlePath) {
+    scanner_.places().beginWalk();
+    if (!scanner_.places().answers(bundlePath)) return Error::posix(ETIMEDOUT, bundlePath);
     std::optional<std::string> canonical = canonicalPath(bundlePath);
     struct stat status;
     if (!canonical || ::stat(canonical->c_str(), &status) != 0)
@@ -377,10 +379,13 @@ std::optional<Error> DiskWorkspace::registerOnQueue(const std::string& bundlePat
 /// Takes the plug-ins within a path out of the state; walks leave them out as they are now.
 bool DiskWorkspace::forgetWithin(const std::string& path, RegistryChanges& changes) {
     reader_.beginPass();
+    scanner_.places().beginWalk();
     forEachWithin(state_.plugIns, path, [&](auto entry) {
         changes.uninstalled.push_back(entry->second.record);
-        BundleFolder folder(entry->first);
-        state_.forgotten[entry->first] = {reader_.toRemember(folder, entry->second.print)};
+        const Fingerprint& known = entry->second.print;
+        const bool isThere = scanner_.places().answers(entry->first);
+        state_.forgotten[entry->first] = {
+            isThere ? reader_.toRemember(BundleFolder(entry->first), known) : known};
         changes.forgotten.insert(entry->first);
         state_.plugIns.erase(entry);
     });

@@ -29,20 +29,26 @@ bool isLink(int directory, const dirent& entry) {
 }
 
 void add(FolderEntries& found, const std::filesystem::path& folder, const dirent& entry,
-         FolderWatch& watch, Complaints& complaints) {
+         FolderWatch& watch, ForeignPlaces& places, Complaints& complaints) {
     if (entry.d_name[0] == '.' ||
         (entry.d_type != DT_DIR && entry.d_type != DT_LNK && entry.d_type != DT_UNKNOWN))
         return;
     std::string path = joinPath(folder.native(), entry.d_name);
     std::string target;
     if (isLink(found.directory(), entry)) {
+        std::error_code failure;
+        const auto link = std::filesystem::read_symlink(path, failure);
+        const std::string named = (folder / link).lexically_normal().string();
+        if (!failure && !places.answers(named)) {
+            found.unseen.push_back(named);
+            return;
+        }
         watch.markWay(path);
         std::optional<std::string> canonical = canonicalPath(path);
         if (!canonical) {
             complaints.add(path, "skipping", path + ": a link that cannot be resolved");
             std::error_code ignored;
-            const auto end = std::filesystem::read_symlink(path, ignored);
-            const auto missing = std::filesystem::weakly_canonical(folder / end, ignored);
+            const auto missing = std::filesystem::weakly_canonical(folder / link, ignored);
             found.nowhere.push_back(missing.string());
             return;
         }
@@ -66,13 +72,13 @@ bool isUsablePath(const std::string& path) {
 }
 
 Result<FolderEntries> FolderEntries::read(const std::string& path, FolderWatch& watch,
-                                          Complaints& complaints) {
+                                          ForeignPlaces& places, Complaints& complaints) {
     FolderEntries found;
     found.stream.reset(::opendir(path.c_str()));
     if (!found.stream) return Error::posix(errno, path);
     errno = 0;
     while (const dirent* entry = ::readdir(found.stream.get())) {
-        add(found, path, *entry, watch, complaints);
+        add(found, path, *entry, watch, places, complaints);
         errno = 0;
     }
     if (errno != 0) return Error::posix(errno, path);

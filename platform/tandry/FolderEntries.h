@@ -9,6 +9,7 @@
 #include "platform/system/Error.h"
 #include "platform/tandry/Complaints.h"
 #include "platform/tandry/FolderWatch.h"
+#include "platform/tandry/ForeignPlaces.h"
 
 namespace platform::tandry {
 
@@ -25,6 +26,7 @@ struct FolderEntries {
     std::unique_ptr<DIR, Closer> stream;
     std::vector<Entry> entries;
     std::vector<std::string> nowhere;  // where links that cannot be resolved would lead
+    std::vector<std::string> unseen;   // where links lead to what does not answer
 
     /// The open directory, owned here.
     int directory() const { return ::dirfd(stream.get()); }
@@ -33,7 +35,7 @@ struct FolderEntries {
     /// left out; the first kind is logged. Where links lead is marked in `watch`. Error: the
     /// system's.
     static Result<FolderEntries> read(const std::string& path, FolderWatch& watch,
-                                      Complaints& complaints);
+                                      ForeignPlaces& places, Complaints& complaints);
 };
 
 /// Whether a path can stand in messages: valid UTF-8 without ASCII control characters.

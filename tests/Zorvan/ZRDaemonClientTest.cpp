@@ -7,6 +7,7 @@
 #include <future>
 
 #include "Zorvan/Keys.h"
+#include "platform/lum/Limits.h"
 #include "platform/lum/Listener.h"
 #include "platform/system/Directories.h"
 #include "tests/Zorvan/LogLines.h"
@@ -159,6 +160,10 @@ TEST_F(ClientTest, WhatTheDaemonMustRefuseCostsThatRequestAndNothingElse) {
         EXPECT_EQ(error->code, kZRErrorInvalidRequest);
         EXPECT_THAT(*error->description, testing::StartsWith("request not sent: "));
     }
+    const std::vector<std::string> paths(platform::lum::kMaxListed + 1, "/");
+    Reply reply = replyOf([&](auto done) { client_->addPlugIns(paths, done); });
+    EXPECT_EQ(ZRDaemonClient::errorInReply(reply)->description,
+              "request not sent: it has too long a list");
     EXPECT_EQ(sent("bulk", &ZRDaemonClient::bulkPlugins, 0), (Dictionary{{"flags", 0}}));
 }
 

@@ -23,7 +23,8 @@ TEST(ZRSandboxExtension, ConsumesOnceUntilExpelled) {
     platform::RunLoop loop;
     const auto sandbox =
         platform::makeKernelSandbox(platform::Directories::fromEnvironment(), "test", loop);
-    const std::string token = *sandbox->issueReadExtension(test::known(home.path("bundle")), ".");
+    const std::string token = *sandbox->issueReadExtension(test::known(home.path("bundle")), ".",
+                                                           platform::Wait::Allowed);
     std::thread thread([&] { loop.run(); });
 
     auto extension = ZRSandboxExtension::initWithExtension(token);

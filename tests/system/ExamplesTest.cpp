@@ -26,7 +26,7 @@ class Examples : public SystemTest {
 
     std::unique_ptr<Process> textTool(const std::string& arguments, const std::string& text = "") {
         const std::string input = home_.write("input", text);
-        auto tool = spawn("/bin/sh", {"-c", "exec " TEXT_TOOL " " + arguments + " < " + input});
+        auto tool = spawn("/bin/sh", {"-c", "exec '" TEXT_TOOL "' " + arguments + " < " + input});
         tool->wait();
         return tool;
     }

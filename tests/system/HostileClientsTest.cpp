@@ -144,7 +144,7 @@ TEST_F(HostileClients, AnotherUserIsNotLetIn) {
 
 TEST_F(HostileClients, IdleConnectionsOfSomeKeepNobodyElseOut) {
     stop(SIGTERM);
-    zrd_ = spawn("/bin/sh", {"-c", "ulimit -n 400; exec " ZRD_PROGRAM});
+    zrd_ = spawn("/bin/sh", {"-c", "ulimit -n 400; exec '" ZRD_PROGRAM "'"});
     ASSERT_TRUE(waitUntil([&] { return RawClient(socket_).isConnected(); }));
     client_ = ZRDaemonClient::initWithServiceName(nullptr);
     expectService();

@@ -5,9 +5,12 @@
 #include <sys/mount.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <csignal>
 #include <filesystem>
+#include <thread>
 
+#include "Zorvan/ZRPlugInProcess.h"
 #include "platform/system/UniqueFd.h"
 #include "tests/system/SystemTest.h"
 
@@ -45,10 +48,14 @@ class HungFileSystem : public SystemTest {
             "rootmode=40000,user_id=0,group_id=0,fd=" + std::to_string(fuse_.get());
         ASSERT_EQ(::mount("hung", hung_.c_str(), "fuse", MS_NOSUID | MS_NODEV, options.c_str()), 0);
     }
-    void expectService() {
+    static void expectQuick(const std::function<void()>& work) {
         const auto start = std::chrono::steady_clock::now();
-        EXPECT_THAT(match({{"VXExtensionIdentifier", "steady"}}), ElementsAre("steady 1"));
+        work();
         EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(1));
+    }
+    void expectService() {
+        const Dictionary steady{{"VXExtensionIdentifier", "steady"}};
+        expectQuick([&] { EXPECT_THAT(match(steady), ElementsAre("steady 1")); });
     }
 
     const std::string hung_ = home_.path("hung");
@@ -72,6 +79,71 @@ TEST_F(HungFileSystem, APathOnItHoldsUpItsSenderAlone) {
     EXPECT_THAT(holding.receive(), HasSubstr("invalid path: " + hung_ + "/a"));
     adding.send(RawClient::request({{"request", "add"}, {"version", 3}, {"paths", Array{hung_}}}));
     EXPECT_THAT(adding.receive(), HasSubstr("invalid plugin path: " + hung_));
+}
+
+TEST_F(HungFileSystem, ARegisteredBundleOnItHoldsUpWhoAsksForItAlone) {
+    const std::string bundle = "hung/H.app/PlugIns/far.appex";
+    Dictionary far = info("far");
+    far.set("QFBundleExecutable", "run");
+    writePlugIn(bundle, far);
+    std::filesystem::copy_file("/bin/true", home_.path(bundle + "/run"));
+    ASSERT_EQ(add({home_.path("hung/H.app")}), "");
+    const auto idOf = [&](const char* name) {
+        return *platform::Uuid::parse(
+            *forms({{"VXExtensionIdentifier", name}}).at(0).find("uuid")->string());
+    };
+    const platform::Uuid steady = idOf("steady"), uuid = idOf("far");
+    const auto ready = [&](const platform::Uuid& plugIn) {
+        return errorOf(
+            ask([&](auto& client, auto& reply) { client.readyPlugIns({plugIn}, 0, reply); }));
+    };
+    ASSERT_EQ(ready(uuid), "");
+    const std::string refusal = ready(steady);  // it has no executable
+    hang();
+    const auto asking = [&](Dictionary request) {
+        auto client = std::make_unique<RawClient>(socket_);
+        request.set("version", 3);
+        client->send(RawClient::request(request));
+        return client;
+    };
+    const auto readying = asking({{"request", "ready"}, {"uuids", Array{uuid}}});
+    const auto accessing = asking({{"request", "access"}, {"uuids", Array{steady, uuid}}});
+    const auto matching = asking({{"request", "match"}});
+    std::thread starting([&] {
+        std::optional<zorvan::ZRError> error;
+        EXPECT_FALSE(
+            zorvan::ZRPlugInProcess::start(nullptr, home_.path(bundle + "/run"), {}, error));
+        EXPECT_EQ(error ? error->code : 0, ETIMEDOUT);
+    });
+    const Dictionary near{{"VXExtensionIdentifier", "steady"}};
+    for (int i = 0; i < 20; ++i) {
+        expectQuick([&] { EXPECT_THAT(match(near), ElementsAre("steady 1")); });
+        expectQuick([&] { EXPECT_EQ(ready(steady), refusal); });
+    }
+    EXPECT_THAT(readying->receive(), HasSubstr("unable to enable plug-in far"));
+    EXPECT_THAT(accessing->receive(), HasSubstr("cannot create extension to " + home_.path(bundle) +
+                                                ": " + std::to_string(ETIMEDOUT)));
+    const std::string found = matching->receive();
+    EXPECT_THAT(found, testing::AllOf(HasSubstr("steady"), HasSubstr("far.appex")));
+    starting.join();
+    // Nobody waits for what is known not to answer.
+    for (int i = 0; i < 3; ++i)
+        expectQuick([&] { EXPECT_THAT(match(), ElementsAre("far 1", "steady 1")); });
+    // The registry goes on, and so does a new start.
+    EXPECT_THAT(add({home_.path("hung/H.app")}), HasSubstr("invalid plugin path"));
+    writePlugIn(plugInPath("B", "new"), info("new"));
+    EXPECT_TRUE(waitUntil([&] { return match({{"VXExtensionIdentifier", "new"}}).size() == 1; }));
+    std::filesystem::remove_all(home_.path(plugInPath("B", "new")));
+    EXPECT_TRUE(waitUntil([&] { return match({{"VXExtensionIdentifier", "new"}}).empty(); }));
+    stop(SIGTERM);
+    start();
+    EXPECT_THAT(match(), ElementsAre("far 1", "steady 1"));
+    expectQuick([&] { EXPECT_EQ(add({home_.path(plugInPath("A", "steady"))}), ""); });
+    fuse_.reset();
+    ASSERT_EQ(::umount2(hung_.c_str(), MNT_DETACH), 0);
+    EXPECT_TRUE(waitUntil([&] { return ready(uuid).empty(); }));
+    for (const Dictionary& form : forms())
+        EXPECT_TRUE(form.find("extensions")->dictionary()->contains("."));
 }
 
 TEST_F(HungFileSystem, AHostOnItHoldsUpItselfAlone) {

@@ -59,7 +59,7 @@ TEST_F(Start, ASecondDaemonIsNotConstructedAndTheFirstGoesOn) {
 }
 
 TEST_F(Start, ClosedStandardStreamsAreNoFilesOfItsOwn) {
-    auto zrd = spawn("/bin/sh", {"-c", "exec " ZRD_PROGRAM " <&- >&- 2>&-"});
+    auto zrd = spawn("/bin/sh", {"-c", "exec '" ZRD_PROGRAM "' <&- >&- 2>&-"});
     ASSERT_TRUE(waitUntil([&] { return std::filesystem::exists(socket_); }));
     const std::string descriptors = "/proc/" + std::to_string(zrd->pid()) + "/fd/";
     for (const char* number : {"0", "1", "2"})
@@ -74,8 +74,8 @@ TEST_F(Start, NobodyHasToReadWhatItWrites) {
     const auto daemon = [&](const std::string& start) {
         return spawn("/bin/sh", {"-c", start + unread});
     };
-    EXPECT_EQ(daemon("exec " ZRD_PROGRAM " -v -x")->wait(), 2);
-    zrd_ = daemon("export ZR_LOG=info; exec " ZRD_PROGRAM " -v");
+    EXPECT_EQ(daemon("exec '" ZRD_PROGRAM "' -v -x")->wait(), 2);
+    zrd_ = daemon("export ZR_LOG=info; exec '" ZRD_PROGRAM "' -v");
     ::close(ends[1]);
     EXPECT_TRUE(waitUntil([&] { return !zrd_->isRunning() || RawClient(socket_).isConnected(); }));
 }
@@ -99,8 +99,8 @@ TEST_F(Start, AJournalOutOfReachLosesNoLines) {
     if (std::filesystem::exists("/run/systemd/journal/socket")) GTEST_SKIP();
     auto zrd =
         spawn("/bin/sh",
-              {"-c", "export JOURNAL_STREAM=$(stat -L -c %d:%i /proc/$$/fd/2); exec " ZRD_PROGRAM
-                     " -S a/b"});
+              {"-c", "export JOURNAL_STREAM=$(stat -L -c %d:%i /proc/$$/fd/2); exec '" ZRD_PROGRAM
+                     "' -S a/b"});
     EXPECT_EQ(zrd->wait(), 1);
     EXPECT_EQ(zrd->errLines("unable to construct server"), 1u);
 }

@@ -95,13 +95,17 @@ struct FakeSandbox final : platform::Sandbox {
     bool isSandboxed(const platform::AuditToken&) override { return sandboxed; }
     bool isConfined(const platform::AuditToken&) override { return sandboxed; }
     platform::Result<std::string> issueReadExtension(const platform::KnownDirectory& bundle,
-                                                     const std::string& resource) override {
+                                                     const std::string& resource,
+                                                     platform::Wait wait) override {
         const std::string path = resource == "." ? bundle.path : bundle.path + "/" + resource;
         if (onIssue) onIssue();
+        if (wait == platform::Wait::Never && distant.contains(bundle.path))
+            return platform::Error::posix(EAGAIN, path);
         if (unreadable.contains(path)) return platform::Error::posix(EACCES, path);
         return "token " + std::to_string(++issued) + " " + path;
     }
     std::set<std::string> unreadable;
+    std::set<std::string> distant;  // bundles that are not looked at without waiting
     std::function<void()> onIssue;
     int issued = 0;
     bool sandboxed = false;
@@ -109,12 +113,25 @@ struct FakeSandbox final : platform::Sandbox {
 
 /// Knows no instances, until told what to answer; keeps what it was asked for.
 struct FakeLauncher final : platform::Launcher {
-    int addExternalService(const platform::AuditToken&, const platform::ExternalService& service,
-                           const Dictionary& overlay) override {
+    struct Checked final : platform::CheckedService {
+        Checked(const platform::ExternalService& service, const Dictionary& overlay)
+            : contents(service, overlay) {}
+        const std::pair<platform::ExternalService, Dictionary> contents;
+    };
+    platform::Result<std::shared_ptr<const platform::CheckedService>> checkExternalService(
+        const platform::ExternalService& service, const Dictionary& overlay) override {
+        if (onCheck) onCheck();
+        return std::shared_ptr<const platform::CheckedService>(new Checked(service, overlay));
+    }
+    int grantExternalService(
+        const platform::AuditToken&,
+        const std::shared_ptr<const platform::CheckedService>& checked) override {
+        const auto& [service, overlay] = static_cast<const Checked&>(*checked).contents;
         granted.emplace_back(service.executable, overlay);
         services.push_back(service);
         return refused.contains(service.executable) ? EACCES : 0;
     }
+    std::function<void()> onCheck;
     void removeExternalServices(const std::string& bundlePath) override {
         takenBack.insert(bundlePath);
     }

@@ -3,6 +3,7 @@
 #include <filesystem>
 
 #include "Zorvan/Keys.h"
+#include "platform/lum/Limits.h"
 #include "tests/zrd/TransactionTest.h"
 
 namespace zorvan {
@@ -114,8 +115,9 @@ TEST_F(HoldsTest, WhatComesToAHeldPlaceIsHeld) {
     release({application});
     EXPECT_NE(comes(1, "Empty.app/com.b.appex"), held);
 
+    EXPECT_TRUE(lock(ZRHoldApplications, {directory_.path("Empty.app")}).contains("uuids"));
     Array places;
-    for (std::size_t i = 0; i <= server_->holdPool().quarter(); ++i)
+    for (std::size_t i = 0; i < server_->holdPool().mostOfOne(); ++i)
         places.append(directory_.makeDirectory("places/" + std::to_string(i)));
     EXPECT_EQ(lock(ZRHoldApplications, places), error(11, "too many holds"));
 }
@@ -147,7 +149,7 @@ TEST_F(HoldsTest, ADyingClientGivesItsHoldsBackAndHadAQuarterOfAll) {
     EXPECT_EQ(lock(ZRHoldPlugIns, {a_}), error(11, "too many holds"));
     // The others must not have to wait, neither for these nor for the end of those.
     Array unknown;
-    for (int i = 0; i < 200'000; ++i) unknown.append(Uuid::random());
+    for (std::size_t i = 0; i < platform::lum::kMaxListed; ++i) unknown.append(Uuid::random());
     const auto begin = std::chrono::steady_clock::now();
     release(std::move(unknown));
     EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(1));

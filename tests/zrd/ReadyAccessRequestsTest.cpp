@@ -2,6 +2,7 @@
 #include <filesystem>
 
 #include "Zorvan/Keys.h"
+#include "platform/lum/Limits.h"
 #include "tests/support/KnownDirectory.h"
 #include "tests/zrd/TransactionTest.h"
 #include "zrd/ZRDPlugInSignature.h"
@@ -54,6 +55,31 @@ TEST_F(ReadyAccessTest, AllAreAdmittedBeforeAnyIsEnabled) {
     EXPECT_EQ(launcher_->granted.size(), 2u) << "the others are enabled all the same";
 }
 
+TEST_F(ReadyAccessTest, WhatIsHeldWhileItIsLookedAtIsNotEnabled) {
+    const auto plugIn = server_->findPlugIn(workspace_->installed[0]->plugInUuid);
+    launcher_->onCheck = [&] {
+        auto share = server_->holdPool().draw({1, 1, 0});
+        server_->addHold(std::make_shared<ZRDPlugInHold>(
+            HoldSubject{{plugIn}, {}}, client().weak_from_this(), *std::move(share), *launcher_));
+    };
+    EXPECT_EQ(ask("ready", {0, 3}),
+              error(11, "access to plugin com.a denied: the plug-in is on hold"));
+    EXPECT_THAT(launcher_->granted, IsEmpty());
+}
+
+TEST_F(ReadyAccessTest, ListsHaveAnEnd) {
+    const Array uuids(std::vector<Value>(platform::lum::kMaxListed + 1, platform::Uuid::random()));
+    for (const char* request : {"ready", "access", "annotate", "lock"})
+        EXPECT_EQ(TransactionTest::ask({{"request", request},
+                                        {"uuids", uuids},
+                                        {"annotations", Dictionary{{"election", 1}}}}),
+                  error(4, "invalid request (bad uuid array)"));
+    const Array paths(std::vector<Value>(uuids.size(), "/"));
+    for (const char* request : {"add", "lock"})
+        EXPECT_EQ(TransactionTest::ask({{"request", request}, {"paths", paths}}),
+                  error(4, "invalid request format"));
+}
+
 TEST_F(ReadyAccessTest, AccessGivesOneTokenForEach) {
     const Dictionary reply = ask("access", {0, 0, 1});
     const auto& tokens = *reply.find("extensions")->array();
@@ -72,6 +98,8 @@ TEST_F(ReadyAccessTest, AccessGivesOneTokenForEach) {
 }
 
 TEST_F(ReadyAccessTest, MatchGivesTokensWithEachForm) {
+    sandbox_->distant = {executable(0), executable(2)};
+    EXPECT_EQ(ask("access", {0, 1, 2}).find("extensions")->array()->size(), 3u);
     const Value matches = *TransactionTest::ask({{"request", "match"}}).find("matches");
     for (const Value& form : *matches.packed()->value()->array()) {
         const Dictionary& extensions = *form.dictionary()->find("extensions")->dictionary();
@@ -80,9 +108,13 @@ TEST_F(ReadyAccessTest, MatchGivesTokensWithEachForm) {
     }
 }
 
+std::optional<ZRError> enable(const ZRDPlugIn& plugIn, const FakeHost& host) {
+    return plugIn.enableForClient(host, plugIn.prepareForClient(host));
+}
+
 /// The overlay with which a record is enabled for a host.
 Dictionary overlayOf(const FakeWorld& world, const platform::TDPlugInProxyRef& proxy) {
-    EXPECT_EQ(world.record(proxy)->enableForClient(FakeHost()), std::nullopt);
+    EXPECT_EQ(enable(*world.record(proxy), FakeHost()), std::nullopt);
     return world.launcher->granted.back().second;
 }
 
@@ -133,7 +165,7 @@ TEST(Enabling, TheOverlayFixesEnvironmentAndSandbox) {
 
     FakeHost gone;
     gone.token.reset();
-    EXPECT_EQ(world.record(proxy)->enableForClient(gone)->code, 4);
+    EXPECT_EQ(enable(*world.record(proxy), gone)->code, 4);
 }
 
 TEST(Enabling, TheProfileFollowsTheExtensionPointAndTheUsersConsent) {
@@ -157,6 +189,10 @@ TEST(Enabling, TheProfileFollowsTheExtensionPointAndTheUsersConsent) {
 }
 
 TEST(Enabling, OnlyWhatHasATokenIsShared) {
+    using Augmented = ZRDPlugIn::Augmented;
+    const auto augment = [](const ZRDPlugIn& plugIn, Dictionary& form) {
+        return plugIn.augmentForm(form, platform::Wait::Allowed);
+    };
     FakeWorld world;
     auto proxy = makeProxy(
         "com.a", {},
@@ -166,24 +202,26 @@ TEST(Enabling, OnlyWhatHasATokenIsShared) {
     world.sandbox->unreadable = {path + "/none", path + "/../out"};
     LogLines log;
     Dictionary form;
-    EXPECT_FALSE(world.record(proxy)->augmentForm(form));
+    EXPECT_EQ(augment(*world.record(proxy), form), Augmented::ForNow);
     const Dictionary& extensions = *form.find("extensions")->dictionary();
     EXPECT_EQ(extensions.size(), 1u);
     EXPECT_TRUE(extensions.contains("in"));
     EXPECT_EQ(world.sandbox->issued, 1) << "a name counts once";
     Array names;
     for (int i = 0; i < 100; ++i) names.append(std::to_string(i));
-    EXPECT_EQ(world.record(proxy)->issueResourceExtensions(names).size(), 64u);
+    EXPECT_EQ(world.record(proxy)->issueResourceExtensions(names, platform::Wait::Never)->size(),
+              64u);
     EXPECT_THAT(log.take(), Contains("ops I: failed to make extension for " + path +
                                      "/../out in plug-in at " + path + ": Permission denied"));
     auto single = makeProxy("com.a", {}, {{"Shared", "in"}, {"VXExtensionProtocol", "P"}});
     single->bundlePath = proxy->bundlePath;
-    EXPECT_FALSE(world.record(single)->augmentForm(form)) << "another file may take its place";
+    EXPECT_EQ(augment(*world.record(single), form), Augmented::ForNow)
+        << "another file may take its place";
     EXPECT_TRUE(form.find("extensions")->dictionary()->contains("in"));
     auto unshared = makeProxy("com.b", {}, {{"VXExtensionProtocol", "P"}});
     unshared->bundlePath = "/Apps/Host.app/PlugIns/b.plugin";
     Dictionary untouched;
-    EXPECT_TRUE(world.record(unshared)->augmentForm(untouched));
+    EXPECT_EQ(augment(*world.record(unshared), untouched), Augmented::ForGood);
     EXPECT_EQ(untouched, Dictionary());
 }
 
@@ -198,8 +236,9 @@ TEST(Enabling, AFormsTokenIsUsedAgainOnlyWhileTheBundleIsInItsPlace) {
     platform::UntouchedBundles untouched;
     const auto token = [&] {
         std::optional<ZRError> error;
-        const auto form = record->completedForm(*record->draftForm(untouched, error));
-        const Value* found = form.find("extensions")->dictionary()->find(".");
+        auto draft = record->draftForm(untouched, error);
+        const auto form = record->completedForm(*draft, platform::Wait::Never);
+        const Value* found = form->find("extensions")->dictionary()->find(".");
         return found ? *found->string() : std::string("none");
     };
     const std::string first = token();
@@ -225,7 +264,7 @@ TEST(Enabling, TheLauncherIsToldOfTheVeryBundle) {
     FakeWorld world;
     const auto proxy = makeProxy("com.a");
     proxy->bundleIdentity = {7, 11};
-    EXPECT_EQ(world.record(proxy)->enableForClient(FakeHost()), std::nullopt);
+    EXPECT_EQ(enable(*world.record(proxy), FakeHost()), std::nullopt);
     const platform::ExternalService& service = world.launcher->services.at(0);
     EXPECT_EQ(service.bundle.path, *proxy->bundlePath);
     EXPECT_EQ(service.bundle.identity, proxy->bundleIdentity);
@@ -233,7 +272,7 @@ TEST(Enabling, TheLauncherIsToldOfTheVeryBundle) {
     // Which somebody may have removed.
     EXPECT_EQ(world.workspace->restored, std::vector{*proxy->dataContainerPath});
     world.workspace->lostContainers = true;
-    EXPECT_TRUE(world.record(proxy)->enableForClient(FakeHost()));
+    EXPECT_TRUE(enable(*world.record(proxy), FakeHost()));
     EXPECT_EQ(world.launcher->services.size(), 1u);
 }
 

@@ -26,6 +26,7 @@ class TransactionTest : public testing::Test {
         services_.mainLoop = std::make_shared<platform::RunLoop>();
         services_.looks = services_.pathLooks =
             std::make_shared<platform::PeerLooks>(*services_.mainLoop);
+        services_.bundleLooks = std::make_shared<platform::PlaceLooks>(*services_.mainLoop);
         services_.workspace = workspace_;
         services_.codeSigning = codeSigning_;
         services_.sandbox = sandbox_;

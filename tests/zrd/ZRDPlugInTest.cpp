@@ -57,8 +57,9 @@ TEST_F(ZRDPlugInTest, AFormHasTheNamesAsTheyAreNow) {
     const UntouchedBundles all(std::make_shared<UntouchedBundles::Paths>());
     const auto name = [&](const char* key) {
         std::optional<ZRError> error;
-        const auto form = plugIn->completedForm(*plugIn->draftForm(all, error));
-        const Value* found = form.find(key);
+        auto draft = plugIn->draftForm(all, error);
+        const auto form = plugIn->completedForm(*draft, platform::Wait::Allowed);
+        const Value* found = form->find(key);
         return found ? describe(*found) : "none";
     };
     // One name changes while a form is made.

@@ -318,6 +318,12 @@ TEST_F(ListenerTest, LargeRequestsAreDecodedAndFreedElsewhereAndKeepTheirOrder) 
                 ElementsAre("message 1", "message 2", "message 1", "message 4", "imminent"));
     EXPECT_EQ(errorLines("not UTF-8"), 1u);
     EXPECT_LT(longest, decoding / 3);
+    {
+        RawPeer gone(path());
+        for (std::size_t sent = 0; sent < broken.size(); loop.runOnce(std::chrono::milliseconds(1)))
+            sent += gone.write(std::string_view(broken).substr(sent));
+    }
+    EXPECT_TRUE(stepUntil([&] { return errorLines("not UTF-8") == 2; })) << "who does not stay";
 }
 
 TEST_F(ListenerTest, AHalfClosedPeerStillGetsItsReplies) {
