@@ -49,34 +49,28 @@ void Transaction::readyPlugIns() {
         return Walk::Continue;
     });
     if (!completed) return;
-    enableWhenPrepared(std::move(toEnable));
+    enableNext(std::make_shared<Enabling>(Enabling{.plugIns = std::move(toEnable)}));
 }
 
-void Transaction::enableWhenPrepared(std::vector<std::shared_ptr<ZRDPlugIn>> plugIns) {
-    using Preparation = ZRDPlugIn::Preparation;
-    const auto prepared = std::make_shared<std::vector<Preparation>>(plugIns.size());
-    std::vector<platform::PlaceLooks::Look> looks;
-    for (std::size_t i = 0; i < plugIns.size(); ++i)
-        looks.push_back({plugIns[i]->path(), [plugIn = plugIns[i], client = client_, prepared, i] {
-                             (*prepared)[i] = plugIn->prepareForClient(*client);
-                         }});
-    lookAtBundles(std::move(looks), [this, plugIns = std::move(plugIns),
-                                     prepared](const std::vector<bool>& done) {
-        // Since they were looked at they may have been held, or gone.
-        for (const auto& plugIn : plugIns) {
-            if (!server().findPlugIn(plugIn->uuid()))
-                return fail(kZRErrorInvalidRequest, "no such plugin (uuid not found)");
-            if (!admitToReady(*plugIn)) return;
-        }
-        const Preparation tooLate{.service = nullptr, .failure = ETIMEDOUT};
-        std::optional<ZRError> firstFailure;
-        for (std::size_t i = 0; i < plugIns.size(); ++i) {
-            auto failure =
-                plugIns[i]->enableForClient(*client_, done[i] ? (*prepared)[i] : tooLate);
-            if (failure && !firstFailure) firstFailure = std::move(failure);
-        }
-        if (firstFailure) return fail(kZRErrorInvalidRequest, *firstFailure);
-        this->done();
+void Transaction::enableNext(const std::shared_ptr<Enabling>& enabling) {
+    if (enabling->next == enabling->plugIns.size()) {
+        if (enabling->firstFailure) return fail(kZRErrorInvalidRequest, *enabling->firstFailure);
+        return done();
+    }
+    const auto& plugIn = enabling->plugIns[enabling->next++];
+    const auto prepared = std::make_shared<ZRDPlugIn::Preparation>();
+    platform::PlaceLooks::Look look{plugIn->path(), [plugIn, client = client_, prepared] {
+                                        *prepared = plugIn->prepareForClient(*client);
+                                    }};
+    lookAtBundles({std::move(look)}, [=, this](const std::vector<bool>& isDone) {
+        // Since it was looked at it may have been held, or gone.
+        if (!server().findPlugIn(plugIn->uuid()))
+            return fail(kZRErrorInvalidRequest, "no such plugin (uuid not found)");
+        if (!admitToReady(*plugIn)) return;
+        const ZRDPlugIn::Preparation tooLate{.service = nullptr, .failure = ETIMEDOUT};
+        auto failure = plugIn->enableForClient(*client_, isDone[0] ? *prepared : tooLate);
+        if (failure && !enabling->firstFailure) enabling->firstFailure = std::move(failure);
+        enableNext(enabling);
     });
 }
 

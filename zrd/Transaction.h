@@ -73,7 +73,13 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     const HostRestriction& hostRestriction();
     /// Whether the host may have a plug-in made ready; otherwise the failure has been sent.
     bool admitToReady(const ZRDPlugIn& plugIn);
-    void enableWhenPrepared(std::vector<std::shared_ptr<ZRDPlugIn>> plugIns);
+    /// Plug-ins that are made ready one after another.
+    struct Enabling {
+        std::vector<std::shared_ptr<ZRDPlugIn>> plugIns;
+        std::size_t next = 0;
+        std::optional<ZRError> firstFailure{};
+    };
+    void enableNext(const std::shared_ptr<Enabling>& enabling);
     void releaseHolds(const platform::Array& tokens);
     /// What "paths" names; false when the failure has been sent.
     bool collectPlugInsToHold(HoldSubject& subject);

@@ -20,8 +20,12 @@ namespace platform {
 
 namespace {
 
+constexpr int kSocket = STDERR_FILENO + 1;
+
 /// In a child of the process: what the parcel asks for, until it takes too long.
 [[noreturn]] void obey(const Parcel& parcel, pid_t parent, std::chrono::seconds patience) {
+    // With it, orders would go on being taken, and lost, when the process is gone.
+    ::close(kSocket);
     sigset_t alarm;
     ::sigemptyset(&alarm);
     ::sigaddset(&alarm, SIGALRM);
@@ -40,7 +44,6 @@ namespace {
 [[noreturn]] void serve(int socket, std::chrono::seconds patience) {
     ::prctl(PR_SET_NAME, "zrd-mounts");
     // Nothing of the daemon's stays open here: locks and connections must not outlive it.
-    constexpr int kSocket = STDERR_FILENO + 1;
     const int null = ::open("/dev/null", O_RDWR);
     if (::dup2(socket, kSocket) < 0) ::_exit(1);
     for (int fd = STDIN_FILENO; fd <= STDERR_FILENO; ++fd) ::dup2(null, fd);

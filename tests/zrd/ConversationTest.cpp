@@ -196,12 +196,12 @@ td D: raw LUMService=<private>
 ops I: assigning plug-in <private>(<private>) used to <private> sandbox
 ops -: allowing host 7 <private> to use plug-in <private>(<private>) uuid=used at <private>
 ops D: activation overlay=<private>
+ops E: spawnerd error 13 trying to allow 7 <private> to use plug-in <private>(<private>) uuid=used at <private>
 ops I: failed to create bundle for <private>
 ops I: no LUMService for plug-in; database returned <private>
 ops I: assigning plug-in <private>(<private>) lost to <private> sandbox
 ops -: allowing host 7 <private> to use plug-in <private>(<private>) uuid=lost at <private>
 ops E: failed to obtain execPath for plug-in <private>(lost) bundle=<private>
-ops E: spawnerd error 13 trying to allow 7 <private> to use plug-in <private>(<private>) uuid=used at <private>
 )");
     const auto refused = install("refused", {}, {{"VXExtensionHostEntitlement", "com.demand"}});
     EXPECT_EQ(said("ready", {{"uuids", Array{refused->plugInUuid}}}), R"(
