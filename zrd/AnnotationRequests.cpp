@@ -2,6 +2,7 @@
 
 #include <unordered_map>
 #include <unordered_set>
+#include <utility>
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
@@ -49,8 +50,12 @@ bool Transaction::hasShareFor(const Dictionary& change, const ZRDPlugIn& plugIn)
 }
 
 void Transaction::annotate(const Dictionary& change, const ZRDPlugIn& plugIn) {
-    hasUnsavedAnnotations_ = true;
-    server().changeAnnotation(change, plugIn, origin());
+    hasUnsyncedAnnotations_ = true;
+    server().setAnnotation(change, plugIn, origin(), platform::Sync::No);
+}
+
+void Transaction::syncAnnotations() {
+    if (std::exchange(hasUnsyncedAnnotations_, false)) server().syncAnnotations();
 }
 
 void Transaction::annotatePlugIns() {
@@ -88,6 +93,7 @@ void Transaction::annotatePlugIns() {
         return Walk::Continue;
     });
     if (!completed) return;
+    syncAnnotations();
     server().notifyAnnotationChange();
     done();
 }
@@ -120,6 +126,7 @@ void Transaction::bulkAnnotatePlugIns() {
                     plugIn->identifier(), pub(plugIn->uuid()), value);
         annotate(change, *plugIn);
     }
+    syncAnnotations();
     server().notifyAnnotationChange();
     done();
 }

@@ -177,8 +177,7 @@ void Transaction::addAnnotationForPlugIn(const ZRDPlugIn& plugIn, Dictionary& in
 }
 
 void Transaction::done() {
-    // What was changed is on the disk before anybody is told.
-    if (std::exchange(hasUnsavedAnnotations_, false)) server().saveAnnotations();
+    syncAnnotations();
     if (probes::requestOutputEnabled()) {
         probes::requestOutput(client_->pid(), describe(reply_).c_str());
     }

@@ -87,8 +87,10 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     bool areIdle(const std::vector<std::shared_ptr<ZRDPlugIn>>& plugIns);
     void takeHold(HoldSubject subject);
 
-    /// Changes the plug-in's annotation for this client; saved with the others before the reply.
+    /// Changes the plug-in's annotation for this client, and saves it without a sync.
     void annotate(const platform::Dictionary& change, const ZRDPlugIn& plugIn);
+    /// What this request has changed is on the disk afterwards: before anybody is told of it.
+    void syncAnnotations();
     /// The request's "annotations"; null when they cannot be stored, and the failure has been sent.
     const platform::Dictionary* requestedAnnotations();
     /// Whether the store has room for a change; otherwise the failure has been sent.
@@ -147,7 +149,7 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     const std::shared_ptr<RequestPaths> paths_;
     platform::Message reply_;
     std::optional<HostRestriction> hostRestriction_;
-    bool hasUnsavedAnnotations_ = false;
+    bool hasUnsyncedAnnotations_ = false;
     std::atomic<std::uint64_t> version_{0};
 };
 

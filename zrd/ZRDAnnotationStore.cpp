@@ -111,10 +111,11 @@ std::optional<ZRError> ZRDAnnotationStore::loadDb() {
     return error;
 }
 
-std::optional<ZRError> ZRDAnnotationStore::saveDb() {
+std::optional<ZRError> ZRDAnnotationStore::saveDb(platform::Sync sync) {
     const auto bytes = text_.text(annotations_, cost_);
     if (!bytes) return zrError(bytes.error());
-    if (auto error = platform::writeFileAtomically(annotationsURL_, *bytes)) return zrError(*error);
+    if (auto error = platform::writeFileAtomically(annotationsURL_, *bytes, sync))
+        return zrError(*error);
     return std::nullopt;
 }
 
@@ -152,14 +153,8 @@ bool ZRDAnnotationStore::hasShareFor(const Dictionary& annotation, const ZRDPlug
 
 void ZRDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,
                                        const ZRDPlugIn& plugIn,
-                                       const std::optional<platform::Origin>& origin) {
-    changeAnnotation(annotation, plugIn, origin);
-    save();
-}
-
-void ZRDAnnotationStore::changeAnnotation(const std::optional<Dictionary>& annotation,
-                                          const ZRDPlugIn& plugIn,
-                                          const std::optional<platform::Origin>& origin) {
+                                       const std::optional<platform::Origin>& origin,
+                                       platform::Sync sync) {
     const std::string& key = plugIn.annotationKey();
     std::optional<platform::PropertyListCost> cost;
     if (const Value* current = annotations_.find(key)) cost_ -= costOf(key, *current);
@@ -174,13 +169,15 @@ void ZRDAnnotationStore::changeAnnotation(const std::optional<Dictionary>& annot
     }
     shares_.changed(key, cost);
     text_.changed(key);
+    if (auto error = saveDb(sync)) logFailure(*error);
 }
 
-void ZRDAnnotationStore::save() {
-    if (auto error = saveDb()) {
-        EVLOG_ERROR(ops(), "unable to save annotations:{} error:{}", pub(annotationsURL_),
-                    pub(*error));
-    }
+void ZRDAnnotationStore::sync() {
+    if (auto error = platform::syncFile(annotationsURL_)) logFailure(zrError(*error));
+}
+
+void ZRDAnnotationStore::logFailure(const ZRError& error) const {
+    EVLOG_ERROR(ops(), "unable to save annotations:{} error:{}", pub(annotationsURL_), pub(error));
 }
 
 }  // namespace zorvan

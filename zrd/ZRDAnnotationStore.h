@@ -5,6 +5,7 @@
 #include <string>
 
 #include "Zorvan/ZRError.h"
+#include "platform/system/Files.h"
 #include "platform/values/Value.h"
 #include "zrd/AnnotationShares.h"
 #include "zrd/AnnotationText.h"
@@ -53,18 +54,17 @@ class ZRDAnnotationStore {
     /// Merges the entries of `annotation` into the plug-in's annotation, or removes that when there
     /// are none, then saves. A failed save is logged; the change stays and reaches the file with
     /// the next successful one. Hosts' data belongs to the origin from then on, if one is given.
+    /// Who makes many changes syncs the file once, after the last one.
     void setAnnotation(const std::optional<platform::Dictionary>& annotation,
                        const ZRDPlugIn& plugIn,
-                       const std::optional<platform::Origin>& origin = std::nullopt);
-
-    /// The same without saving, for who changes many; and what saves them.
-    void changeAnnotation(const std::optional<platform::Dictionary>& annotation,
-                          const ZRDPlugIn& plugIn, const std::optional<platform::Origin>& origin);
-    void save();
+                       const std::optional<platform::Origin>& origin = std::nullopt,
+                       platform::Sync sync = platform::Sync::Yes);
+    /// Syncs the file after changes that were saved without. A failure is logged.
+    void sync();
 
     /// Each answers what went wrong, or none.
     std::optional<ZRError> loadDb();
-    std::optional<ZRError> saveDb();
+    std::optional<ZRError> saveDb(platform::Sync sync = platform::Sync::Yes);
 
     /// <user directory>/com.orbel.zorvan/Annotations. Makes the directory (0700). Without one the
     /// daemon cannot do its work: an internal inconsistency.
@@ -76,6 +76,8 @@ class ZRDAnnotationStore {
   private:
     platform::Dictionary merged(const platform::Dictionary& annotation,
                                 const std::string& key) const;
+
+    void logFailure(const ZRError& error) const;
 
     explicit ZRDAnnotationStore(std::string path) : annotationsURL_(std::move(path)) {}
 

@@ -124,18 +124,14 @@ bool ZRDatabase::hasShareForAnnotation(const Dictionary& annotation, const ZRDPl
 
 std::optional<ZRError> ZRDatabase::setAnnotation(const std::optional<Dictionary>& annotation,
                                                  const ZRDPlugIn& plugIn,
-                                                 const std::optional<platform::Origin>& origin) {
-    sync_.sync([&] { annotations_->setAnnotation(annotation, plugIn, origin); });
+                                                 const std::optional<platform::Origin>& origin,
+                                                 platform::Sync sync) {
+    sync_.sync([&] { annotations_->setAnnotation(annotation, plugIn, origin, sync); });
     return std::nullopt;
 }
 
-void ZRDatabase::changeAnnotation(const Dictionary& annotation, const ZRDPlugIn& plugIn,
-                                  const platform::Origin& origin) {
-    sync_.sync([&] { annotations_->changeAnnotation(annotation, plugIn, origin); });
-}
-
-void ZRDatabase::saveAnnotations() {
-    sync_.sync([&] { annotations_->save(); });
+void ZRDatabase::syncAnnotations() {
+    sync_.sync([&] { annotations_->sync(); });
 }
 
 void ZRDatabase::notifyAnnotationChange() {

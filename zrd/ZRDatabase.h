@@ -12,6 +12,7 @@
 #include "Zorvan/ZRError.h"
 #include "platform/Services.h"
 #include "platform/lum/Origin.h"
+#include "platform/system/Files.h"
 #include "platform/tandry/Workspace.h"
 #include "platform/threads/SyncQueue.h"
 #include "zrd/PlugInContext.h"
@@ -86,11 +87,10 @@ class ZRDatabase : public AnnotationReader, public platform::WorkspaceObserver {
     /// failed save is logged, and the change kept. Hosts' data belongs to the origin, if given.
     std::optional<ZRError> setAnnotation(
         const std::optional<platform::Dictionary>& annotation, const ZRDPlugIn& plugIn,
-        const std::optional<platform::Origin>& origin = std::nullopt);
-    /// The same for one of many, which are saved together, once, by `saveAnnotations`.
-    void changeAnnotation(const platform::Dictionary& annotation, const ZRDPlugIn& plugIn,
-                          const platform::Origin& origin);
-    void saveAnnotations();
+        const std::optional<platform::Origin>& origin = std::nullopt,
+        platform::Sync sync = platform::Sync::Yes);
+    /// After changes that were saved without a sync.
+    void syncAnnotations();
     /// Tells whoever listens that annotations, and with them match results, have changed.
     void notifyAnnotationChange();
 

@@ -223,6 +223,16 @@ std::optional<Error> writeFileAtomically(const std::string& path, std::string_vi
     return std::nullopt;
 }
 
+std::optional<Error> syncFile(const std::string& path) {
+    const auto target = followLinks(path);
+    if (!target) return target.error();
+    for (const std::string& synced : {*target, std::string(parentPath(*target))}) {
+        const UniqueFd file(::open(synced.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+        if (!file || ::fsync(file.get()) != 0) return Error::posix(errno, path);
+    }
+    return std::nullopt;
+}
+
 void removeLeftovers(const std::string& path) {
     const auto target = followLinks(path);
     if (hasNul(path) || !target) return;

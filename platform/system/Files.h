@@ -28,11 +28,14 @@ Result<std::string> readFileBeneath(int dirfd, const std::string& name, std::siz
 /// without such files one of its own, see `removeLeftovers`); no other file is touched. A new file
 /// gets mode 0600; an existing one keeps its mode. A symbolic link stays, and the file that it
 /// leads to is replaced. None on success. Errors: the system's; EINVAL when something other than a
-/// regular file is there. Without the sync, what means nothing after a crash of the machine is
-/// replaced sooner.
+/// regular file is there. Without the sync, a crash of the machine (not of a process) may leave
+/// neither.
 enum class Sync { Yes, No };
 std::optional<Error> writeFileAtomically(const std::string& path, std::string_view bytes,
                                          Sync sync = Sync::Yes);
+
+/// Syncs the file at `path`, and the directory that it lies in: for who has replaced it without.
+std::optional<Error> syncFile(const std::string& path);
 
 /// Removes what writing this very file has left beside it when it was interrupted by a crash.
 /// Nobody else's files are touched: such a file bears a name of ours that follows from the name at
