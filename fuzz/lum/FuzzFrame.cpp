@@ -1,5 +1,5 @@
 // A stream is cut into the same payloads however its bytes arrive, and a message is sent again as
-// what it was.
+// what it was. What a host would not send, since it would be refused, is refused, and nothing else.
 // Covers: platform/lum/Frame.cpp platform/lum/Message.cpp
 
 #include <algorithm>
@@ -44,6 +44,39 @@ void sendAgain(const Message& message, FrameKind kind) {
     fuzz::require(describe(*same) == describe(message));
 }
 
+/// As a host may have made it: with texts that are any bytes, where data was, and deeper.
+Value likeAHosts(const Value& value) {
+    if (const Data* data = value.data()) return std::string(data->bytes());
+    if (const Array* array = value.array()) {
+        std::vector<Value> elements;
+        for (const Value& element : *array) elements.push_back(likeAHosts(element));
+        return Array(std::move(elements));
+    }
+    if (const Dictionary* dictionary = value.dictionary()) {
+        Dictionary made;
+        for (const auto& [key, element] : *dictionary) {
+            const Data* name = element.data();
+            made.set(name ? name->bytes() : key, likeAHosts(element));
+        }
+        return made;
+    }
+    return value;
+}
+
+void sendAsHost(const Message& message) {
+    Dictionary body = *likeAHosts(Value(message.contents())).dictionary();
+    const Value* levels = body.find("levels");
+    for (std::uint64_t i = levels ? levels->unsignedInteger().value_or(0) % 256 : 0; i > 0; --i)
+        body = i % 2 ? Dictionary{{"", Array{std::move(body)}}} : Dictionary{{"", std::move(body)}};
+    const auto wrong = whatIsWrongWith(body);
+    const auto frame = encodeFrame(FrameKind::Request, Message(body), SIZE_MAX);
+    const auto received =
+        decodePayload(std::make_shared<const std::string>(frame->string().substr(kFrameHeaderSize)),
+                      FrameKind::Request);
+    fuzz::require(wrong ? std::holds_alternative<Error>(received)
+                        : std::holds_alternative<Message>(received));
+}
+
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
@@ -53,7 +86,11 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     for (const auto& payload : whole)
         for (const FrameKind kind : {FrameKind::Request, FrameKind::Reply}) {
             const auto decoded = decodePayload(payload, kind);
-            if (const auto* message = std::get_if<Message>(&decoded)) sendAgain(*message, kind);
+            const auto* message = std::get_if<Message>(&decoded);
+            if (!message) continue;
+            sendAgain(*message, kind);
+            sendAsHost(*message);
+            fuzz::require(Message::replyTo(*message).serial() == message->serial());
         }
     return 0;
 }

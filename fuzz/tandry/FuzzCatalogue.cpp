@@ -1,11 +1,13 @@
 // Rows of a catalogue: an array of [table, value, ...]. What is read of them is stored, and is then
-// read as it was.
+// read as it was. Rows of numbers behind those of the tables say what changes then, and what is
+// looked for.
 // Covers: platform/tandry/CatalogueTables.cpp platform/tandry/Sqlite.cpp
-// Covers: platform/tandry/Snapshot.cpp
+// Covers: platform/tandry/Snapshot.cpp platform/values/LazyDictionary.cpp
 
 #include <fmt/format.h>
 
 #include <algorithm>
+#include <set>
 
 #include "fuzz/Support.h"
 #include "platform/tandry/CatalogueTables.h"
@@ -67,16 +69,109 @@ RegistryChanges everythingOf(const RegistryState& state) {
     return changes;
 }
 
-void lookAt(const RegistryState& state) {
-    const Snapshot snapshot(state);
+/// The state without what lies at some paths, and with other stamps of what lies at others.
+RegistryChanges change(RegistryState& state, const std::set<std::string>& gone,
+                       const std::set<std::string>& restamped) {
+    RegistryChanges changes;
+    changes.applications = changes.registrations = changes.forgotten = changes.refusals = gone;
+    for (const std::string& path : gone) {
+        const auto plugIn = state.plugIns.find(path);
+        if (plugIn != state.plugIns.end()) changes.uninstalled.push_back(plugIn->second.record);
+        // A plug-in that comes anew is another one.
+        if (plugIn != state.plugIns.end() && restamped.contains(path)) {
+            auto record = std::make_shared<TDPlugInProxy>(*plugIn->second.record);
+            record->plugInUuid = Uuid::random();
+            plugIn->second.record = record;
+            plugIn->second.attachDictionaries();
+            changes.installed.push_back(record);
+            continue;
+        }
+        state.plugIns.erase(path);
+        state.registrations.erase(path);
+        state.forgotten.erase(path);
+        state.refusals.erase(path);
+        std::erase_if(state.plugIns, [&](const auto& entry) {
+            const auto& application = entry.second.record->containingApplication;
+            const bool goes = application && application->bundlePath == path;
+            if (goes) changes.uninstalled.push_back(entry.second.record);
+            return goes;
+        });
+        state.applications.erase(path);
+    }
+    for (auto& [path, entry] : state.plugIns)
+        if (restamped.contains(path)) entry.print.stamps += "later";
+    changes.restamped = restamped;
+    return changes;
+}
+
+bool contains(const TDPlugInProxyList& list, const TDPlugInProxyRef& plugIn) {
+    return std::ranges::find(list, plugIn) != list.end();
+}
+
+void lookAt(const Snapshot& snapshot) {
     for (const auto& plugIn : snapshot.plugIns()) {
         (void)plugIn->infoPlist.get();
         (void)plugIn->entitlements.get();
         fuzz::require(snapshot.plugInAtPath(*plugIn->bundlePath) == plugIn);
+        fuzz::require(bool(snapshot.plugInWithUuid(plugIn->plugInUuid)));
         const Dictionary query{{"VXExtensionIdentifier", "=" + *plugIn->plugInIdentifier}};
-        const auto found = snapshot.candidates(query);
-        fuzz::require(std::ranges::find(found, plugIn) != found.end());
+        fuzz::require(contains(snapshot.candidates(query), plugIn));
+        const auto& application = plugIn->containingApplication;
+        if (application && plugIn->bundlePath->starts_with(application->bundlePath + "/"))
+            fuzz::require(contains(snapshot.plugInsOfApplication(application->bundlePath), plugIn));
     }
+}
+
+std::set<std::string> texts(const Array& row) {
+    std::set<std::string> texts;
+    for (const Value& element : row)
+        if (element.string()) texts.insert(*element.string());
+    return texts;
+}
+
+/// What the rows behind those of the tables say.
+struct Later {
+    static constexpr std::uint64_t kFirst = std::size(kTables);
+
+    explicit Later(const Array& rows) {
+        for (const Value& row : rows) {
+            const Array* fields = row.array();
+            const auto number =
+                fields && !fields->empty() ? (*fields)[0].unsignedInteger() : std::nullopt;
+            if (number == kFirst) gone = texts(*fields);
+            if (number == kFirst + 1) restamped = texts(*fields);
+            if (number == kFirst + 2 && fields->size() > 1 && (*fields)[1].dictionary())
+                query = *(*fields)[1].dictionary();
+            if (number == kFirst + 3) damage = texts(*fields);
+        }
+    }
+    std::set<std::string> gone, restamped;
+    Dictionary query;
+    std::set<std::string> damage;  // tables whose sums are wrong
+};
+
+/// A catalogue that is written anew, then changed, holds what the state does.
+void write(RegistryState& state, const Later& later) {
+    SqliteDatabase database = std::move(*SqliteDatabase::open(":memory:"));
+    CatalogueTables tables(database);
+    fuzz::require(!tables.create() && !tables.clear(true));
+    fuzz::require(!tables.write(state, everythingOf(state)));
+    const Snapshot before(state);
+    const RegistryChanges changes = change(state, later.gone, later.restamped);
+    fuzz::require(!tables.write(state, changes));
+    const Snapshot after(before, state, changes), fresh(state);
+    lookAt(after);
+    fuzz::require(after.plugIns() == fresh.plugIns());
+    fuzz::require(after.candidates(later.query) == fresh.candidates(later.query));
+    RegistryState again;
+    bool leftOut = false;
+    fuzz::require(!tables.read(again, leftOut) && !leftOut);
+    fuzz::require(again.plugIns.size() == state.plugIns.size());
+    fuzz::require(again.applications.size() == state.applications.size());
+    fuzz::require(again.registrations == state.registrations);
+    fuzz::require(again.forgotten.size() == state.forgotten.size());
+    fuzz::require(again.refusals.size() == state.refusals.size());
+    fuzz::require(!tables.clearForgotten());
 }
 
 }  // namespace
@@ -89,17 +184,16 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     for (const Value& row : *rows->array())
         if (row.array()) insert(database, *row.array());
     fuzz::require(!database.run(kSumUp));
+    const Later later(*rows->array());
+    for (const std::string& table : later.damage)
+        (void)database.run(fmt::format("UPDATE \"{}\" SET sum = x'00'", table).c_str());
 
     RegistryState state;
     bool leftOut = false;
-    fuzz::require(!CatalogueTables(database).read(state, leftOut));
-    lookAt(state);
-    SqliteDatabase second = std::move(*SqliteDatabase::open(":memory:"));
-    fuzz::require(!CatalogueTables(second).create());
-    fuzz::require(!CatalogueTables(second).write(state, everythingOf(state)));
-    RegistryState again;
-    fuzz::require(!CatalogueTables(second).read(again, leftOut = false) && !leftOut);
-    fuzz::require(again.plugIns.size() == state.plugIns.size());
-    fuzz::require(again.registrations == state.registrations);
+    const auto error = CatalogueTables(database).read(state, leftOut);
+    fuzz::require(!error || !later.damage.empty());
+    if (error) return 0;
+    lookAt(Snapshot(state));
+    write(state, later);
     return 0;
 }

@@ -4,6 +4,7 @@
 
 #include "fuzz/Support.h"
 #include "platform/values/Cbor.h"
+#include "platform/values/SliceList.h"
 
 using namespace platform;
 
@@ -27,6 +28,15 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     auto plain = decodeCbor(bytes);
     fuzz::require(plain && *encoded(*plain) == *bytes);
     fuzz::require(describe(*again) == describe(*value));
+    if (const Dictionary* dictionary = plain->dictionary()) {
+        keepCborEncoded(*dictionary);
+        fuzz::require(*encoded(*plain) == *bytes);
+        SliceList slices;
+        encodeCbor(*dictionary, slices);
+        fuzz::require(slices.string() == *bytes);
+        (void)describeWhole(*dictionary);
+    }
+    if (const Array* array = plain->array()) fuzz::require(describe(*array) == describe(*value));
     if (const Packed* packed = value->packed()) (void)unpack(*packed);
     return 0;
 }

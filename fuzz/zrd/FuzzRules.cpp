@@ -7,13 +7,15 @@
 #include "fuzz/Support.h"
 #include "platform/tandry/Snapshot.h"
 #include "tests/zrd/Fakes.h"
+#include "zrd/RuleSet.h"
 
 using namespace platform;
 
 namespace {
 
-struct Candidate {
-    Candidate() {
+/// A plug-in of an application, and one of the system.
+struct Candidates {
+    Candidates() {
         const auto proxy = zorvan::makeProxy("com.a", {{"V", "1.10"},
                                                        {"VXExtensionPointIdentifier", "p.01"},
                                                        {"List", Array{7, "a", "b", "p2"}},
@@ -22,27 +24,40 @@ struct Candidate {
                                                        {"Type", "png"},
                                                        {"Rule", Dictionary{{"image", 2}}}});
         proxy->entitlements = Dictionary{{"on", true}, {"text", "t"}};
+        world.annotations->stored["com.a"] = Dictionary{{"election", 0x101}};
+        add(proxy, "p.01");
+        const auto system = zorvan::makeProxy("com.b", {{"VXExtensionPointIdentifier", "q"}});
+        system->bundlePath = "/System/b.appex";
+        system->containingApplication = nullptr;
+        add(system, "q");
+    }
+    void add(const std::shared_ptr<TDPlugInProxy>& proxy, const std::string& point) {
         tandry::PlugInEntry entry;
         entry.record = proxy;
-        entry.points = std::string("p.01") + '\0';
+        entry.points = point + '\0';
         state.plugIns.emplace(*proxy->bundlePath, entry);
-        plugIn = world.record(proxy);
+        plugIns.push_back(world.record(proxy));
+        fuzz::require(bool(plugIns.back()));
     }
     zorvan::FakeWorld world;
     tandry::RegistryState state;
-    std::shared_ptr<zorvan::ZRDPlugIn> plugIn;
+    std::vector<std::shared_ptr<zorvan::ZRDPlugIn>> plugIns;
 };
 
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
-    static const Candidate candidate;
-    static const tandry::Snapshot snapshot(candidate.state);
+    static const Candidates candidates;
+    static const tandry::Snapshot snapshot(candidates.state);
     const Dictionary rules = fuzz::dictionaryIn(fuzz::text(data, size));
-    const bool holds = candidate.plugIn->match(&rules);
-    fuzz::require(holds == std::ranges::all_of(rules, [&](const auto& rule) {
-                      return candidate.plugIn->matchKey(rule.first, rule.second);
-                  }));
-    if (holds) fuzz::require(snapshot.candidates(rules).size() == 1);
+    (void)zorvan::RuleSet::isAffordable(rules);
+    const auto found = snapshot.candidates(rules);
+    for (const auto& plugIn : candidates.plugIns) {
+        const bool holds = plugIn->match(&rules);
+        const auto each = std::ranges::count_if(
+            rules, [&](const auto& rule) { return plugIn->matchKey(rule.first, rule.second); });
+        fuzz::require(holds == (static_cast<std::size_t>(each) == rules.size()));
+        if (holds) fuzz::require(std::ranges::find(found, plugIn->tdproxy()) != found.end());
+    }
     return 0;
 }

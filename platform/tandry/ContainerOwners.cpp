@@ -74,7 +74,9 @@ std::optional<Error> ContainerOwners::read() {
     const Dictionary* contents = value->dictionary();
     const Value* version = contents ? contents->find(kVersionKey) : nullptr;
     const Dictionary* places = contents ? dictionaryAt(*contents, kPlaces) : nullptr;
-    if (!version || *version != Value(kVersion) || !places) return malformed;
+    // What the file could not be written with again would keep everything else from being stored.
+    if (!version || *version != Value(kVersion) || !places || !isPropertyList(*value))
+        return malformed;
     wasDamaged_ = contents->contains(kDamaged);
     for (const auto& [place, entry] : *places)
         if (!entry.dictionary() || !take(place, *entry.dictionary())) return malformed;
