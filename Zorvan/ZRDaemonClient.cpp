@@ -72,7 +72,8 @@ bool hasTooLongList(const Message& message) {
     const Value* type = message.find(message::kRequest);
     const Value* all = message.find(message::kAnnotations);
     const bool isBulk = type && type->string() && *type->string() == request::kBulkAnnotate;
-    return isTooLong(message::kUuids) || isTooLong(message::kPaths) ||
+    const bool isLock = type && type->string() && *type->string() == request::kLock;
+    return (!isLock && isTooLong(message::kUuids)) || isTooLong(message::kPaths) ||
            (isBulk && all && all->dictionary() &&
             all->dictionary()->size() > platform::lum::kMaxListed);
 }
@@ -102,16 +103,14 @@ void ZRDaemonClient::setUuids(Message& message, const std::vector<Uuid>& uuids) 
 
 void ZRDaemonClient::send(Message message, ReplyCallback reply) {
     EVLOG_DEBUG(traffic(), "request: {}", message);
-    if (hasTooLongList(message)) {
-        const ConnectionError refused{ConnectionError::Kind::Refused, "it has too long a list"};
-        return replyQueue_.async([reply = std::move(reply), refused] {
-            if (reply) reply(Reply(refused));
-        });
-    }
-    zrd_->sendWithReply(std::move(message), [reply = std::move(reply)](const Reply& received) {
+    auto receive = [reply = std::move(reply)](const Reply& received) {
         EVLOG_DEBUG(traffic(), "reply: {}", describeReply(received));
         if (reply) reply(received);
-    });
+    };
+    if (!hasTooLongList(message))
+        return zrd_->sendWithReply(std::move(message), std::move(receive));
+    const ConnectionError refused{ConnectionError::Kind::Refused, "it has too long a list"};
+    replyQueue_.async([receive = std::move(receive), refused] { receive(Reply(refused)); });
 }
 
 std::optional<ZRError> ZRDaemonClient::errorInReply(const Reply& reply) {

@@ -42,7 +42,6 @@ void Transaction::lockDownPlugIns() {
 }
 
 void Transaction::releaseHolds(const Array& tokens) {
-    if (tokens.size() > platform::lum::kMaxListed) return static_cast<void>(failForBadUuids());
     for (const Value& element : tokens) {
         // What is no token releases nothing.
         if (auto token = element.uuid()) server().unholdToken(*token);

@@ -49,81 +49,85 @@ void Transaction::readyPlugIns() {
         return Walk::Continue;
     });
     if (!completed) return;
-    enableNext(std::make_shared<Enabling>(Enabling{.plugIns = std::move(toEnable)}));
+    prepareNext(std::make_shared<Enabling>(Enabling{.plugIns = std::move(toEnable)}));
 }
 
-void Transaction::enableNext(const std::shared_ptr<Enabling>& enabling) {
-    if (enabling->next == enabling->plugIns.size()) {
-        if (enabling->firstFailure) return fail(kZRErrorInvalidRequest, *enabling->firstFailure);
-        return done();
-    }
-    const auto& plugIn = enabling->plugIns[enabling->next++];
+void Transaction::prepareNext(const std::shared_ptr<Enabling>& enabling) {
+    const std::size_t next = enabling->prepared.size();
+    if (next == enabling->plugIns.size()) return enable(*enabling);
+    const auto plugIn = enabling->plugIns[next];
     const auto prepared = std::make_shared<ZRDPlugIn::Preparation>();
     platform::PlaceLooks::Look look{plugIn->path(), [plugIn, client = client_, prepared] {
                                         *prepared = plugIn->prepareForClient(*client);
                                     }};
     lookAtBundles({std::move(look)}, [=, this](const std::vector<bool>& isDone) {
-        // Since it was looked at it may have been held, or gone.
-        if (!server().findPlugIn(plugIn->uuid()))
-            return fail(kZRErrorInvalidRequest, "no such plugin (uuid not found)");
-        if (!admitToReady(*plugIn)) return;
-        const ZRDPlugIn::Preparation tooLate{.service = nullptr, .failure = ETIMEDOUT};
-        auto failure = plugIn->enableForClient(*client_, isDone[0] ? *prepared : tooLate);
-        if (failure && !enabling->firstFailure) enabling->firstFailure = std::move(failure);
-        enableNext(enabling);
+        enabling->prepared.push_back(isDone[0] ? std::move(*prepared)
+                                               : plugIn->couldNotPrepareFor(*client_, ETIMEDOUT));
+        prepareNext(enabling);
     });
 }
 
-namespace {
-
-/// Read access to a bundle that is asked for.
-struct Access {
-    std::shared_ptr<ZRDPlugIn> plugIn;
-    platform::Result<std::string> token;
-};
-
-}  // namespace
+void Transaction::enable(const Enabling& enabling) {
+    // Since they were looked at they may have been held, or gone: then none is enabled.
+    for (const auto& plugIn : enabling.plugIns) {
+        if (!server().isRegistered(plugIn->uuid()))
+            return fail(kZRErrorInvalidRequest, "no such plugin (uuid not found)");
+        if (!admitToReady(*plugIn)) return;
+    }
+    std::optional<ZRError> firstFailure;
+    for (std::size_t i = 0; i < enabling.plugIns.size(); ++i) {
+        auto failure = enabling.plugIns[i]->enableForClient(*client_, enabling.prepared[i]);
+        if (failure && !firstFailure) firstFailure = std::move(failure);
+    }
+    if (firstFailure) return fail(kZRErrorInvalidRequest, *firstFailure);
+    done();
+}
 
 void Transaction::accessPlugIns() {
+    accessFrom(0, {});
+}
+
+void Transaction::accessFrom(std::size_t first, Array tokens) {
     const auto sandbox = server().services().sandbox;
-    const auto accesses = std::make_shared<std::vector<Access>>();
-    const auto failAt = [this](const ZRDPlugIn& plugIn, int code) {
-        fail(kZRErrorInvalidRequest,
-             fmt::format("cannot create extension to {}: {}", plugIn.path(), code));
-    };
-    std::vector<std::size_t> late;
-    bool completed = processUuidList([&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
-        auto token =
-            sandbox->issueReadExtension(plugIn->bundleDirectory(), ".", platform::Wait::Never);
-        const bool isLate = !token && token.error().code == EAGAIN;
-        if (!token && !isLate) {
-            failAt(*plugIn, token.error().code);
-            return Walk::Stop;
-        }
-        if (isLate) late.push_back(accesses->size());
-        accesses->push_back({plugIn, std::move(token)});
-        return Walk::Continue;
-    });
-    if (!completed) return;
-    std::vector<platform::PlaceLooks::Look> looks;
-    looks.reserve(late.size());
-    for (const std::size_t index : late)
-        looks.push_back({(*accesses)[index].plugIn->path(), [sandbox, accesses, index] {
-                             Access& access = (*accesses)[index];
-                             access.token = sandbox->issueReadExtension(
-                                 access.plugIn->bundleDirectory(), ".", platform::Wait::Allowed);
-                         }});
-    lookAtBundles(std::move(looks), [=, this](const std::vector<bool>& done) {
-        for (std::size_t i = 0; i < done.size(); ++i) {
-            const Access& access = (*accesses)[late[i]];
-            if (!done[i]) return failAt(*access.plugIn, ETIMEDOUT);
-            if (!access.token) return failAt(*access.plugIn, access.token.error().code);
-        }
-        Array tokens;
-        for (Access& access : *accesses) tokens.append(*std::move(access.token));
+    std::shared_ptr<ZRDPlugIn> late;
+    const bool completed = processUuidList(
+        [&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
+            auto token =
+                sandbox->issueReadExtension(plugIn->bundleDirectory(), ".", platform::Wait::Never);
+            if (!token) {
+                if (token.error().code == EAGAIN)
+                    late = plugIn;
+                else
+                    failToAccess(*plugIn, token.error().code);
+                return Walk::Stop;
+            }
+            tokens.append(*std::move(token));
+            return Walk::Continue;
+        },
+        first);
+    if (completed) {
         reply_.set(message::kExtensions, std::move(tokens));
-        this->done();
+        return done();
+    }
+    if (!late) return;
+    const auto token = std::make_shared<platform::Result<std::string>>(std::string());
+    platform::PlaceLooks::Look look{late->path(), [sandbox, late, token] {
+                                        *token = sandbox->issueReadExtension(
+                                            late->bundleDirectory(), ".", platform::Wait::Allowed);
+                                    }};
+    lookAtBundles({std::move(look)}, [this, late, token, tokens = std::move(tokens)](
+                                         const std::vector<bool>& isDone) mutable {
+        if (!isDone[0]) return failToAccess(*late, ETIMEDOUT);
+        if (!*token) return failToAccess(*late, token->error().code);
+        tokens.append(**token);
+        const std::size_t next = tokens.size();
+        accessFrom(next, std::move(tokens));
     });
+}
+
+void Transaction::failToAccess(const ZRDPlugIn& plugIn, int code) {
+    fail(kZRErrorInvalidRequest,
+         fmt::format("cannot create extension to {}: {}", plugIn.path(), code));
 }
 
 }  // namespace zorvan

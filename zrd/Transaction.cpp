@@ -145,15 +145,15 @@ bool Transaction::marshalPaths(const std::function<Walk(const NamedPath&)>& call
 }
 
 bool Transaction::processUuidList(
-    const std::function<Walk(const std::shared_ptr<ZRDPlugIn>&)>& callback) {
+    const std::function<Walk(const std::shared_ptr<ZRDPlugIn>&)>& callback, std::size_t first) {
     const Value* uuids = request_.find(message::kUuids);
     if (!uuids || !uuids->array()) {
         fail(kZRErrorInvalidRequest, "invalid request format (uuid)");
         return false;
     }
     if (isTooLong(*uuids->array())) return failForBadUuids();
-    for (const Value& element : *uuids->array()) {
-        auto uuid = element.uuid();
+    for (std::size_t i = first; i < uuids->array()->size(); ++i) {
+        auto uuid = (*uuids->array())[i].uuid();
         if (!uuid) return failForBadUuids();
         auto plugIn = server().findPlugIn(*uuid);
         if (!plugIn) {

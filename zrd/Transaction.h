@@ -13,6 +13,7 @@
 #include "platform/lum/Origin.h"
 #include "platform/lum/PlaceLooks.h"
 #include "zrd/HostRestriction.h"
+#include "zrd/ZRDPlugIn.h"
 
 namespace zorvan {
 
@@ -73,13 +74,17 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     const HostRestriction& hostRestriction();
     /// Whether the host may have a plug-in made ready; otherwise the failure has been sent.
     bool admitToReady(const ZRDPlugIn& plugIn);
-    /// Plug-ins that are made ready one after another.
+    /// Goes on with "access" from the plug-in of that place on, with the tokens of those before.
+    void accessFrom(std::size_t first, platform::Array tokens);
+    void failToAccess(const ZRDPlugIn& plugIn, int code);
+    /// Plug-ins that are to be enabled, and how far they are prepared: one after another.
     struct Enabling {
         std::vector<std::shared_ptr<ZRDPlugIn>> plugIns;
-        std::size_t next = 0;
-        std::optional<ZRError> firstFailure{};
+        std::vector<ZRDPlugIn::Preparation> prepared{};
     };
-    void enableNext(const std::shared_ptr<Enabling>& enabling);
+    void prepareNext(const std::shared_ptr<Enabling>& enabling);
+    /// Enables all of them, or, when one may not be by now, none.
+    void enable(const Enabling& enabling);
     void releaseHolds(const platform::Array& tokens);
     /// What "paths" names; false when the failure has been sent.
     bool collectPlugInsToHold(HoldSubject& subject);
@@ -125,8 +130,9 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     Walk prepareRemoving(const NamedPath& path);
     std::optional<ZRError> remove(const std::string& path);
     void refuseRemoving(const std::string& path);
-    /// Visits the plug-ins that "uuids" names, in order; answers as `marshalPaths`.
-    bool processUuidList(const std::function<Walk(const std::shared_ptr<ZRDPlugIn>&)>& callback);
+    /// Visits the plug-ins that "uuids" names, in order, from one on; answers as `marshalPaths`.
+    bool processUuidList(const std::function<Walk(const std::shared_ptr<ZRDPlugIn>&)>& callback,
+                         std::size_t first = 0);
     /// Sends the failure of "uuids" that are no list of UUIDs, or too many; answers false.
     bool failForBadUuids();
     /// Stores the plug-in's annotation, or an empty one, under "annotations".

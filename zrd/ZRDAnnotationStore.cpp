@@ -116,6 +116,7 @@ std::optional<ZRError> ZRDAnnotationStore::saveDb(platform::Sync sync) {
     if (!bytes) return zrError(bytes.error());
     if (auto error = platform::writeFileAtomically(annotationsURL_, *bytes, sync))
         return zrError(*error);
+    isUnsynced_ = sync == platform::Sync::No;
     return std::nullopt;
 }
 
@@ -173,7 +174,8 @@ void ZRDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotati
 }
 
 void ZRDAnnotationStore::sync() {
-    if (auto error = platform::syncFile(annotationsURL_)) logFailure(zrError(*error));
+    if (!std::exchange(isUnsynced_, false) || !platform::syncFile(annotationsURL_)) return;
+    if (auto error = saveDb()) logFailure(*error);
 }
 
 void ZRDAnnotationStore::logFailure(const ZRError& error) const {

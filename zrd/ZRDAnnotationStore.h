@@ -59,7 +59,8 @@ class ZRDAnnotationStore {
                        const ZRDPlugIn& plugIn,
                        const std::optional<platform::Origin>& origin = std::nullopt,
                        platform::Sync sync = platform::Sync::Yes);
-    /// Syncs the file after changes that were saved without. A failure is logged.
+    /// Syncs the file if changes were saved without. What cannot be synced is saved once more; a
+    /// failure of that is logged.
     void sync();
 
     /// Each answers what went wrong, or none.
@@ -85,6 +86,7 @@ class ZRDAnnotationStore {
     platform::Dictionary annotations_;
     platform::PropertyListCost cost_;  // of the annotations
     AnnotationText text_;
+    bool isUnsynced_ = false;
     AnnotationShares shares_{AnnotationText::kMaxSize - kReservedForElections};
 };
 

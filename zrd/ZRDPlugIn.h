@@ -104,13 +104,14 @@ class ZRDPlugIn final : public ZRPlugInCore {
     // Enabling.
     /// What a host needs to start this plug-in, as the bundle is now, or why it cannot.
     struct Preparation {
-        std::shared_ptr<const platform::CheckedService> service;  // null when the launcher refuses
-        int failure = 0;                                          // the launcher's, then
-        std::optional<ZRError> error{};  // when the launcher was not even asked
+        std::shared_ptr<const platform::CheckedService> service;  // null when there is an error
+        std::optional<ZRError> error{};
     };
     /// Prepares the start by a host. Waits for the bundle's file system, so not on the service
     /// queue.
     Preparation prepareForClient(const HostProcess& host) const;
+    /// What comes of it when it met an errno, which it logs.
+    Preparation couldNotPrepareFor(const HostProcess& host, int failure) const;
     /// Tells the launcher that the host may start this plug-in, as it was prepared. The error says
     /// why not.
     std::optional<ZRError> enableForClient(const HostProcess& host,

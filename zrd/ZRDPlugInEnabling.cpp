@@ -112,27 +112,29 @@ ZRDPlugIn::Preparation ZRDPlugIn::prepareForClient(const HostProcess& host) cons
     const platform::ExternalService service{*executable, bundleDirectory(),
                                             tdproxy_->dataContainerPath.value_or("")};
     if (const auto error = context_->workspace->restoreContainer(*tdproxy_))
-        return {.service = nullptr, .failure = error->code};
+        return couldNotPrepareFor(host, error->code);
     auto checked = context_->launcher->checkExternalService(service, overlay);
-    if (!checked) return {.service = nullptr, .failure = checked.error().code};
+    if (!checked) return couldNotPrepareFor(host, checked.error().code);
     return {.service = *std::move(checked)};
+}
+
+ZRDPlugIn::Preparation ZRDPlugIn::couldNotPrepareFor(const HostProcess& host, int failure) const {
+    EVLOG_ERROR(ops(),
+                "spawnerd error {} trying to allow {} {} to use plug-in {}({}) uuid={} at {}",
+                failure, host.pid(), host.path(), identifier(), version(), pub(uuid()), path());
+    return {.service = nullptr,
+            .error = ZRErrorWithFormat(kZRErrorInvalidRequest, "unable to enable plug-in {}({})",
+                                       identifier(), uuid().string())};
 }
 
 std::optional<ZRError> ZRDPlugIn::enableForClient(const HostProcess& host,
                                                   const Preparation& preparation) const {
     if (preparation.error) return preparation.error;
-    int failure = preparation.failure;
-    if (preparation.service) {
-        const auto token = host.auditToken();
-        failure =
-            token ? context_->launcher->grantExternalService(*token, preparation.service) : ESRCH;
-    }
+    const auto token = host.auditToken();
+    const int failure =
+        token ? context_->launcher->grantExternalService(*token, preparation.service) : ESRCH;
     if (failure == 0) return std::nullopt;
-    EVLOG_ERROR(ops(),
-                "spawnerd error {} trying to allow {} {} to use plug-in {}({}) uuid={} at {}",
-                failure, host.pid(), host.path(), identifier(), version(), pub(uuid()), path());
-    return ZRErrorWithFormat(kZRErrorInvalidRequest, "unable to enable plug-in {}({})",
-                             identifier(), uuid().string());
+    return couldNotPrepareFor(host, failure).error;
 }
 
 std::optional<Dictionary> ZRDPlugIn::issueResourceExtensions(const Value& resources,
@@ -141,12 +143,15 @@ std::optional<Dictionary> ZRDPlugIn::issueResourceExtensions(const Value& resour
     const Value* end = resources.array() ? resources.array()->end() : &resources + 1;
     const platform::KnownDirectory bundle = bundleDirectory();
     Dictionary extensions;
+    // Logged once it is clear that the resources are not gone through again.
+    std::vector<std::pair<std::string_view, int>> failures;
+    bool sharesTooMany = false;
     std::unordered_set<std::string_view> known;
     for (const Value* element = begin; element != end; ++element) {
         const std::string* name = element->string();
         if (!name || known.contains(*name)) continue;
         if (known.size() == kMaxResources) {
-            EVLOG_INFO(ops(), "plug-in at {} shares more than {} resources", path(), kMaxResources);
+            sharesTooMany = true;
             break;
         }
         known.insert(*name);
@@ -156,11 +161,16 @@ std::optional<Dictionary> ZRDPlugIn::issueResourceExtensions(const Value& resour
         } else if (wait == platform::Wait::Never && token.error().code == EAGAIN) {
             return std::nullopt;
         } else {
-            const std::string location = *name == "." ? path() : platform::joinPath(path(), *name);
-            EVLOG_INFO(ops(), "failed to make extension for {} in plug-in at {}: {}", location,
-                       path(), pub(std::strerror(token.error().code)));
+            failures.emplace_back(*name, token.error().code);
         }
     }
+    for (const auto& [name, code] : failures) {
+        const std::string location = name == "." ? path() : platform::joinPath(path(), name);
+        EVLOG_INFO(ops(), "failed to make extension for {} in plug-in at {}: {}", location, path(),
+                   pub(std::strerror(code)));
+    }
+    if (sharesTooMany)
+        EVLOG_INFO(ops(), "plug-in at {} shares more than {} resources", path(), kMaxResources);
     return extensions;
 }
 

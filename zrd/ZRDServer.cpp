@@ -99,9 +99,6 @@ void ZRDServer::removedPlugIns(const platform::TDPlugInProxyList& plugIns) {
 
 void ZRDServer::run() {
     service_->resume();
-    // What an earlier daemon held is free, and a crash may have kept its last posts from being
-    // written.
-    notifyAnnotationChange();
     services().mainLoop->run();
 }
 

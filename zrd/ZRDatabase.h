@@ -61,6 +61,10 @@ class ZRDatabase : public AnnotationReader, public platform::WorkspaceObserver {
     /// The record with a UUID. Null for an unknown one, which is logged, and when none can be
     /// built.
     ZRDPlugInRef findPlugIn(const platform::Uuid& uuid);
+    /// Whether the registry has it; no record is looked for, nor made.
+    bool isRegistered(const platform::Uuid& uuid) {
+        return workspace().plugInWithUuid(uuid) != nullptr;
+    }
     /// The record of the plug-in bundle at a path; null, which is logged, when none is registered
     /// there.
     ZRDPlugInRef findPlugInAtPath(const std::string& bundlePath);

@@ -57,6 +57,14 @@ platform::Services diskServices(const std::string& serviceName,
     return services;
 }
 
+/// What is on disk is whole at any moment. A request that a slow disk holds up must not hold up the
+/// end as well, so nothing else is waited for.
+[[noreturn]] void leave(const platform::Services& services, int status) {
+    platform::lum::removeServiceSockets();
+    services.notifications->finish();
+    std::_Exit(status);
+}
+
 }  // namespace
 
 int main(int argc, char* argv[]) {
@@ -68,13 +76,12 @@ int main(int argc, char* argv[]) {
     if (!options) return 2;
     const auto mainLoop = std::make_shared<platform::RunLoop>();
     platform::Services services;
-    int status = EXIT_SUCCESS;
-    const auto end = [&] { services.launcher->shutDown([&] { mainLoop->stop(); }); };
     // Before there are other threads; heard once the loop runs.
-    const platform::TerminationWatch termination(*mainLoop, end);
+    const platform::TerminationWatch termination(
+        *mainLoop, [&] { services.launcher->shutDown([&] { mainLoop->stop(); }); });
     services = diskServices(options->serviceName, mainLoop, [&] {
-        status = EXIT_FAILURE;  // for whoever starts the daemon anew
-        end();
+        // For whoever starts the daemon anew.
+        services.launcher->shutDown([&] { leave(services, EXIT_FAILURE); });
     });
     auto server =
         zorvan::ZRDServer::initForService(options->serviceName, options->databasePath, services);
@@ -85,10 +92,9 @@ int main(int argc, char* argv[]) {
     server->setVerbose(options->verbose);
     server->setCacheLimit(options->cacheLimit);
     mainLoop->post(platform::notifyServiceManagerReady);
+    // What an earlier daemon held is free, and a crash may have kept its last posts from being
+    // written.
+    server->notifyAnnotationChange();
     server->run();
-    platform::lum::removeServiceSockets();
-    services.notifications->finish();
-    // What is on disk is whole at any moment. A request that a slow disk holds up must not hold up
-    // the end as well, so nothing else is waited for.
-    std::_Exit(status);
+    leave(services, EXIT_SUCCESS);
 }

@@ -121,6 +121,7 @@ struct FakeLauncher final : platform::Launcher {
     platform::Result<std::shared_ptr<const platform::CheckedService>> checkExternalService(
         const platform::ExternalService& service, const Dictionary& overlay) override {
         if (onCheck) onCheck();
+        if (refused.contains(service.executable)) return platform::Error::posix(EACCES, "refused");
         return std::shared_ptr<const platform::CheckedService>(new Checked(service, overlay));
     }
     int grantExternalService(
@@ -129,7 +130,7 @@ struct FakeLauncher final : platform::Launcher {
         const auto& [service, overlay] = static_cast<const Checked&>(*checked).contents;
         granted.emplace_back(service.executable, overlay);
         services.push_back(service);
-        return refused.contains(service.executable) ? EACCES : 0;
+        return 0;
     }
     std::function<void()> onCheck;
     void removeExternalServices(const std::string& bundlePath) override {
