@@ -53,6 +53,7 @@ void Transaction::readyPlugIns() {
 }
 
 void Transaction::prepareNext(const std::shared_ptr<Enabling>& enabling) {
+    if (!client_->acceptWork()) return;
     const std::size_t next = enabling->prepared.size();
     if (next == enabling->plugIns.size()) return enable(*enabling);
     const auto plugIn = enabling->plugIns[next];

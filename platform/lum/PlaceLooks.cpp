@@ -1,9 +1,12 @@
 #include "platform/lum/PlaceLooks.h"
 
 #include <fcntl.h>
+#include <sys/sysmacros.h>
 
 #include <atomic>
 #include <cerrno>
+#include <compare>
+#include <functional>
 #include <map>
 #include <set>
 #include <utility>
@@ -48,18 +51,40 @@ struct Round {
     }
 };
 
+/// Who waits for one another: looks at one file system, or, where it is the machine's own and so
+/// hangs only with everything, at one path: what hangs there lies beneath that path.
+struct Neighbourhood {
+    dev_t device = 0;
+    std::string path;  // empty: all of the file system
+
+    static Neighbourhood of(const std::string& path) {
+        static const dev_t root = FileIdentity::at(AT_FDCWD, "/").device;
+        const dev_t device = fileSystemOf(path);
+        const bool isOwn = device == root || major(device) != 0;
+        return {device, isOwn ? path : std::string()};
+    }
+    /// Others of the same hash only wait longer.
+    Origin origin() const {
+        return {device, 1, static_cast<pid_t>(std::hash<std::string>()(path))};
+    }
+
+    auto operator<=>(const Neighbourhood&) const = default;  // NOLINT(modernize-use-nullptr)
+};
+
 }  // namespace
 
 struct PlaceLooks::State : std::enable_shared_from_this<PlaceLooks::State> {
     State(RunLoop& runLoop, std::chrono::milliseconds time)
         : loop(runLoop), patience(time), looks(runLoop, time, 1) {}
 
-    void begin(const std::shared_ptr<Round>& round, const std::map<dev_t, Members>& members);
-    void look(const std::shared_ptr<Round>& round, dev_t fileSystem, const Members& members);
+    void begin(const std::shared_ptr<Round>& round,
+               const std::map<Neighbourhood, Members>& members);
+    void look(const std::shared_ptr<Round>& round, const Neighbourhood& place,
+              const Members& members);
 
     RunLoop& loop;
     const std::chrono::milliseconds patience;
-    std::set<dev_t> silent;  // one that was given up still waits for these
+    std::set<Neighbourhood> silent;  // one that was given up still waits for these
     PeerLooks looks;
 };
 
@@ -77,19 +102,19 @@ struct Visit {
 }  // namespace
 
 void PlaceLooks::State::begin(const std::shared_ptr<Round>& round,
-                              const std::map<dev_t, Members>& members) {
+                              const std::map<Neighbourhood, Members>& members) {
     round->open = 1;
-    for (const auto& [fileSystem, indices] : members)
-        if (!silent.contains(fileSystem)) look(round, fileSystem, indices);
+    for (const auto& [place, indices] : members)
+        if (!silent.contains(place)) look(round, place, indices);
     round->leave();
 }
 
-void PlaceLooks::State::look(const std::shared_ptr<Round>& round, dev_t fileSystem,
+void PlaceLooks::State::look(const std::shared_ptr<Round>& round, const Neighbourhood& place,
                              const Members& members) {
     ++round->open;
     const auto visit = std::make_shared<Visit>();
     looks.look(
-        Origin{fileSystem, 1, 0},
+        place.origin(),
         [round, members, visit, time = patience](PeerLooks::Pace& pace) {
             visit->hasBegun = true;
             // However well it gets on, those who wait behind it get their turn.
@@ -100,13 +125,13 @@ void PlaceLooks::State::look(const std::shared_ptr<Round>& round, dev_t fileSyst
                 pace.step();
             }
         },
-        [this, round, members, fileSystem, weakVisit = std::weak_ptr(visit)](bool isDone,
-                                                                             std::size_t steps) {
+        [this, round, members, place, weakVisit = std::weak_ptr(visit)](bool isDone,
+                                                                        std::size_t steps) {
             const auto hung = isDone ? nullptr : weakVisit.lock();
             if (hung && hung->hasBegun) {
-                silent.insert(fileSystem);
-                hung->whenBack = [weak = weak_from_this(), fileSystem] {
-                    if (const auto self = weak.lock()) self->silent.erase(fileSystem);
+                silent.insert(place);
+                hung->whenBack = [weak = weak_from_this(), place] {
+                    if (const auto self = weak.lock()) self->silent.erase(place);
                 };
             }
             for (std::size_t i = 0; i < steps; ++i) round->done[members[i]] = true;
@@ -124,9 +149,9 @@ void PlaceLooks::make(std::vector<Look> looks, Outcome outcome) {
     round->done.resize(looks.size());
     round->looks = std::move(looks);
     round->outcome = std::move(outcome);
-    std::map<dev_t, Members> members;
+    std::map<Neighbourhood, Members> members;
     for (std::size_t i = 0; i < round->looks.size(); ++i)
-        members[fileSystemOf(round->looks[i].path)].push_back(i);
+        members[Neighbourhood::of(round->looks[i].path)].push_back(i);
     state_->loop.post([weak = std::weak_ptr(state_), round, members = std::move(members)] {
         if (const auto self = weak.lock()) self->begin(round, members);
     });

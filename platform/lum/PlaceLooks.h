@@ -13,8 +13,9 @@ namespace platform {
 /// Looks at places on disk that everybody may ask about, such as registered bundles, whose file
 /// systems need not answer. What hangs is not charged to those who ask: each file system has one
 /// thread at a time, and while one that was given up still waits, nobody else waits for that file
-/// system. The looks at one are made one after another, and those that do not get their turn within
-/// the patience are not made.
+/// system. On the machine's own (that of "/", and those of block devices) this holds for each path:
+/// there it is something beneath the path that hangs. The looks at one are made one after another,
+/// and those that do not get their turn within the patience are not made.
 ///
 /// Its run loop must outlive it; it goes where the loop runs, or while it does not. Its end waits
 /// for the looks that run.

@@ -28,6 +28,7 @@ constexpr std::size_t kMostPeers = 32;
 constexpr int kMostAcceptedAtOnce = 32;
 // For a peer to say its token, and then for the mount to be made: file systems may be slow.
 constexpr std::chrono::seconds kPatience{5};
+constexpr std::chrono::seconds kGrace{1};
 // For a peer to say its token when others wait to be let in.
 constexpr std::chrono::milliseconds kPatienceWhenFull{50};
 constexpr std::chrono::milliseconds kPauseAfterFailure{100};
@@ -180,14 +181,20 @@ void SandboxBroker::State::serve(Place peer, std::string_view token) {
         peer->refuse(outcome.error().code);
         return drop(peer);
     }
-    peer->deadline.cancel();
+    // Who hangs in the kernel cannot be ended, and keeps its peer's place, or there would be ever
+    // more of them; but nobody waits for it.
+    peer->deadline.start(kPatience + kGrace, [peer] {
+        peer->refuse(ETIMEDOUT);
+        peer->socket.reset();
+    });
     peer->outcome = std::move(*outcome);
     peer->outcomeWatch.emplace(loop, peer->outcome.get());
     peer->outcomeWatch->awaitReadable([this, peer] { finish(peer); });
 }
 
 void SandboxBroker::State::finish(Place peer) {
-    if (const int errnum = MountProcess::outcomeAt(peer->outcome)) peer->refuse(errnum);
+    const int errnum = MountProcess::outcomeAt(peer->outcome);
+    if (errnum != 0 && peer->socket) peer->refuse(errnum);
     drop(peer);
 }
 

@@ -212,6 +212,8 @@ void ApplicationScanner::visitFolder(const std::string& folder) {
     }
     for (const std::string& target : found->nowhere) unreachable_.push_back(target);
     for (const std::string& target : found->unseen) keepUnseen(target);
+    // What a link leads to may be known under another name.
+    if (!found->unseen.empty()) isIncomplete_ = true;
     for (const auto& [name, target] : found->entries) {
         if (!isApplication(name)) continue;
         const std::string entry = joinPath(folder, name);
@@ -279,6 +281,8 @@ void ApplicationScanner::visitPlugIns(const std::string& application, const std:
     if (!found) return;
     for (const std::string& target : found->nowhere) unreachable_.push_back(target);
     for (const std::string& target : found->unseen) keepUnseen(target);
+    // What a link leads to may be known under another name.
+    if (!found->unseen.empty()) isIncomplete_ = true;
     const bool isInside = isWithin(folder, application);
     for (const auto& [name, target] : found->entries)
         if (!target.empty()) {

@@ -86,12 +86,13 @@ class ManyOnTheirWay {
         const __user_cap_data_struct none[2] = {{0, usual_[0].permitted, 0},
                                                 {0, usual_[1].permitted, 0}};
         ::syscall(SYS_capset, &header_, none);
+        EXPECT_EQ(::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends_), 0);
+        const std::vector<int> many(Parcel::kMostDescriptors, STDIN_FILENO);
+        // Whatever others of this user have on their way meanwhile, these are too many.
+        for (int i = 0; i < 7; ++i) EXPECT_FALSE(Parcel::send(ends_[0], "x", many));
         ::getrlimit(RLIMIT_NOFILE, &limit_);
         const rlimit narrow{200, limit_.rlim_max};
         ::setrlimit(RLIMIT_NOFILE, &narrow);
-        EXPECT_EQ(::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends_), 0);
-        const std::vector<int> many(Parcel::kMostDescriptors, STDIN_FILENO);
-        for (int i = 0; i < 7; ++i) EXPECT_FALSE(Parcel::send(ends_[0], "x", many));
     }
     ~ManyOnTheirWay() {
         for (const int end : ends_) ::close(end);
