@@ -58,7 +58,7 @@ TEST_F(PeerLooksTest, WhoHangsIsGivenUpAndTakesAQuarterOfTheThreadsAtTheMost) {
 }
 
 TEST_F(PeerLooksTest, WhatGetsOnIsNotGivenUpAndWhatItFoundBeforeItHangsCounts) {
-    PeerLooks looks(loop_, milliseconds(50));
+    PeerLooks looks(loop_, milliseconds(400));
     std::vector<int> found(8);
     std::optional<std::size_t> steps;
     looks.look(
@@ -67,7 +67,7 @@ TEST_F(PeerLooksTest, WhatGetsOnIsNotGivenUpAndWhatItFoundBeforeItHangsCounts) {
             for (int& value : found) {
                 value = 7;
                 pace.step();
-                gate_.wait_for(milliseconds(30));
+                gate_.wait_for(milliseconds(60));
             }
             gate_.wait();
         },
