@@ -7,7 +7,6 @@
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
-#include "platform/lum/Limits.h"
 #include "zrd/Transaction.h"
 #include "zrd/ZRDLumClient.h"
 #include "zrd/ZRDPlugIn.h"
@@ -43,7 +42,7 @@ void Transaction::lockDownPlugIns() {
 
 void Transaction::releaseHolds(const Array& tokens) {
     for (const Value& element : tokens) {
-        // What is no token releases nothing.
+        // What is no token releases nothing: this never fails.
         if (auto token = element.uuid()) server().unholdToken(*token);
     }
     done();

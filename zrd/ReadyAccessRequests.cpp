@@ -89,6 +89,7 @@ void Transaction::accessPlugIns() {
 }
 
 void Transaction::accessFrom(std::size_t first, Array tokens) {
+    if (!client_->acceptWork()) return;
     const auto sandbox = server().services().sandbox;
     std::shared_ptr<ZRDPlugIn> late;
     const bool completed = processUuidList(

@@ -23,7 +23,8 @@ namespace {
 using Members = std::vector<std::size_t>;
 
 /// The file system that a look at a path would wait for: that of the nearest directory above which
-/// the kernel can find without asking. Mounts are always in its memory, so that is none above.
+/// the kernel can find without asking. Mounts are always in its memory, so that is none above; but
+/// one that is only made when somebody comes is charged to what it will lie in.
 dev_t fileSystemOf(std::string path) {
     // A mount that is made meanwhile, anywhere, makes one try fail.
     constexpr int kMostAttempts = 8;

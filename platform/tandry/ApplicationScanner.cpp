@@ -169,25 +169,6 @@ void ApplicationScanner::visitAll() {
     for (const std::string& path : state_.registrations) visitRegistration(path);
 }
 
-/// What lies within a path does not answer: all that is known there stays as it is, until a walk
-/// that comes later.
-void ApplicationScanner::keepUnseen(const std::string& path) {
-    hasTransientFailure_ = true;
-    unreachable_.push_back(path);
-    complaints_.add(path, "nothing is known of what does not answer:", path);
-    forEachWithin(state_.plugIns, path, [this](auto entry) { keep(entry->second); });
-    forEachWithin(state_.applications, path,
-                  [this](auto entry) { entry->second.pass = entry->second.plugInsPass = pass_; });
-    forEachWithin(state_.refusals, path, [this](auto entry) { entry->second.pass = pass_; });
-}
-
-/// Whether what lies at a path can be looked at; otherwise it has been kept as it was.
-bool ApplicationScanner::canSee(const std::string& path) {
-    const bool result = places_.answers(path);
-    if (!result) keepUnseen(path);
-    return result;
-}
-
 void ApplicationScanner::visitRegistration(const std::string& path) {
     if (!canSee(path)) return;
     watch_.markWay(path);
@@ -210,10 +191,7 @@ void ApplicationScanner::visitFolder(const std::string& folder) {
         if (noteTransient(found.error())) isIncomplete_ = true;
         return;
     }
-    for (const std::string& target : found->nowhere) unreachable_.push_back(target);
-    for (const std::string& target : found->unseen) keepUnseen(target);
-    // What a link leads to may be known under another name.
-    if (!found->unseen.empty()) isIncomplete_ = true;
+    noteLost(*found);
     for (const auto& [name, target] : found->entries) {
         if (!isApplication(name)) continue;
         const std::string entry = joinPath(folder, name);
@@ -279,10 +257,7 @@ void ApplicationScanner::visitPlugIns(const std::string& application, const std:
     TDApplicationProxyRef record = applicationAt(application);
     state_.applications[application].plugInsPass = pass_;
     if (!found) return;
-    for (const std::string& target : found->nowhere) unreachable_.push_back(target);
-    for (const std::string& target : found->unseen) keepUnseen(target);
-    // What a link leads to may be known under another name.
-    if (!found->unseen.empty()) isIncomplete_ = true;
+    noteLost(*found);
     const bool isInside = isWithin(folder, application);
     for (const auto& [name, target] : found->entries)
         if (!target.empty()) {

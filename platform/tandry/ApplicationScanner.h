@@ -15,6 +15,8 @@
 
 namespace platform::tandry {
 
+struct FolderEntries;
+
 /// Brings the registry's state in line with the disk. What did not change since the state was last
 /// in line is only looked at, not read. Belongs to the registry's thread, as the state does.
 class ApplicationScanner {
@@ -60,6 +62,7 @@ class ApplicationScanner {
     void begin(bool overEverything);
     void visitAll();
     void keepUnseen(const std::string& path);
+    void noteLost(const FolderEntries& found);
     bool canSee(const std::string& path);
     void visitFolder(const std::string& folder);
     void visitRegistration(const std::string& path);

@@ -1,10 +1,11 @@
-// The end of a walk: what it has not met goes.
+// The end of a walk: what it has not met goes, but for what it could not see.
 
 #include <algorithm>
 #include <utility>
 
 #include "platform/system/Files.h"
 #include "platform/tandry/ApplicationScanner.h"
+#include "platform/tandry/FolderEntries.h"
 
 namespace platform::tandry {
 
@@ -66,6 +67,33 @@ RegistryChanges ApplicationScanner::finish(const Scopes& scopes) {
     for (const std::string& scope : scopes) noteUnwatched(scope);
     containers_.saveOwners();
     return std::exchange(changes_, {});
+}
+
+/// What lies within a path does not answer: all that is known there stays as it is, until a walk
+/// that comes later.
+void ApplicationScanner::keepUnseen(const std::string& path) {
+    hasTransientFailure_ = true;
+    unreachable_.push_back(path);
+    complaints_.add(path, "nothing is known of what does not answer:", path);
+    forEachWithin(state_.plugIns, path, [this](auto entry) { keep(entry->second); });
+    forEachWithin(state_.applications, path,
+                  [this](auto entry) { entry->second.pass = entry->second.plugInsPass = pass_; });
+    forEachWithin(state_.refusals, path, [this](auto entry) { entry->second.pass = pass_; });
+}
+
+/// Where links of a folder lead in vain.
+void ApplicationScanner::noteLost(const FolderEntries& found) {
+    for (const std::string& target : found.nowhere) unreachable_.push_back(target);
+    for (const std::string& target : found.unseen) keepUnseen(target);
+    // It may be known under another name.
+    if (!found.unseen.empty()) isIncomplete_ = true;
+}
+
+/// Whether what lies at a path can be looked at; otherwise it has been kept as it was.
+bool ApplicationScanner::canSee(const std::string& path) {
+    const bool result = places_.answers(path);
+    if (!result) keepUnseen(path);
+    return result;
 }
 
 }  // namespace platform::tandry
