@@ -38,6 +38,13 @@ std::string nextComponent(std::string_view& rest) {
     return name;
 }
 
+/// The number of the mount that something open lies on.
+std::uint64_t mountOf(int fd) {
+    struct statx status {};
+    ::statx(fd, "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC, STATX_MNT_ID, &status);
+    return status.stx_mnt_id;
+}
+
 /// One component at a time, none of which may be a symbolic link or ".." (errno `linkError`). -1,
 /// with errno, on failure.
 int openByComponents(int start, std::string_view rest, int flags, int linkError) {
@@ -78,12 +85,13 @@ Result<UniqueFd> opened(int fd, const std::string& path) {
 
 Result<UniqueFd> openBeneath(int dirfd, const std::string& path, int flags, Wait wait) {
     if (path.find('\0') != std::string::npos) return Error::posix(EINVAL, path);
-    int fd = openResolving(dirfd, path, flags, RESOLVE_BENEATH | RESOLVE_NO_MAGICLINKS, wait);
-    if (mustTakeSteps(fd, wait)) {
-        if (path.starts_with('/')) return Error::posix(EXDEV, path);
-        fd = openByComponents(dirfd, path, flags, EXDEV);
-    }
-    return opened(fd, path);
+    constexpr std::uint64_t kInside = RESOLVE_BENEATH | RESOLVE_NO_XDEV | RESOLVE_NO_MAGICLINKS;
+    const int fd = openResolving(dirfd, path, flags, kInside, wait);
+    if (!mustTakeSteps(fd, wait)) return opened(fd, path);
+    if (path.starts_with('/')) return Error::posix(EXDEV, path);
+    auto file = opened(openByComponents(dirfd, path, flags, EXDEV), path);
+    if (file && mountOf(file->get()) != mountOf(dirfd)) return Error::posix(EXDEV, path);
+    return file;
 }
 
 Result<UniqueFd> openWithoutLinks(int dirfd, const std::string& path, int flags, Wait wait) {

@@ -15,10 +15,10 @@ namespace platform {
 enum class Wait { Allowed, Never };
 
 /// Opens what a path leads to from the directory `dirfd` (borrowed), as long as nothing on the way
-/// leads out of that directory: no "..", no absolute path, no symbolic link. Errors: the system's;
-/// EXDEV when the way leads out, ELOOP when it goes through a link of the kernel's own (as in
-/// /proc) or through too many. Where the kernel cannot watch the way (no openat2), no symbolic
-/// link is followed at all: EXDEV.
+/// leads out of that directory: no "..", no absolute path, no symbolic link, and no other mount, so
+/// that it answers as the directory does. Errors: the system's; EXDEV when the way leads out, ELOOP
+/// when it goes through a link of the kernel's own (as in /proc) or through too many. Where the
+/// kernel cannot watch the way (no openat2), no symbolic link is followed at all: EXDEV.
 Result<UniqueFd> openBeneath(int dirfd, const std::string& path, int flags,
                              Wait wait = Wait::Allowed);
 

@@ -71,7 +71,7 @@ Result<Dictionary> readDictionary(const BundleFolder& folder, const char* name) 
     std::string file = joinPath(folder.path, name);
     Result<std::string> bytes = readFileBeneath(folder.dirfd, name, kMaxBundleFile);
     if (!bytes && leadsOutside(bytes.error()))
-        return malformed(file, "a symbolic link that leads out of the bundle");
+        return malformed(file, "a symbolic link or a mount that leads out of the bundle");
     if (!bytes) return Error::posix(bytes.error().code, file);
     Result<Value> value = parsePropertyList(*bytes);
     if (!value) return malformed(file, value.error().text);

@@ -285,7 +285,14 @@ void SandboxExtension::tryMounts() {
     home_.write("bundle/inner/file", "text");
     start();
     {
-        const Handle bundle(issue());
+        const auto token = [&](const char* resource) {
+            return sandbox_->issueReadExtension(test::known(root), resource, Wait::Allowed);
+        };
+        for (const char* mounted : {"inner", "inner/file"}) {
+            const auto refused = token(mounted);
+            EXPECT_EQ(refused ? 0 : refused.error().code, EACCES) << mounted;
+        }
+        const Handle bundle(*token("."));
         expectReadOnly(bundle.fd);
         EXPECT_EQ(openError(bundle.fd, "inner/file", O_RDONLY), 0);
         EXPECT_EQ(openError(bundle.fd, "inner/file", O_RDWR), EROFS);

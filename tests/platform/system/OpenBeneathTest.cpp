@@ -4,6 +4,8 @@
 #include <gtest/gtest.h>
 #include <linux/filter.h>
 #include <linux/seccomp.h>
+#include <sched.h>
+#include <sys/mount.h>
 #include <sys/prctl.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
@@ -11,6 +13,7 @@
 #include <cerrno>
 #include <cstddef>
 #include <filesystem>
+#include <functional>
 #include <iterator>
 
 #include "platform/system/Files.h"
@@ -77,6 +80,20 @@ class OpenBeneath : public testing::Test {
         EXPECT_EQ(direct("in/file/more"), ENOTDIR);
         EXPECT_EQ(direct("../top/in/file"), follows ? EXDEV : ELOOP);
     }
+    /// Works in a process of its own, once that is prepared.
+    static void inChild(const std::function<bool()>& prepare, const std::function<void()>& work) {
+        const pid_t child = ::fork();
+        if (child == 0) {
+            if (!prepare()) ::_exit(77);
+            work();
+            ::_exit(HasFailure() ? 1 : 0);
+        }
+        int status = -1;
+        ASSERT_EQ(::waitpid(child, &status, 0), child);
+        if (WIFEXITED(status) && WEXITSTATUS(status) == 77) GTEST_SKIP() << "not permitted here";
+        EXPECT_EQ(status, 0);
+    }
+
     test::TemporaryDirectory files_;
 };
 
@@ -85,16 +102,30 @@ TEST_F(OpenBeneath, NothingLeadsOut) {
 }
 
 TEST_F(OpenBeneath, NothingLeadsOutWhereTheKernelCannotWatchTheWay) {
-    const pid_t child = ::fork();
-    if (child == 0) {
-        if (!forgetOpenat2()) ::_exit(77);
-        look(false);
-        ::_exit(HasFailure() ? 1 : 0);
-    }
-    int status = -1;
-    ASSERT_EQ(::waitpid(child, &status, 0), child);
-    if (WIFEXITED(status) && WEXITSTATUS(status) == 77) GTEST_SKIP() << "filters cannot be made";
-    EXPECT_EQ(status, 0);
+    inChild(forgetOpenat2, [this] { look(false); });
+}
+
+TEST_F(OpenBeneath, MountsLeadOut) {
+    const std::string inner = files_.path("top/in");
+    const auto mount = [&] {
+        return ::unshare(CLONE_NEWUSER | CLONE_NEWNS) == 0 &&
+               ::mount(inner.c_str(), inner.c_str(), nullptr, MS_BIND, nullptr) == 0;
+    };
+    const auto lookAtMount = [&] {
+        const auto from = [](const std::string& directory, const std::string& path) {
+            const UniqueFd top(::open(directory.c_str(), O_PATH | O_CLOEXEC));
+            const auto file = openBeneath(top.get(), path, O_PATH);
+            return file ? 0 : file.error().code;
+        };
+        for (const char* path : {"in", "in/file", "./in/file"})
+            EXPECT_EQ(from(files_.path("top"), path), EXDEV) << path;
+        EXPECT_EQ(from(inner, "file"), 0);
+        EXPECT_EQ(from(inner, "."), 0);
+    };
+    inChild(mount, [&] {
+        lookAtMount();
+        if (forgetOpenat2()) lookAtMount();
+    });
 }
 
 }  // namespace
