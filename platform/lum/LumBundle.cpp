@@ -1,24 +1,28 @@
 #include "platform/lum/LumBundle.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 
 #include <mutex>
 
 #include "platform/plist/PropertyList.h"
 #include "platform/system/Files.h"
+#include "platform/system/UniqueFd.h"
 
 namespace platform {
 
 namespace {
 
-bool hasInfoDictionary(const std::string& directory) {
-    struct stat status;
-    return ::stat(joinPath(directory, "Info.plist").c_str(), &status) == 0 &&
-           S_ISREG(status.st_mode);
+constexpr const char* kInfoPlist = "Info.plist";
+
+UniqueFd openDirectory(const std::string& path) {
+    return UniqueFd(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
 }
 
-std::optional<Dictionary> readInfoDictionary(const std::string& directory) {
-    const Result<Value> value = readPropertyListFile(joinPath(directory, "Info.plist"));
+std::optional<Dictionary> readInfoDictionary(const std::string& path) {
+    const UniqueFd directory = openDirectory(path);
+    if (!directory) return std::nullopt;
+    const Result<Value> value = readPropertyListBeneath(directory.get(), kInfoPlist);
     const Dictionary* dictionary = value ? value->dictionary() : nullptr;
     return dictionary ? std::optional(*dictionary) : std::nullopt;
 }
@@ -46,9 +50,15 @@ std::shared_ptr<LumBundle> LumBundle::make(const std::string& path, Mode mode) {
         state->bundlePath = state->path;
     } else {
         std::string directory(parentPath(path));
-        if (hasInfoDictionary(directory)) state->bundlePath = std::move(directory);
+        if (isAt(openDirectory(directory).get())) state->bundlePath = std::move(directory);
     }
     return std::shared_ptr<LumBundle>(new LumBundle(std::move(state)));
+}
+
+bool LumBundle::isAt(int directory) {
+    struct stat status;
+    return ::fstatat(directory, kInfoPlist, &status, AT_SYMLINK_NOFOLLOW) == 0 &&
+           (S_ISREG(status.st_mode) || S_ISLNK(status.st_mode));
 }
 
 std::shared_ptr<LumBundle> LumBundle::mainBundle() {

@@ -25,13 +25,16 @@ class LumBundle {
     /// Null when `path` is not an absolute path. In mode `Executable` a path that lies in no bundle
     /// (its directory has no `Info.plist`) gives an object without a bundle path.
     static std::shared_ptr<LumBundle> make(const std::string& path, Mode mode);
+    /// Whether an open directory (borrowed) is a bundle's: it has an `Info.plist`, which may be a
+    /// symbolic link, wherever that leads.
+    static bool isAt(int directory);
     /// The bundle around this process's own executable.
     static std::shared_ptr<LumBundle> mainBundle();
 
     std::optional<std::string> property(int number) const;
 
-    /// The `Info.plist`, read once and cached until `discardCache`. None when it is missing, is no
-    /// property list, or is no dictionary.
+    /// The `Info.plist`, read once and cached until `discardCache`. None when it is missing, leads
+    /// out of the bundle, is no property list, or is no dictionary.
     std::optional<Dictionary> infoDictionary() const;
     void discardCache();
 

@@ -253,6 +253,16 @@ plist_t nodeOf(const Value& value) {
     return nullptr;
 }
 
+/// What the bytes of a file hold.
+Result<Value> parsed(const Result<std::string>& bytes, const std::string& file) {
+    if (!bytes) return bytes.error();
+    auto value = parsePropertyList(*bytes);
+    if (value) return value;
+    Error error = value.error();
+    error.text = fmt::format("{}: {}", file, error.text);
+    return error;
+}
+
 }  // namespace
 
 Result<Value> parsePropertyList(std::string_view bytes) {
@@ -277,13 +287,11 @@ Result<Value> parsePropertyList(std::string_view bytes) {
 }
 
 Result<Value> readPropertyListFile(const std::string& path, std::size_t limit) {
-    auto bytes = readFile(path, limit);
-    if (!bytes) return bytes.error();
-    auto value = parsePropertyList(*bytes);
-    if (value) return value;
-    Error error = value.error();
-    error.text = fmt::format("{}: {}", path, error.text);
-    return error;
+    return parsed(readFile(path, limit), path);
+}
+
+Result<Value> readPropertyListBeneath(int dirfd, const std::string& name, std::size_t limit) {
+    return parsed(readFileBeneath(dirfd, name, limit), name);
 }
 
 Result<std::string> writeXmlPropertyList(const Value& value, std::size_t limit) {

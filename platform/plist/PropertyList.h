@@ -22,6 +22,11 @@ Result<Value> parsePropertyList(std::string_view bytes);
 Result<Value> readPropertyListFile(const std::string& path,
                                    std::size_t limit = kMaxPropertyListFile);
 
+/// The same for a file that must lie beneath the directory `dirfd` (borrowed). Errors also: those
+/// of `openBeneath`.
+Result<Value> readPropertyListBeneath(int dirfd, const std::string& name,
+                                      std::size_t limit = kMaxPropertyListFile);
+
 /// The XML form of a value, of at most `limit` bytes (which is at most 1 GiB). Errors: the value is
 /// not a property list (`isPropertyList`, at the depth that is read), or over the limits, the
 /// reader's among them. What this writes, `parsePropertyList` reads back equal (dates lose the

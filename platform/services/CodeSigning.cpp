@@ -1,15 +1,14 @@
 #include "platform/services/CodeSigning.h"
 
-#include <sys/stat.h>
 #include <unistd.h>
 
-#include <fcntl.h>
 #include <atomic>
 #include <cerrno>
 #include <string_view>
 #include <utility>
 
 #include "platform/log/OpsLog.h"
+#include "platform/lum/LumBundle.h"
 #include "platform/plist/PropertyList.h"
 #include "platform/sandbox/Sandbox.h"
 #include "platform/system/Files.h"
@@ -34,12 +33,6 @@ struct Entitlements {
     std::string weakest;
 };
 
-bool isBundle(const PinnedDirectory& directory) {
-    struct stat status;
-    return ::fstatat(directory.descriptor(), "Info.plist", &status, 0) == 0 &&
-           S_ISREG(status.st_mode);
-}
-
 /// Without a file there are no entitlements, and no error.
 Result<Entitlements> orMissing(const Error& error) {
     if (error.code == ENOENT) return Entitlements{};
@@ -49,7 +42,7 @@ Result<Entitlements> orMissing(const Error& error) {
 Result<Entitlements> readEntitlements(const std::string& executable) {
     const auto directory = PinnedDirectory::open(std::string(parentPath(executable)), ::geteuid());
     if (!directory) return orMissing(directory.error());
-    const std::string name = isBundle(*directory)
+    const std::string name = LumBundle::isAt(directory->descriptor())
                                  ? std::string("Entitlements.plist")
                                  : std::string(lastPathComponent(executable)) + ".entitlements";
     const auto file = directory->file(name);

@@ -39,8 +39,7 @@ std::optional<Error> checkExecutable(int bundle, const std::string& name, const 
 
 /// A property list of an open bundle; none when it has none that can be used.
 std::optional<Dictionary> readList(int bundle, const char* name) {
-    const Result<std::string> bytes = readFileBeneath(bundle, name, kMaxPropertyListFile);
-    const Result<Value> value = bytes ? parsePropertyList(*bytes) : bytes.error();
+    const Result<Value> value = readPropertyListBeneath(bundle, name);
     const Dictionary* dictionary = value ? value->dictionary() : nullptr;
     return dictionary ? std::optional(*dictionary) : std::nullopt;
 }

@@ -3,6 +3,9 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <filesystem>
+#include <utility>
+
 #include "platform/plist/PropertyList.h"
 #include "tests/Zorvan/LogLines.h"
 #include "tests/support/TemporaryDirectory.h"
@@ -59,6 +62,19 @@ TEST_F(ZRBundleTest, ReadsTheInfoPlistAfresh) {
     writeInfoPlist({{"QFBundleIdentifier", 7}});
     EXPECT_EQ(bundle->infoDictionary(), (Dictionary{{"QFBundleIdentifier", 7}}));
     EXPECT_FALSE(bundle->bundleIdentifier());
+}
+
+TEST_F(ZRBundleTest, ReadsNothingThatLiesOutside) {
+    writeInfoPlist({{"QFBundleExecutable", "run"}});
+    std::filesystem::rename(path_ + "/Info.plist", path_ + "/moved.plist");
+    for (const auto& [target, name] : {std::pair{std::string("moved.plist"), "/run"},
+                                       {"../A.app/moved.plist", ""},
+                                       {path_ + "/moved.plist", ""}}) {
+        std::filesystem::remove(path_ + "/Info.plist");
+        std::filesystem::create_symlink(target, path_ + "/Info.plist");
+        const auto bundle = ZRBundle::initWithExecutablePath(path_ + "/run");
+        EXPECT_EQ(bundle->executablePath(), path_ + name) << target;
+    }
 }
 
 }  // namespace

@@ -163,6 +163,9 @@ TEST_F(Tool, EntitlementsLieBesideABareToolOrInItsBundle) {
     EXPECT_EQ(held(), "prn");
     writeEntitlements("bin/Info.plist");
     EXPECT_EQ(held(), "") << "the bundle has none";
+    std::filesystem::remove(files_.path("bin/Info.plist"));
+    std::filesystem::create_symlink("/nowhere", files_.path("bin/Info.plist"));
+    EXPECT_EQ(held(), "") << "a bundle wherever its list leads";
     writeEntitlements("bin/Entitlements.plist");
     EXPECT_EQ(held(), "prn");
 
