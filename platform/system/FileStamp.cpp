@@ -10,6 +10,9 @@
 #include <ctime>
 #include <span>
 
+#include "platform/system/Files.h"
+#include "platform/system/OpenBeneath.h"
+
 namespace platform {
 
 namespace {
@@ -28,13 +31,14 @@ std::int64_t nanoseconds(const timespec& time) {
 
 }  // namespace
 
-FileStamp FileStamp::of(int dirfd, const char* path) {
+FileStamp FileStamp::ofFailure(int errnum) {
     FileStamp stamp;
-    struct stat status;
-    if (::fstatat(dirfd, path, &status, 0) != 0) {
-        stamp.error = errno == ENOTDIR ? ENOENT : errno;
-        return stamp;
-    }
+    stamp.error = errnum == ENOTDIR ? ENOENT : errnum;
+    return stamp;
+}
+
+FileStamp FileStamp::of(const struct stat& status) {
+    FileStamp stamp;
     stamp.facts = {static_cast<std::int64_t>(status.st_dev),
                    static_cast<std::int64_t>(status.st_ino),
                    status.st_size,
@@ -52,7 +56,20 @@ FileStamp FileStamp::of(int dirfd, const char* path) {
 }
 
 FileStamp FileStamp::of(const std::string& path) {
-    return of(AT_FDCWD, path.c_str());
+    struct stat status;
+    return ::stat(path.c_str(), &status) == 0 ? of(status) : ofFailure(errno);
+}
+
+FileStamp FileStamp::beneath(int dirfd, const std::string& folder, const std::string& file) {
+    struct stat status;
+    if (::fstatat(dirfd, joinPath(folder, file).c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0)
+        return ofFailure(errno);
+    if (!S_ISLNK(status.st_mode)) return of(status);
+    const auto directory = openWithoutLinks(dirfd, folder, O_PATH | O_DIRECTORY | O_NOFOLLOW);
+    if (!directory) return ofFailure(directory.error().code);
+    const auto target = openBeneath(directory->get(), file, O_PATH);
+    if (!target) return ofFailure(target.error().code);
+    return ::fstat(target->get(), &status) == 0 ? of(status) : ofFailure(errno);
 }
 
 bool FileStamp::isMissing() const {

@@ -5,6 +5,8 @@
 #include <string>
 #include <string_view>
 
+struct stat;
+
 namespace platform {
 
 /// What tells one content of a file from another without reading it. Equal stamps: the file was
@@ -19,10 +21,12 @@ struct FileStamp {
     bool settled = true;
     std::int64_t lookedAt = 0;  // when it was taken, in nanoseconds since 1970
 
-    /// The stamp that a file has now; symbolic links are followed. A relative path starts at the
-    /// directory `dirfd` (borrowed, or AT_FDCWD).
-    static FileStamp of(int dirfd, const char* path);
+    /// The stamp that a file has now; symbolic links are followed.
     static FileStamp of(const std::string& path);
+    /// That of a file in the directory `folder`; a relative path to that starts at the directory
+    /// `dirfd` (borrowed, or AT_FDCWD). Symbolic links are followed as far as `openBeneath` goes
+    /// from there: what they lead to elsewhere is not looked at.
+    static FileStamp beneath(int dirfd, const std::string& folder, const std::string& file);
 
     bool exists() const { return error == 0; }
     /// There is no such file. One that cannot be looked at is neither here nor missing: reading it
@@ -45,6 +49,10 @@ struct FileStamp {
     friend bool operator==(const FileStamp& a, const FileStamp& b) {
         return a.error == b.error && a.facts == b.facts;
     }
+
+  private:
+    static FileStamp of(const struct stat& status);
+    static FileStamp ofFailure(int errnum);
 };
 
 }  // namespace platform

@@ -192,10 +192,9 @@ void BundleReader::beginPass() {
     sdkStamps_.clear();
 }
 
-bool BundleReader::appendStamp(const BundleFolder& folder, std::string_view file,
+bool BundleReader::appendStamp(const BundleFolder& folder, const std::string& file,
                                std::string& stamps) {
-    scratch_.assign(folder.name).append("/").append(file);
-    const FileStamp stamp = FileStamp::of(folder.dirfd, scratch_.c_str());
+    const FileStamp stamp = FileStamp::beneath(folder.dirfd, folder.name, file);
     note(stamp);
     stamp.appendTo(stamps);
     return stamp.exists();

@@ -85,7 +85,7 @@ class BundleReader {
   private:
     /// Remembers when a look at a file has failed.
     void note(const FileStamp& stamp);
-    bool appendStamp(const BundleFolder& folder, std::string_view file, std::string& stamps);
+    bool appendStamp(const BundleFolder& folder, const std::string& file, std::string& stamps);
     void appendLocalizedStamp(const BundleFolder& folder, std::string& stamps);
     void appendFixedStamps(const BundleFolder& folder, std::string& stamps);
     void appendNamedStamps(const BundleFolder& folder, const Fingerprint& print,
@@ -105,7 +105,6 @@ class BundleReader {
     std::vector<std::string> languages_;
     std::string languageText_;  // each ended by a NUL
     std::map<std::string, std::string> sdkStamps_;
-    std::string scratch_;
     bool isUnsure_ = false;  // something could not be looked at
 };
 

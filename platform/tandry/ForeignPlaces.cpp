@@ -2,8 +2,6 @@
 
 #include <dirent.h>
 #include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <array>
@@ -15,6 +13,7 @@
 
 #include "platform/system/Files.h"
 #include "platform/system/UniqueFd.h"
+#include "platform/tandry/BundleReader.h"
 #include "platform/tandry/RegistryState.h"
 
 namespace platform::tandry {
@@ -52,12 +51,8 @@ void look(const std::string& path) {
             static_cast<void>(::readdir(directory));
             ::closedir(directory);
         }
-    const UniqueFd info(
-        ::open(joinPath(path, "Info.plist").c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC));
-    char first = 0;
-    struct stat status;
-    if (info && ::fstat(info.get(), &status) == 0 && S_ISREG(status.st_mode))
-        static_cast<void>(::read(info.get(), &first, 1));
+    const UniqueFd bundle(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    if (bundle) static_cast<void>(readFileBeneath(bundle.get(), "Info.plist", kMaxBundleFile));
 }
 
 }  // namespace

@@ -241,6 +241,10 @@ TEST_F(RegistryTest, ReadsNothingThatLiesOutsideABundle) {
     fs::remove(files.path(folder + "rights/Entitlements.plist"));
     start();
     EXPECT_THAT(installed(), ElementsAre("inside", "names", "rights", "whole"));
+    const Uuid uuid = plugIn("names")->plugInUuid;
+    writePlist("private.plist", {{"another", "secret"}});
+    start();
+    EXPECT_EQ(plugIn("names")->plugInUuid, uuid) << "what lies outside is not looked at";
 }
 
 TEST_F(RegistryTest, MakesDataContainersThatAreTheUsersOwn) {
