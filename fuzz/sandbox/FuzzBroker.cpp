@@ -20,8 +20,7 @@ using namespace platform;
 
 namespace {
 
-constexpr std::size_t kServedAtOnce = 32;
-constexpr std::size_t kMaxPeers = 48;
+constexpr std::size_t kMaxPeers = 72;  // more than one origin may have
 constexpr std::chrono::milliseconds kStep{10};
 
 struct Broker {
@@ -103,10 +102,9 @@ class Peers {
         broker_.settle();
     }
 
-    /// Until the one that came first is answered, or, of a crowd, the silent have had their time.
+    /// Until the one that came first is answered.
     void await() {
-        const bool isCrowd = all_.size() > kServedAtOnce;
-        if (all_.empty() || !(isCrowd || all_.front().hasAsked)) return;
+        if (all_.empty() || !all_.front().hasAsked) return;
         pollfd state{all_.front().socket.get(), POLLIN, 0};
         for (int i = 0; i < 6 && patience_ > 0 && ::poll(&state, 1, 0) == 0; ++i, --patience_)
             broker_.loop.runOnce(kStep);

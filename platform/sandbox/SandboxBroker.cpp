@@ -23,10 +23,12 @@ namespace platform {
 
 namespace {
 
-// A peer takes some descriptors and a child process.
-constexpr std::size_t kMostPeers = 32;
+// Who is connected, and for how many of them a mount is made at a time, which takes a process and a
+// pipe. One origin has a quarter of either, or whoever fills it would keep the others out.
+constexpr std::size_t kMostPeers = 256, kMostMounts = 32;
 constexpr int kMostAcceptedAtOnce = 32;
-// For a peer to say its token, and then for the mount to be made: file systems may be slow.
+// For a peer to say its token, then for its turn to come, and then for the mount to be made: file
+// systems may be slow.
 constexpr std::chrono::seconds kPatience{5};
 constexpr std::chrono::seconds kGrace{1};
 // For a peer to say its token when others wait to be let in.
@@ -35,30 +37,36 @@ constexpr std::chrono::milliseconds kPauseAfterFailure{100};
 
 using Clock = std::chrono::steady_clock;
 
+void refuse(const UniqueFd& socket, pid_t pid, int errnum) {
+    EVLOG_INFO(ops(), "sandbox extension for process {} refused: {}", pid,
+               pub(std::generic_category().message(errnum)));
+    const std::string line = std::to_string(errnum) + "\n";
+    (void)!::send(socket.get(), line.data(), line.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
+}
+
 struct Peer {
     UniqueFd socket;
     const pid_t pid;
-    const std::optional<Pool::Share> share;  // of the peers that there may be; sandboxes have one
+    const Pool::Share place;
     const Clock::time_point since = Clock::now();
     RunLoop::Watch watch;
     RunLoop::Timer deadline;
     std::string received;
-    UniqueFd outcome;  // of its grant, since it has sent a good token
+    std::optional<SandboxTokens::File> file;  // since it has sent a good token
+    std::optional<Pool::Share> turn;          // since its mount is being made
+    UniqueFd outcome;                         // of that
     std::optional<RunLoop::Watch> outcomeWatch;
 
-    Peer(RunLoop& loop, UniqueFd connected, pid_t process, std::optional<Pool::Share> drawn)
+    Peer(RunLoop& loop, UniqueFd connected, pid_t process, Pool::Share drawn)
         : socket(std::move(connected)),
           pid(process),
-          share(std::move(drawn)),
+          place(std::move(drawn)),
           watch(loop, socket.get()),
           deadline(loop) {}
 
-    void refuse(int errnum) const {
-        EVLOG_INFO(ops(), "sandbox extension for process {} refused: {}", pid,
-                   pub(std::generic_category().message(errnum)));
-        const std::string line = std::to_string(errnum) + "\n";
-        (void)!::send(socket.get(), line.data(), line.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
-    }
+    bool isSilent() const { return !file; }
+    bool waits() const { return file && !turn; }
+    void refuse(int errnum) const { platform::refuse(socket, pid, errnum); }
 };
 
 }  // namespace
@@ -70,7 +78,7 @@ struct SandboxBroker::State {
     lum::ServiceSocket socket;
     RunLoop::Watch watch{loop, socket.fd()};
     RunLoop::Timer pause{loop};
-    Pool pool{kMostPeers};
+    Pool places{kMostPeers}, turns{kMostMounts};
     std::list<Peer> peers;  // in the order in which they came
     bool full = false;      // nobody is accepted until a peer goes, or has been silent for too long
 
@@ -86,11 +94,16 @@ struct SandboxBroker::State {
         watch.awaitReadable([this] { acceptSome(); });
     }
     void acceptSome();
-    bool drawFor(int connected, std::optional<Pool::Share>& share);
+    void admit(UniqueFd connected, pid_t pid);
+    Place firstSilent(const std::optional<Origin>& origin);
     bool makeRoom();
+    void turnOut(Place silent);
+    void remove(Place peer);
     void drop(Place peer);
     void read(Place peer);
     void serve(Place peer, std::string_view token);
+    void tellTurns();
+    bool mount(Place peer);
     void finish(Place peer);
 };
 
@@ -109,35 +122,48 @@ void SandboxBroker::State::acceptSome() {
             return;
         }
         const auto pid = connected ? lum::admittedPeer(connected.get()) : std::nullopt;
-        if (!pid) continue;
-        std::optional<Pool::Share> share;
-        if (!drawFor(connected.get(), share)) continue;
-        const Place peer =
-            peers.emplace(peers.end(), loop, std::move(connected), *pid, std::move(share));
-        peer->deadline.start(kPatience, [this, peer] { drop(peer); });
-        read(peer);  // who wants access has usually said so by now
+        if (pid) admit(std::move(connected), *pid);
     }
     acceptOnceReadable();
 }
 
-/// One sandbox has its part and no more: whoever of it comes beyond that is gone at once, or a
-/// plug-in could hold up everybody by those that wait to be accepted. Others wait for their turn,
-/// and have no share.
-bool SandboxBroker::State::drawFor(int connected, std::optional<Pool::Share>& share) {
-    const auto token = AuditToken::ofPeer(connected);
-    if (!token) return false;
+/// Of an origin that has its part, the one that has been silent for longest goes; when all have
+/// sent their tokens, the one that comes. So nobody has to wait to be accepted for long.
+void SandboxBroker::State::admit(UniqueFd connected, pid_t pid) {
+    const auto token = AuditToken::ofPeer(connected.get());
+    if (!token) return refuse(connected, pid, EAGAIN);
     const Origin origin = Origin::of(*token);
-    if (!origin.isSandbox()) return true;
-    share = pool.draw(origin);
-    return share.has_value();
+    auto share = places.draw(origin);
+    if (!share) {
+        const Place silent = firstSilent(origin);
+        if (silent == peers.end()) return refuse(connected, pid, EAGAIN);
+        turnOut(silent);
+        share = places.draw(origin);
+    }
+    if (!share) return refuse(connected, pid, EAGAIN);
+    const Place peer =
+        peers.emplace(peers.end(), loop, std::move(connected), pid, std::move(*share));
+    peer->deadline.start(kPatience, [this, peer] { drop(peer); });
+    read(peer);  // who wants access has usually said so by now
+}
+
+/// The one that has been silent for longest, of one origin or of all.
+SandboxBroker::State::Place SandboxBroker::State::firstSilent(const std::optional<Origin>& origin) {
+    return std::ranges::find_if(peers, [&](const Peer& peer) {
+        return peer.isSilent() && (!origin || peer.place.origin() == *origin);
+    });
+}
+
+void SandboxBroker::State::turnOut(Place silent) {
+    silent->refuse(EAGAIN);
+    peers.erase(silent);
 }
 
 /// Whoever holds back its token does not keep out those who send theirs: the one that has been
 /// silent for longest goes, now or soon.
 bool SandboxBroker::State::makeRoom() {
     if (peers.size() < kMostPeers) return true;
-    const Place silent =
-        std::find_if(peers.begin(), peers.end(), [](const Peer& peer) { return !peer.outcome; });
+    const Place silent = firstSilent(std::nullopt);
     if (silent == peers.end()) return false;
     const auto age =
         std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now() - silent->since);
@@ -145,15 +171,21 @@ bool SandboxBroker::State::makeRoom() {
         pause.start(kPatienceWhenFull - age, [this] { acceptSome(); });
         return false;
     }
-    peers.erase(silent);
+    turnOut(silent);
     return true;
 }
 
-void SandboxBroker::State::drop(Place peer) {
+void SandboxBroker::State::remove(Place peer) {
     peers.erase(peer);
     if (!std::exchange(full, false)) return;
     pause.cancel();
     acceptOnceReadable();
+}
+
+/// Its turn may be another's.
+void SandboxBroker::State::drop(Place peer) {
+    remove(peer);
+    tellTurns();
 }
 
 void SandboxBroker::State::read(Place peer) {
@@ -171,18 +203,37 @@ void SandboxBroker::State::read(Place peer) {
 }
 
 void SandboxBroker::State::serve(Place peer, std::string_view token) {
-    const auto file = tokens.check(token);
-    if (!file) {
+    peer->file = tokens.check(token);
+    if (!peer->file) {
         peer->refuse(EACCES);
         return drop(peer);
     }
-    auto outcome = mounts.grant(*file, peer->socket.get());
+    peer->deadline.start(kPatience, [this, peer] {
+        peer->refuse(ETIMEDOUT);
+        drop(peer);
+    });
+    tellTurns();
+}
+
+/// Has mounts made for those who wait, as far as their origins may have more of them.
+void SandboxBroker::State::tellTurns() {
+    for (Place next = peers.begin(); next != peers.end();) {
+        const Place peer = next++;
+        if (!peer->waits()) continue;
+        peer->turn = turns.draw(peer->place.origin());
+        if (peer->turn && !mount(peer)) remove(peer);
+    }
+}
+
+/// False when that cannot even begin.
+bool SandboxBroker::State::mount(Place peer) {
+    auto outcome = mounts.grant(*peer->file, peer->socket.get());
     if (!outcome) {
         peer->refuse(outcome.error().code);
-        return drop(peer);
+        return false;
     }
-    // Who hangs in the kernel cannot be ended, and keeps its peer's place, or there would be ever
-    // more of them; but nobody waits for it.
+    // Who hangs in the kernel cannot be ended, and keeps its peer's turn, or there would be ever
+    // more of them; but nobody of another origin waits for it.
     peer->deadline.start(kPatience + kGrace, [peer] {
         peer->refuse(ETIMEDOUT);
         peer->socket.reset();
@@ -190,6 +241,7 @@ void SandboxBroker::State::serve(Place peer, std::string_view token) {
     peer->outcome = std::move(*outcome);
     peer->outcomeWatch.emplace(loop, peer->outcome.get());
     peer->outcomeWatch->awaitReadable([this, peer] { finish(peer); });
+    return true;
 }
 
 void SandboxBroker::State::finish(Place peer) {

@@ -23,7 +23,7 @@ namespace platform {
 namespace {
 
 // Longer than a broker takes at its slowest.
-constexpr timeval kPatience{15, 0};
+constexpr timeval kPatience{20, 0};
 // Below lie the standard streams, which a caller may have closed and want back, and 0, which is no
 // handle.
 constexpr int kLeastHandle = 3;

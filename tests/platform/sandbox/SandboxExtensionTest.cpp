@@ -13,6 +13,7 @@
 #include <algorithm>
 #include <atomic>
 #include <cerrno>
+#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
@@ -102,6 +103,7 @@ class SandboxExtension : public testing::Test {
         loop_.reset();
     }
     void tryMounts();
+    void tryMountsThatHang();
     std::string issue(const std::string& relative = "bundle") const {
         const auto token =
             sandbox_->issueReadExtension(test::known(home_.path()), relative, Wait::Allowed);
@@ -316,7 +318,7 @@ TEST_F(SandboxExtension, PeersThatSayNothingOrTooMuchHinderNobody) {
     start();
     const std::string path = *lum::socketPath(directories_, "test.sandbox");
     std::vector<lum::RawPeer> silent;
-    for (int i = 0; i < 50; ++i) silent.emplace_back(lum::unixSocket(path, ::connect));
+    for (int i = 0; i < 80; ++i) silent.emplace_back(lum::unixSocket(path, ::connect));
     EXPECT_GT(Handle(issue()).fd, 0);
     EXPECT_TRUE(silent.front().hasEnded()) << "it made room";
 
@@ -394,7 +396,7 @@ TEST_F(SandboxExtension, WhatTakesTooLongEndsAndAKilledProcessIsReplaced) {
     ::umount2(home_.path("hung").c_str(), MNT_DETACH);
 }
 
-/// Runs in a child: inside a sandbox, or as another user.
+/// Runs in a child: inside a sandbox, as another user, or in another session.
 int runTests(const std::string& filter, std::vector<std::string> command, uid_t user) {
     command.insert(command.end(), {"--gtest_filter=" + filter, "--gtest_also_run_disabled_tests"});
     std::vector<char*> arguments;
@@ -452,6 +454,43 @@ TEST_F(SandboxExtension, WorksFromInsideASandbox) {
     if (runTests("none", probe, ::geteuid()) != 0) GTEST_SKIP() << "no sandbox can be made here";
     command.insert(command.end(), {"--", "/test"});
     EXPECT_EQ(runTests("SandboxedConsumer.*", command, ::geteuid()), 0);
+}
+
+TEST(SandboxedConsumer, DISABLED_HasItsTurn) {
+    EXPECT_GT(Handle(::getenv(kTokenVariable)).fd, 0);
+}
+
+void SandboxExtension::tryMountsThatHang() {
+    const UniqueFd fuse(::open("/dev/fuse", O_RDWR | O_CLOEXEC));
+    if (!fuse || ::unshare(CLONE_NEWNS) != 0 ||
+        ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0)
+        GTEST_SKIP() << "may not mount";
+    home_.write("hung/file", "text");
+    start();
+    const std::string hung = issue("hung/file") + "\n", token = issue();
+    const std::string options =
+        "rootmode=40000,user_id=0,group_id=0,fd=" + std::to_string(fuse.get());
+    if (::mount("hung", home_.path("hung").c_str(), "fuse", 0, options.c_str()) != 0)
+        GTEST_SKIP() << "may not mount";
+    std::vector<lum::RawPeer> waiting;
+    for (int i = 0; i < 40; ++i)
+        waiting
+            .emplace_back(
+                lum::unixSocket(*lum::socketPath(directories_, "test.sandbox"), ::connect))
+            .write(hung);
+    const auto begin = std::chrono::steady_clock::now();
+    EXPECT_EQ(runTests("SandboxedConsumer.DISABLED_HasItsTurn",
+                       {"env", std::string(kTokenVariable) + "=" + token, "setsid", "--wait",
+                        fs::read_symlink("/proc/self/exe")},
+                       ::geteuid()),
+              0);
+    EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(3));
+    ::umount2(home_.path("hung").c_str(), MNT_DETACH);
+    stop();
+}
+
+TEST_F(SandboxExtension, MountsThatHangHoldUpThoseOfOneOriginAlone) {
+    std::thread([this] { tryMountsThatHang(); }).join();
 }
 
 TEST(SandboxExtensionAsUser, WorksToo) {
