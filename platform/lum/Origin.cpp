@@ -6,51 +6,87 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <optional>
+#include <string>
 #include <utility>
 
+#include "platform/system/FileIdentity.h"
 #include "platform/system/UniqueFd.h"
 
 namespace platform {
 
 namespace {
 
-constexpr const char* kPidNamespace = "ns/pid";
+/// A kind of namespaces that lie one within the other.
+struct Kind {
+    const char* link;  // of a process's directory below /proc
+    FileIdentity own;
 
-const struct stat& ownNamespace() {
-    static const struct stat own = [] {
+    static Kind make(const char* link) {
         struct stat status {};
-        ::stat("/proc/self/ns/pid", &status);
-        return status;
-    }();
-    return own;
-}
-
-bool isOwn(const struct stat& status) {
-    return status.st_ino == ownNamespace().st_ino && status.st_dev == ownNamespace().st_dev;
-}
-
-/// The outermost namespace around a peer's, its own included, that is not ours: whoever is in a
-/// sandbox can make more inside it.
-void findOutermost(int procDirectory, struct stat& status) {
-    UniqueFd inner(::openat(procDirectory, kPidNamespace, O_RDONLY | O_CLOEXEC));
-    while (inner) {
-        UniqueFd outer(::ioctl(inner.get(), NS_GET_PARENT));
-        struct stat parent {};
-        if (!outer || ::fstat(outer.get(), &parent) != 0 || isOwn(parent)) return;
-        status = parent;
-        inner = std::move(outer);
+        ::stat((std::string("/proc/self/") + link).c_str(), &status);
+        return {link, FileIdentity::of(status)};
     }
+};
+
+const Kind& processKind() {
+    static const Kind kind = Kind::make("ns/pid");
+    return kind;
+}
+
+const Kind& userKind() {
+    static const Kind kind = Kind::make("ns/user");
+    return kind;
+}
+
+struct Namespace {
+    FileIdentity identity;
+    UniqueFd descriptor;  // none when there are none left
+};
+
+/// Goes out to the last that is not ours: whoever is in a sandbox can make more inside it. False
+/// when it lies in none of ours.
+bool goOutermost(Namespace& space, const Kind& kind) {
+    for (;;) {
+        UniqueFd outer(::ioctl(space.descriptor.get(), NS_GET_PARENT));
+        const auto identity = outer ? FileIdentity::ofOpen(outer.get()) : std::nullopt;
+        if (!identity) return !space.descriptor;
+        if (*identity == kind.own) return true;
+        space = {*identity, std::move(outer)};
+    }
+}
+
+/// The outermost one around a process, if that is not in ours.
+std::optional<Namespace> sandboxOf(const AuditToken& token, const Kind& kind) {
+    struct stat status {};
+    if (::fstatat(token.procDirectory(), kind.link, &status, 0) != 0) return std::nullopt;
+    Namespace space{FileIdentity::of(status), UniqueFd()};
+    if (space.identity == kind.own) return std::nullopt;
+    space.descriptor.reset(::openat(token.procDirectory(), kind.link, O_RDONLY | O_CLOEXEC));
+    if (!goOutermost(space, kind)) return std::nullopt;
+    return space;
+}
+
+/// What stands for the sandbox of a process, if it is in one. Of a sandbox with a user namespace it
+/// is that: its processes may be in any number of others, of either kind, within.
+std::optional<FileIdentity> sandboxOf(const AuditToken& token) {
+    const auto processes = sandboxOf(token, processKind());
+    if (!processes) {
+        const auto users = sandboxOf(token, userKind());
+        return users ? std::optional(users->identity) : std::nullopt;
+    }
+    Namespace owner{{}, UniqueFd(::ioctl(processes->descriptor.get(), NS_GET_USERNS))};
+    const auto identity =
+        owner.descriptor ? FileIdentity::ofOpen(owner.descriptor.get()) : std::nullopt;
+    if (!identity || *identity == userKind().own) return processes->identity;
+    owner.identity = *identity;
+    return goOutermost(owner, userKind()) ? owner.identity : processes->identity;
 }
 
 }  // namespace
 
 Origin Origin::of(const AuditToken& token) {
-    struct stat status {};
-    const bool isKnown = ::fstatat(token.procDirectory(), kPidNamespace, &status, 0) == 0;
-    if (isKnown && !isOwn(status)) {
-        findOutermost(token.procDirectory(), status);
-        return {status.st_dev, status.st_ino, 0};
-    }
+    if (const auto sandbox = sandboxOf(token)) return {sandbox->device, sandbox->inode, 0};
     // A process that has just ended, or may not be asked about, stands for itself. All that are in
     // sessions from outside our namespace are one: such sessions have no number here.
     const pid_t session = ::getsid(token.pid());

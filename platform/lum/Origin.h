@@ -9,15 +9,13 @@
 namespace platform {
 
 /// Where a peer comes from, as far as sharing goes: what one origin takes, it takes from itself.
-/// All processes of one pid namespace other than ours, a sandbox with what is nested in it, are
-/// one; of the others, a process with those that it forked and that did not begin a session of
-/// their own. A value.
+/// All processes of a sandbox, which has a user or a pid namespace within ours, are one, with what
+/// is nested in it; of the others, a process with those that it forked and that did not begin a
+/// session of their own. A value.
 struct Origin {
-    dev_t device = 0;  // of the pid namespace; 0 for ours, and for one that cannot be told
+    dev_t device = 0;  // of the sandbox's namespace; 0 for who is in none, or cannot be told
     ino_t inode = 0;
     pid_t session = 0;  // 0 for a sandbox, and for a session that began outside our namespace
-
-    bool isSandbox() const { return inode != 0; }
 
     static Origin of(const AuditToken& token);
 

@@ -1,9 +1,14 @@
 #include "platform/lum/AuditToken.h"
 
 #include <fcntl.h>
+#include <sched.h>
 #include <signal.h>
+#include <sys/prctl.h>
 #include <sys/wait.h>
 
+#include <fstream>
+
+#include "platform/lum/Origin.h"
 #include "tests/platform/lum/LumFixture.h"
 
 namespace platform {
@@ -67,6 +72,51 @@ TEST_F(AuditTokenTest, NamesAnExecutableOnlyWhileItIsTheOneThatRuns) {
     waitpid(child, nullptr, 0);
     EXPECT_FALSE(AuditToken::ofPeer(connected.get()));
     for (int fd : input) close(fd);
+}
+
+/// Goes into one user namespace after the other, and into a pid namespace in the end, each time in
+/// a session of its own, with a process that stays behind and has connected.
+[[noreturn]] void nestNamespaces(const std::string& meeting) {
+    for (const int more : {CLONE_NEWUSER, CLONE_NEWUSER, CLONE_NEWUSER | CLONE_NEWPID, 0}) {
+        const uid_t user = ::geteuid();
+        const gid_t group = ::getegid();
+        ::prctl(PR_SET_PDEATHSIG, SIGKILL);
+        ::setsid();
+        if (::unshare(more) != 0) ::_exit(1);
+        // Who is nobody in there may make no more.
+        std::ofstream("/proc/self/uid_map") << "0 " << user << " 1";
+        std::ofstream("/proc/self/setgroups") << "deny";
+        std::ofstream("/proc/self/gid_map") << "0 " << group << " 1";
+        if (::fork() == 0) continue;
+        const UniqueFd socket = lum::unixSocket(meeting, ::connect);
+        for (;;) ::pause();
+    }
+    ::_exit(0);
+}
+
+TEST_F(AuditTokenTest, ASandboxIsOneOriginHoweverItNestsNamespaces) {
+    const std::string meeting = directories.runtime + "/meeting";
+    const UniqueFd listening = lum::unixSocket(meeting, ::bind);
+    ASSERT_EQ(::listen(listening.get(), 8), 0);
+    const timeval patience{10, 0};
+    ::setsockopt(listening.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+    std::vector<Origin> sandboxes;
+    for (int sandbox = 0; sandbox < 2; ++sandbox) {
+        const pid_t child = ::fork();
+        if (child == 0) nestNamespaces(meeting);
+        for (int process = 0; process < 4; ++process) {
+            const UniqueFd connected(::accept(listening.get(), nullptr, nullptr));
+            const auto token = connected ? AuditToken::ofPeer(connected.get()) : std::nullopt;
+            if (!token) GTEST_SKIP() << "no namespaces can be made here";
+            const Origin origin = Origin::of(*token);
+            EXPECT_NE(origin.inode, 0u);
+            if (process == 0) sandboxes.push_back(origin);
+            EXPECT_EQ(origin, sandboxes.back()) << process;
+        }
+        ::kill(child, SIGKILL);
+        ::waitpid(child, nullptr, 0);
+    }
+    EXPECT_NE(sandboxes.at(0), sandboxes.at(1));
 }
 
 }  // namespace
