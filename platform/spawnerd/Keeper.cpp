@@ -17,6 +17,9 @@
 namespace platform::spawnerd {
 
 Result<Keeper> Keeper::make() {
+    // What could not be found again in the end is not started.
+    if (::access(KeeperProcess::kChildren, R_OK) != 0)
+        return Error::posix(errno, KeeperProcess::kChildren);
     int ends[2];
     if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends) != 0)
         return Error::posix(errno, "socketpair");

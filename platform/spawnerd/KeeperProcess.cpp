@@ -1,6 +1,5 @@
 #include "platform/spawnerd/KeeperProcess.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <poll.h>
 #include <sched.h>
@@ -11,41 +10,17 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <charconv>
 #include <csignal>
 #include <cstring>
-#include <memory>
 #include <sstream>
 #include <utility>
 
 #include "platform/spawnerd/ChildProcess.h"
-#include "platform/system/Files.h"
 #include "platform/system/Parcel.h"
-#include "platform/system/Process.h"
 
 namespace platform::spawnerd {
 
 namespace {
-
-constexpr std::size_t kMostChildren = 1u << 20;
-
-void killChildren() {
-    const std::unique_ptr<DIR, int (*)(DIR*)> proc(::opendir("/proc"), &::closedir);
-    if (!proc) return;
-    while (const dirent* entry = ::readdir(proc.get())) {
-        pid_t process = 0;
-        std::from_chars(entry->d_name, entry->d_name + std::strlen(entry->d_name), process);
-        if (process > 0 && parentOf(process) == ::getpid()) ::kill(process, SIGKILL);
-    }
-}
-
-/// As this process reaps orphans, what a child leaves when it ends is a child of this one by the
-/// time that it can be waited for.
-void endAll() {
-    do {
-        killChildren();
-    } while (::waitpid(-1, nullptr, 0) > 0);
-}
 
 /// A file of the kernel's, which shows each namespace its own, and what is written there.
 using Setting = std::pair<const char*, std::string_view>;
@@ -131,9 +106,11 @@ void KeeperProcess::main(int socket) {
     ::sigaddset(&children, SIGCHLD);
     ::signal(SIGCHLD, SIG_DFL);
     UniqueFd childSignals(::signalfd(-1, &children, SFD_CLOEXEC | SFD_NONBLOCK));
-    if (!childSignals || ::prctl(PR_SET_CHILD_SUBREAPER, 1, 0, 0, 0) != 0) ::_exit(1);
-    KeeperProcess(UniqueFd(kSocket), std::move(childSignals)).serve();
-    endAll();
+    UniqueFd list(::open(kChildren, O_RDONLY | O_CLOEXEC));
+    if (!childSignals || !list || ::prctl(PR_SET_CHILD_SUBREAPER, 1, 0, 0, 0) != 0) ::_exit(1);
+    KeeperProcess keeper(UniqueFd(kSocket), std::move(childSignals), std::move(list));
+    keeper.serve();
+    keeper.endAll();
     ::_exit(0);
 }
 
@@ -214,13 +191,26 @@ void KeeperProcess::reap() {
     if (ends_.size() < before) endOrphans();
 }
 
-void KeeperProcess::endOrphans() {
-    const std::string self = std::to_string(::getpid());
-    const auto children = readFile("/proc/self/task/" + self + "/children", kMostChildren);
-    std::istringstream numbers(children ? *children : std::string());
-    // Only this process reaps them: until then their numbers are their own.
+void KeeperProcess::endOrphans() const {
+    std::string list;
+    char buffer[4096];
+    for (ssize_t count = 0; (count = ::pread(children_.get(), buffer, sizeof buffer,
+                                             static_cast<off_t>(list.size()))) > 0;)
+        list.append(buffer, static_cast<std::size_t>(count));
+    std::istringstream numbers(list);
+    // Only this process reaps them: until then their numbers are their own, and none leaves the
+    // list while it is read.
     for (pid_t pid = 0; numbers >> pid;)
         if (!ends_.contains(pid)) ::kill(pid, SIGKILL);
+}
+
+/// As this process reaps orphans, what a child leaves when it ends is a child of this one by the
+/// time that it can be waited for.
+void KeeperProcess::endAll() {
+    ends_.clear();  // nobody waits for any of them now
+    do {
+        endOrphans();
+    } while (::waitpid(-1, nullptr, 0) > 0);
 }
 
 }  // namespace platform::spawnerd

@@ -40,12 +40,17 @@ struct KeeperAnswer {
 /// The keeper's own side: see `Keeper`.
 class KeeperProcess {
   public:
+    /// Where the kernel lists a process's children, if it was built to.
+    static constexpr const char* kChildren = "/proc/thread-self/children";
+
     /// What the process does from its fork to its end. `socket` leads to the daemon.
     [[noreturn]] static void main(int socket);
 
   private:
-    KeeperProcess(UniqueFd socket, UniqueFd childSignals)
-        : socket_(std::move(socket)), childSignals_(std::move(childSignals)) {}
+    KeeperProcess(UniqueFd socket, UniqueFd childSignals, UniqueFd children)
+        : socket_(std::move(socket)),
+          childSignals_(std::move(childSignals)),
+          children_(std::move(children)) {}
 
     /// Until the daemon is gone.
     void serve();
@@ -60,9 +65,12 @@ class KeeperProcess {
     void reap();
     /// Ends what an ended child has left behind, which may be a sandbox whose ties to it were not
     /// knotted yet.
-    void endOrphans();
+    void endOrphans() const;
+    /// Ends everything, and waits until nothing is left.
+    void endAll();
 
     const UniqueFd socket_, childSignals_;
+    const UniqueFd children_;         // the kernel's list of this process's children
     std::map<pid_t, UniqueFd> ends_;  // where to tell how a child ended; none for a forgotten one
 };
 
