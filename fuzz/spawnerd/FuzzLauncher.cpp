@@ -1,7 +1,8 @@
 // The launcher's service, over its socket, by a host that may start one plug-in. Each part of an
 // input is a request, or a step that its first letter names: see `take`. "@" stands for the
 // executable that may be started, "%" for the instance that was started last, "#" for a long text.
-// Covers: platform/spawnerd/SpawnService.cpp platform/lum/PeerConnection.cpp
+// Covers: platform/spawnerd/SpawnService.cpp platform/spawnerd/SpawnServiceStart.cpp
+// Covers: platform/spawnerd/SpawnRequest.cpp platform/lum/PeerConnection.cpp
 
 #include <poll.h>
 #include <sys/socket.h>

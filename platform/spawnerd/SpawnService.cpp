@@ -1,74 +1,17 @@
 #include "platform/spawnerd/SpawnService.h"
 
 #include <poll.h>
-#include <sys/socket.h>
+#include <unistd.h>
 
-#include <algorithm>
 #include <cerrno>
 #include <csignal>
 #include <utility>
 
 #include "platform/log/OpsLog.h"
-#include "platform/sandbox/Namespaces.h"
-#include "platform/sandbox/Sandbox.h"
 #include "platform/spawnerd/Launcher.h"
 #include "platform/spawnerd/Protocol.h"
-#include "platform/spawnerd/SandboxProfile.h"
 
 namespace platform::spawnerd {
-
-namespace {
-
-const std::string* textAt(const Message& message, const char* key) {
-    const Value* value = message.find(key);
-    return value ? value->string() : nullptr;
-}
-
-/// The arguments of a "start"; none of them when the key is absent.
-Result<std::vector<std::string>> argumentsIn(const Message& message) {
-    std::vector<std::string> arguments;
-    const Value* value = message.find(kArguments);
-    if (!value) return arguments;
-    if (!value->array()) return Error::posix(EINVAL, "\"arguments\" is no array");
-    std::size_t bytes = 0;
-    for (const Value& element : *value->array()) {
-        const std::string* text = element.string();
-        if (!text) return Error::posix(EINVAL, "an argument is no text");
-        bytes += text->size();
-        if (bytes > kMaxStringBytes || arguments.size() == kMaxStrings)
-            return Error::posix(E2BIG, "arguments");
-        arguments.push_back(*text);
-    }
-    return arguments;
-}
-
-/// A plug-in that is not started is one that was never made ready, or is not ready any more.
-Error notReady(const std::string& executable) {
-    EVLOG_INFO(ops(), "refusing to start {}: it was not made ready for its host", executable);
-    return Error::posix(EPERM, "this process may not start " + executable);
-}
-
-template <class Asked>
-void reply(const Asked& asked, const Message& message) {
-    if (auto connection = asked.connection.lock()) connection->send(message);
-}
-
-template <class Asked>
-void refuse(const Asked& asked, const Error& error) {
-    Message message = Message::replyTo(asked.message);
-    message.set(kErrorCode, error.code);
-    message.set(kError, error.text);
-    reply(asked, message);
-}
-
-template <class Asked>
-void replyStatus(const Asked& asked, int status) {
-    Message message = Message::replyTo(asked.message);
-    message.set(kStatus, status);
-    reply(asked, message);
-}
-
-}  // namespace
 
 std::shared_ptr<SpawnService> SpawnService::make(Directories directories, std::string daemonService,
                                                  std::shared_ptr<RunLoop> loop,
@@ -161,154 +104,30 @@ void SpawnService::accept(const std::shared_ptr<Connection>& connection) {
     connection->resume();
 }
 
-void SpawnService::serve(const Host& host, const Asked& asked) {
-    const std::string* request = textAt(asked.message, kRequest);
-    if (!request) return refuse(asked, Error::posix(EINVAL, "\"request\" is missing"));
-    if (*request == kStart) return start(host, asked);
-    if (*request == kWait) return awaitEnd(host, asked, false);
-    if (*request == kTerminate) return awaitEnd(host, asked, true);
-    refuse(asked, Error::posix(ENOSYS, "unrecognized request"));
+void SpawnService::serve(const Host& host, const SpawnRequest& request) {
+    const std::string* what = request.text(kRequest);
+    if (!what) return request.refuse(Error::posix(EINVAL, "\"request\" is missing"));
+    if (*what == kStart) return start(host, request);
+    if (*what == kWait) return awaitEnd(host, request, false);
+    if (*what == kTerminate) return awaitEnd(host, request, true);
+    request.refuse(Error::posix(ENOSYS, "unrecognized request"));
 }
 
-Result<Pool::Share> SpawnService::drawFor(const Host& host) {
-    const auto own = std::ranges::count_if(
-        instances_, [&](const auto& entry) { return entry.second.host == host; });
-    if (static_cast<std::size_t>(own) >= kMaxInstancesPerHost)
-        return Error::posix(EAGAIN, "this process has started too many plug-ins");
-    if (instances_.size() >= kMaxInstances)
-        return Error::posix(EAGAIN, "too many plug-ins are running");
-    auto share = pool_.draw(Origin::of(host->token));
-    if (!share)
-        return Error::posix(EAGAIN, "those that this process belongs with run too many plug-ins");
-    return std::move(*share);
-}
-
-void SpawnService::start(const Host& host, const Asked& asked) {
-    const std::string* executable = textAt(asked.message, kExecutable);
-    if (!executable) return refuse(asked, Error::posix(EINVAL, "\"executable\" is missing"));
-    const auto arguments = argumentsIn(asked.message);
-    if (!arguments) return refuse(asked, arguments.error());
-    auto grant = host ? hosts_->grant(host, *executable) : nullptr;
-    if (!grant) return refuse(asked, notReady(*executable));
-    auto share = drawFor(host);
-    if (!share) return refuse(asked, share.error());
-    const std::uint64_t id = ++lastId_;
-    Running& running = instances_[id];
-    running.share = std::move(*share);
-    running.host = host;
-    running.grant = std::move(grant);
-    running.arguments = *arguments;
-    running.starting = asked;
-    open(id);
-}
-
-void SpawnService::open(std::uint64_t id) {
-    const Running& running = instances_.at(id);
-    const auto& grant = running.grant;
-    auto places = std::make_shared<std::optional<Result<GrantedPlaces>>>();
-    looks_.look(
-        Origin::of(running.host->token),
-        [places, grant, directories = directories_](PeerLooks::Pace&) {
-            places->emplace(GrantedPlaces::open(*grant, directories));
-        },
-        [places, grant, id, weak = weak_from_this()](bool isDone, std::size_t) {
-            auto self = weak.lock();
-            if (!self) return;
-            if (isDone) return self->opened(id, std::move(**places));
-            self->opened(id, Error::posix(ETIMEDOUT, grant->bundle.path));
-        });
-}
-
-void SpawnService::opened(std::uint64_t id, Result<GrantedPlaces> places) {
-    const auto found = instances_.find(id);
-    if (found == instances_.end()) return;  // it was ended meanwhile
-    Running& running = found->second;
-    // Without the connection over which it was asked for, nobody could ever speak to it.
-    if (running.starting->connection.expired()) return end(id);
-    auto grant = hosts_->grant(running.host, running.grant->executable);
-    if (!grant) return fail(id, notReady(running.grant->executable));
-    if (grant != running.grant) {
-        // It was made ready anew, perhaps in another place.
-        running.grant = std::move(grant);
-        return open(id);
-    }
-    if (auto error = places ? spawn(id, std::move(*places)) : places.error()) {
-        EVLOG_ERROR(ops(), "cannot start {}: {}", running.grant->executable, pub(*error));
-        fail(id, *error);
-    }
-}
-
-Allowance SpawnService::allowanceFor(const Running& running) const {
-    Allowance allowance = spawnerd::allowanceFor(*running.grant, settings_);
-    const AuditToken& host = running.host->token;
-    // What confines a host may keep it from the network in ways that do not show.
-    allowance.network &= sharesNamespace(host, NamespaceKind::Network) && !isConfined(host);
-    return allowance;
-}
-
-std::optional<Error> SpawnService::spawn(std::uint64_t id, GrantedPlaces places) {
-    if (!keeper_) return keeper_.error();
-    Running& running = instances_.at(id);
-    const Grant& grant = *running.grant;
-    auto busyFolder = BusyFolder::make(directories_, grant.bundleIdentifier, grant.bundle.path);
-    if (!busyFolder) return busyFolder.error();
-    const Surroundings surroundings{.allowance = allowanceFor(running),
-                                    .busyFolder = busyFolder->path()};
-    const Allowance& allowance = surroundings.allowance;
-    running.busyFolder.emplace(std::move(*busyFolder));
-    auto group = groups_.make(id, allowance.limits);
-    if (!group) return group.error();
-    const auto setup =
-        sandboxSetup(grant, std::move(places), directories_, daemonService_, surroundings);
-    if (!setup) return setup.error();
-    int ends[2];
-    if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) != 0)
-        return Error::posix(errno, "no connection");
-    running.connection.reset(ends[0]);
-    const UniqueFd plugInEnd(ends[1]);
-
-    std::vector<std::string> command{grant.executable};
-    command.insert(command.end(), running.arguments.begin(), running.arguments.end());
-    auto process =
-        SandboxedProcess::spawn(*keeper_, programs_.bubblewrap, *setup, command, plugInEnd);
-    if (!process) return process.error();
-    running.instance = std::make_unique<Instance>(
-        *loop_, *keeper_, programs_.pasta, std::move(*process), grant.bundleIdentifier, allowance,
-        std::move(*group), [this, id] { runs(id); }, [this, id](int status) { ended(id, status); });
-    return std::nullopt;
-}
-
-void SpawnService::runs(std::uint64_t id) {
-    Running& running = instances_.at(id);
-    EVLOG_INFO(ops(), "client {} has started plug-in {} as instance {}", running.host->token.pid(),
-               running.grant->bundleIdentifier, id);
-    // Without the connection over which it was asked for, nobody could ever speak to it.
-    if (running.starting->connection.expired()) return end(id);
-    Message message = Message::replyTo(running.starting->message);
-    message.set(kInstance, id);
-    message.setDescriptor(std::move(running.connection));
-    reply(*running.starting, message);
-    running.starting.reset();
-}
-
-void SpawnService::awaitEnd(const Host& host, const Asked& asked, bool kill) {
-    const Value* value = asked.message.find(kInstance);
-    const auto id = value ? value->unsignedInteger() : std::nullopt;
-    if (!id) return refuse(asked, Error::posix(EINVAL, "\"instance\" is missing"));
+void SpawnService::awaitEnd(const Host& host, const SpawnRequest& request, bool kill) {
+    const auto id = request.instance();
+    if (!id) return request.refuse(Error::posix(EINVAL, "\"instance\" is missing"));
     const auto found = instances_.find(*id);
     if (!host || found == instances_.end() || found->second.host != host) {
         if (host)
             for (const auto& [ended, status] : host->ended)
-                if (ended == *id) return replyStatus(asked, status);
-        return refuse(asked, Error::posix(ESRCH, "no instance of this process"));
+                if (ended == *id) return request.replyStatus(status);
+        return request.refuse(Error::posix(ESRCH, "no instance of this process"));
     }
     Running& running = found->second;
     if (running.waiters.size() >= kMaxWaitersPerInstance)
-        return refuse(asked, Error::posix(EBUSY, "too many requests wait for this instance"));
-    // Without its contents and its turn: the connection goes on meanwhile.
-    Asked later{asked.connection, {}};
-    later.message.setSerial(asked.message.serial());
-    running.waiters.push_back([later](int status) { replyStatus(later, status); });
+        return request.refuse(Error::posix(EBUSY, "too many requests wait for this instance"));
+    running.waiters.push_back(
+        [later = request.withoutTurn()](int status) { later.replyStatus(status); });
     if (kill) end(*id);
 }
 
@@ -325,17 +144,12 @@ void SpawnService::end(std::uint64_t id) {
     ended(id, 128 + SIGKILL);
 }
 
-void SpawnService::fail(std::uint64_t id, const Error& error) {
-    refuse(*std::exchange(instances_.at(id).starting, std::nullopt), error);
-    ended(id, 128 + SIGKILL);
-}
-
 void SpawnService::ended(std::uint64_t id, int status) {
     auto node = instances_.extract(id);
     Running& running = node.mapped();
     running.busyFolder.reset();
     if (running.starting)
-        refuse(*running.starting, Error::posix(EIO, "the sandbox of " + running.grant->executable));
+        running.starting->refuse(Error::posix(EIO, "the sandbox of " + running.grant->executable));
     if (running.instance) {
         EVLOG_INFO(ops(), "instance {} of plug-in {} has ended with status {}", id,
                    running.grant->bundleIdentifier, status);

@@ -17,6 +17,7 @@
 #include "platform/spawnerd/InstanceGroups.h"
 #include "platform/spawnerd/Keeper.h"
 #include "platform/spawnerd/Launcher.h"
+#include "platform/spawnerd/SpawnRequest.h"
 #include "platform/system/Directories.h"
 #include "platform/system/UniqueFd.h"
 #include "platform/threads/SerialQueue.h"
@@ -66,18 +67,13 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
   private:
     using Waiter = std::function<void(int status)>;
     using Host = GrantedHosts::Host;
-    /// A request, with where its reply goes.
-    struct Asked {
-        std::weak_ptr<Connection> connection;
-        Message message;  // holds the connection's turn as long as it is kept
-    };
     struct Running {
         Host host;
         std::shared_ptr<const Grant> grant;
         std::vector<std::string> arguments;
         std::optional<Pool::Share> share;      // of the instances that there may be
         std::optional<BusyFolder> busyFolder;  // from its start on
-        std::optional<Asked> starting;         // until it is answered
+        std::optional<SpawnRequest> starting;  // until it is answered
         UniqueFd connection;                   // the host's end, until then
         std::unique_ptr<Instance> instance;    // null while its places are being opened
         std::vector<Waiter> waiters;
@@ -88,8 +84,12 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
 
     void watchKeeper();
     void accept(const std::shared_ptr<Connection>& connection);
-    void serve(const Host& host, const Asked& asked);
-    void start(const Host& host, const Asked& asked);
+    void serve(const Host& host, const SpawnRequest& request);
+
+    // SpawnServiceStart.cpp:
+    void start(const Host& host, const SpawnRequest& request);
+    /// Draws from the instances that there may be; the error says that there are too many.
+    Result<Pool::Share> drawFor(const Host& host);
     /// Opens what the grant of an instance names, where only its host waits for it.
     void open(std::uint64_t id);
     void opened(std::uint64_t id, Result<GrantedPlaces> places);
@@ -97,17 +97,16 @@ class SpawnService : public std::enable_shared_from_this<SpawnService> {
     /// What the grant allows, as narrow as the host is.
     Allowance allowanceFor(const Running& running) const;
     void runs(std::uint64_t id);
-    void awaitEnd(const Host& host, const Asked& asked, bool kill);
+    /// Refuses what was asked for, and forgets it.
+    void fail(std::uint64_t id, const Error& error);
+
+    void awaitEnd(const Host& host, const SpawnRequest& request, bool kill);
     std::vector<std::uint64_t> instancesWith(
         const std::function<bool(const Running&)>& property) const;
     /// Ends an instance. One that was not started yet is gone at once.
     void end(std::uint64_t id);
-    /// Refuses what was asked for, and forgets it.
-    void fail(std::uint64_t id, const Error& error);
     void ended(std::uint64_t id, int status);
     void hostDied(const Host& host);
-    /// Draws from the instances that there may be; the error says that there are too many.
-    Result<Pool::Share> drawFor(const Host& host);
     void finishShutDown();
 
     const Directories directories_;

@@ -96,6 +96,39 @@ TEST_F(HostTest, APlugInEndsWithItsHostHoweverItHasForked) {
     EXPECT_EQ(launcher->addExternalService(token, service(executable), overlay()), ESRCH);
 }
 
+void startMany(int meeting) {
+    char reply[4096];
+    if (::read(meeting, reply, 1) != 1) return;
+    const int service = lum::unixSocket(childsService, ::connect).release();
+    for (std::size_t i = 0; i < kMaxInstancesPerHost; ++i)
+        if (::write(service, childsRequest.data(), childsRequest.size()) < 0 ||
+            ::read(service, reply, sizeof reply) <= 0)
+            return;
+    (void)!::write(meeting, "", 1);
+}
+
+TEST_F(HostTest, HostsThatBelongTogetherHaveAQuarterOfTheInstances) {
+    const std::string executable = plugIn("one", "exec sleep 1000");
+    childsService = path("test.spawnerd");
+    childsRequest = lum::requestFrame(1, {{"request", "start"}, {"executable", executable}});
+    std::vector<std::unique_ptr<Child>> hosts;
+    for (std::size_t left = kMaxInstances / 4; left > 0; left -= kMaxInstancesPerHost) {
+        hosts.push_back(std::make_unique<Child>(meeting_, 0, startMany));
+        EXPECT_EQ(launcher->addExternalService(meet(), service(executable), overlay()), 0);
+        goOn();
+        char done;
+        EXPECT_TRUE(
+            stepUntil([&] { return ::recv(accepted_.get(), &done, 1, MSG_DONTWAIT) == 1; }));
+    }
+    EXPECT_EQ(grant(executable), 0);
+    const Message refused = start(executable);
+    ASSERT_EQ(number(refused, kErrorCode), EAGAIN);
+    EXPECT_NE(refused.find(kError)->string()->find("belongs with"), std::string::npos);
+    hosts.clear();
+    EXPECT_TRUE(stepUntil([&] { return processesWith(executable).empty(); }));
+    EXPECT_GT(number(start(executable), kInstance), 0);
+}
+
 TEST_F(HostTest, AnotherProcessWithTheNumberOfADeadHostIsAnother) {
     const auto hosts = std::make_shared<GrantedHosts>(queue, [](const auto&) {});
     Grant granted;

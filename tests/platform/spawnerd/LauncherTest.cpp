@@ -312,6 +312,28 @@ TEST_F(LauncherTest, NothingRunsWithoutBubblewrap) {
     EXPECT_FALSE(std::filesystem::exists(home.path("ran")));
 }
 
+/// As where the kernel refuses a limit: this sandbox has no user namespace to set it in.
+TEST_F(LauncherTest, WhatCannotBeLimitedIsNotStarted) {
+    const std::string sandbox =
+        home.write("bwrap",
+                   "#!/bin/sh\n"
+                   "space=$(stat -Lc %i /proc/$$/ns/pid)\n"
+                   "echo \"{ \\\"child-pid\\\": $$, \\\"pid-namespace\\\": $space }\" >&5\n"
+                   "exec 5>&-\n"
+                   "head -c 1 <&6 >/dev/null\n"
+                   "while [ \"$1\" != -- ]; do shift; done\n"
+                   "shift\n"
+                   "exec \"$@\"\n");
+    std::filesystem::permissions(sandbox, std::filesystem::perms::owner_all);
+    useLauncher({.bubblewrap = sandbox});
+    const std::string executable = plugIn("one", "touch " + home.path("ran"));
+    EXPECT_EQ(grant(executable), 0);
+    EXPECT_EQ(number(start(executable), kErrorCode), EIO);
+    EXPECT_EQ(errorLines("cannot limit plug-in one"), 1u);
+    EXPECT_TRUE(processesWith(sandbox).empty());
+    EXPECT_FALSE(std::filesystem::exists(home.path("ran")));
+}
+
 /// At whatever point of the start there is no further descriptor.
 TEST_F(LauncherTest, AStartWithoutDescriptorsFailsAndLeavesNothing) {
     const std::string executable = plugIn("one", "cat");
