@@ -39,7 +39,8 @@ TEST_F(Discovery, APropertyListThatLiesOutsideItsBundleIsNotRead) {
     std::filesystem::create_symlink(secret, link);
     start();
     EXPECT_THAT(match(kPoint), ElementsAre("one 1.10"));
-    EXPECT_EQ(zrd_->errLines(link + ": a symbolic link or a mount that leads out of the bundle"), 1u);
+    EXPECT_EQ(zrd_->errLines(link + ": a symbolic link or a mount that leads out of the bundle"),
+              1u);
     EXPECT_THAT(add({home_.path(plugInPath("A", "two"))}), testing::StartsWith("2 "));
     EXPECT_THAT(match(), ElementsAre("one 1.10"));
     // One that is exchanged for such a link later goes.
