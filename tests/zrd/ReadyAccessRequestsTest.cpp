@@ -97,6 +97,19 @@ TEST_F(ReadyAccessTest, AccessGivesOneTokenForEach) {
                   unknown);
 }
 
+TEST_F(ReadyAccessTest, OthersHaveTheirTurnsBetweenTheTokensOfALongRequest) {
+    std::promise<void> begin;
+    server_->submitWork([&] { begin.get_future().wait(); });
+    Array uuids;
+    for (int i = 0; i < 1000; ++i) uuids.append(workspace_->installed[i % 2]->plugInUuid);
+    deliver(platform::Message({{"request", "access"}, {"version", 3}, {"uuids", uuids}}));
+    bool wasFirst = true;
+    server_->submitWork([&] { wasFirst = connection_->isAnswered; });
+    begin.set_value();
+    EXPECT_EQ(answer(*connection_).find("extensions")->array()->size(), 1000u);
+    EXPECT_FALSE(wasFirst);
+}
+
 TEST_F(ReadyAccessTest, MatchGivesTokensWithEachForm) {
     sandbox_->distant = {executable(0), executable(2)};
     EXPECT_EQ(ask("access", {0, 1, 2}).find("extensions")->array()->size(), 3u);
