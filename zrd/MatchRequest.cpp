@@ -1,5 +1,7 @@
 // The request "match".
 
+#include <algorithm>
+
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
 #include "Zorvan/ZRDaemonClient.h"
@@ -17,6 +19,9 @@ using platform::Dictionary;
 using platform::Value;
 
 namespace {
+
+/// Plug-ins that share resources, up to 64 each, for which tokens are issued in one go.
+constexpr std::size_t kMostSharing = 4;
 
 bool areRules(const Value& value) {
     return value.dictionary() && RuleSet::isAffordable(*value.dictionary()) &&
@@ -43,12 +48,14 @@ struct Transaction::Matching {
         std::size_t number;  // in the result
         std::shared_ptr<ZRDPlugIn> plugIn;
         ZRDPlugIn::Draft draft;
+        bool isComplete = false;
     };
 
     Matching(std::uint64_t flags, std::size_t expected) : result(flags, expected) {}
 
     MatchResult result;
     std::size_t leftOut = 0;
+    std::size_t sharing = 0;  // plug-ins that were met and share resources
     std::vector<Late> late;
 };
 
@@ -91,13 +98,15 @@ void Transaction::matchPlugIns() {
     if (matching->leftOut != 0)
         EVLOG_ERROR(ops(), "leaving {} plug-ins out of a match that no reply can hold",
                     matching->leftOut);
-    completeLateForms(matching);
+    completeForms(matching, 0);
 }
 
-/// Only who has won is given tokens.
+/// Only who has won is given tokens. Those that are issued for each answer anew come later where
+/// they are many: nobody waits for all of them.
 void Transaction::accept(const std::shared_ptr<ZRDPlugIn>& plugIn, ZRDPlugInDraft& draft,
                          Matching& matching) {
-    auto form = plugIn->completedForm(draft, platform::Wait::Never);
+    const bool mustWait = plugIn->sharesResources() && matching.sharing++ >= kMostSharing;
+    auto form = mustWait ? std::nullopt : plugIn->completedForm(draft, platform::Wait::Never);
     const bool isLate = !form;
     if (isLate) {
         form = draft.form;
@@ -110,10 +119,28 @@ void Transaction::accept(const std::shared_ptr<ZRDPlugIn>& plugIn, ZRDPlugInDraf
         matching.late.push_back({matching.result.lastAccepted(), plugIn, std::move(draft)});
 }
 
+/// Gives tokens to some; then others have their turn.
+void Transaction::completeForms(const std::shared_ptr<Matching>& matching, std::size_t first) {
+    if (!client_->acceptWork()) return;
+    const std::size_t end = std::min(first + kMostSharing, matching->late.size());
+    for (std::size_t next = first; next < end; ++next) {
+        auto& late = matching->late[next];
+        late.isComplete = !matching->result.stands(late.number);
+        if (late.isComplete) continue;
+        auto form = late.plugIn->completedForm(late.draft, platform::Wait::Never);
+        if (!form) continue;
+        addAnnotationForPlugIn(*late.plugIn, *form);
+        matching->result.replace(late.number, *std::move(form));
+        late.isComplete = true;
+    }
+    if (end == matching->late.size()) return completeLateForms(matching);
+    server().submitWork(
+        [self = shared_from_this(), matching, end] { self->completeForms(matching, end); });
+}
+
 /// Gives tokens to those whose file systems have to be asked, beside the service queue.
 void Transaction::completeLateForms(const std::shared_ptr<Matching>& matching) {
-    std::erase_if(matching->late,
-                  [&](const auto& late) { return !matching->result.stands(late.number); });
+    std::erase_if(matching->late, [](const auto& late) { return late.isComplete; });
     const auto forms = std::make_shared<std::vector<Dictionary>>(matching->late.size());
     std::vector<platform::PlaceLooks::Look> looks;
     for (std::size_t i = 0; i < forms->size(); ++i) {

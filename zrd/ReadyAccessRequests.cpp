@@ -18,6 +18,13 @@ namespace zorvan {
 
 using platform::Array;
 
+namespace {
+
+/// Tokens that are issued in one go, some 25 µs each; then others have their turn.
+constexpr std::size_t kMostTokensAtOnce = 32;
+
+}  // namespace
+
 const HostRestriction& Transaction::hostRestriction() {
     if (!hostRestriction_) hostRestriction_.emplace(*client_, server().services().types);
     return *hostRestriction_;
@@ -92,8 +99,11 @@ void Transaction::accessFrom(std::size_t first, Array tokens) {
     if (!client_->acceptWork()) return;
     const auto sandbox = server().services().sandbox;
     std::shared_ptr<ZRDPlugIn> late;
+    bool isPausing = false;
     const bool completed = processUuidList(
         [&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
+            isPausing = tokens.size() == first + kMostTokensAtOnce;
+            if (isPausing) return Walk::Stop;
             auto token =
                 sandbox->issueReadExtension(plugIn->bundleDirectory(), ".", platform::Wait::Never);
             if (!token) {
@@ -111,6 +121,10 @@ void Transaction::accessFrom(std::size_t first, Array tokens) {
         reply_.set(message::kExtensions, std::move(tokens));
         return done();
     }
+    if (isPausing)
+        return server().submitWork(
+            [self = shared_from_this(), next = first + kMostTokensAtOnce,
+             tokens = std::move(tokens)]() mutable { self->accessFrom(next, std::move(tokens)); });
     if (!late) return;
     const auto token = std::make_shared<platform::Result<std::string>>(std::string());
     platform::PlaceLooks::Look look{late->path(), [sandbox, late, token] {

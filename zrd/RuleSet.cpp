@@ -12,6 +12,9 @@ using platform::Value;
 
 namespace {
 
+/// Lines about operators that do not exist, of one pattern: everybody waits for each.
+constexpr std::size_t kMostTold = 256;
+
 /// Takes the bytes of a value's texts and data off `left`; false when there are more.
 bool takeBytes(const Value& value, std::size_t& left) {
     std::size_t bytes = 0;
@@ -51,7 +54,10 @@ RulePattern::Content RulePattern::read(const Value& pattern,
         areKnown = texts.patterns.add(*alternative.string()) && areKnown;
         given.push_back(*alternative.string());
     }
-    if (!areKnown) texts.told = Told{std::move(given), types};
+    if (!areKnown) {
+        const std::size_t walks = std::max<std::size_t>(kMostTold / given.size(), 1);
+        texts.told = Told{std::move(given), types, walks};
+    }
     return texts;
 }
 

@@ -35,7 +35,7 @@ class RulePattern {
     struct Told {
         std::vector<std::string> patterns;
         std::shared_ptr<platform::Types> types;
-        std::size_t walks = 256;
+        std::size_t walks;
     };
     struct Texts {
         TextPatterns patterns;

@@ -61,6 +61,7 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     struct Matching;
     void accept(const std::shared_ptr<ZRDPlugIn>& plugIn, ZRDPlugInDraft& draft,
                 Matching& matching);
+    void completeForms(const std::shared_ptr<Matching>& matching, std::size_t first);
     void completeLateForms(const std::shared_ptr<Matching>& matching);
     void answerMatch(MatchResult& result);
 

@@ -71,6 +71,8 @@ class ZRDPlugIn final : public ZRPlugInCore {
     /// afresh. None, and the draft as it was, when that would have to wait for the bundle's file
     /// system, and may not.
     std::optional<platform::Dictionary> completedForm(Draft& draft, platform::Wait wait) const;
+    /// Whether tokens are issued for each of its forms anew.
+    bool sharesResources() const;
 
     /// The plug-in's value for an entitlement, or null.
     const platform::Value* valueForEntitlement(std::string_view name) const;

@@ -174,6 +174,10 @@ std::optional<Dictionary> ZRDPlugIn::issueResourceExtensions(const Value& resour
     return extensions;
 }
 
+bool ZRDPlugIn::sharesResources() const {
+    return !isAppExtension() && pluginKey(key::kShared);
+}
+
 ZRDPlugIn::Augmented ZRDPlugIn::augmentForm(Dictionary& form, platform::Wait wait) const {
     static const Value bundleItself = Array{"."};
     const Value* resources = isAppExtension() ? &bundleItself : pluginKey(key::kShared);

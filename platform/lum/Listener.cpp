@@ -9,9 +9,12 @@
 #include <chrono>
 #include <climits>
 #include <optional>
+#include <string_view>
 #include <system_error>
 #include <utility>
 #include <vector>
+
+#include <fmt/format.h>
 
 #include "platform/log/OpsLog.h"
 #include "platform/lum/Limits.h"
@@ -78,7 +81,7 @@ struct Listener::State : std::enable_shared_from_this<Listener::State> {
     bool failing = false;  // accepting has failed, and hosts have waited since then
     bool closed = false;
     UniqueFd undecided;       // accepted when no descriptors were left to look at its peer
-    std::size_t refused = 0;  // by the pool, since the log was told
+    std::size_t refused = 0;  // since the log was told
     std::chrono::steady_clock::time_point nextRefusalLine{};
 
     State(SerialQueue& eventQueue, lum::ServiceSocket serviceSocket)
@@ -97,6 +100,7 @@ struct Listener::State : std::enable_shared_from_this<Listener::State> {
     void acceptFailed(int errnum);
     void admit(UniqueFd connected);
     std::optional<Pool::Share> drawFor(const AuditToken& token);
+    void refuse(pid_t client, std::string_view reason);
     void remember(const std::shared_ptr<lum::PeerConnection>& connection);
     void close();
 };
@@ -140,10 +144,7 @@ void Listener::State::admit(UniqueFd connected) {
         undecided = std::move(connected);
         return;
     }
-    if (!token) {
-        EVLOG_ERROR(ops(), "client {} is not let in: it cannot be told who it is", *peer);
-        return;
-    }
+    if (!token) return refuse(*peer, "it cannot be told who it is");
     auto share = drawFor(*token);
     if (!share) return;
     auto connection = std::make_shared<lum::PeerConnection>(std::move(connected), std::move(*token),
@@ -152,20 +153,25 @@ void Listener::State::admit(UniqueFd connected) {
     handler(std::move(connection));
 }
 
-/// None when those of the peer's origin have their part already. With a line at times: whoever
-/// connects again and again, and from ever new origins, does not fill the log.
+/// None when those of the peer's origin have their part already.
 std::optional<Pool::Share> Listener::State::drawFor(const AuditToken& token) {
     auto share = pool.draw(Origin::of(token));
-    if (share) return share;
+    if (!share)
+        refuse(token.pid(), fmt::format("there are too many connections, or it and those it "
+                                        "belongs with have too many, {} are the most",
+                                        pool.mostOfOne()));
+    return share;
+}
+
+/// With a line at times: whoever connects again and again, and from ever new origins, does not fill
+/// the log.
+void Listener::State::refuse(pid_t client, std::string_view reason) {
     ++refused;
     const auto now = std::chrono::steady_clock::now();
-    if (now < nextRefusalLine) return share;
+    if (now < nextRefusalLine) return;
     nextRefusalLine = now + kBetweenRefusalLines;
-    EVLOG_ERROR(ops(),
-                "client {} is not let in: there are too many connections, or it and those it "
-                "belongs with have too many, {} are the most ({} refused since the last such line)",
-                token.pid(), pool.mostOfOne(), std::exchange(refused, 0));
-    return share;
+    EVLOG_ERROR(ops(), "client {} is not let in: {} ({} refused since the last such line)", client,
+                pub(reason), std::exchange(refused, 0));
 }
 
 void Listener::State::remember(const std::shared_ptr<lum::PeerConnection>& connection) {

@@ -1,6 +1,7 @@
 #include "platform/lum/ServiceSocket.h"
 
 #include <fcntl.h>
+#include <poll.h>
 #include <sys/file.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -25,6 +26,9 @@
 namespace platform::lum {
 
 namespace {
+
+/// To be let in: who connects again and again fills the line, and others stand behind in it.
+constexpr int kMostWaiting = 256;
 
 /// The paths of the sockets that were made here and are still there.
 struct OwnPaths {
@@ -128,7 +132,7 @@ Result<UniqueFd> bindSocket(const std::string& path) {
     // Whatever the umask, nobody can connect before `listen`, nor reach through the directory.
     if (!socket ||
         ::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0 ||
-        chmod(path.c_str(), 0600) != 0 || ::listen(socket.get(), SOMAXCONN) != 0)
+        chmod(path.c_str(), 0600) != 0 || ::listen(socket.get(), kMostWaiting) != 0)
         return Error::posix(errno, path);
     return socket;
 }
@@ -168,6 +172,8 @@ void removeServiceSockets() {
 }
 
 std::optional<pid_t> admittedPeer(int connected) {
+    pollfd state{connected, 0, 0};
+    if (::poll(&state, 1, 0) > 0) return std::nullopt;
     ucred peer{};
     socklen_t size = sizeof peer;
     if (getsockopt(connected, SOL_SOCKET, SO_PEERCRED, &peer, &size) != 0) return std::nullopt;

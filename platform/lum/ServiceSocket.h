@@ -43,7 +43,8 @@ class ServiceSocket {
 void removeServiceSockets();
 
 /// The process that connected to a service, if it may speak to it: processes of this user and of
-/// root may, others get a log line. The id may have come to mean another process already.
+/// root may, others get a log line. None, too, when it has closed the connection already: to find
+/// out who it was takes longer than to connect. The id may have come to mean another process.
 std::optional<pid_t> admittedPeer(int connected);
 
 }  // namespace lum

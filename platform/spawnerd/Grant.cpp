@@ -20,6 +20,9 @@ namespace platform::spawnerd {
 
 namespace {
 
+constexpr const char* kExtension = "VXExtension";
+constexpr const char* kExtensionPoint = "VXExtensionPointIdentifier";
+
 /// What lies behind a directory in the path of something in it; empty when that lies elsewhere.
 std::string pathWithin(const std::string& directory, const std::string& path) {
     if (directory.empty() || !path.starts_with(directory + '/')) return {};
@@ -53,12 +56,29 @@ std::string textAt(const Dictionary& info, std::initializer_list<const char*> ke
     return {};
 }
 
+const Dictionary* dictionaryAt(const Dictionary* dictionary, const char* key) {
+    const Value* value = dictionary ? dictionary->find(key) : nullptr;
+    return value ? value->dictionary() : nullptr;
+}
+
+/// The profile and the limits go by the plug-in dictionary's extension point, hosts also find a
+/// plug-in by its attributes and the top level: whoever is found as a keyboard is confined as one.
+bool statesOneExtensionPoint(const Dictionary& info) {
+    const Dictionary* plugIn = dictionaryAt(&info, kExtension);
+    const Value* own = plugIn ? plugIn->find(kExtensionPoint) : nullptr;
+    if (own && !own->string()) return false;
+    for (const Dictionary* place : {dictionaryAt(plugIn, "VXExtensionAttributes"), &info}) {
+        const Value* other = place ? place->find(kExtensionPoint) : nullptr;
+        if (other && (!own || *other != *own)) return false;
+    }
+    return true;
+}
+
 void readIdentifiers(const Dictionary& info, Grant& grant) {
     constexpr const char* kIdentifier = "VXExtensionIdentifier";
-    const Value* extension = info.find("VXExtension");
-    if (const Dictionary* plugIn = extension ? extension->dictionary() : nullptr) {
+    if (const Dictionary* plugIn = dictionaryAt(&info, kExtension)) {
         grant.plugInIdentifier = textAt(*plugIn, {kIdentifier});
-        grant.extensionPoint = textAt(*plugIn, {"VXExtensionPointIdentifier"});
+        grant.extensionPoint = textAt(*plugIn, {kExtensionPoint});
     }
     if (grant.plugInIdentifier.empty()) grant.plugInIdentifier = textAt(info, {kIdentifier});
     grant.bundleIdentifier = textAt(info, {"QFBundleIdentifier"});
@@ -145,6 +165,9 @@ Result<Grant> Grant::make(const Directories& directories, const ExternalService&
     if (auto error = checkExecutable(bundle->get(), name, service.executable)) return *error;
     const auto info = readList(bundle->get(), "Info.plist");
     if (!info) return Error::posix(EINVAL, "the Info.plist of " + service.bundle.path);
+
+    if (!statesOneExtensionPoint(*info))
+        return Error::posix(EINVAL, "more than one extension point, " + service.bundle.path);
 
     Grant grant;
     grant.executable = service.executable;

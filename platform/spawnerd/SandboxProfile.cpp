@@ -85,6 +85,8 @@ void bindSystem(Arguments& arguments, const SandboxProfile& profile, const Insta
     // Everything in /dev that can be written to lies in memory.
     append(arguments, {"--dev", "/dev", "--size", std::to_string(limits.sharedMemory), "--tmpfs",
                        "/dev/shm", "--remount-ro", "/dev"});
+    // The machine has so many pseudo terminals, which all its sandboxes would share.
+    append(arguments, {"--tmpfs", "/dev/pts", "--remount-ro", "/dev/pts"});
     append(arguments, {"--size", std::to_string(limits.temporary), "--tmpfs", "/tmp"});
 }
 

@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <linux/sched.h>
+#include <netinet/in.h>
 #include <seccomp.h>
 #include <sys/ioctl.h>
 #include <sys/mman.h>
@@ -42,7 +43,9 @@ constexpr const char* kRefused[] = {
     // The machine's own business.
     "kexec_load", "kexec_file_load", "create_module", "init_module", "finit_module",
     "delete_module", "get_kernel_syms", "query_module", "syslog", "acct", "quotactl", "quotactl_fd",
-    "swapon", "swapoff", "reboot", "nfsservctl", "vhangup"};
+    "swapon", "swapoff", "reboot", "nfsservctl", "vhangup",
+    // While anybody has such memory the machine does not hibernate.
+    "memfd_secret"};
 
 /// Its flags lie in memory, where no filter sees them. Programs take this for an old kernel and
 /// use "clone".
@@ -62,6 +65,11 @@ constexpr std::uint32_t kHoldingUp[] = {F_SETLEASE, F_NOTIFY};
 /// No netlink: it is a wide road into the kernel, and tells of the machine's network also those who
 /// have none. Resolvers ask it which kinds of addresses there are, and without it try them all.
 constexpr std::uint32_t kFamilies[] = {AF_UNSPEC, AF_UNIX, AF_INET, AF_INET6};
+
+/// Of internet sockets: what a program chooses that names none, ICMP, TCP, UDP and ICMPv6. Others
+/// (SCTP, L2TP, ...) would be loaded into the kernel for whoever asks.
+constexpr std::uint32_t kProtocols[] = {IPPROTO_IP, IPPROTO_ICMP, IPPROTO_TCP, IPPROTO_UDP,
+                                        IPPROTO_ICMPV6};
 
 /// Of Unix sockets: senders that wait for a full queue of datagrams can have more descriptors on
 /// their way than a user may have, and then nobody of the user's passes any.
@@ -166,6 +174,7 @@ Result<std::string> compile() {
         for (const std::uint32_t command : kHoldingUp) rules.refuseValue(call, 1, command);
     for (const char* call : {"socket", "socketpair"}) {
         rules.refuseOthers(call, 0, kFamilies);
+        rules.refuseOthers(call, 2, kProtocols);
         for (const std::uint32_t type : kPiling)
             rules.refusePair(call, AF_UNIX,
                              scmp_arg_cmp{1, SCMP_CMP_MASKED_EQ, kSocketTypes, type});

@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <linux/sched.h>
+#include <netinet/in.h>
 #include <sys/ioctl.h>
 #include <sys/ptrace.h>
 #include <sys/socket.h>
@@ -122,6 +123,7 @@ TEST_F(HostilePlugIn, IsRefusedSystemCallsThatNoPlugInNeeds) {
         {"quotactl", SYS_quotactl},
         {"swapon", SYS_swapon},
         {"reboot", SYS_reboot},
+        {"memfd_secret", SYS_memfd_secret},
 #ifdef SYS_modify_ldt
         {"modify_ldt", SYS_modify_ldt},
 #endif
@@ -154,6 +156,9 @@ TEST_F(HostilePlugIn, IsRefusedArgumentsOfOtherSystemCalls) {
     EXPECT_EQ(call(SYS_personality, {0xffffffff}), "ok") << "the question";
     for (const std::uint64_t family : {AF_INET, AF_INET6})
         EXPECT_EQ(call(SYS_socket, {family, SOCK_DGRAM}), "ok") << family;
+    for (const std::uint64_t protocol : {IPPROTO_MPTCP, IPPROTO_SCTP, IPPROTO_UDPLITE})
+        EXPECT_EQ(call(SYS_socket, {AF_INET, SOCK_STREAM, protocol}), "EPERM") << protocol;
+    EXPECT_EQ(call(SYS_socket, {AF_INET, SOCK_STREAM, IPPROTO_TCP}), "ok");
     EXPECT_EQ(call(SYS_socket, {AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC}), "ok");
     EXPECT_EQ(call(SYS_socket, {AF_UNIX, SOCK_SEQPACKET}), "ok");
     for (const std::uint64_t type : {SOCK_DGRAM | SOCK_CLOEXEC, SOCK_RAW | SOCK_NONBLOCK}) {
@@ -197,6 +202,7 @@ TEST_F(HostilePlugIn, DoesNotOutliveTheDaemon) {
 TEST_F(HostilePlugIn, HasSoManyProcessesAndDescriptorsAndNoMore) {
     EXPECT_EQ(tell("descriptors"), "512");
     EXPECT_EQ(tell("watch-queues"), "16");
+    EXPECT_EQ(tell("sh ls /dev/pts"), "") << "terminals, of which all sandboxes share so many";
     EXPECT_EQ(tell("sh ulimit -c; ulimit -Hc; ulimit -n"), "0\n0\n512\n");
     if (::geteuid() == 0) GTEST_SKIP() << "without a group, root has as many processes as it likes";
     EXPECT_THAT(std::stoi(tell("fork-bomb 2000")), AllOf(Gt(100), Le(512)));

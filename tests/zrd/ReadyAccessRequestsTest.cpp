@@ -97,6 +97,31 @@ TEST_F(ReadyAccessTest, AccessGivesOneTokenForEach) {
                   unknown);
 }
 
+TEST_F(ReadyAccessTest, OthersHaveTheirTurnsBetweenTheTokensOfALongRequest) {
+    Array uuids;
+    for (int i = 0; i < 1000; ++i) uuids.append(workspace_->installed[i % 2]->plugInUuid);
+    for (const char* name : {"a", "b", "c", "d", "e", "f", "g", "h", "i", "j"}) {
+        const Dictionary shared{{"Shared", "x"}, {"VXExtensionProtocol", "P"}};
+        const auto plugIn = makeProxy(name, {}, shared);
+        plugIn->bundlePath = std::string("/Apps/Host.app/PlugIns/") + name;
+        workspace_->installed.push_back(plugIn);
+    }
+    for (const char* request : {"access", "match"}) {
+        std::promise<void> begin;
+        server_->submitWork([&] { begin.get_future().wait(); });
+        deliver(platform::Message({{"request", request}, {"version", 3}, {"uuids", uuids}}));
+        bool wasFirst = true;
+        server_->submitWork([&] { wasFirst = connection_->isAnswered; });
+        begin.set_value();
+        const Dictionary reply = answer(*connection_);
+        EXPECT_FALSE(wasFirst);
+        const Value* matches = reply.find("matches");
+        if (!matches) continue;
+        for (const Value& form : *matches->packed()->value()->array())
+            EXPECT_EQ(form.dictionary()->find("extensions")->dictionary()->size(), 1u);
+    }
+}
+
 TEST_F(ReadyAccessTest, MatchGivesTokensWithEachForm) {
     sandbox_->distant = {executable(0), executable(2)};
     EXPECT_EQ(ask("access", {0, 1, 2}).find("extensions")->array()->size(), 3u);

@@ -132,6 +132,12 @@ TEST_F(MatchingTest, UnknownOperatorsNeverMatchAndAreLogged) {
     const std::string y = "ops I: unrecognized match operator:?y";
     const std::string z = "ops I: unrecognized match operator:?z";
     EXPECT_THAT(log.take(), ElementsAre(y, z, y, y, z, y));
+    // Everybody waits meanwhile.
+    Array many;
+    for (int i = 0; i < 300; ++i) many.append("?");
+    const RuleSet unknown({{"Name", many}}, nullptr);
+    for (int i = 0; i < 2; ++i) EXPECT_FALSE(plugIn->match(unknown));
+    EXPECT_EQ(log.take().size(), 300u);
 }
 
 TEST_F(MatchingTest, AMissingApplicationFailsEveryPattern) {

@@ -224,10 +224,11 @@ TEST_F(ListenerTest, AMalformedFrameEndsItsConnectionAlone) {
              Case{requestFrame(1).substr(0, 6), "middle of a frame", true},
              Case{head, "middle of a frame", true},
          }) {
-        const std::size_t lines = errorLines();
+        const std::size_t lines = errorLines(), before = accepted;
         events.clear();
         RawPeer peer(path());
         peer.write(bytes);
+        EXPECT_TRUE(stepUntil([&] { return accepted > before; }));
         if (closes) peer.close();
         EXPECT_TRUE(stepUntil([&] { return events.size() == 1; })) << reason;
         EXPECT_THAT(events, ElementsAre("invalid"));
@@ -361,6 +362,16 @@ TEST_F(ListenerTest, ADeadPeersWaitingRequestsAreDropped) {
     EXPECT_TRUE(stepUntil([&] { return contexts[0].expired(); }));
     EXPECT_THAT(events, ElementsAre("message 1", "invalid"));
     EXPECT_EQ(errorLines(), 0u);
+}
+
+/// It would take longer to find out who it was than to come again.
+TEST_F(ListenerTest, APeerThatGoesBeforeItIsLetInTakesNoTime) {
+    openAndResume();
+    replySize = 1;
+    for (int i = 0; i < 100; ++i) RawPeer(path()).write(requestFrame(1));
+    RawPeer peer(path());
+    EXPECT_TRUE(ask(peer, 2));
+    EXPECT_EQ(accepted, 1);
 }
 
 TEST_F(ListenerTest, WhoNeverReadsIsNotServedOnAndHoldsUpNobody) {

@@ -212,6 +212,25 @@ TEST_F(LauncherTest, BadGrantsAreRefused) {
     EXPECT_EQ(grant(good), EINVAL);
 }
 
+/// Hosts would find it as what it is not confined as.
+TEST_F(LauncherTest, APlugInServesOneExtensionPoint) {
+    constexpr const char* kPoint = "VXExtensionPointIdentifier";
+    const std::string executable = plugIn("one", "");
+    const auto grantFor = [&](const Value& own, const Dictionary& attributes,
+                              Dictionary info = {{"QFBundleIdentifier", "one"}}) {
+        info.set("VXExtension", Dictionary{{kPoint, own}, {"VXExtensionAttributes", attributes}});
+        writeInfo("one", info);
+        return grant(executable);
+    };
+    const Dictionary keyboard{{kPoint, "keyboard"}};
+    EXPECT_EQ(grantFor("keyboard", keyboard, {{"QFBundleIdentifier", "one"}, {kPoint, "keyboard"}}),
+              0);
+    EXPECT_EQ(grantFor("other", keyboard), EINVAL);
+    EXPECT_EQ(grantFor("other", {}, {{"QFBundleIdentifier", "one"}, {kPoint, "keyboard"}}), EINVAL);
+    EXPECT_EQ(grantFor("keyboard", {{kPoint, Array{"keyboard", "other"}}}), EINVAL);
+    EXPECT_EQ(grantFor(Array{"keyboard"}, Dictionary()), EINVAL);
+}
+
 TEST_F(LauncherTest, AContainerThatLeadsElsewhereIsRefusedAlsoLater) {
     const std::string executable = plugIn("one", "echo $HOME");
     const std::string place = container("one");
