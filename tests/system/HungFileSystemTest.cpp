@@ -177,7 +177,7 @@ TEST_F(HungFileSystem, APlugInOnItHoldsUpWhoStartsItAlone) {
     starting.send(request);
     for (int i = 0; i < 20; ++i) expectService();
     EXPECT_THAT(starting.receive(), HasSubstr(bundle + ": Connection timed out"));
-    EXPECT_EQ(zrd_->errLines("cannot start " + bundle), 1u);
+    EXPECT_EQ(zrd_->errLines("cannot start " + bundle), 1u) << zrd_->err();
     starting.send(request);
 }
 
