@@ -49,21 +49,37 @@ bool Transaction::hasShareFor(const Dictionary& change, const ZRDPlugIn& plugIn)
     return false;
 }
 
-void Transaction::annotate(const Dictionary& change, const ZRDPlugIn& plugIn) {
+void Transaction::annotate(const Dictionary& change, const ZRDPlugIn& plugIn,
+                           std::function<void()> then) {
     hasUnsyncedAnnotations_ = true;
-    server().setAnnotation(change, plugIn, origin(), platform::Sync::No);
+    server().setAnnotation(change, plugIn, origin(), platform::Sync::Later,
+                           onServiceQueue(std::move(then)));
 }
 
-void Transaction::syncAnnotations() {
-    if (std::exchange(hasUnsyncedAnnotations_, false)) server().syncAnnotations();
+void Transaction::syncAnnotations(std::function<void()> then) {
+    if (!std::exchange(hasUnsyncedAnnotations_, false)) return then();
+    server().syncAnnotations(onServiceQueue(std::move(then)));
 }
+
+void Transaction::finishAnnotating() {
+    syncAnnotations([this] {
+        server().notifyAnnotationChange();
+        done();
+    });
+}
+
+/// One change for several plug-ins, and how far it has come.
+struct Transaction::Annotating {
+    Dictionary change;
+    std::unordered_set<platform::Uuid> changed{};
+    std::size_t next = 0;  // in "uuids"
+};
 
 void Transaction::annotatePlugIns() {
     const Dictionary* annotations = requestedAnnotations();
     if (!annotations) return;
     Dictionary change;
-    const Value* election = annotations->find(annotation::kElection);
-    if (election) {
+    if (const Value* election = annotations->find(annotation::kElection)) {
         if (!election->isNumber()) {
             return fail(kZRErrorInvalidRequest, "invalid request format (annotation election)");
         }
@@ -76,27 +92,38 @@ void Transaction::annotatePlugIns() {
         change.set(annotation::kExtension, *extension);
     }
     if (change.empty()) return done();
-
-    // A plug-in named again has the change already.
-    std::unordered_set<platform::Uuid> changed;
-    bool completed = processUuidList([&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
-        if (!changed.insert(plugIn->uuid()).second) return Walk::Continue;
-        if (!hasShareFor(change, *plugIn)) return Walk::Stop;
-        if (!hasRoomFor(change, *plugIn)) return Walk::Stop;
-        EVLOG_DEBUG(ops(), "client {} plug-in {}({}) annotation change: {}", client_->pid(),
-                    plugIn->identifier(), pub(plugIn->uuid()), change);
-        if (election) {
-            EVLOG_INFO(ops(), "client {} plug-in {}({}) election := {}", client_->pid(),
-                       plugIn->identifier(), pub(plugIn->uuid()), *election);
-        }
-        annotate(change, *plugIn);
-        return Walk::Continue;
-    });
-    if (!completed) return;
-    syncAnnotations();
-    server().notifyAnnotationChange();
-    done();
+    annotateNext(std::make_shared<Annotating>(Annotating{.change = std::move(change)}));
 }
+
+void Transaction::annotateNext(const std::shared_ptr<Annotating>& annotating) {
+    const Dictionary& change = annotating->change;
+    const bool completed = processUuidList(
+        [&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
+            ++annotating->next;
+            // A plug-in named again has the change already.
+            if (!annotating->changed.insert(plugIn->uuid()).second) return Walk::Continue;
+            if (!hasShareFor(change, *plugIn) || !hasRoomFor(change, *plugIn)) return Walk::Stop;
+            EVLOG_DEBUG(ops(), "client {} plug-in {}({}) annotation change: {}", client_->pid(),
+                        plugIn->identifier(), pub(plugIn->uuid()), change);
+            if (const Value* election = change.find(annotation::kElection)) {
+                EVLOG_INFO(ops(), "client {} plug-in {}({}) election := {}", client_->pid(),
+                           plugIn->identifier(), pub(plugIn->uuid()), *election);
+            }
+            annotate(change, *plugIn, [=, this] { annotateNext(annotating); });
+            return Walk::Stop;
+        },
+        annotating->next);
+    if (completed) finishAnnotating();
+}
+
+/// Changes of several plug-ins, and how far they have come.
+struct Transaction::BulkAnnotating {
+    const Dictionary& annotations;  // of the request
+    // A UUID can be spelt in many ways: of the entries for one plug-in only the last is applied,
+    // which would replace what those before it had set.
+    std::unordered_map<platform::Uuid, const Value*> lastOf{};
+    const Dictionary::Entry* next = annotations.begin();
+};
 
 void Transaction::bulkAnnotatePlugIns() {
     const Dictionary* annotations = requestedAnnotations();
@@ -104,13 +131,16 @@ void Transaction::bulkAnnotatePlugIns() {
     EVLOG_DEBUG(ops(), "bulk change requested for {} plug-ins", annotations->size());
     if (annotations->size() > platform::lum::kMaxListed)
         return fail(kZRErrorInvalidRequest, "invalid request format (bad annotations dictionary)");
-    // A UUID can be spelt in many ways: of the entries for one plug-in only the last is applied,
-    // which would replace what those before it had set.
-    std::unordered_map<platform::Uuid, const Value*> lastOf;
+    const auto annotating = std::make_shared<BulkAnnotating>(BulkAnnotating{*annotations});
     for (const auto& [key, value] : *annotations) {
-        if (auto uuid = platform::Uuid::parse(key)) lastOf[*uuid] = &value;
+        if (auto uuid = platform::Uuid::parse(key)) annotating->lastOf[*uuid] = &value;
     }
-    for (const auto& [key, value] : *annotations) {
+    bulkAnnotateNext(annotating);
+}
+
+void Transaction::bulkAnnotateNext(const std::shared_ptr<BulkAnnotating>& annotating) {
+    while (annotating->next != annotating->annotations.end()) {
+        const auto& [key, value] = *annotating->next++;
         if (!value.dictionary()) {
             return fail(kZRErrorAnnotation, "annotations values must be dictionaries");
         }
@@ -118,17 +148,14 @@ void Transaction::bulkAnnotatePlugIns() {
         if (!uuid) return fail(kZRErrorAnnotation, "invalid plug-in UUID value");
         auto plugIn = server().findPlugIn(*uuid);
         if (!plugIn) return fail(kZRErrorRegistration, "no plug-in with the requested uuid");
-        if (lastOf[*uuid] != &value) continue;
+        if (annotating->lastOf[*uuid] != &value) continue;
         const Dictionary change{{annotation::kExtension, value}};
-        if (!hasShareFor(change, *plugIn)) return;
-        if (!hasRoomFor(change, *plugIn)) return;
+        if (!hasShareFor(change, *plugIn) || !hasRoomFor(change, *plugIn)) return;
         EVLOG_DEBUG(ops(), "client {} bulk plug-in {}({}) annotation change: {}", client_->pid(),
                     plugIn->identifier(), pub(plugIn->uuid()), value);
-        annotate(change, *plugIn);
+        return annotate(change, *plugIn, [=, this] { bulkAnnotateNext(annotating); });
     }
-    syncAnnotations();
-    server().notifyAnnotationChange();
-    done();
+    finishAnnotating();
 }
 
 }  // namespace zorvan

@@ -101,14 +101,21 @@ void Transaction::dispatch() {
 void Transaction::lookAtBundles(std::vector<platform::PlaceLooks::Look> looks,
                                 std::function<void(const std::vector<bool>& done)> then) {
     if (looks.empty()) return then({});
+    const auto done = std::make_shared<std::vector<bool>>();
+    auto goOn = onServiceQueue([done, then = std::move(then)] { then(*done); });
     server().services().bundleLooks->make(
-        std::move(looks),
-        [self = shared_from_this(), then = std::move(then)](const std::vector<bool>& done) mutable {
-            ZRDServer& server = self->server();
-            // Handed on, so that nothing of the request goes on this thread.
-            server.submitWork(
-                [self = std::move(self), then = std::move(then), done] { then(done); });
+        std::move(looks), [done, goOn = std::move(goOn)](const std::vector<bool>& found) {
+            *done = found;
+            goOn();
         });
+}
+
+std::function<void()> Transaction::onServiceQueue(std::function<void()> then) {
+    return [self = shared_from_this(), then = std::move(then)]() mutable {
+        ZRDServer& server = self->server();
+        // Handed on, so that nothing of the request goes on the caller's thread.
+        server.submitWork([self = std::move(self), then = std::move(then)] { then(); });
+    };
 }
 
 const platform::Array* Transaction::requestedPaths() {
@@ -177,7 +184,7 @@ void Transaction::addAnnotationForPlugIn(const ZRDPlugIn& plugIn, Dictionary& in
 }
 
 void Transaction::done() {
-    syncAnnotations();
+    if (hasUnsyncedAnnotations_) return syncAnnotations([this] { done(); });
     if (probes::requestOutputEnabled()) {
         probes::requestOutput(client_->pid(), describe(reply_).c_str());
     }

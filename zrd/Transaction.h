@@ -71,6 +71,9 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     void lookAtBundles(std::vector<platform::PlaceLooks::Look> looks,
                        std::function<void(const std::vector<bool>& done)> then);
 
+    /// What goes on with the request on the service queue when it is called, once, by any thread.
+    std::function<void()> onServiceQueue(std::function<void()> then);
+
     /// Read when it is first asked for.
     const HostRestriction& hostRestriction();
     /// Whether the host may have a plug-in made ready; otherwise the failure has been sent.
@@ -93,10 +96,18 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     bool areIdle(const std::vector<std::shared_ptr<ZRDPlugIn>>& plugIns);
     void takeHold(HoldSubject subject);
 
-    /// Changes the plug-in's annotation for this client, and saves it without a sync.
-    void annotate(const platform::Dictionary& change, const ZRDPlugIn& plugIn);
-    /// What this request has changed is on the disk afterwards: before anybody is told of it.
-    void syncAnnotations();
+    // Annotations are changed one after another, and other requests are served while the file is
+    // replaced for each. The request goes on to its end, whether or not its client waits.
+    struct Annotating;
+    struct BulkAnnotating;
+    void annotateNext(const std::shared_ptr<Annotating>& annotating);
+    void bulkAnnotateNext(const std::shared_ptr<BulkAnnotating>& annotating);
+    /// Changes the plug-in's annotation for this client, and goes on when that is saved.
+    void annotate(const platform::Dictionary& change, const ZRDPlugIn& plugIn,
+                  std::function<void()> then);
+    /// Goes on when what this request has changed is on the disk: before anybody is told of it.
+    void syncAnnotations(std::function<void()> then);
+    void finishAnnotating();
     /// The request's "annotations"; null when they cannot be stored, and the failure has been sent.
     const platform::Dictionary* requestedAnnotations();
     /// Whether the store has room for a change; otherwise the failure has been sent.

@@ -69,13 +69,16 @@ struct PeerLooks::State : std::enable_shared_from_this<PeerLooks::State> {
 };
 
 void PeerLooks::State::begin(const JobRef& job) {
+    if (tryStart(job)) return;
     watch(job);
-    if (!tryStart(job)) lines[job->origin].push_back(job);
+    lines[job->origin].push_back(job);
 }
 
 bool PeerLooks::State::tryStart(const JobRef& job) {
     job->share = pool.draw(job->origin);
     if (!job->share) return false;
+    job->periodsWithoutStep = 0;
+    watch(job);
     bool isShort = false;
     {
         const std::lock_guard lock(mutex);

@@ -38,7 +38,7 @@ class PeerLooks {
     /// may be read: it may still run.
     using Outcome = std::function<void(bool isDone, std::size_t steps)>;
 
-    /// A look that has made no step for so long is given up.
+    /// A look that has made no step for so long is given up, and one that has not begun.
     static constexpr std::chrono::milliseconds kPatience{2000};
     static constexpr std::size_t kMostThreads = 32;
 

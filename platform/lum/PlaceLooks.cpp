@@ -1,19 +1,16 @@
 #include "platform/lum/PlaceLooks.h"
 
-#include <fcntl.h>
 #include <sys/sysmacros.h>
 
 #include <atomic>
-#include <cerrno>
 #include <compare>
 #include <functional>
 #include <map>
+#include <mutex>
 #include <set>
 #include <utility>
 
-#include "platform/system/FileIdentity.h"
-#include "platform/system/Files.h"
-#include "platform/system/OpenBeneath.h"
+#include "platform/system/MountTable.h"
 #include "platform/threads/RunLoop.h"
 
 namespace platform {
@@ -21,23 +18,6 @@ namespace platform {
 namespace {
 
 using Members = std::vector<std::size_t>;
-
-/// The file system that a look at a path would wait for: that of the nearest directory above which
-/// the kernel can find without asking. Mounts are always in its memory, so that is none above; but
-/// one that is only made when somebody comes is charged to what it will lie in.
-dev_t fileSystemOf(std::string path) {
-    // A mount that is made meanwhile, anywhere, makes one try fail.
-    constexpr int kMostAttempts = 8;
-    for (;; path = parentPath(path)) {
-        for (int attempt = 0; attempt < kMostAttempts; ++attempt) {
-            const auto found = openWithoutLinks(AT_FDCWD, path, O_PATH, Wait::Never);
-            const auto identity = found ? FileIdentity::ofOpen(found->get()) : std::nullopt;
-            if (identity) return identity->device;
-            if (!found && found.error().code != EAGAIN) break;
-        }
-        if (path.size() <= 1) return 0;
-    }
-}
 
 /// What was asked for at once.
 struct Round {
@@ -58,11 +38,12 @@ struct Neighbourhood {
     dev_t device = 0;
     std::string path;  // empty: all of the file system
 
-    static Neighbourhood of(const std::string& path) {
-        static const dev_t root = FileIdentity::at(AT_FDCWD, "/").device;
-        const dev_t device = fileSystemOf(path);
-        const bool isOwn = device == root || major(device) != 0;
-        return {device, isOwn ? path : std::string()};
+    static Neighbourhood of(const MountTable& mounts, const std::string& path) {
+        const auto* const mount = mounts.of(path);
+        const auto* const root = mounts.of("/");
+        if (!mount) return {0, path};
+        const bool isOwn = mount->device == root->device || major(mount->device) != 0;
+        return {mount->device, isOwn ? path : std::string()};
     }
     /// Others of the same hash only wait longer.
     Origin origin() const {
@@ -78,6 +59,7 @@ struct PlaceLooks::State : std::enable_shared_from_this<PlaceLooks::State> {
     State(RunLoop& runLoop, std::chrono::milliseconds time)
         : loop(runLoop), patience(time), looks(runLoop, time, 1) {}
 
+    std::map<Neighbourhood, Members> byNeighbourhood(const std::vector<Look>& all);
     void begin(const std::shared_ptr<Round>& round,
                const std::map<Neighbourhood, Members>& members);
     void look(const std::shared_ptr<Round>& round, const Neighbourhood& place,
@@ -87,6 +69,8 @@ struct PlaceLooks::State : std::enable_shared_from_this<PlaceLooks::State> {
     const std::chrono::milliseconds patience;
     std::set<Neighbourhood> silent;  // one that was given up still waits for these
     PeerLooks looks;
+    std::mutex mutex;
+    MountTable mounts;  // guarded by it
 };
 
 namespace {
@@ -96,11 +80,28 @@ struct Visit {
     ~Visit() {
         if (whenBack) whenBack();
     }
-    std::atomic<bool> hasBegun = false;
+    enum class Stage { Waiting, Begun, GivenUp };
+    /// Whether it goes from waiting to another stage: that is once, be it by the thread, which
+    /// begins, or by who gives it up, whose thread must not begin any more.
+    bool leaveWaiting(Stage next) {
+        Stage waiting = Stage::Waiting;
+        return stage.compare_exchange_strong(waiting, next);
+    }
+
+    std::atomic<Stage> stage = Stage::Waiting;
     std::function<void()> whenBack;
 };
 
 }  // namespace
+
+std::map<Neighbourhood, Members> PlaceLooks::State::byNeighbourhood(const std::vector<Look>& all) {
+    std::map<Neighbourhood, Members> members;
+    const std::lock_guard lock(mutex);
+    mounts.refresh();
+    for (std::size_t i = 0; i < all.size(); ++i)
+        members[Neighbourhood::of(mounts, all[i].path)].push_back(i);
+    return members;
+}
 
 void PlaceLooks::State::begin(const std::shared_ptr<Round>& round,
                               const std::map<Neighbourhood, Members>& members) {
@@ -117,7 +118,7 @@ void PlaceLooks::State::look(const std::shared_ptr<Round>& round, const Neighbou
     looks.look(
         place.origin(),
         [round, members, visit, time = patience](PeerLooks::Pace& pace) {
-            visit->hasBegun = true;
+            if (!visit->leaveWaiting(Visit::Stage::Begun)) return;
             // However well it gets on, those who wait behind it get their turn.
             const auto end = std::chrono::steady_clock::now() + time;
             for (const std::size_t index : members) {
@@ -129,7 +130,7 @@ void PlaceLooks::State::look(const std::shared_ptr<Round>& round, const Neighbou
         [this, round, members, place, weakVisit = std::weak_ptr(visit)](bool isDone,
                                                                         std::size_t steps) {
             const auto hung = isDone ? nullptr : weakVisit.lock();
-            if (hung && hung->hasBegun) {
+            if (hung && !hung->leaveWaiting(Visit::Stage::GivenUp)) {
                 silent.insert(place);
                 hung->whenBack = [weak = weak_from_this(), place] {
                     if (const auto self = weak.lock()) self->silent.erase(place);
@@ -150,12 +151,10 @@ void PlaceLooks::make(std::vector<Look> looks, Outcome outcome) {
     round->done.resize(looks.size());
     round->looks = std::move(looks);
     round->outcome = std::move(outcome);
-    std::map<Neighbourhood, Members> members;
-    for (std::size_t i = 0; i < round->looks.size(); ++i)
-        members[Neighbourhood::of(round->looks[i].path)].push_back(i);
-    state_->loop.post([weak = std::weak_ptr(state_), round, members = std::move(members)] {
-        if (const auto self = weak.lock()) self->begin(round, members);
-    });
+    state_->loop.post(
+        [weak = std::weak_ptr(state_), round, members = state_->byNeighbourhood(round->looks)] {
+            if (const auto self = weak.lock()) self->begin(round, members);
+        });
 }
 
 }  // namespace platform

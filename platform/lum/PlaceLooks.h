@@ -15,7 +15,8 @@ namespace platform {
 /// thread at a time, and while one that was given up still waits, nobody else waits for that file
 /// system. On the machine's own (that of "/", and those of block devices) this holds for each path:
 /// there it is something beneath the path that hangs. The looks at one are made one after another,
-/// and those that do not get their turn within the patience are not made.
+/// and those that do not get their turn within the patience are not made; one that gets it has all
+/// of the patience for itself.
 ///
 /// Its run loop must outlive it; it goes where the loop runs, or while it does not. Its end waits
 /// for the looks that run.

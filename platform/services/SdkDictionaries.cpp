@@ -21,21 +21,30 @@ std::vector<std::string> SdkDictionaries::candidateFiles(const std::string& name
 }
 
 Result<std::optional<Dictionary>> SdkDictionaries::copyExtensionSdkEntry(const std::string& name) {
-    const std::vector<std::string> candidates = candidateFiles(name);
-    const std::lock_guard lock(mutex_);
-    for (const std::string& path : candidates) {
+    for (const std::string& path : candidateFiles(name)) {
         const FileStamp stamp = FileStamp::of(path);
         if (stamp.isMissing()) continue;
-        DictionaryFile& file = entries_.try_emplace(name, path, "SDK dictionary").first->second;
-        if (file.path() != path) file = DictionaryFile(path, "SDK dictionary");
+        DictionaryFile file = known(name, path);
         const std::optional<Error> error = file.update(stamp);
-        if (!error) return file.dictionary();
+        const std::optional<Dictionary> dictionary = file.dictionary();
+        const std::lock_guard lock(mutex_);
+        entries_.insert_or_assign(name, std::move(file));
+        if (!error) return dictionary;
         if (isTransient(*error)) return *error;
         return std::optional<Dictionary>();
     }
     // Names without a file are not kept: there is no end of them.
+    const std::lock_guard lock(mutex_);
     entries_.erase(name);
     return std::optional<Dictionary>();
+}
+
+/// What is known of a file. It is read without the lock, for which others would wait.
+DictionaryFile SdkDictionaries::known(const std::string& name, const std::string& path) {
+    const std::lock_guard lock(mutex_);
+    const auto found = entries_.find(name);
+    const bool isKnown = found != entries_.end() && found->second.path() == path;
+    return isKnown ? found->second : DictionaryFile(path, "SDK dictionary");
 }
 
 void SdkDictionaries::clear() {

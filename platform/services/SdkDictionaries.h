@@ -31,6 +31,8 @@ class SdkDictionaries {
     void clear();
 
   private:
+    DictionaryFile known(const std::string& name, const std::string& path);
+
     std::vector<std::string> folders_;
     std::mutex mutex_;                               // guards entries_
     std::map<std::string, DictionaryFile> entries_;  // the file that counts, by name

@@ -22,8 +22,9 @@ bool isMissingFile(const Error& error) {
 }
 
 bool isTransient(const Error& error) {
-    return error.domain == "POSIX" && (error.code == EMFILE || error.code == ENFILE ||
-                                       error.code == ENOMEM || error.code == EIO);
+    return error.domain == "POSIX" &&
+           (error.code == EMFILE || error.code == ENFILE || error.code == ENOMEM ||
+            error.code == EIO || error.code == ETIMEDOUT);
 }
 
 }  // namespace platform

@@ -120,7 +120,7 @@ class TemporaryFile {
             if (count < 0) return errno;
             bytes.remove_prefix(static_cast<std::size_t>(count));
         }
-        return sync == Sync::No || ::fsync(fd_.get()) == 0 ? 0 : errno;
+        return sync != Sync::Yes || ::fsync(fd_.get()) == 0 ? 0 : errno;
     }
 
     int rename(const char* name) {
@@ -159,11 +159,29 @@ class TemporaryFile {
     UniqueFd fd_;
 };
 
+/// The name that a file keeps which was synced, once another one that is not has taken its place.
+std::string syncedName(std::string_view name) {
+    return temporaryPrefix(name) + "synced";
+}
+
+/// One that has the name already was synced later than all that took its place since.
+bool keepSynced(int dirfd, const char* name) {
+    return ::linkat(dirfd, name, dirfd, syncedName(name).c_str(), 0) == 0 || errno == EEXIST;
+}
+
+/// Makes the names in the directory of a file that is synced durable. 0 or the errno.
+int syncNames(int dirfd, std::string_view name) {
+    if (::fsync(dirfd) != 0) return errno;
+    ::unlinkat(dirfd, syncedName(name).c_str(), 0);
+    return 0;
+}
+
 int replaceIn(int dirfd, const char* name, std::string_view bytes, Sync sync) {
     struct stat existing {};
     bool exists = ::fstatat(dirfd, name, &existing, AT_SYMLINK_NOFOLLOW) == 0;
     if (!exists && errno != ENOENT) return errno;
     if (exists && !S_ISREG(existing.st_mode)) return EINVAL;
+    if (sync == Sync::Later && exists && !keepSynced(dirfd, name)) sync = Sync::Yes;
 
     TemporaryFile file(dirfd, name);
     int failure = file.create();
@@ -171,16 +189,22 @@ int replaceIn(int dirfd, const char* name, std::string_view bytes, Sync sync) {
     if (!failure) failure = file.write(bytes, sync);
     if (!failure) failure = file.rename(name);
     // The rename itself is durable only once the directory is.
-    if (!failure && sync == Sync::Yes && ::fsync(dirfd) != 0) failure = errno;
-    return failure;
+    return failure || sync != Sync::Yes ? failure : syncNames(dirfd, name);
 }
 
-/// Whether a file bears a temporary name, is this user's own, and nobody is writing it.
-bool isLeftover(int dirfd, const char* name) {
-    const UniqueFd fd(::openat(dirfd, name, kReading | O_NOFOLLOW));
+/// Opens a regular file of this user's own.
+UniqueFd openOwn(int dirfd, const char* name) {
+    UniqueFd fd(::openat(dirfd, name, kReading | O_NOFOLLOW));
     struct stat status {};
-    return fd && ::fstat(fd.get(), &status) == 0 && S_ISREG(status.st_mode) &&
-           status.st_uid == ::geteuid() && ::flock(fd.get(), LOCK_EX | LOCK_NB) == 0;
+    const bool isOwn = fd && ::fstat(fd.get(), &status) == 0 && S_ISREG(status.st_mode) &&
+                       status.st_uid == ::geteuid();
+    return isOwn ? std::move(fd) : UniqueFd();
+}
+
+/// Whether a file with a temporary name is this user's own, and nobody is writing it.
+bool isLeftover(int dirfd, const char* name) {
+    const UniqueFd fd = openOwn(dirfd, name);
+    return fd && ::flock(fd.get(), LOCK_EX | LOCK_NB) == 0;
 }
 
 std::string_view withoutTrailingSlashes(std::string_view path) {
@@ -226,11 +250,19 @@ std::optional<Error> writeFileAtomically(const std::string& path, std::string_vi
 std::optional<Error> syncFile(const std::string& path) {
     const auto target = followLinks(path);
     if (!target) return target.error();
-    for (const std::string& synced : {*target, std::string(parentPath(*target))}) {
-        const UniqueFd file(::open(synced.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
-        if (!file || ::fsync(file.get()) != 0) return Error::posix(errno, path);
-    }
-    return std::nullopt;
+    const UniqueFd file(::open(target->c_str(), kReading));
+    const UniqueFd directory(
+        ::open(std::string(parentPath(*target)).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!file || !directory || ::fsync(file.get()) != 0) return Error::posix(errno, path);
+    const int failure = syncNames(directory.get(), lastPathComponent(*target));
+    return failure ? std::optional(Error::posix(failure, path)) : std::nullopt;
+}
+
+std::optional<std::string> lastSyncedFile(const std::string& path) {
+    const auto target = followLinks(path);
+    if (hasNul(path) || !target) return std::nullopt;
+    std::string file = joinPath(parentPath(*target), syncedName(lastPathComponent(*target)));
+    return openOwn(AT_FDCWD, file.c_str()) ? std::optional(std::move(file)) : std::nullopt;
 }
 
 void removeLeftovers(const std::string& path) {

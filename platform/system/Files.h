@@ -29,13 +29,18 @@ Result<std::string> readFileBeneath(int dirfd, const std::string& name, std::siz
 /// gets mode 0600; an existing one keeps its mode. A symbolic link stays, and the file that it
 /// leads to is replaced. None on success. Errors: the system's; EINVAL when something other than a
 /// regular file is there. Without the sync, a crash of the machine (not of a process) may leave
-/// neither.
-enum class Sync { Yes, No };
+/// neither. Who syncs later, by `syncFile`, loses nothing in between: what was synced last keeps a
+/// name of its own until then (where a file cannot have two names, the sync is not put off).
+enum class Sync { Yes, No, Later };
 std::optional<Error> writeFileAtomically(const std::string& path, std::string_view bytes,
                                          Sync sync = Sync::Yes);
 
 /// Syncs the file at `path`, and the directory that it lies in: for who has replaced it without.
 std::optional<Error> syncFile(const std::string& path);
+
+/// The file, of this user's, that holds what was last synced at `path`, if a crash has come between
+/// a write that was to be synced later and that sync.
+std::optional<std::string> lastSyncedFile(const std::string& path);
 
 /// Removes what writing this very file has left beside it when it was interrupted by a crash.
 /// Nobody else's files are touched: such a file bears a name of ours that follows from the name at

@@ -35,12 +35,14 @@ bool isMissing(const Error& error) {
 
 ApplicationScanner::ApplicationScanner(RegistryState& state, BundleReader& reader,
                                        DataContainers& containers, FolderWatch& watch,
-                                       UntrustedPlaces& untrusted, Folders folders)
+                                       UntrustedPlaces& untrusted, ForeignPlaces& places,
+                                       Folders folders)
     : state_(state),
       reader_(reader),
       containers_(containers),
       watch_(watch),
       untrusted_(untrusted),
+      places_(places),
       folders_(std::move(folders)) {}
 
 bool ApplicationScanner::isApplication(std::string_view path) {
@@ -68,7 +70,7 @@ bool ApplicationScanner::isHeld(const std::string& path) {
 }
 
 void ApplicationScanner::begin(bool overEverything) {
-    ++pass_;
+    pass_ = ++state_.lastPass;
     metPlugIns_ = 0;
     isIncomplete_ = hasTransientFailure_ = false;
     unreachable_.clear();
@@ -149,6 +151,11 @@ bool ApplicationScanner::visitScope(const std::string& path) {
 
 void ApplicationScanner::visitAll() {
     for (const std::string& folder : folders_.dictionaries) {
+        if (!places_.answers(folder)) {
+            // Those who need it stay as they are.
+            hasTransientFailure_ = true;
+            continue;
+        }
         watch_.markWay(folder);
         if (std::optional<std::string> canonical = canonicalPath(folder))
             watch_.markContents(*canonical, {});

@@ -28,9 +28,11 @@ class ApplicationScanner {
     };
 
     /// Every directory that a walk looks into is marked in `watch`; bundles in untrusted places are
-    /// left out. All references must outlive this.
+    /// left out. What a walk gives to whom is to be stored by the caller. All references must
+    /// outlive this.
     ApplicationScanner(RegistryState& state, BundleReader& reader, DataContainers& containers,
-                       FolderWatch& watch, UntrustedPlaces& untrusted, Folders folders);
+                       FolderWatch& watch, UntrustedPlaces& untrusted, ForeignPlaces& places,
+                       Folders folders);
 
     /// Walks every application folder and everything that was registered by path.
     RegistryChanges scanAll();
@@ -46,9 +48,6 @@ class ApplicationScanner {
 
     /// The paths of plug-ins whose exchange for another directory the watch would not show at once.
     const std::set<std::string>& unwatched() const { return unwatched_; }
-
-    /// Where somebody else has to be waited for.
-    ForeignPlaces& places() { return places_; }
 
     /// Whether an application folder holds the plug-in or application at a path, so that a walk
     /// would find it by itself.
@@ -99,8 +98,8 @@ class ApplicationScanner {
     DataContainers& containers_;
     FolderWatch& watch_;
     UntrustedPlaces& untrusted_;
+    ForeignPlaces& places_;
     Folders folders_;
-    ForeignPlaces places_;
     Complaints complaints_;
     std::map<std::string, std::string> folderPaths_;  // canonical ones, when they were last seen
     std::set<std::string> links_;  // links to bundles since the last walk over everything, and

@@ -49,7 +49,7 @@ void ApplicationScanner::noteUnwatched(const std::string& scope) {
     forEachWithin(unwatched_, scope, [this](auto path) { unwatched_.erase(path); });
     std::string known;
     forEachWithin(state_.plugIns, scope, [&](auto entry) {
-        if (places_.answers(entry->first) && watch_.seesExchangeOf(entry->first, known))
+        if (places_.answersWithin(entry->first) && watch_.seesExchangeOf(entry->first, known))
             known = entry->first;
         else
             unwatched_.insert(entry->first);
@@ -65,7 +65,6 @@ RegistryChanges ApplicationScanner::finish(const Scopes& scopes) {
             if (entry.pass == 0) keep(entry);
     watch_.endWalk();
     for (const std::string& scope : scopes) noteUnwatched(scope);
-    containers_.saveOwners();
     return std::exchange(changes_, {});
 }
 
@@ -89,9 +88,9 @@ void ApplicationScanner::noteLost(const FolderEntries& found) {
     if (!found.unseen.empty()) isIncomplete_ = true;
 }
 
-/// Whether what lies at a path can be looked at; otherwise it has been kept as it was.
+/// Whether what lies at a path, and within, can be looked at; otherwise it has been kept as it was.
 bool ApplicationScanner::canSee(const std::string& path) {
-    const bool result = places_.answers(path);
+    const bool result = places_.answersWithin(path);
     if (!result) keepUnseen(path);
     return result;
 }

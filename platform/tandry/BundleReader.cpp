@@ -3,9 +3,12 @@
 #include <fcntl.h>
 #include <fmt/format.h>
 #include <openssl/evp.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
+#include <memory>
 
 #include "platform/log/OpsLog.h"
 #include "platform/plist/PropertyList.h"
@@ -81,14 +84,28 @@ Result<Dictionary> readDictionary(const BundleFolder& folder, const char* name) 
     return *dictionary;
 }
 
-/// A digest of what a file holds; empty when it cannot be read, or is too large for that.
-std::string digestOf(const BundleFolder& folder, const std::string& file) {
-    const Result<std::string> bytes = readFileBeneath(folder.dirfd, file, kMaxDigested);
+/// A digest of what a file holds; empty when it cannot be read, or is too large for that. `places`
+/// hears of each step: a slow server may take a while.
+std::string digestOf(const BundleFolder& folder, const std::string& file, ForeignPlaces& places) {
+    constexpr std::size_t kStep = 1u << 20;
+    const auto fd = openBeneath(folder.dirfd, file, O_RDONLY | O_NONBLOCK | O_NOCTTY);
+    struct stat status {};
+    if (!fd || ::fstat(fd->get(), &status) != 0 || !S_ISREG(status.st_mode)) return {};
+    const std::unique_ptr<EVP_MD_CTX, decltype(&EVP_MD_CTX_free)> context(EVP_MD_CTX_new(),
+                                                                          &EVP_MD_CTX_free);
+    EVP_DigestInit_ex(context.get(), EVP_sha256(), nullptr);
+    std::vector<char> bytes(kStep);
+    std::size_t total = 0;
+    for (ssize_t count = 1; count > 0; total += static_cast<std::size_t>(count)) {
+        places.step();
+        do count = ::read(fd->get(), bytes.data(), bytes.size());
+        while (count < 0 && errno == EINTR);
+        if (count < 0 || total + static_cast<std::size_t>(count) > kMaxDigested) return {};
+        EVP_DigestUpdate(context.get(), bytes.data(), static_cast<std::size_t>(count));
+    }
     std::string digest(EVP_MAX_MD_SIZE, '\0');
     unsigned size = 0;
-    if (bytes)
-        EVP_Digest(bytes->data(), bytes->size(), reinterpret_cast<unsigned char*>(digest.data()),
-                   &size, EVP_sha256(), nullptr);
+    EVP_DigestFinal_ex(context.get(), reinterpret_cast<unsigned char*>(digest.data()), &size);
     digest.resize(size);
     return digest;
 }
@@ -183,8 +200,8 @@ BundleFolder BundleFolder::reachedBy(int directory) const {
 }
 
 BundleReader::BundleReader(SdkDictionaries& sdks, SdkMerge merge,
-                           std::vector<std::string> languages)
-    : sdks_(sdks), merge_(std::move(merge)), languages_(std::move(languages)) {
+                           std::vector<std::string> languages, ForeignPlaces& places)
+    : sdks_(sdks), places_(places), merge_(std::move(merge)), languages_(std::move(languages)) {
     for (const std::string& language : languages_) languageText_.append(language).push_back('\0');
 }
 
@@ -250,7 +267,10 @@ const std::string& BundleReader::sdkStamps(const std::string& sdk) {
     auto [entry, isNew] = sdkStamps_.try_emplace(sdk);
     if (isNew)
         for (const std::string& file : sdks_.candidateFiles(sdk)) {
-            const FileStamp stamp = FileStamp::of(file);
+            // What cannot be looked at is said where it is read.
+            FileStamp stamp;
+            stamp.error = ETIMEDOUT;
+            if (places_.answers(file)) stamp = FileStamp::of(file);
             note(stamp);
             stamp.appendTo(entry->second);
         }
@@ -302,6 +322,8 @@ BundleReader::Reading BundleReader::readPlugIn(const BundleFolder& place, bool w
 
 std::optional<Error> BundleReader::complete(Dictionary& info, const std::string& sdk) {
     if (!sdk.empty()) {
+        for (const std::string& file : sdks_.candidateFiles(sdk))
+            if (!places_.answers(file)) return Error::posix(ETIMEDOUT, file);
         const Result<std::optional<Dictionary>> defaults = sdks_.copyExtensionSdkEntry(sdk);
         if (!defaults) return defaults.error();
         if (*defaults) info = merge_(**defaults, info);
@@ -352,7 +374,7 @@ std::optional<Error> BundleReader::fill(const BundleFolder& folder, PlugInEntry&
     appendNamedStamps(folder, entry.print, entry.print.stamps);
     if (executable &&
         (withDigest || !FileStamp::from(entry.print.stamps.substr(fixedSize)).settled))
-        entry.print.executableDigest = digestOf(folder, *executable);
+        entry.print.executableDigest = digestOf(folder, *executable, places_);
 
     if (std::optional<Error> error = complete(info, entry.print.sdk))
         return Error{error->domain, error->code, fmt::format("{}: {}", file, error->text)};

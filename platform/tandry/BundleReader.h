@@ -8,6 +8,7 @@
 #include "platform/services/SdkDictionaries.h"
 #include "platform/system/FileStamp.h"
 #include "platform/tandry/DiskWorkspace.h"
+#include "platform/tandry/ForeignPlaces.h"
 #include "platform/tandry/RegistryState.h"
 
 namespace platform::tandry {
@@ -48,7 +49,8 @@ class BundleReader {
         std::optional<Error> refusal;
     };
 
-    BundleReader(SdkDictionaries& sdks, SdkMerge merge, std::vector<std::string> languages);
+    BundleReader(SdkDictionaries& sdks, SdkMerge merge, std::vector<std::string> languages,
+                 ForeignPlaces& places);
 
     /// To be called before each walk: the stamps of SDK dictionaries are taken once a walk.
     void beginPass();
@@ -101,6 +103,7 @@ class BundleReader {
     Result<Dictionary> localizations(const BundleFolder& folder);
 
     SdkDictionaries& sdks_;
+    ForeignPlaces& places_;
     SdkMerge merge_;
     std::vector<std::string> languages_;
     std::string languageText_;  // each ended by a NUL

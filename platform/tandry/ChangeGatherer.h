@@ -18,6 +18,8 @@ struct WatchSettings {
     std::chrono::milliseconds longest{400};
     /// How often everything is looked at while something cannot be watched or read.
     std::chrono::milliseconds retry{30'000};
+    /// How long a walk waits for a mount of somebody else's.
+    std::chrono::milliseconds patience{2000};
     /// Most directories that are watched.
     std::size_t mostWatches = std::numeric_limits<std::size_t>::max();
 };

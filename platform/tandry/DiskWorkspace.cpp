@@ -1,7 +1,6 @@
 #include "platform/tandry/DiskWorkspace.h"
 
 #include <fmt/format.h>
-#include <sys/stat.h>
 
 #include <algorithm>
 #include <atomic>
@@ -12,29 +11,15 @@
 #include "platform/log/OpsLog.h"
 #include "platform/services/SdkDictionaries.h"
 #include "platform/system/Directories.h"
-#include "platform/system/Files.h"
-#include "platform/tandry/ApplicationScanner.h"
 #include "platform/tandry/Catalogue.h"
 #include "platform/tandry/CurrentSnapshot.h"
-#include "platform/tandry/FolderEntries.h"
-#include "platform/tandry/LocalizedNames.h"
+#include "platform/tandry/DiskWalks.h"
 #include "platform/threads/ProgrammingError.h"
 #include "platform/threads/SerialQueue.h"
 
 namespace platform::tandry {
 
 namespace {
-
-ApplicationScanner::Folders scannedFolders(const Directories& directories) {
-    ApplicationScanner::Folders folders;
-    auto add = [&folders](const std::string& data) {
-        folders.applications.push_back(data + "/Applications");
-        folders.dictionaries.push_back(data + "/SDKs");
-    };
-    add(directories.zorvanData());
-    for (const std::string& folder : directories.dataDirs) add(folder + "/zorvan");
-    return folders;
-}
 
 /// Tells of a change that is refused, and why.
 Error refused(const char* change, const std::string& path, const std::string& reason) {
@@ -85,32 +70,29 @@ class DiskWorkspace final : public Workspace {
     void published();
     void withdraw(const TDPlugInProxyList& plugIns);
     void announceGoing(const TDPlugInProxyList& plugIns);
-    bool lacksRoom() const;
+    bool lacksRoom();
     void makeContainers();
-    std::optional<Error> registerOnQueue(const std::string& bundlePath);
-    std::optional<Error> unregisterOnQueue(const std::string& bundlePath);
-    void dropApplications(const std::string& path, RegistryChanges& changes);
-    bool dropRegistrations(const std::string& path, RegistryChanges& changes);
-    bool forgetWithin(const std::string& path, RegistryChanges& changes);
+    template <class Result>
+    std::optional<Result> walk(std::function<Result(Disk&)> work);
+    void follow();
+    std::optional<Error> change(const std::string& bundlePath, const char* what,
+                                Disk::Outcome (Disk::*make)(const std::string&));
     std::optional<Error> apply(const RegistryChanges& changes);
+    Disk& disk() { return *walks_.disk(); }
 
     SdkDictionaries& sdks_;
     CurrentSnapshot current_;
-    std::mutex unwatchedMutex_;
-    std::shared_ptr<const UntouchedBundles::Paths> unwatched_;  // guarded by it
+    std::mutex watchMutex_;  // guards what lookups are told of the watch
+    std::shared_ptr<Disk> watched_;
+    std::shared_ptr<const UntouchedBundles::Paths> unwatched_;
     std::atomic<bool> closing_ = false;
 
     // Of the registry's thread:
     std::unique_ptr<Catalogue> catalogue_;
-    BundleReader reader_;
-    DataContainers containers_;
-    bool isScanned_ = false;
-    RegistryState state_;
-    std::shared_ptr<const Snapshot> published_;
-    FolderWatch watch_;
-    UntrustedPlaces untrusted_;
-    ApplicationScanner scanner_;
     const WatchSettings settings_;
+    DiskWalks walks_;
+    bool isScanned_ = false;
+    std::shared_ptr<const Snapshot> published_;
     std::unique_ptr<ChangeGatherer> gatherer_;  // from the first scan until the end
     std::vector<WorkspaceObserver*> observers_;
 
@@ -135,12 +117,13 @@ DiskWorkspace::DiskWorkspace(const Directories& directories, SdkDictionaries& sd
                              std::unique_ptr<Catalogue> catalogue, const WatchSettings& settings)
     : sdks_(sdks),
       catalogue_(std::move(catalogue)),
-      reader_(sdks, std::move(merge), userLanguages()),
-      containers_(directories.zorvanData()),
-      watch_(settings.mostWatches),
-      untrusted_(directories),
-      scanner_(state_, reader_, containers_, watch_, untrusted_, scannedFolders(directories)),
       settings_(settings),
+      walks_(
+          [=, &sdks, merge = std::move(merge)](RegistryState known) {
+              return std::make_shared<Disk>(directories, sdks, merge, settings.mostWatches,
+                                            std::move(known));
+          },
+          settings.patience),
       queue_("tandry") {}
 
 DiskWorkspace::~DiskWorkspace() {
@@ -168,50 +151,92 @@ void DiskWorkspace::activate() {
     queue_.async([this] { firstScan(); });
 }
 
+/// Has a walk made. None when it had to be given up: then nothing is known of a change that it has
+/// met, and everything has to be walked over.
+template <class Result>
+std::optional<Result> DiskWorkspace::walk(std::function<Result(Disk&)> work) {
+    const std::shared_ptr<Disk> before = walks_.disk();
+    std::optional<Result> result = walks_.walk(std::move(work));
+    if (result) {
+        disk().containers.saveOwners();
+        return result;
+    }
+    {
+        const std::lock_guard lock(watchMutex_);
+        watched_.reset();
+    }
+    if (!gatherer_) return result;
+    // It may be the one that has called.
+    queue_.async(
+        [before, gatherer = std::shared_ptr(std::move(gatherer_))]() mutable { gatherer.reset(); });
+    follow();
+    return result;
+}
+
+void DiskWorkspace::follow() {
+    gatherer_ =
+        std::make_unique<ChangeGatherer>(queue_.runLoop(), disk().watch, settings_,
+                                         [this](const Scopes& touched) { rescan(touched); });
+}
+
 void DiskWorkspace::firstScan() {
     queue_.assertCurrent();
     if (closing_ || std::exchange(isScanned_, true)) return;
-    containers_.beginWalk();
-    // Filled in place: the scanner refers to the state.
-    state_ = catalogue_->load();
-    // Marking every directory takes time, and lookups wait: it is left to a second walk, which
-    // finds what has changed since the first.
-    watch_.setPostponed(true);
-    RegistryChanges changes = scanner_.scanAll();
-    watch_.setPostponed(false);
-    EVLOG_INFO(ops(), "{} plug-ins in {} applications, {} new, {} gone", state_.plugIns.size(),
-               state_.applications.size(), changes.installed.size(), changes.uninstalled.size());
-    if (!changes.records()) publish(changes);
-    gatherer_ = std::make_unique<ChangeGatherer>(
-        queue_.runLoop(), watch_, settings_, [this](const Scopes& touched) { rescan(touched); });
+    std::optional<RegistryChanges> changes;
+    while (!changes) {
+        if (closing_) return;
+        disk().containers.beginWalk();
+        // Read anew for each try: what nobody has seen, a walk may complete in place.
+        disk().state = catalogue_->load();
+        // Marking every directory takes time, and lookups wait: it is left to a second walk, which
+        // finds what has changed since the first.
+        changes = walk<RegistryChanges>([](Disk& disk) {
+            disk.watch.setPostponed(true);
+            RegistryChanges found = disk.scanner.scanAll();
+            disk.watch.setPostponed(false);
+            return found;
+        });
+    }
+    EVLOG_INFO(ops(), "{} plug-ins in {} applications, {} new, {} gone",
+               disk().state.plugIns.size(), disk().state.applications.size(),
+               changes->installed.size(), changes->uninstalled.size());
+    if (!changes->records()) publish(*changes);
+    follow();
     // The catalogue has told of a failure, and nobody waits for an answer.
-    static_cast<void>(apply(changes));
+    static_cast<void>(apply(*changes));
     queue_.async([this] { rescan({std::string()}); });
 }
 
+/// A walk that is given up is followed by one that leaves alone what it has waited for.
 void DiskWorkspace::rescan(const Scopes& touched) {
     queue_.assertCurrent();
-    if (closing_) return;
-    RegistryChanges changes = scanner_.scanTouched(touched);
-    if (changes.records() || changes.lists()) return static_cast<void>(apply(changes));
-    gatherer_->walkEnded(scanner_.isComplete());
+    std::optional<RegistryChanges> changes;
+    for (Scopes scopes = touched; !changes; scopes = {std::string()}) {
+        if (closing_) return;
+        changes = walk<RegistryChanges>(
+            [scopes](Disk& disk) { return disk.scanner.scanTouched(scopes); });
+    }
+    if (changes->records() || changes->lists()) return static_cast<void>(apply(*changes));
+    gatherer_->walkEnded(disk().scanner.isComplete());
     published();
     makeContainers();
 }
 
 /// Lookups see the state; nobody has seen anything before the first time.
 void DiskWorkspace::publish(const RegistryChanges& changes) {
-    published_ = published_ ? std::make_shared<const Snapshot>(*published_, state_, changes)
-                            : std::make_shared<const Snapshot>(state_);
+    published_ = published_ ? std::make_shared<const Snapshot>(*published_, disk().state, changes)
+                            : std::make_shared<const Snapshot>(disk().state);
     current_.publish(published_);
 }
 
 /// What the last walk found is there for all to see.
 void DiskWorkspace::published() {
-    auto unwatched = std::make_shared<const UntouchedBundles::Paths>(scanner_.unwatched());
+    auto unwatched = std::make_shared<const UntouchedBundles::Paths>(disk().scanner.unwatched());
+    auto watched = walks_.disk();
     {
-        const std::lock_guard lock(unwatchedMutex_);
+        const std::lock_guard lock(watchMutex_);
         unwatched_.swap(unwatched);
+        watched_.swap(watched);
     }
     gatherer_->published();
 }
@@ -219,8 +244,8 @@ void DiskWorkspace::published() {
 /// Asked in this order, and records looked up afterwards: when the watch is quiet, both the
 /// exceptions and the records are at least as new as what it has seen.
 UntouchedBundles DiskWorkspace::untouchedBundles() {
-    if (!watch_.isQuiet()) return {};
-    const std::lock_guard lock(unwatchedMutex_);
+    const std::lock_guard lock(watchMutex_);
+    if (!watched_ || !watched_->watch.isQuiet()) return {};
     return UntouchedBundles(unwatched_);
 }
 
@@ -239,18 +264,18 @@ void DiskWorkspace::announceGoing(const TDPlugInProxyList& plugIns) {
     for (WorkspaceObserver* observer : observers_) observer->pluginsWillUninstall(plugIns);
 }
 
-bool DiskWorkspace::lacksRoom() const {
-    return std::ranges::any_of(state_.refusals,
+bool DiskWorkspace::lacksRoom() {
+    return std::ranges::any_of(disk().state.refusals,
                                [](const auto& entry) { return entry.second.size != 0; });
 }
 
 /// Makes the containers that the last walk found missing. Where that fails, records that say so
 /// take the places of those that were published.
 void DiskWorkspace::makeContainers() {
-    const std::set<std::string> impossible = containers_.makeMissing();
+    const std::set<std::string> impossible = disk().containers.makeMissing();
     if (impossible.empty()) return;
     RegistryChanges changes;
-    for (auto& [path, entry] : state_.plugIns) {
+    for (auto& [path, entry] : disk().state.plugIns) {
         const TDPlugInProxyRef before = entry.record;
         if (!before->dataContainerPath || !impossible.contains(*before->dataContainerPath))
             continue;
@@ -271,17 +296,17 @@ void DiskWorkspace::makeContainers() {
 std::optional<Error> DiskWorkspace::apply(const RegistryChanges& changes) {
     // What had no room may find it where something went.
     const bool mayFit = !changes.uninstalled.empty() && lacksRoom();
-    gatherer_->walkEnded(scanner_.isComplete() && !mayFit);
+    gatherer_->walkEnded(disk().scanner.isComplete() && !mayFit);
     // Those that go, then those that others replace.
     TDPlugInProxyList going = changes.uninstalled;
     const auto replaced =
         std::stable_partition(going.begin(), going.end(), [this](const auto& record) {
-            return published_ && !state_.plugIns.contains(record->bundlePath.value_or(""));
+            return published_ && !disk().state.plugIns.contains(record->bundlePath.value_or(""));
         });
     const TDPlugInProxyList later(replaced, going.end());
     going.erase(replaced, going.end());
     withdraw(going);
-    std::optional<Error> error = catalogue_->save(state_, changes);
+    std::optional<Error> error = catalogue_->save(disk().state, changes);
     if (changes.records()) publish(changes);
     published();
     announceGoing(later);
@@ -333,104 +358,28 @@ std::optional<Error> DiskWorkspace::afterFirstScan(
 std::optional<Error> DiskWorkspace::registerPlugIn(const std::string& bundlePath,
                                                    Requester requester) {
     if (requester == Requester::Confined) return refused("register", bundlePath, kConfined);
-    return afterFirstScan([&] { return registerOnQueue(bundlePath); });
+    return afterFirstScan([&] { return change(bundlePath, "register", &Disk::registerBundle); });
 }
 
 std::optional<Error> DiskWorkspace::unregisterPlugIn(const std::string& bundlePath,
                                                      Requester requester) {
     if (requester == Requester::Confined) return refused("unregister", bundlePath, kConfined);
-    return afterFirstScan([&] { return unregisterOnQueue(bundlePath); });
+    return afterFirstScan(
+        [&] { return change(bundlePath, "unregister", &Disk::unregisterBundle); });
 }
 
-std::optional<Error> DiskWorkspace::registerOnQueue(const std::string& bundlePath) {
-    scanner_.places().beginWalk();
-    if (!scanner_.places().answers(bundlePath)) return Error::posix(ETIMEDOUT, bundlePath);
-    std::optional<std::string> canonical = canonicalPath(bundlePath);
-    struct stat status;
-    if (!canonical || ::stat(canonical->c_str(), &status) != 0)
-        return Error::posix(ENOENT, bundlePath);
-    if (!S_ISDIR(status.st_mode)) return Error::posix(ENOTDIR, bundlePath);
-    if (!isUsablePath(*canonical)) return Error::posix(EILSEQ, bundlePath);
-
-    const std::string& path = *canonical;
-    untrusted_.beginWalk();
-    if (const char* place = untrusted_.around(path))
-        return refused("register", path, fmt::format("it lies in {}", place));
-    const bool isNew = !scanner_.isHeld(path) && state_.registrations.insert(path).second;
-    std::map<std::string, Forgotten> forgotten;
-    forEachWithin(state_.forgotten, path,
-                  [&](auto entry) { forgotten.insert(state_.forgotten.extract(entry)); });
-    bool hasPlugIns = false;
-    RegistryChanges changes = scanner_.scanPath(path, hasPlugIns);
-    if (hasPlugIns) {
-        for (const auto& [inside, entry] : forgotten) changes.forgotten.insert(inside);
-        if (isNew) changes.registrations.insert(path);
-    } else {
-        state_.forgotten.merge(forgotten);
-        if (isNew) state_.registrations.erase(path);
-        if (isNew) dropApplications(path, changes);
+/// Has a path registered or unregistered, and waits for the walk that this takes.
+std::optional<Error> DiskWorkspace::change(const std::string& bundlePath, const char* what,
+                                           Disk::Outcome (Disk::*make)(const std::string&)) {
+    const auto outcome = walk<Disk::Outcome>([=](Disk& disk) { return (disk.*make)(bundlePath); });
+    if (!outcome) {
+        rescan({std::string()});
+        return Error::posix(ETIMEDOUT, bundlePath);
     }
-    std::optional<Error> error = apply(changes);
-    if (hasPlugIns) return error;
-    if (!changes.refusal.empty()) return Error{"Registry", 0, changes.refusal};
-    return Error{"Registry", 0, fmt::format("{}: no plug-ins in this application", path)};
-}
-
-/// Takes the plug-ins within a path out of the state; walks leave them out as they are now.
-bool DiskWorkspace::forgetWithin(const std::string& path, RegistryChanges& changes) {
-    reader_.beginPass();
-    scanner_.places().beginWalk();
-    forEachWithin(state_.plugIns, path, [&](auto entry) {
-        changes.uninstalled.push_back(entry->second.record);
-        const Fingerprint& known = entry->second.print;
-        const bool isThere = scanner_.places().answers(entry->first);
-        state_.forgotten[entry->first] = {
-            isThere ? reader_.toRemember(BundleFolder(entry->first), known) : known};
-        changes.forgotten.insert(entry->first);
-        state_.plugIns.erase(entry);
-    });
-    return !changes.uninstalled.empty();
-}
-
-/// Drops the applications that no walk would find.
-void DiskWorkspace::dropApplications(const std::string& path, RegistryChanges& changes) {
-    if (scanner_.isHeld(path)) return;
-    forEachWithin(state_.applications, path, [&](auto entry) {
-        bool hasPlugIns = false;
-        forEachWithin(state_.plugIns, entry->first, [&](auto) { hasPlugIns = true; });
-        if (hasPlugIns) return;
-        changes.applications.insert(entry->first);
-        state_.applications.erase(entry);
-    });
-}
-
-/// Drops the registrations of a path and of the plug-ins inside; answers whether there were any.
-bool DiskWorkspace::dropRegistrations(const std::string& path, RegistryChanges& changes) {
-    return std::erase_if(state_.registrations, [&](const std::string& registered) {
-               if (!isWithin(registered, path)) return false;
-               changes.registrations.insert(registered);
-               return true;
-           }) != 0;
-}
-
-std::optional<Error> DiskWorkspace::unregisterOnQueue(const std::string& bundlePath) {
-    RegistryChanges changes;
-    // Only what a path names goes, never what merely lies below some directory.
-    const bool isKnown = state_.plugIns.contains(bundlePath) ||
-                         state_.applications.contains(bundlePath) ||
-                         state_.registrations.contains(bundlePath);
-    const bool wasRegistered = isKnown && dropRegistrations(bundlePath, changes);
-    const bool hadPlugIns = isKnown && forgetWithin(bundlePath, changes);
-    if (!wasRegistered && !hadPlugIns)
-        return Error{"Registry", 0, fmt::format("{}: nothing is registered there", bundlePath)};
-    if (!hadPlugIns) {
-        // Links may have led from there to plug-ins elsewhere.
-        RegistryChanges walk = scanner_.scanAll();
-        walk.registrations.merge(changes.registrations);
-        changes = std::move(walk);
-    }
-    dropApplications(bundlePath, changes);
-    return apply(changes);
+    if (outcome->isRefused) return refused(what, outcome->error->domain, outcome->error->text);
+    if (!outcome->changes) return outcome->error;
+    std::optional<Error> error = apply(*outcome->changes);
+    return outcome->error ? outcome->error : error;
 }
 
 }  // namespace

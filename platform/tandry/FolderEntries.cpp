@@ -35,20 +35,19 @@ void add(FolderEntries& found, const std::filesystem::path& folder, const dirent
         return;
     std::string path = joinPath(folder.native(), entry.d_name);
     std::string target;
+    std::string unseen;
+    if (entry.d_type != DT_DIR && !places.answers(path, &unseen)) {
+        found.unseen.push_back(std::move(unseen));
+        return;
+    }
     if (isLink(found.directory(), entry)) {
-        std::error_code failure;
-        const auto link = std::filesystem::read_symlink(path, failure);
-        const std::string named = (folder / link).lexically_normal().string();
-        if (!failure && !places.answers(named)) {
-            found.unseen.push_back(named);
-            return;
-        }
         watch.markWay(path);
         std::optional<std::string> canonical = canonicalPath(path);
         if (!canonical) {
             complaints.add(path, "skipping", path + ": a link that cannot be resolved");
             std::error_code ignored;
-            const auto missing = std::filesystem::weakly_canonical(folder / link, ignored);
+            const auto missing = std::filesystem::weakly_canonical(
+                folder / std::filesystem::read_symlink(path, ignored), ignored);
             found.nowhere.push_back(missing.string());
             return;
         }

@@ -1,20 +1,12 @@
 #include "platform/tandry/ForeignPlaces.h"
 
-#include <dirent.h>
-#include <fcntl.h>
-
 #include <algorithm>
 #include <array>
-#include <fstream>
-#include <future>
-#include <sstream>
+#include <filesystem>
 #include <string_view>
 #include <utility>
 
 #include "platform/system/Files.h"
-#include "platform/system/UniqueFd.h"
-#include "platform/tandry/BundleReader.h"
-#include "platform/tandry/RegistryState.h"
 
 namespace platform::tandry {
 
@@ -24,93 +16,115 @@ namespace {
 constexpr std::array<std::string_view, 14> kOwn{"ext2", "ext3",  "ext4",  "xfs",     "btrfs",
                                                 "f2fs", "tmpfs", "ramfs", "overlay", "squashfs",
                                                 "vfat", "erofs", "zfs",   "bcachefs"};
+constexpr int kMostLinks = 40;
 
-/// The text of a field of the table of mounts, in which odd characters stand as "\ooo".
-std::string unescaped(std::string_view field) {
-    std::string text;
-    for (std::size_t i = 0; i < field.size(); ++i) {
-        const std::string_view digits = field.substr(i + 1, 3);
-        const bool isEscape =
-            field[i] == '\\' && digits.size() == 3 &&
-            std::ranges::all_of(digits, [](char c) { return c >= '0' && c <= '7'; });
-        if (isEscape) {
-            text += static_cast<char>((digits[0] - '0') << 6 | (digits[1] - '0') << 3 |
-                                      (digits[2] - '0'));
-            i += 3;
-        } else {
-            text += field[i];
-        }
-    }
-    return text;
+bool isForeign(const MountTable::Mount* mount) {
+    // Without the root nothing goes on anyhow.
+    return mount && mount->place != "/" && std::ranges::find(kOwn, mount->type) == kOwn.end();
 }
 
-/// Looks at what a walk would look at first.
-void look(const std::string& path) {
-    for (const std::string& place : {path, joinPath(path, "PlugIns")})
-        if (DIR* directory = ::opendir(place.c_str())) {
-            static_cast<void>(::readdir(directory));
-            ::closedir(directory);
-        }
-    const UniqueFd bundle(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-    if (bundle) static_cast<void>(readFileBeneath(bundle.get(), "Info.plist", kMaxBundleFile));
+/// Takes the first component off a path.
+std::string takeComponent(std::string& path) {
+    path.erase(0, path.find_first_not_of('/'));
+    std::string component = path.substr(0, path.find('/'));
+    path.erase(0, component.size());
+    return component;
 }
 
 }  // namespace
 
-ForeignPlaces::~ForeignPlaces() {
-    if (!queue_) return;
-    queue_->async([this] { looks_.reset(); });
-    queue_.reset();
-}
-
 void ForeignPlaces::beginWalk() {
-    answers_.clear();
-    std::ifstream table("/proc/self/mountinfo");
-    if (!table) return;  // what was known serves as well
-    mounts_.clear();
-    foreign_.clear();
-    for (std::string line; std::getline(table, line);) {
-        // id, parent, device, root, place, options, any number of fields, "-", type, ...
-        std::istringstream fields(line);
-        std::string field, place, type;
-        for (int i = 0; i < 4; ++i) fields >> field;
-        fields >> place;
-        while (fields >> field && field != "-") continue;
-        if (!(fields >> type)) continue;
-        place = unescaped(place);
-        // Without the root nothing goes on anyhow.
-        const bool isForeign = place != "/" && std::ranges::find(kOwn, type) == kOwn.end();
-        if (isForeign) foreign_.push_back(place);
-        // Of two at one place, the later one covers the other.
-        mounts_[std::move(place)] = isForeign;
+    mounts_.refresh();
+    known_.clear();
+}
+
+bool ForeignPlaces::isAvoided(const std::string& path) const {
+    const auto* const mount = avoided_.empty() ? nullptr : mounts_.of(path);
+    return mount && avoided_.contains(mount->id);
+}
+
+bool ForeignPlaces::answers(const std::string& path, std::string* unseen) {
+    std::string way = "/", rest = path;
+    for (std::string_view above = parentPath(path); above.size() > 1; above = parentPath(above))
+        if (known_.contains(std::string(above))) {
+            way = above;
+            rest = path.substr(above.size());
+            break;
+        }
+    std::vector<std::string> places;
+    std::string name = takeComponent(rest);
+    for (; !name.empty(); name = takeComponent(rest)) {
+        if (name == ".") continue;
+        if (name == "..") {
+            way = parentPath(way);
+            continue;
+        }
+        const std::string next = joinPath(way, name);
+        if (isAvoided(next)) {
+            if (unseen) *unseen = next + rest;
+            return false;
+        }
+        places.push_back(next);
+        noteAt(places);
+        std::error_code failure;
+        const std::filesystem::path target = std::filesystem::read_symlink(next, failure);
+        if (failure) {
+            if (!rest.empty() && failure == std::errc::invalid_argument) known_.insert(next);
+            places.pop_back();
+            way = next;
+            continue;
+        }
+        if (places.size() > kMostLinks) break;  // whoever looks finds that out
+        if (target.is_absolute()) way.assign(1, '/');
+        rest.insert(0, '/' + target.string());
     }
+    places.push_back(way);
+    noteAt(std::move(places));
+    return true;
 }
 
-bool ForeignPlaces::isForeign(const std::string& path) const {
-    if (std::ranges::none_of(foreign_, [&](const auto& place) { return isWithin(path, place); }))
-        return false;
-    // Something else may be mounted there again.
-    for (std::string_view place = path; place.size() > 1; place = parentPath(place))
-        if (const auto found = mounts_.find(place); found != mounts_.end()) return found->second;
-    return false;
+bool ForeignPlaces::answersWithin(const std::string& path) {
+    if (!answers(path)) return false;
+    if (avoided_.empty()) return true;
+    const auto inside = mounts_.within(path);
+    return std::ranges::none_of(inside,
+                                [this](const auto* mount) { return avoided_.contains(mount->id); });
 }
 
-bool ForeignPlaces::answers(const std::string& path) {
-    if (!isForeign(path)) return true;
-    const auto [answer, isNew] = answers_.try_emplace(path, false);
-    if (isNew) answer->second = ask(path);
-    return answer->second;
+void ForeignPlaces::noteAt(std::vector<std::string> places) {
+    const std::lock_guard lock(mutex_);
+    if (isGivenUp_) throw GivenUp();
+    if (!places.empty()) places_ = std::move(places);
+    ++steps_;
 }
 
-bool ForeignPlaces::ask(const std::string& path) {
-    if (!queue_) {
-        queue_ = std::make_unique<SerialQueue>("places");
-        looks_ = std::make_unique<PlaceLooks>(queue_->runLoop());
-    }
-    const auto answer = std::make_shared<std::promise<bool>>();
-    looks_->make({{path, [path] { look(path); }}},
-                 [answer](const std::vector<bool>& done) { answer->set_value(done[0]); });
-    return answer->get_future().get();
+std::uint64_t ForeignPlaces::steps() const {
+    const std::lock_guard lock(mutex_);
+    return steps_;
+}
+
+std::string ForeignPlaces::place() const {
+    const std::lock_guard lock(mutex_);
+    return places_.empty() ? std::string() : places_.back();
+}
+
+/// Of those on the way, or else of those that lie within what the walk looks into.
+std::set<int> ForeignPlaces::awaited() const {
+    MountTable mounts;
+    mounts.refresh();
+    std::set<int> found;
+    const std::lock_guard lock(mutex_);
+    for (const std::string& place : places_)
+        if (const auto* mount = mounts.of(place); isForeign(mount)) found.insert(mount->id);
+    if (!found.empty() || places_.empty()) return found;
+    for (const auto* mount : mounts.within(places_.back()))
+        if (isForeign(mount)) found.insert(mount->id);
+    return found;
+}
+
+void ForeignPlaces::giveUp() {
+    const std::lock_guard lock(mutex_);
+    isGivenUp_ = true;
 }
 
 }  // namespace platform::tandry

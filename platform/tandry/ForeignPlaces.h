@@ -1,44 +1,57 @@
 #pragma once
 
-#include <map>
-#include <memory>
+#include <cstdint>
+#include <mutex>
+#include <set>
 #include <string>
-#include <string_view>
+#include <unordered_set>
 #include <vector>
 
-#include "platform/lum/PlaceLooks.h"
-#include "platform/threads/SerialQueue.h"
+#include "platform/system/MountTable.h"
 
 namespace platform::tandry {
 
-/// Which places on disk can be looked at without waiting for somebody else: a server may be away,
-/// and the program behind a mount of a user's own may do what it likes. Before a walk looks at such
-/// a place it has a thread see whether it answers. Belongs to the registry's thread.
+/// Where a walk over the disk may have to wait for somebody else: a server may be away, and the
+/// program behind a mount of a user's own may do what it likes. Mounts that an earlier walk still
+/// waits for are left alone, whichever links lead there, and who waits for this walk can tell where
+/// it is. Belongs to the walk's thread, but for the last operations.
 class ForeignPlaces {
   public:
-    ForeignPlaces() = default;
-    ForeignPlaces(const ForeignPlaces&) = delete;
-    /// Waits for the threads that wait for an answer.
-    ~ForeignPlaces();
+    /// Thrown in a walk that has been given up: it ends where it is.
+    struct GivenUp {};
 
     /// To be called before each walk, and before the first question: learns what is mounted where.
-    /// Each place is asked once a walk.
     void beginWalk();
+    /// From now on these mounts, by their ids, are left alone.
+    void avoid(std::set<int> mounts) { avoided_ = std::move(mounts); }
 
-    /// Whether what lies at a path can be looked at: at once when its file system is the kernel's
-    /// own, otherwise when it has answered in time.
-    bool answers(const std::string& path);
+    /// Whether what a path leads to can be looked at. Otherwise `unseen` says where that lies. To
+    /// be called before each look at something else.
+    bool answers(const std::string& path, std::string* unseen = nullptr);
+    /// The same for a path and all that lies within.
+    bool answersWithin(const std::string& path);
+    /// The walk gets on.
+    void step() { noteAt({}); }
+
+    std::uint64_t steps() const;
+    /// Where the walk is.
+    std::string place() const;
+    /// The mounts that the walk may be waiting for, but for the kernel's own.
+    std::set<int> awaited() const;
+    void giveUp();
 
   private:
-    bool isForeign(const std::string& path) const;
-    bool ask(const std::string& path);
+    bool isAvoided(const std::string& path) const;
+    void noteAt(std::vector<std::string> places);
 
-    std::map<std::string, bool, std::less<>> mounts_;  // by place: whether they are foreign
-    std::vector<std::string> foreign_;                 // places of those that are
-    std::map<std::string, bool> answers_;              // of this walk
-    // From the first question on:
-    std::unique_ptr<SerialQueue> queue_;
-    std::unique_ptr<PlaceLooks> looks_;  // the queue's
+    MountTable mounts_;
+    std::set<int> avoided_;
+    std::unordered_set<std::string> known_;  // directories on which no link lies, in this walk
+
+    mutable std::mutex mutex_;         // guards what follows
+    std::vector<std::string> places_;  // where the walk is, and links by which it has come there
+    std::uint64_t steps_ = 0;
+    bool isGivenUp_ = false;
 };
 
 }  // namespace platform::tandry

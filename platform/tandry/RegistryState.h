@@ -72,6 +72,7 @@ struct RegistryState {
     std::set<std::string> registrations;  // paths of plug-ins and applications registered by path
     std::map<std::string, Forgotten> forgotten;
     std::map<std::string, Refusal> refusals;
+    Pass lastPass = 0;  // of the last walk
 };
 
 /// How the state differs from before. A changed plug-in is in both lists, under two UUIDs.

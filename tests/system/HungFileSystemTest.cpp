@@ -1,17 +1,12 @@
 // A file system that does not answer, which everybody can have who mounts one of his own.
 
-#include <fcntl.h>
-#include <sched.h>
-#include <sys/mount.h>
-#include <unistd.h>
-
 #include <cerrno>
 #include <csignal>
 #include <filesystem>
 #include <thread>
 
 #include "Zorvan/ZRPlugInProcess.h"
-#include "platform/system/UniqueFd.h"
+#include "tests/support/HungMount.h"
 #include "tests/system/SystemTest.h"
 
 namespace test {
@@ -25,29 +20,18 @@ class HungFileSystem : public SystemTest {
   protected:
     void SetUp() override {
         home_.makeDirectory("hung");
-        if (::geteuid() != 0 || ::access("/dev/fuse", R_OK | W_OK) != 0)
-            GTEST_SKIP() << "only root mounts what does not answer";
-        // Others look at the mounts as well.
-        if (::unshare(CLONE_NEWNS) != 0 ||
-            ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0)
-            GTEST_SKIP() << "no mount namespaces";
+        if (!HungMount::isPossible()) GTEST_SKIP() << "only root mounts what does not answer";
         writePlugIn(plugInPath("A", "steady"), info("steady"));
         start();
     }
     void TearDown() override {
         // Also the end of the daemon waits for nobody.
         if (zrd_) stop(SIGTERM);
-        fuse_.reset();  // those who wait for an answer get an error
-        ::umount2(hung_.c_str(), MNT_DETACH);
+        mount_.end();
         SystemTest::TearDown();
     }
     /// From now on whoever looks beneath it waits.
-    void hang() {
-        fuse_.reset(::open("/dev/fuse", O_RDWR | O_CLOEXEC));
-        const std::string options =
-            "rootmode=40000,user_id=0,group_id=0,fd=" + std::to_string(fuse_.get());
-        ASSERT_EQ(::mount("hung", hung_.c_str(), "fuse", MS_NOSUID | MS_NODEV, options.c_str()), 0);
-    }
+    void hang() { ASSERT_TRUE(mount_.begin(hung_)); }
     static void expectQuick(const std::function<void()>& work) {
         const auto start = std::chrono::steady_clock::now();
         work();
@@ -59,7 +43,7 @@ class HungFileSystem : public SystemTest {
     }
 
     const std::string hung_ = home_.path("hung");
-    platform::UniqueFd fuse_;
+    HungMount mount_;
 };
 
 TEST_F(HungFileSystem, APathOnItHoldsUpItsSenderAlone) {
@@ -139,8 +123,7 @@ TEST_F(HungFileSystem, ARegisteredBundleOnItHoldsUpWhoAsksForItAlone) {
     start();
     EXPECT_THAT(match(), ElementsAre("far 1", "steady 1"));
     expectQuick([&] { EXPECT_EQ(add({home_.path(plugInPath("A", "steady"))}), ""); });
-    fuse_.reset();
-    ASSERT_EQ(::umount2(hung_.c_str(), MNT_DETACH), 0);
+    mount_.end();
     EXPECT_TRUE(waitUntil([&] { return ready(uuid).empty(); }));
     for (const Dictionary& form : forms())
         EXPECT_TRUE(form.find("extensions")->dictionary()->contains("."));
@@ -194,7 +177,7 @@ TEST_F(HungFileSystem, APlugInOnItHoldsUpWhoStartsItAlone) {
     starting.send(request);
     for (int i = 0; i < 20; ++i) expectService();
     EXPECT_THAT(starting.receive(), HasSubstr(bundle + ": Connection timed out"));
-    EXPECT_EQ(zrd_->errLines("cannot start " + bundle), 1u);
+    EXPECT_EQ(zrd_->errLines("cannot start " + bundle), 1u) << zrd_->err();
     starting.send(request);
 }
 

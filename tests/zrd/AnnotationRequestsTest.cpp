@@ -98,8 +98,8 @@ TEST_F(AnnotationRequestsTest, NoHostCanFillTheStoreForOthers) {
         return Dictionary{{"k", Array(std::vector<Value>(count, Value(1)))}};
     };
     // What an earlier daemon has stored leaves room for less than what may be read back.
-    server_->setAnnotation(Dictionary{{"extension", withObjects(470'000)}},
-                           *server_->findPlugIn(uuid(0)));
+    zorvan::annotate(*server_, {{"extension", withObjects(470'000)}},
+                     *server_->findPlugIn(uuid(0)));
     const Dictionary extension = withObjects(60'000), large{{"extension", extension}};
     LogLines log(LogLines::Private::Hidden);
     const std::string told = "ops I: client " + std::to_string(getpid()) + " plug-in <private>(" +
@@ -121,7 +121,7 @@ TEST_F(AnnotationRequestsTest, NoHostCanFillTheStoreForOthers) {
     EXPECT_EQ(bulkAnnotate(Dictionary{{uuid(0).string(), more}}), refused);
     const ZRDPlugInRef plugIn = server_->findPlugIn(uuid(1));
     EXPECT_TRUE(server_->hasShareForAnnotation({{"extension", more}}, *plugIn, {1, 1, 0}));
-    server_->setAnnotation(large, *plugIn, platform::Origin{1, 1, 0});
+    zorvan::annotate(*server_, large, *plugIn, platform::Origin{1, 1, 0});
     EXPECT_EQ(annotate(Dictionary{{"extension", more}}, Array{uuid(0)}), Dictionary())
         << "what somebody else has replaced is theirs";
 }
@@ -172,6 +172,33 @@ TEST_F(AnnotationRequestsTest, BulkChangesGiveEachPlugInItsOwnExtension) {
               error(2, "no plug-in with the requested uuid"));
     EXPECT_EQ(*stored()[0].dictionary()->find("extension"), Value(Dictionary()));
     EXPECT_EQ(posts(), 0u);
+}
+
+TEST_F(AnnotationRequestsTest, OthersAreServedWhileTheFileIsReplaced) {
+    const auto other = std::make_shared<FakeConnection>();
+    connect(other);
+    const Dictionary bulk{{uuid(0).string(), Dictionary()}, {uuid(1).string(), Dictionary()}};
+    const Dictionary changing[] = {
+        {{"request", "annotate"},
+         {"version", 3},
+         {"annotations", Dictionary{{"election", 1}}},
+         {"uuids", Array{uuid(0), uuid(1)}}},
+        {{"request", "bulk-annotate"}, {"version", 3}, {"annotations", bulk}}};
+    for (const Dictionary& request : changing) {
+        std::promise<void> go;
+        bool wasAnswered = true;
+        server_->submitWork([blocked = go.get_future().share()] { blocked.wait(); });
+        deliver(platform::Message(request));
+        other->deliver(platform::Message({{"request", "match"}, {"version", 3}}));
+        server_->submitWork([&] { wasAnswered = connection_->isAnswered; });
+        go.set_value();
+        EXPECT_TRUE(answer(*other).contains("matches"));
+        EXPECT_FALSE(wasAnswered) << "its first change lets the match in";
+        EXPECT_EQ(answer(*connection_), Dictionary());
+        EXPECT_EQ(posts(), 1u);
+    }
+    const Dictionary annotation{{"election", 1}, {"extension", Dictionary()}};
+    EXPECT_EQ(stored(), (Array{annotation, annotation}));
 }
 
 }  // namespace

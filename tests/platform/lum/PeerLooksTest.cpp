@@ -81,5 +81,16 @@ TEST_F(PeerLooksTest, WhatGetsOnIsNotGivenUpAndWhatItFoundBeforeItHangsCounts) {
     letGo_.set_value();
 }
 
+TEST_F(PeerLooksTest, WhoHasWaitedForItsTurnHasAllOfTheTimeThen) {
+    PeerLooks looks(loop_, milliseconds(1000), 1);
+    int done = 0, givenUp = 0;
+    for (int i = 0; i < 2; ++i)
+        looks.look(
+            one_, [gate = gate_](PeerLooks::Pace&) { gate.wait_for(milliseconds(700)); },
+            counting(done, givenUp));
+    runUntil([&] { return done + givenUp == 2; });
+    EXPECT_EQ(done, 2);
+}
+
 }  // namespace
 }  // namespace platform

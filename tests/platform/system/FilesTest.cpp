@@ -173,6 +173,26 @@ TEST_F(Files, LeftoversOfACrashAreTold) {
     EXPECT_EQ(text("a"), "old");
 }
 
+TEST_F(Files, WhatIsSyncedLaterLeavesWhatWasSynced) {
+    const auto kept = [this] {
+        const auto file = lastSyncedFile(at("a"));
+        return file ? *readFile(*file, 9) : "none";
+    };
+    for (const char* content : {"1", "2", "3"})
+        EXPECT_FALSE(writeFileAtomically(at("a"), content, Sync::Later));
+    EXPECT_EQ(kept(), "1");
+    fs::create_symlink("a", at("link"));
+    EXPECT_TRUE(lastSyncedFile(at("link")));
+    EXPECT_FALSE(syncFile(at("link")));
+    EXPECT_EQ(kept(), "none");
+    EXPECT_FALSE(writeFileAtomically(at("a"), "4", Sync::Later));
+    EXPECT_EQ(kept(), "3");
+    EXPECT_FALSE(writeFileAtomically(at("a"), "5"));
+    EXPECT_EQ(kept(), "none");
+    EXPECT_EQ(text("a"), "5");
+    EXPECT_EQ(count(), 2);
+}
+
 TEST(FileStamps, VouchForNothingUntilTheyHaveSettled) {
     const std::string file = testing::TempDir() + "stamped";
     std::string fresh, again, settled;
