@@ -22,6 +22,9 @@ Result<std::string> readFileAt(int dirfd, const std::string& name, std::size_t l
 /// of `openBeneath`.
 Result<std::string> readFileBeneath(int dirfd, const std::string& name, std::size_t limit);
 
+/// Whether what is written has to outlive a crash of the machine.
+enum class Sync { Yes, No };
+
 /// Replaces the file at `path` by one that holds `bytes`, in one rename, so that whoever opens the
 /// path sees either the old file or the new one, also after a crash: file and directory are synced.
 /// The new file lies in the same directory and has no name until it is whole (on file systems
@@ -30,7 +33,6 @@ Result<std::string> readFileBeneath(int dirfd, const std::string& name, std::siz
 /// leads to is replaced. None on success. Errors: the system's; EINVAL when something other than a
 /// regular file is there. Without the sync, a crash of the machine (not of a process) may leave
 /// neither.
-enum class Sync { Yes, No };
 std::optional<Error> writeFileAtomically(const std::string& path, std::string_view bytes,
                                          Sync sync = Sync::Yes);
 
