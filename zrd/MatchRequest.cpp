@@ -1,5 +1,8 @@
 // The request "match".
 
+#include <algorithm>
+#include <random>
+
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
 #include "Zorvan/ZRDaemonClient.h"
@@ -114,6 +117,8 @@ void Transaction::accept(const std::shared_ptr<ZRDPlugIn>& plugIn, ZRDPlugInDraf
 void Transaction::completeLateForms(const std::shared_ptr<Matching>& matching) {
     std::erase_if(matching->late,
                   [&](const auto& late) { return !matching->result.stands(late.number); });
+    // Those at the end may not get their turn in time: they are others in each match.
+    std::shuffle(matching->late.begin(), matching->late.end(), std::random_device());
     const auto forms = std::make_shared<std::vector<Dictionary>>(matching->late.size());
     std::vector<platform::PlaceLooks::Look> looks;
     for (std::size_t i = 0; i < forms->size(); ++i) {
@@ -124,6 +129,7 @@ void Transaction::completeLateForms(const std::shared_ptr<Matching>& matching) {
              }});
     }
     lookAtBundles(std::move(looks), [this, matching, forms](const std::vector<bool>& done) {
+        std::size_t unfit = 0;
         for (std::size_t i = 0; i < done.size(); ++i) {
             const auto& late = matching->late[i];
             if (!done[i]) {
@@ -133,8 +139,11 @@ void Transaction::completeLateForms(const std::shared_ptr<Matching>& matching) {
                 continue;
             }
             addAnnotationForPlugIn(*late.plugIn, (*forms)[i]);
-            matching->result.replace(late.number, std::move((*forms)[i]));
+            if (!matching->result.replace(late.number, std::move((*forms)[i]))) ++unfit;
         }
+        if (unfit != 0)
+            EVLOG_ERROR(ops(), "leaving {} plug-ins without extensions that no reply can hold",
+                        unfit);
         answerMatch(matching->result);
     });
 }
