@@ -1,6 +1,7 @@
 // The request "match".
 
 #include <algorithm>
+#include <random>
 
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
@@ -55,6 +56,7 @@ struct Transaction::Matching {
 
     MatchResult result;
     std::size_t leftOut = 0;
+    std::size_t unfit = 0;    // complete forms that the reply has no room for
     std::size_t sharing = 0;  // plug-ins that were met and share resources
     std::vector<Late> late;
 };
@@ -130,7 +132,7 @@ void Transaction::completeForms(const std::shared_ptr<Matching>& matching, std::
         auto form = late.plugIn->completedForm(late.draft, platform::Wait::Never);
         if (!form) continue;
         addAnnotationForPlugIn(*late.plugIn, *form);
-        matching->result.replace(late.number, *std::move(form));
+        if (!matching->result.replace(late.number, *std::move(form))) ++matching->unfit;
         late.isComplete = true;
     }
     if (end == matching->late.size()) return completeLateForms(matching);
@@ -141,6 +143,8 @@ void Transaction::completeForms(const std::shared_ptr<Matching>& matching, std::
 /// Gives tokens to those whose file systems have to be asked, beside the service queue.
 void Transaction::completeLateForms(const std::shared_ptr<Matching>& matching) {
     std::erase_if(matching->late, [](const auto& late) { return late.isComplete; });
+    // Those at the end may not get their turn in time: they are others in each match.
+    std::shuffle(matching->late.begin(), matching->late.end(), std::random_device());
     const auto forms = std::make_shared<std::vector<Dictionary>>(matching->late.size());
     std::vector<platform::PlaceLooks::Look> looks;
     for (std::size_t i = 0; i < forms->size(); ++i) {
@@ -160,8 +164,11 @@ void Transaction::completeLateForms(const std::shared_ptr<Matching>& matching) {
                 continue;
             }
             addAnnotationForPlugIn(*late.plugIn, (*forms)[i]);
-            matching->result.replace(late.number, std::move((*forms)[i]));
+            if (!matching->result.replace(late.number, std::move((*forms)[i]))) ++matching->unfit;
         }
+        if (matching->unfit != 0)
+            EVLOG_ERROR(ops(), "leaving {} plug-ins without extensions that no reply can hold",
+                        matching->unfit);
         answerMatch(matching->result);
     });
 }

@@ -96,14 +96,15 @@ bool MatchResult::append(std::shared_ptr<ZRDPlugIn> plugIn, Dictionary form) {
     return true;
 }
 
-void MatchResult::replace(std::size_t number, Dictionary form) {
+bool MatchResult::replace(std::size_t number, Dictionary form) {
     Accepted& accepted = accepted_[number];
     const std::size_t bytes = encodedSize(form) + kMarks;
     const std::size_t others = bytes_ - accepted.bytes;
-    if (others + bytes > platform::lum::kMaxReplyPayload - kFrame) return;
+    if (others + bytes > platform::lum::kMaxReplyPayload - kFrame) return false;
     bytes_ = others + bytes;
     accepted.bytes = bytes;
     accepted.form = std::move(form);
+    return true;
 }
 
 void MatchResult::linkOverrides() {

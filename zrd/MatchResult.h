@@ -35,8 +35,8 @@ class MatchResult {
     /// Whether an accepted form still stands, by its number.
     bool stands(std::size_t number) const { return !accepted_[number].displaced; }
     /// Puts another form of the same plug-in into the place of an accepted one, unless one reply
-    /// cannot hold it with the others.
-    void replace(std::size_t number, platform::Dictionary form);
+    /// cannot hold it with the others: then the answer is false.
+    bool replace(std::size_t number, platform::Dictionary form);
     /// Sets "overrider" on the form of each replaced plug-in and "overriding" on its replacer's.
     void linkOverrides();
 

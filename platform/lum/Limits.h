@@ -14,7 +14,8 @@ inline constexpr std::size_t kMaxReplyPayload = 256u << 20;
 inline constexpr std::size_t kMaxRequestValues = 1u << 18;
 
 /// Most elements of a list in a request that stand for something each ("uuids", "paths", and the
-/// entries of "annotations" in "bulk-annotate"): each costs up to 20 µs while everybody waits.
+/// entries of "annotations" in "bulk-annotate"): each costs up to 20 µs while everybody waits, the
+/// change of an annotation several times that.
 inline constexpr std::size_t kMaxListed = 4096;
 
 /// A request with a larger payload is decoded on a thread of its own: so many values take longer

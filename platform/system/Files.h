@@ -22,6 +22,10 @@ Result<std::string> readFileAt(int dirfd, const std::string& name, std::size_t l
 /// of `openBeneath`.
 Result<std::string> readFileBeneath(int dirfd, const std::string& name, std::size_t limit);
 
+/// Whether what is written has to outlive a crash of the machine: at once, not at all, or once who
+/// writes has synced it.
+enum class Sync { Yes, No, Later };
+
 /// Replaces the file at `path` by one that holds `bytes`, in one rename, so that whoever opens the
 /// path sees either the old file or the new one, also after a crash: file and directory are synced.
 /// The new file lies in the same directory and has no name until it is whole (on file systems
@@ -31,7 +35,6 @@ Result<std::string> readFileBeneath(int dirfd, const std::string& name, std::siz
 /// regular file is there. Without the sync, a crash of the machine (not of a process) may leave
 /// neither. Who syncs later, by `syncFile`, loses nothing in between: what was synced last keeps a
 /// name of its own until then (where a file cannot have two names, the sync is not put off).
-enum class Sync { Yes, No, Later };
 std::optional<Error> writeFileAtomically(const std::string& path, std::string_view bytes,
                                          Sync sync = Sync::Yes);
 

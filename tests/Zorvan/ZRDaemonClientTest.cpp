@@ -98,7 +98,7 @@ class ClientTest : public testing::Test {
         return request;
     }
 
-    LogLines log_;
+    LogLines log_{LogLines::Private::Hidden};
     test::TemporaryDirectory runtime_;
     std::unique_ptr<platform::Listener> listener_;
     platform::SerialQueue queue_{"lum"};
@@ -194,8 +194,8 @@ TEST_F(ClientTest, AnswersEveryRequestWithAnErrorWithoutAService) {
         EXPECT_EQ(ZRDaemonClient::errorInReply(reply)->code, kZRErrorInvalidRequest);
     }
     auto lines = log_.take();
-    for (const char* line :
-         {"traffic D: request: ", "traffic D: reply: ", "ops E: Communications error: "})
+    for (const char* line : {"traffic D: request: <private>", "traffic D: reply: <private>",
+                             "ops E: Communications error: connection invalid"})
         EXPECT_THAT(lines, testing::Contains(testing::StartsWith(line)));
 }
 

@@ -68,7 +68,7 @@ class SdkResolution : public testing::Test {
 
     test::TemporaryDirectory directory_;
     platform::Directories directories_;
-    LogLines log_;
+    LogLines log_{LogLines::Private::Hidden};
 };
 
 TEST_F(SdkResolution, CompletesTheInfoPlistFromTheExtensionPoint) {

@@ -42,13 +42,12 @@ TEST_F(ProtocolsTest, CompoundsIncorporateTheirMembersAndAreMadeOnce) {
     EXPECT_FALSE(ZRCompoundProtocol(runtime_, 7, &error));
     EXPECT_FALSE(error);
 
-    LogLines log;
+    LogLines log(LogLines::Private::Hidden);
     EXPECT_FALSE(ZRCompoundProtocol(runtime_, Array{"P", "None"}, &error));
-    const std::string text =
-        "unable to locate protocol \"None\" - check that it is defined and not inadvertently "
-        "optimized away";
-    EXPECT_EQ(error, ZRErrorWithCode(12, text));
-    EXPECT_THAT(log.take(), ElementsAre("ops -: " + text));
+    const std::string start = "unable to locate protocol \"",
+                      end = "\" - check that it is defined and not inadvertently optimized away";
+    EXPECT_EQ(error, ZRErrorWithCode(12, start + "None" + end));
+    EXPECT_THAT(log.take(), ElementsAre("ops -: " + start + "<private>" + end));
     EXPECT_FALSE(runtime_.protocol("__XX_COMPOUND__P__None"));
 }
 
@@ -57,8 +56,8 @@ TEST_F(ProtocolsTest, DescriptionsSetArgumentsUpToTheFirstThatIsWrong) {
     EXPECT_THAT(*interface_.classes({"do", 0, false}), ElementsAre("A", "B"));
     EXPECT_EQ(interface_.interface({"do", 1, true})->protocol(), runtime_.protocol("Q"));
     EXPECT_FALSE(interface_.classes({"do", 0, true}));
-    EXPECT_EQ(describe("request: +7th:{B}"), "");
-    EXPECT_THAT(*interface_.classes({"do", 7, false}), ElementsAre("B"));
+    EXPECT_EQ(describe("request: +010th:{B}"), "");
+    EXPECT_THAT(*interface_.classes({"do", 10, false}), ElementsAre("B"));
 
     EXPECT_EQ(describe("request:3:{A},request:0"), "6 request:3:{A},request:0");
     EXPECT_TRUE(interface_.classes({"do", 3, false})) << "what came before stays";

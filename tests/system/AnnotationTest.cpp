@@ -68,21 +68,6 @@ TEST_F(Annotations, ChoicesNarrowMatchesAndOutliveTheDaemon) {
     EXPECT_EQ(uuidOf("a"), a) << "unchanged bundles keep their identity";
 }
 
-TEST_F(Annotations, FailuresStopWhereTheyAre) {
-    start();
-    const Uuid a = uuidOf("a"), b = uuidOf("b"), unknown = Uuid::random();
-    EXPECT_EQ(annotate({a, unknown, b}, {{"election", 1}}), "4 no such plugin (uuid not found)");
-    EXPECT_THAT(elected("1"), ElementsAre("a 1"));
-    EXPECT_EQ(annotate({b}, {{"election", "1"}}), "4 invalid request format (annotation election)");
-    const std::string refused = "4 invalid request format (bad annotations dictionary)";
-    EXPECT_EQ(annotate({b}, {{"extension", Dictionary{{"k", "\x01"}}}}), refused);
-    EXPECT_EQ(annotate({b}, {{"extension", Dictionary{{"k", unknown}}}}), refused);
-    EXPECT_EQ(bulkAnnotate({{b.string(), 1}}), "18 annotations values must be dictionaries");
-    EXPECT_EQ(bulkAnnotate({{unknown.string(), Dictionary()}}),
-              "2 no plug-in with the requested uuid");
-    EXPECT_EQ(stored(), (Dictionary{{"a", Dictionary{{"election", 1}}}}));
-}
-
 TEST_F(Annotations, SurviveBeingKilledAtAnyMoment) {
     constexpr int kKills = 20, kChanges = 10;
     std::filesystem::create_directories(std::filesystem::path(file_).parent_path());

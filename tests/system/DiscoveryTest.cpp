@@ -86,19 +86,6 @@ TEST_F(Discovery, AHostAndTheCommandLineSeeTheSamePlugIns) {
     EXPECT_THAT(nobody->err(), HasSubstr("zrd is not running: no service at " + home_.path()));
 }
 
-TEST_F(Discovery, VersionTwoGetsNoFormsAndOnlyManagersSeeAll) {
-    writeApplication();
-    start();
-    auto all = [&](auto& client, auto& reply) { client.matchPlugIns({}, 0x200, reply); };
-    EXPECT_EQ(errorOf(ask(all)), "11 unauthorized discovery flag (ZRDiscoverAll)");
-    client_->setProtocolVersion(2);
-    const auto reply =
-        ask([](auto& client, auto& callback) { client.matchPlugIns({}, 0, callback); });
-    EXPECT_EQ(std::get<platform::Message>(reply).contents(), Dictionary());
-    client_->setProtocolVersion(4);
-    EXPECT_EQ(errorOf(ask(all)), "7 unsupported protocol version 4 (current 3)");
-}
-
 TEST_F(Discovery, ReplacersAreMarkedAndElectThemselves) {
     writeApplication();
     writePlugIn(plugInPath("B", "better"), info("better"),

@@ -81,6 +81,9 @@ peer D: reply
 ops D: client 7 requested (null)
 probe D: request 7 (null)
 )");
+    ask({{"request", "bulk"}, {"version", 4}});
+    EXPECT_EQ(said(), "\n");
+    EXPECT_EQ(said("add", {{"paths", Array{"/gone"}}}), "\n");
     const std::string good = directory_.makeDirectory("good"),
                       bad = directory_.makeDirectory("bad");
     workspace_->refused = {bad, "/gone"};
@@ -103,6 +106,10 @@ probe D: plugin-remove DIR/good true
 probe D: plugin-remove /gone false
 ops I: Tandry refused to unregister <private>: <private>
 )");
+    client().setAcceptWork(false);
+    deliver(platform::Message({{"request", "bulk"}, {"version", 3}}));
+    EXPECT_EQ(said(), "\n");
+    EXPECT_EQ(ask({{"version", 4}}), error(7, "unsupported protocol version 4 (current 3)"));
 }
 
 TEST_F(ConversationTest, Discovery) {

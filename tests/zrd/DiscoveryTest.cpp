@@ -150,13 +150,15 @@ TEST_F(MatchResultTest, NoMoreIsAcceptedThanOneReplyHolds) {
     platform::keepCborEncoded(large);
     const FakeWorld world;
     MatchResult result(0, 0);
-    const auto accepts = [&](const char* identifier) {
+    const auto accepts = [&](const char* identifier, const Dictionary& form) {
         const auto plugIn = world.record(makeProxy(identifier, {{"VXExtensionVersion", "1"}}));
-        return result.admit(*plugIn) && result.append(plugIn, large);
+        return result.admit(*plugIn) && result.append(plugIn, form);
     };
-    EXPECT_TRUE(accepts("a") && accepts("b"));
-    EXPECT_FALSE(accepts("c"));
-    EXPECT_TRUE(accepts("a")) << "it displaces the other";
+    EXPECT_TRUE(accepts("a", large) && accepts("b", large));
+    const Dictionary larger{{"a", large}, {"b", large}};
+    EXPECT_FALSE(accepts("c", large) || accepts("a", larger) || result.replace(1, larger));
+    EXPECT_EQ(result.size(), 2u);
+    EXPECT_TRUE(accepts("a", large)) << "it displaces the other";
     EXPECT_EQ(result.size(), 2u);
 }
 

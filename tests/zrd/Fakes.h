@@ -104,11 +104,13 @@ struct FakeSandbox final : platform::Sandbox {
         if (wait == platform::Wait::Never && distant.contains(bundle.path))
             return platform::Error::posix(EAGAIN, path);
         if (unreadable.contains(path)) return platform::Error::posix(EACCES, path);
+        latest = path;
         return "token " + std::to_string(++issued) + " " + path;
     }
     std::set<std::string> unreadable;
     std::set<std::string> distant;  // bundles that are not looked at without waiting
     std::function<void()> onIssue;
+    std::string latest;  // that a token was issued for
     int issued = 0;
     bool sandboxed = false;
 };

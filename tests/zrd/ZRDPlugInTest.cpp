@@ -6,6 +6,7 @@
 #include "Zorvan/Keys.h"
 #include "tests/Zorvan/LogLines.h"
 #include "tests/zrd/Fakes.h"
+#include "zrd/RuleSet.h"
 
 namespace zorvan {
 
@@ -36,6 +37,8 @@ TEST_F(ZRDPlugInTest, TakesItsFactsFromTheRegistry) {
     EXPECT_EQ(plugIn->lastModified(), -1);
     proxy->registrationDate = {2147483648.0};
     EXPECT_EQ(world_.record(proxy)->lastModified(), INT32_MAX);
+    proxy->registrationDate = {-2147483649.0};
+    EXPECT_EQ(world_.record(proxy)->lastModified(), INT32_MIN);
     EXPECT_TRUE(plugIn->onSystemVolume());
     EXPECT_EQ(*plugIn->attribute("Color"), Value("red"));
     EXPECT_EQ(*plugIn->pluginKey("Key"), Value(3));
@@ -167,6 +170,9 @@ TEST_F(ZRDPlugInTest, AdmissionJudgesTheRestrictionThenTheDemand) {
               "the host's plug-in entitlement does not allow this plug-in");
     EXPECT_EQ(reason(Array{"com.a"}, std::nullopt), malformed);
     EXPECT_EQ(reason(false, true), malformed);
+    Dictionary many;  // each holds, but all are too much to ask
+    for (std::size_t i = 0; i <= 4 * RuleSet::kMaxRules; ++i) many.set(std::to_string(i), false);
+    EXPECT_EQ(reason(many, true), malformed);
 
     plugIn = world_.record(makeProxy("com.a"));
     EXPECT_EQ(reason(std::nullopt, std::nullopt), "");

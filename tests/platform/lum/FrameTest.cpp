@@ -50,6 +50,8 @@ TEST(Frame, OverTheLimitIsNotEncoded) {
     Message message({{"key", std::string(100, 'x')}});
     EXPECT_TRUE(encodeFrame(FrameKind::Reply, message, 200));
     EXPECT_FALSE(encodeFrame(FrameKind::Reply, message, 100));
+    message.set("key", std::string(100'000, 'x'));
+    EXPECT_GT(describe(message).size(), 100'000u) << "tracers are told all of it";
 }
 
 DecodedPayload decode(std::string_view payload, FrameKind expected = FrameKind::Request) {

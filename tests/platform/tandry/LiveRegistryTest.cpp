@@ -33,6 +33,16 @@ TEST_F(LiveRegistryTest, FollowsAnApplicationThroughItsLife) {
     EXPECT_THAT(recorder.take(2), ElementsAre("+a", "+b"));
     const Uuid uuid = plugIn("a")->plugInUuid;
     EXPECT_TRUE(fs::exists(at("home/zorvan/Containers/a/tmp")));
+    // A walk that finds nothing new looks at containers, too.
+    const fs::path containers = at("home/zorvan/Containers");
+    fs::remove_all(containers);
+    files.write(apps + "A.app/PlugIns/note", "");
+    const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+    const auto areThere = [&] {
+        return fs::exists(containers / "a/tmp") && fs::exists(containers / "b/tmp");
+    };
+    while (!areThere() && std::chrono::steady_clock::now() < end) settle();
+    EXPECT_TRUE(areThere());
 
     // A new file under an old name.
     addPlugIn("new/A.appex", "a", {}, {{"changed", true}});
@@ -137,6 +147,9 @@ TEST_F(LiveRegistryTest, AFaultCostsOneLineHoweverOftenItIsMet) {
     files.makeDirectory(apps + "Bare.app/PlugIns/Bare.appex");
     ErrorLines errors;
     start();
+    // What a client asked for is less than an error; what comes afterwards is not.
+    EXPECT_TRUE(registerPlugIn(files.makeDirectory("asked")));
+    files.write(apps + "Late.app/PlugIns", "not a directory");
     for (const char* name : {"a", "b", "c"}) {
         addPlugIn(std::string("opt/") + name, name);
         fs::rename(at(std::string("opt/") + name), at(apps + "Bare.app/PlugIns/" + name));
@@ -146,7 +159,7 @@ TEST_F(LiveRegistryTest, AFaultCostsOneLineHoweverOftenItIsMet) {
         addPlugIn("opt/PlugIns/" + std::string(name), name);
     }
     stop();
-    for (const char* name : {"Loop.app", "File.app/PlugIns", "Bare.appex"})
+    for (const char* name : {"Loop.app", "File.app/PlugIns", "Bare.appex", "Late.app/PlugIns"})
         EXPECT_THAT(errors.lines, testing::Contains(HasSubstr(name)).Times(1)) << name;
 }
 

@@ -51,6 +51,12 @@ TEST_F(RegistryTest, RefusesWithTheReason) {
     const std::string broken = files.path("opt/Broken.appex");
     files.write("opt/Broken.appex/Info.plist", "broken");
     addApplication("opt/Empty.app");
+    // Any client can ask for a line in the log: it is no error, and tells nobody of files.
+    std::set<std::pair<LogLevel, std::string>> told;
+    const auto tell = [&](const auto&, LogLevel level, const std::string& text) {
+        if (text.starts_with("leaving out")) told.emplace(level, text);
+    };
+    const LogCapture log(tell, LogCapture::Private::Hidden);
     for (const std::string& path : {broken, files.path("opt/Empty.app"), files.path("missing"),
                                     files.path("opt/Broken.appex/Info.plist")}) {
         std::optional<Error> error = registerPlugIn(path);
@@ -67,6 +73,7 @@ TEST_F(RegistryTest, RefusesWithTheReason) {
     addPlugIn("opt/Broken.appex", "mended");
     start();
     EXPECT_THAT(installed(), ElementsAre("mended"));
+    EXPECT_THAT(told, ElementsAre(std::pair(LogLevel::Info, "leaving out a plug-in: <private>")));
 }
 
 TEST_F(RegistryTest, DoesNothingForConfinedProcesses) {
