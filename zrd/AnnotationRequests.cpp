@@ -52,20 +52,18 @@ bool Transaction::hasShareFor(const Dictionary& change, const ZRDPlugIn& plugIn)
 void Transaction::annotate(const Dictionary& change, const ZRDPlugIn& plugIn,
                            std::function<void()> then) {
     hasUnsyncedAnnotations_ = true;
-    server().setAnnotation(change, plugIn, origin(), platform::Sync::Later,
-                           onServiceQueue(std::move(then)));
+    server().setAnnotation(change, plugIn, origin(), platform::Sync::Later);
+    onServiceQueue(std::move(then))();
 }
 
-void Transaction::syncAnnotations(std::function<void()> then) {
-    if (!std::exchange(hasUnsyncedAnnotations_, false)) return then();
-    server().syncAnnotations(onServiceQueue(std::move(then)));
+void Transaction::syncAnnotations() {
+    if (std::exchange(hasUnsyncedAnnotations_, false)) server().syncAnnotations();
 }
 
 void Transaction::finishAnnotating() {
-    syncAnnotations([this] {
-        server().notifyAnnotationChange();
-        done();
-    });
+    syncAnnotations();
+    server().notifyAnnotationChange();
+    done();
 }
 
 /// One change for several plug-ins, and how far it has come.

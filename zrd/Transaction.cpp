@@ -184,7 +184,7 @@ void Transaction::addAnnotationForPlugIn(const ZRDPlugIn& plugIn, Dictionary& in
 }
 
 void Transaction::done() {
-    if (hasUnsyncedAnnotations_) return syncAnnotations([this] { done(); });
+    syncAnnotations();
     if (probes::requestOutputEnabled()) {
         probes::requestOutput(client_->pid(), describe(reply_).c_str());
     }

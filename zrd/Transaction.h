@@ -96,17 +96,18 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
     bool areIdle(const std::vector<std::shared_ptr<ZRDPlugIn>>& plugIns);
     void takeHold(HoldSubject subject);
 
-    // Annotations are changed one after another, and other requests are served while the file is
-    // replaced for each. The request goes on to its end, whether or not its client waits.
+    // Annotations are changed one after another, and other requests are served in between: the file
+    // is replaced for each. The request goes on to its end, whether or not its client waits.
     struct Annotating;
     struct BulkAnnotating;
     void annotateNext(const std::shared_ptr<Annotating>& annotating);
     void bulkAnnotateNext(const std::shared_ptr<BulkAnnotating>& annotating);
-    /// Changes the plug-in's annotation for this client, and goes on when that is saved.
+    /// Changes the plug-in's annotation for this client, saves it, to be synced later, and goes on
+    /// when others have had their turn.
     void annotate(const platform::Dictionary& change, const ZRDPlugIn& plugIn,
                   std::function<void()> then);
-    /// Goes on when what this request has changed is on the disk: before anybody is told of it.
-    void syncAnnotations(std::function<void()> then);
+    /// What this request has changed is on the disk afterwards: before anybody is told of it.
+    void syncAnnotations();
     void finishAnnotating();
     /// The request's "annotations"; null when they cannot be stored, and the failure has been sent.
     const platform::Dictionary* requestedAnnotations();

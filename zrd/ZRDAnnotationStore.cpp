@@ -3,14 +3,15 @@
 #include <fmt/format.h>
 
 #include <cerrno>
-#include <utility>
 
 #include "Zorvan/Helpers.h"
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
+#include "platform/plist/PropertyList.h"
 #include "platform/plist/PropertyListCost.h"
 #include "platform/system/Directories.h"
 #include "platform/system/Files.h"
+#include "zrd/Probes.h"
 #include "zrd/ZRDPlugIn.h"
 
 namespace zorvan {
@@ -20,12 +21,53 @@ using platform::Value;
 
 namespace {
 
+ZRError zrError(const platform::Error& error) {
+    return {error.domain, error.code, error.text};
+}
+
 bool isMissingFile(const ZRError& error) {
     return error.domain == "POSIX" && error.code == ENOENT;
 }
 
+/// The "data" of an annotation file's root, or what is wrong with it.
+std::optional<ZRError> readRoot(const Value& root, Dictionary& data) {
+    const Dictionary* dictionary = root.dictionary();
+    const Value* version = dictionary ? dictionary->find(AnnotationText::kVersionKey) : nullptr;
+    std::int64_t found = version ? version->numberAsInteger().value_or(0) : 0;
+    if (found != AnnotationText::kVersion) {
+        return ZRErrorWithFormat(kZRErrorVersion, "found database version {} needed version {}",
+                                 found, AnnotationText::kVersion);
+    }
+    const Value* stored = dictionary->find(AnnotationText::kDataKey);
+    if (!stored || !stored->dictionary()) {
+        return ZRErrorWithCode(kZRErrorVersion, "found no data in database");
+    }
+    data = *stored->dictionary();
+    return std::nullopt;
+}
+
 platform::PropertyListCost costOf(const std::string& key, const Value& annotation) {
     return platform::costOfPropertyList(Dictionary{{key, annotation}});
+}
+
+/// Takes out what a binary file can hold but our own file and replies cannot: one such entry would
+/// keep every other from being saved.
+void dropUnstorable(Dictionary& data, const std::string& file) {
+    const Dictionary entries = data;
+    for (const auto& [key, annotation] : entries) {
+        if (platform::isPropertyList(annotation) && platform::isPropertyList(Value(key))) continue;
+        EVLOG_ERROR(ops(), "leaving out an annotation that cannot be stored: {} in {}", key,
+                    pub(file));
+        data.remove(key);
+    }
+}
+
+std::optional<ZRError> read(const std::string& file, Dictionary& annotations) {
+    const auto root = platform::readPropertyListFile(file, AnnotationText::kMaxSize);
+    if (!root) return zrError(root.error());
+    auto error = readRoot(*root, annotations);
+    if (!error) dropUnstorable(annotations, file);
+    return error;
 }
 
 }  // namespace
@@ -34,14 +76,13 @@ std::unique_ptr<ZRDAnnotationStore> ZRDAnnotationStore::initWithDatabase(
     const std::optional<std::string>& path, const platform::Directories& directories) {
     std::unique_ptr<ZRDAnnotationStore> store(
         new ZRDAnnotationStore(path ? *path : defaultDatabaseURL(directories)));
-    if (auto error = store->file_.loadDb(store->annotations_)) {
+    if (auto error = store->loadDb()) {
         if (!isMissingFile(*error)) {
             EVLOG_ERROR(ops(), "unable to load annotation database:{} error:{} (resetting)",
-                        pub(store->file_.path()), pub(*error));
+                        pub(store->annotationsURL_), pub(*error));
         }
+        store->annotations_ = Dictionary();
     }
-    for (const auto& [key, annotation] : store->annotations_)
-        store->cost_ += costOf(key, annotation);
     return store;
 }
 
@@ -61,10 +102,37 @@ std::string ZRDAnnotationStore::defaultDatabaseURL(const platform::Directories& 
     return directory + "Annotations";
 }
 
+std::optional<ZRError> ZRDAnnotationStore::loadDb() {
+    text_.allChanged();
+    platform::removeLeftovers(annotationsURL_);
+    const auto lastSynced = platform::lastSyncedFile(annotationsURL_);
+    auto error = read(annotationsURL_, annotations_);
+    if (error && lastSynced && !read(*lastSynced, annotations_)) {
+        EVLOG_ERROR(ops(), "annotations were lost in a crash: {}: going back to those before",
+                    pub(*error));
+        error.reset();
+    } else if (!error && lastSynced) {
+        // What the file has now is whole, but may not be on the disk yet.
+        isUnsynced_ = true;
+    }
+    cost_ = {};
+    for (const auto& [key, annotation] : annotations_) cost_ += costOf(key, annotation);
+    if (error) probes::dbLoad(error->domain.c_str(), static_cast<std::uint64_t>(error->code));
+    sync();
+    return error;
+}
+
+std::optional<ZRError> ZRDAnnotationStore::saveDb(platform::Sync sync) {
+    const auto bytes = text_.text(annotations_, cost_);
+    if (!bytes) return zrError(bytes.error());
+    if (auto error = platform::writeFileAtomically(annotationsURL_, *bytes, sync))
+        return zrError(*error);
+    isUnsynced_ = sync != platform::Sync::Yes;
+    return std::nullopt;
+}
+
 const Dictionary* ZRDAnnotationStore::annotationForIdentifier(std::string_view key) const {
     const Value* annotation = annotations_.find(key);
-    if (const auto hidden = hidden_.find(key); hidden != hidden_.end())
-        annotation = hidden->second.before ? &*hidden->second.before : nullptr;
     return annotation ? annotation->dictionary() : nullptr;
 }
 
@@ -73,8 +141,8 @@ const Dictionary* ZRDAnnotationStore::annotationForPlugIn(const ZRDPlugIn& plugI
 }
 
 Dictionary ZRDAnnotationStore::merged(const Dictionary& annotation, const std::string& key) const {
-    const Value* current = annotations_.find(key);
-    Dictionary merged = current && current->dictionary() ? *current->dictionary() : Dictionary();
+    const Dictionary* current = annotationForIdentifier(key);
+    Dictionary merged = current ? *current : Dictionary();
     for (const auto& [name, value] : annotation) merged.set(name, value);
     return merged;
 }
@@ -97,16 +165,11 @@ bool ZRDAnnotationStore::hasShareFor(const Dictionary& annotation, const ZRDPlug
 
 void ZRDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,
                                        const ZRDPlugIn& plugIn,
-                                       const std::optional<platform::Origin>& origin, Shown shown) {
+                                       const std::optional<platform::Origin>& origin,
+                                       platform::Sync sync) {
     const std::string& key = plugIn.annotationKey();
-    const Value* current = annotations_.find(key);
-    ++changes_;
-    if (shown == Shown::OnceSaved) {
-        const auto before = current ? std::optional(*current) : std::nullopt;
-        hidden_.try_emplace(key, Hidden{before}).first->second.change = changes_;
-    }
     std::optional<platform::PropertyListCost> cost;
-    if (current) cost_ -= costOf(key, *current);
+    if (const Value* current = annotations_.find(key)) cost_ -= costOf(key, *current);
     if (annotation) {
         Dictionary changed = merged(*annotation, key);
         cost = costOf(key, changed);
@@ -117,15 +180,17 @@ void ZRDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotati
         annotations_.remove(key);
     }
     shares_.changed(key, cost);
-    changed_.insert(key);
+    text_.changed(key);
+    if (auto error = saveDb(sync)) logFailure(*error);
 }
 
-AnnotationSnapshot ZRDAnnotationStore::snapshot() {
-    return {annotations_, cost_, std::exchange(changed_, {}), changes_};
+void ZRDAnnotationStore::sync() {
+    if (!std::exchange(isUnsynced_, false) || !platform::syncFile(annotationsURL_)) return;
+    if (auto error = saveDb()) logFailure(*error);
 }
 
-void ZRDAnnotationStore::saved(std::uint64_t number) {
-    std::erase_if(hidden_, [&](const auto& entry) { return entry.second.change <= number; });
+void ZRDAnnotationStore::logFailure(const ZRError& error) const {
+    EVLOG_ERROR(ops(), "unable to save annotations:{} error:{}", pub(annotationsURL_), pub(error));
 }
 
 }  // namespace zorvan

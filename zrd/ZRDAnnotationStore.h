@@ -1,15 +1,14 @@
 #pragma once
 
-#include <cstdint>
-#include <map>
 #include <memory>
 #include <optional>
-#include <set>
 #include <string>
 
+#include "Zorvan/ZRError.h"
+#include "platform/system/Files.h"
 #include "platform/values/Value.h"
-#include "zrd/AnnotationFile.h"
 #include "zrd/AnnotationShares.h"
+#include "zrd/AnnotationText.h"
 
 namespace platform {
 struct Directories;
@@ -22,8 +21,11 @@ class ZRDPlugIn;
 /// The user's choices about plug-ins ("annotations"), kept over restarts: one small dictionary an
 /// annotation key, in memory and in one property-list file that is rewritten after every change.
 ///
-/// Owned by the database; used on its queue only, once it is built, but for the file: that is used
-/// by the thread that saves, so that nobody waits for the disk.
+/// The file's root is {"version": 16, "data": {annotation key: annotation}}; it is read in any
+/// property-list form and written as XML. Changes that others make to it while the daemon runs are
+/// lost.
+///
+/// Owned by the database; used on its queue only, once it is built.
 class ZRDAnnotationStore {
   public:
     /// The store, loaded. The file is at `path` as given, or at the default place. A file that
@@ -32,7 +34,7 @@ class ZRDAnnotationStore {
     static std::unique_ptr<ZRDAnnotationStore> initWithDatabase(
         const std::optional<std::string>& path, const platform::Directories& directories);
 
-    /// What lookups see under a key, or null. Good until the next change.
+    /// The annotation under a key, or null. Good until the next change.
     const platform::Dictionary* annotationForIdentifier(std::string_view key) const;
     const platform::Dictionary* annotationForPlugIn(const ZRDPlugIn& plugIn) const;
 
@@ -49,47 +51,42 @@ class ZRDAnnotationStore {
     bool hasShareFor(const platform::Dictionary& annotation, const ZRDPlugIn& plugIn,
                      const platform::Origin& origin) const;
 
-    /// When lookups see a change: at once, or when it is in the file, so that whatever was seen
-    /// outlives the daemon.
-    enum class Shown { AtOnce, OnceSaved };
     /// Merges the entries of `annotation` into the plug-in's annotation, or removes that when there
-    /// are none. Hosts' data belongs to the origin from then on, if one is given. To be saved next.
+    /// are none, then saves. A failed save is logged; the change stays and reaches the file with
+    /// the next successful one. Hosts' data belongs to the origin from then on, if one is given.
+    /// Who makes many changes syncs the file once, after the last one.
     void setAnnotation(const std::optional<platform::Dictionary>& annotation,
                        const ZRDPlugIn& plugIn,
                        const std::optional<platform::Origin>& origin = std::nullopt,
-                       Shown shown = Shown::OnceSaved);
+                       platform::Sync sync = platform::Sync::Yes);
+    /// Syncs the file if changes were saved without. What cannot be synced is saved once more; a
+    /// failure of that is logged.
+    void sync();
 
-    AnnotationSnapshot snapshot();
-    bool hasChanged() const { return !changed_.empty(); }
-    /// A snapshot is in the file, or could not be written: the changes stay either way, and reach
-    /// the file with the next successful save.
-    void saved(std::uint64_t number);
-    AnnotationFile& file() { return file_; }
+    /// Each answers what went wrong, or none.
+    std::optional<ZRError> loadDb();
+    std::optional<ZRError> saveDb(platform::Sync sync = platform::Sync::Yes);
 
     /// <user directory>/com.orbel.zorvan/Annotations. Makes the directory (0700). Without one the
     /// daemon cannot do its work: an internal inconsistency.
     static std::string defaultDatabaseURL(const platform::Directories& directories);
 
+    const std::string& annotationsURL() const { return annotationsURL_; }
     const platform::Dictionary& annotations() const { return annotations_; }
 
   private:
-    /// What lookups see of an annotation until its last change is in the file.
-    struct Hidden {
-        std::optional<platform::Value> before;
-        std::uint64_t change = 0;
-    };
-
     platform::Dictionary merged(const platform::Dictionary& annotation,
                                 const std::string& key) const;
 
-    explicit ZRDAnnotationStore(std::string path) : file_(std::move(path)) {}
+    void logFailure(const ZRError& error) const;
 
-    AnnotationFile file_;
+    explicit ZRDAnnotationStore(std::string path) : annotationsURL_(std::move(path)) {}
+
+    std::string annotationsURL_;
     platform::Dictionary annotations_;
     platform::PropertyListCost cost_;  // of the annotations
-    std::set<std::string> changed_;    // keys, since the last snapshot
-    std::uint64_t changes_ = 0;
-    std::map<std::string, Hidden, std::less<>> hidden_;
+    AnnotationText text_;
+    bool isUnsynced_ = false;
     AnnotationShares shares_{AnnotationText::kMaxSize - kReservedForElections};
 };
 

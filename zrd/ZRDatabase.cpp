@@ -122,39 +122,16 @@ bool ZRDatabase::hasShareForAnnotation(const Dictionary& annotation, const ZRDPl
     return sync_.sync([&] { return annotations_->hasShareFor(annotation, plugIn, origin); });
 }
 
-void ZRDatabase::setAnnotation(const std::optional<Dictionary>& annotation, const ZRDPlugIn& plugIn,
-                               const std::optional<platform::Origin>& origin, platform::Sync sync,
-                               std::function<void()> saved) {
-    sync_.sync([&] { annotations_->setAnnotation(annotation, plugIn, origin); });
-    saving_.async([this, sync, saved = std::move(saved)] {
-        saveChangedAnnotations(sync);
-        saved();
-    });
+std::optional<ZRError> ZRDatabase::setAnnotation(const std::optional<Dictionary>& annotation,
+                                                 const ZRDPlugIn& plugIn,
+                                                 const std::optional<platform::Origin>& origin,
+                                                 platform::Sync sync) {
+    sync_.sync([&] { annotations_->setAnnotation(annotation, plugIn, origin, sync); });
+    return std::nullopt;
 }
 
-/// What an earlier save has taken along is not saved again.
-void ZRDatabase::saveChangedAnnotations(platform::Sync sync) {
-    const auto changed = sync_.sync([&] {
-        return annotations_->hasChanged() ? std::optional(annotations_->snapshot()) : std::nullopt;
-    });
-    if (changed) saveAnnotations(*changed, sync);
-}
-
-void ZRDatabase::saveAnnotations(const AnnotationSnapshot& snapshot, platform::Sync sync) {
-    saving_.assertCurrent();
-    AnnotationFile& file = annotations_->file();
-    if (auto error = file.saveDb(snapshot, sync))
-        EVLOG_ERROR(ops(), "unable to save annotations:{} error:{}", pub(file.path()), pub(*error));
-    sync_.sync([&] { annotations_->saved(snapshot.number); });
-}
-
-void ZRDatabase::syncAnnotations(std::function<void()> synced) {
-    saving_.async([this, synced = std::move(synced)] {
-        if (!annotations_->file().sync())
-            saveAnnotations(sync_.sync([&] { return annotations_->snapshot(); }),
-                            platform::Sync::Yes);
-        synced();
-    });
+void ZRDatabase::syncAnnotations() {
+    sync_.sync([&] { annotations_->sync(); });
 }
 
 void ZRDatabase::notifyAnnotationChange() {

@@ -2,7 +2,6 @@
 
 #include <atomic>
 #include <cstdint>
-#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -15,7 +14,6 @@
 #include "platform/lum/Origin.h"
 #include "platform/system/Files.h"
 #include "platform/tandry/Workspace.h"
-#include "platform/threads/SerialQueue.h"
 #include "platform/threads/SyncQueue.h"
 #include "zrd/PlugInContext.h"
 
@@ -23,7 +21,6 @@ namespace zorvan {
 
 class ZRDAnnotationStore;
 class ZRDPlugIn;
-struct AnnotationSnapshot;
 
 using ZRDPlugInRef = std::shared_ptr<ZRDPlugIn>;
 using ZRDPlugInList = std::vector<ZRDPlugInRef>;
@@ -45,7 +42,7 @@ class ZRDatabaseDelegate {
 ///
 /// Every operation may be called from any thread unless it says otherwise; the cache and the store
 /// are only touched on the queue "ZRDatabase", which operations enter synchronously, so none may be
-/// called from inside it. The store's file belongs to the queue "annotations".
+/// called from inside it.
 class ZRDatabase : public AnnotationReader, public platform::WorkspaceObserver {
   public:
     virtual ~ZRDatabase();
@@ -90,16 +87,14 @@ class ZRDatabase : public AnnotationReader, public platform::WorkspaceObserver {
     /// Whether it would be within what one origin may have stored.
     bool hasShareForAnnotation(const platform::Dictionary& annotation, const ZRDPlugIn& plugIn,
                                const platform::Origin& origin);
-    /// Merges `annotation` into the plug-in's, or removes that, and has the file replaced, by a
-    /// thread of its own, which calls `saved` then. The change can be seen from then on; when
-    /// saving failed, which is logged, it reaches the file with a later one. Hosts' data belongs to
-    /// the origin, if given.
-    void setAnnotation(const std::optional<platform::Dictionary>& annotation,
-                       const ZRDPlugIn& plugIn, const std::optional<platform::Origin>& origin,
-                       platform::Sync sync, std::function<void()> saved);
-    /// Syncs the file after changes that were saved to be synced later, and calls `synced` on the
-    /// thread that saves. What cannot be synced is saved once more; a failure of that is logged.
-    void syncAnnotations(std::function<void()> synced);
+    /// Merges `annotation` into the plug-in's, or removes that, and saves. Always answers none: a
+    /// failed save is logged, and the change kept. Hosts' data belongs to the origin, if given.
+    std::optional<ZRError> setAnnotation(
+        const std::optional<platform::Dictionary>& annotation, const ZRDPlugIn& plugIn,
+        const std::optional<platform::Origin>& origin = std::nullopt,
+        platform::Sync sync = platform::Sync::Yes);
+    /// After changes that were saved without a sync.
+    void syncAnnotations();
     /// Tells whoever listens that annotations, and with them match results, have changed.
     void notifyAnnotationChange();
 
@@ -123,10 +118,6 @@ class ZRDatabase : public AnnotationReader, public platform::WorkspaceObserver {
     void purgeCachesToLimit(std::uint32_t limit);
     void autoElect(const ZRDPlugIn& plugIn);
 
-    // On saving_ only.
-    void saveChangedAnnotations(platform::Sync sync);
-    void saveAnnotations(const AnnotationSnapshot& snapshot, platform::Sync sync);
-
     std::optional<platform::TDPlugInProxyList> candidates(const platform::Dictionary* query);
     bool electionAdmits(const std::unordered_set<std::string>& patterns,
                         const std::optional<std::string>& identifier,
@@ -140,8 +131,7 @@ class ZRDatabase : public AnnotationReader, public platform::WorkspaceObserver {
     std::unique_ptr<ZRDAnnotationStore> annotations_;         // guarded by sync_
     std::unordered_map<platform::Uuid, ZRDPlugInRef> cache_;  // guarded by sync_
     std::atomic<std::size_t> cacheCount_{0};                  // size of cache_, for log lines
-    std::unique_ptr<platform::Workspace::Observation> observation_;
-    platform::SerialQueue saving_{"annotations"};  // the first to go: its work uses the others
+    std::unique_ptr<platform::Workspace::Observation> observation_;  // the first to go
 };
 
 }  // namespace zorvan

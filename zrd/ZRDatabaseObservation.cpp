@@ -1,5 +1,6 @@
 // What the registry announces, and the election that plug-ins may ask for.
 
+#include "Zorvan/Helpers.h"
 #include "Zorvan/Keys.h"
 #include "Zorvan/LogHandles.h"
 #include "zrd/ZRDAnnotationStore.h"
@@ -34,18 +35,14 @@ void ZRDatabase::pluginsWillUninstall(const platform::TDPlugInProxyList& plugIns
     if (auto delegate = delegate_.lock()) delegate->removedPlugIns(plugIns);
 }
 
-/// Seen at once, and not waited for: should it be lost, the next start elects anew.
 void ZRDatabase::autoElect(const ZRDPlugIn& plugIn) {
     sync_.assertCurrent();
-    // The user's latest choice, be it in the file or not.
-    const Value* stored = annotations_->annotations().find(plugIn.annotationKey());
-    const Value* election = stored && stored->dictionary()
-                                ? stored->dictionary()->find(annotation::kElection)
-                                : nullptr;
+    const Dictionary* stored = annotations_->annotationForPlugIn(plugIn);
+    Dictionary annotation = stored ? *stored : Dictionary();
+    const Value* election = annotation.find(annotation::kElection);
     if (election && election->numberAsInteger().value_or(0) != 0) return;
-    annotations_->setAnnotation(Dictionary{{annotation::kElection, 1}}, plugIn, std::nullopt,
-                                ZRDAnnotationStore::Shown::AtOnce);
-    saving_.async([this] { saveChangedAnnotations(platform::Sync::Yes); });
+    annotations_->setAnnotation(dictionaryChanging(annotation, annotation::kElection, Value(1)),
+                                plugIn);
 }
 
 }  // namespace zorvan

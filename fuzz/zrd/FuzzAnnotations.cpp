@@ -1,8 +1,8 @@
 // A file of annotations that somebody wrote, and what hosts change in it: dictionaries that lead
 // from plug-ins "a", "b" and "c" to what is set, or to something else for what is removed. Whatever
 // is kept can be stored, and is kept again, in the text that a store has which knows nothing else.
-// Covers: zrd/ZRDAnnotationStore.cpp zrd/AnnotationFile.cpp zrd/AnnotationText.cpp
-// platform/plist/PropertyListCost.cpp Covers: platform/plist/XmlPropertyListText.cpp
+// Covers: zrd/ZRDAnnotationStore.cpp zrd/AnnotationText.cpp platform/plist/PropertyListCost.cpp
+// Covers: platform/plist/XmlPropertyListText.cpp
 
 #include "fuzz/Support.h"
 #include "platform/lum/Origin.h"
@@ -40,10 +40,6 @@ void change(ZRDAnnotationStore& store, const Dictionary& changes) {
     }
 }
 
-void save(ZRDAnnotationStore& store) {
-    fuzz::require(!store.file().saveDb(store.snapshot(), platform::Sync::No));
-}
-
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
@@ -52,13 +48,12 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     const auto parts = fuzz::parts(fuzz::text(data, size), 4);
     fuzz::home().write(file.substr(fuzz::home().path().size() + 1), parts[0]);
     const auto store = ZRDAnnotationStore::initWithDatabase(std::nullopt, directories);
-    save(*store);
+    fuzz::require(!store->saveDb());
     for (std::size_t i = 1; i < parts.size(); ++i) change(*store, fuzz::dictionaryIn(parts[i]));
-    save(*store);
     const auto first = readFile(file, 1u << 20);
     const auto again = ZRDAnnotationStore::initWithDatabase(file, directories);
     fuzz::require(again->annotations().size() == store->annotations().size());
-    save(*again);
+    fuzz::require(!again->saveDb());
     const auto second = readFile(file, 1u << 20);
     fuzz::require(first && second && *first == *second);
     return 0;

@@ -98,8 +98,8 @@ TEST_F(AnnotationRequestsTest, NoHostCanFillTheStoreForOthers) {
         return Dictionary{{"k", Array(std::vector<Value>(count, Value(1)))}};
     };
     // What an earlier daemon has stored leaves room for less than what may be read back.
-    zorvan::annotate(*server_, {{"extension", withObjects(470'000)}},
-                     *server_->findPlugIn(uuid(0)));
+    server_->setAnnotation(Dictionary{{"extension", withObjects(470'000)}},
+                           *server_->findPlugIn(uuid(0)));
     const Dictionary extension = withObjects(60'000), large{{"extension", extension}};
     LogLines log(LogLines::Private::Hidden);
     const std::string told = "ops I: client " + std::to_string(getpid()) + " plug-in <private>(" +
@@ -121,7 +121,7 @@ TEST_F(AnnotationRequestsTest, NoHostCanFillTheStoreForOthers) {
     EXPECT_EQ(bulkAnnotate(Dictionary{{uuid(0).string(), more}}), refused);
     const ZRDPlugInRef plugIn = server_->findPlugIn(uuid(1));
     EXPECT_TRUE(server_->hasShareForAnnotation({{"extension", more}}, *plugIn, {1, 1, 0}));
-    zorvan::annotate(*server_, large, *plugIn, platform::Origin{1, 1, 0});
+    server_->setAnnotation(large, *plugIn, platform::Origin{1, 1, 0});
     EXPECT_EQ(annotate(Dictionary{{"extension", more}}, Array{uuid(0)}), Dictionary())
         << "what somebody else has replaced is theirs";
 }

@@ -3,7 +3,6 @@
 #include <algorithm>
 #include <atomic>
 #include <functional>
-#include <future>
 #include <map>
 #include <memory>
 #include <optional>
@@ -20,7 +19,6 @@
 #include "zrd/HostProcess.h"
 #include "zrd/PlugInContext.h"
 #include "zrd/ZRDPlugIn.h"
-#include "zrd/ZRDatabase.h"
 
 namespace zorvan {
 
@@ -340,14 +338,5 @@ struct FakeConnection final : platform::Connection {
     std::vector<platform::Message> sent;
     std::atomic<bool> isAnswered = false;
 };
-
-/// Changes an annotation as requests do, and waits for its file.
-inline void annotate(ZRDatabase& database, const Dictionary& annotation, const ZRDPlugIn& plugIn,
-                     const std::optional<platform::Origin>& origin = std::nullopt) {
-    std::promise<void> saved;
-    database.setAnnotation(annotation, plugIn, origin, platform::Sync::No,
-                           [&] { saved.set_value(); });
-    saved.get_future().wait();
-}
 
 }  // namespace zorvan

@@ -111,8 +111,9 @@ TEST_F(TransactionTest, MatchAnswersForms) {
     EXPECT_THAT(match({{"rules", Dictionary{{"Color", "blue"}}}}), IsEmpty());
     EXPECT_EQ(ask({{"request", "match"}, {"version", 2}}), Dictionary());
 
-    annotate(*server_, {{"election", 2}}, *server_->plugInForProxy(versionless));
-    annotate(*server_, {{"election", 1}}, *server_->plugInForProxy(workspace_->installed[0]));
+    server_->setAnnotation(Dictionary{{"election", 2}}, *server_->plugInForProxy(versionless));
+    server_->setAnnotation(Dictionary{{"election", 1}},
+                           *server_->plugInForProxy(workspace_->installed[0]));
     const Value matches = *ask({{"request", "match"}}).find("matches");
     const Array& forms = *matches.packed()->value()->array();
     EXPECT_EQ(*forms[0].dictionary()->find("annotations"), Value(Dictionary{{"election", 1}}));

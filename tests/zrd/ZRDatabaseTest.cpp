@@ -51,8 +51,8 @@ class ZRDatabaseTest : public testing::Test {
         return proxy;
     }
     void elect(const TDPlugInProxyRef& proxy, Value election) {
-        annotate(*database_, {{"election", std::move(election)}},
-                 *database_->plugInForProxy(proxy));
+        database_->setAnnotation(Dictionary{{"election", std::move(election)}},
+                                 *database_->plugInForProxy(proxy));
     }
     std::vector<std::string> find(const Dictionary& query) {
         std::vector<std::string> identifiers;
@@ -185,8 +185,8 @@ TEST_F(ZRDatabaseTest, PlugInsMayElectThemselvesWhenTheUserHasNotChosen) {
     auto proxy = install("chosen", entitled);
     const Dictionary extension{{"k", "v"}};
     for (int election : {-1, 2, 0}) {
-        annotate(*database_, {{"election", election}, {"extension", extension}},
-                 *database_->plugInForProxy(proxy));
+        database_->setAnnotation(Dictionary{{"election", election}, {"extension", extension}},
+                                 *database_->plugInForProxy(proxy));
         workspace_->observer->pluginsWillUninstall({proxy});  // so that the record is built again
         EXPECT_EQ(stored(proxy), (Dictionary{{"election", election == 0 ? 1 : election},
                                              {"extension", extension}}));
