@@ -78,6 +78,9 @@ std::string readStored(const World& world) {
 }
 
 void measureAnnotate(const Run& run, std::size_t count) {
+    const std::string key = fmt::format("annotate-{}/p50", count);
+    const std::string sizeKey = fmt::format("annotate-{}/file-bytes", count);
+    if (!run.report.wants({key, sizeKey})) return;
     const World& world = run.worlds[1];
     Storing storing(world, count, Question::byPoint(10));
     const std::string request = annotateRequest(storing.plugIns[0]);
@@ -87,13 +90,13 @@ void measureAnnotate(const Run& run, std::size_t count) {
     const Plan plan{count < 10000 ? 400 : 60, 5, run.quick ? 0.3 : 2.5};
     const auto p50 = medianOfEach(plan, {timed([&] { storing.client.exchange(request); }),
                                          timed([&] { replaceBarely(beside, stored); })});
-    run.report.add({.key = fmt::format("annotate-{}/p50", count),
+    run.report.add({.key = key,
                     .title = fmt::format("annotate with {} stored, p50", count),
                     .value = p50[0],
                     .besideSource = "baseline",
                     .beside = p50[1],
                     .now = {Target::Kind::RatioAtMost, 3}});
-    run.report.add({.key = fmt::format("annotate-{}/file-bytes", count),
+    run.report.add({.key = sizeKey,
                     .title = "  its file",
                     .value = static_cast<double>(stored.size()),
                     .unit = "B"});
@@ -102,6 +105,8 @@ void measureAnnotate(const Run& run, std::size_t count) {
 /// Beside it, as many bare replacements of the file as it is in the end; a tenth of them is made.
 void measureBulkAnnotate(const Run& run) {
     constexpr std::size_t kEntries = 1000;
+    const std::string key = fmt::format("bulk-annotate-{}/p50", kEntries);
+    if (!run.report.wants({key})) return;
     const World& world = run.worlds[1];
     Storing storing(world, 0, Question::ofAll(kEntries));
     const std::string request = bulkAnnotateRequest(storing.plugIns);
@@ -116,7 +121,7 @@ void measureBulkAnnotate(const Run& run) {
                                replaceBarely(world.annotationsFile() + ".bare", stored);
                        })());
     }
-    run.report.add({.key = fmt::format("bulk-annotate-{}/p50", kEntries),
+    run.report.add({.key = key,
                     .title = fmt::format("bulk-annotate of {}, p50", kEntries),
                     .value = median(std::move(bulk)),
                     .besideSource = "baseline",
@@ -171,6 +176,7 @@ std::optional<double> timeUntilFound(FrameClient& client, const Question& questi
 }
 
 void measureAppearance(const Run& run) {
+    if (!run.report.wants({"appear/p50"})) return;
     const World& world = run.worlds[1];
     Storing storing(world, 0, Question::byPoint(10));
     Newcomer newcomer(run, world);

@@ -47,6 +47,7 @@ double startBarely(const std::string& executable, const std::string& fifo, int o
 }
 
 void measureReady(const Run& run, FrameClient& client, const std::string& request) {
+    if (!run.report.wants({"ready/p50"})) return;
     const std::string reply(client.exchange(request));
     expectSuccess(reply);
     const EchoServer server(run.scratch, "ready", reply, EchoKind::Blocking);
@@ -62,6 +63,7 @@ void measureReady(const Run& run, FrameClient& client, const std::string& reques
 }
 
 void measureStart(const Run& run, const std::string& executable) {
+    if (!run.report.wants({"start-plug-in/p50"})) return;
     const std::string fifo = run.scratch + "/first-byte";
     if (::mkfifo(fifo.c_str(), 0600) < 0 && errno != EEXIST) failErrno(fifo);
     const platform::UniqueFd output(::open(fifo.c_str(), O_RDWR | O_CLOEXEC));
@@ -80,6 +82,7 @@ void measureStart(const Run& run, const std::string& executable) {
 }  // namespace
 
 void measurePlugIns(const Run& run) {
+    if (!run.report.wants({"ready/p50", "start-plug-in/p50"})) return;
     const World& world = run.largest();
     const Child daemon = world.startDaemon();
     FrameClient client(waitForSocket(world.socketPath(), daemon));

@@ -62,6 +62,8 @@ Round connectRound(const std::string& socketPath, const std::string& request) {
 }
 
 void measureSmall(const Run& run) {
+    if (!run.report.wants({"small/p50", "connect+small/p50", "connect+small/connect+echo/p50"}))
+        return;
     const std::string socketPath = run.largest().socketPath();
     const std::string request = smallRequest();
     const std::string reply = checkedSmallReply(run.largest());
@@ -130,6 +132,8 @@ double rateOf(const std::string& socketPath, const std::string& request, std::si
 }
 
 void measureRate(const Run& run, std::size_t clients, Target now, Target goal) {
+    const std::string key = fmt::format("{}conn/small/rate", clients);
+    if (!run.report.wants({key})) return;
     const double seconds = run.quick ? 0.1 : 0.5;
     const std::string request = smallRequest();
     const EchoServer server(run.scratch, "many", checkedSmallReply(run.largest()), EchoKind::Many);
@@ -139,7 +143,7 @@ void measureRate(const Run& run, std::size_t clients, Target now, Target goal) {
         zrd.push_back(rateOf(run.largest().socketPath(), request, clients, seconds));
         echo.push_back(rateOf(server.socketPath(), request, clients, seconds));
     }
-    run.report.add({.key = fmt::format("{}conn/small/rate", clients),
+    run.report.add({.key = key,
                     .title = fmt::format("{} client{}, small requests a second", clients,
                                          clients == 1 ? "" : "s"),
                     .value = median(std::move(zrd)),
@@ -151,20 +155,23 @@ void measureRate(const Run& run, std::size_t clients, Target now, Target goal) {
 }
 
 void measureMatch(const Run& run, std::size_t matches, Target now, Target goal) {
+    const std::string key = fmt::format("match-{}/p50", matches);
+    const std::string sizeKey = fmt::format("match-{}/reply-bytes", matches);
+    if (!run.report.wants({key, sizeKey})) return;
     const Question question = Question::byPoint(matches);
     const std::string reply = checkedReply(run.largest(), question);
     const EchoServer server(run.scratch, "match", reply, EchoKind::Blocking);
     const auto p50 = medianOfEach(planForMatches(run, matches),
                                   {exchangeRound(run.largest().socketPath(), question.frame),
                                    exchangeRound(server.socketPath(), question.frame)});
-    run.report.add({.key = fmt::format("match-{}/p50", matches),
+    run.report.add({.key = key,
                     .title = fmt::format("match of {} by extension point, p50", matches),
                     .value = p50[0],
                     .besideSource = "echo",
                     .beside = p50[1],
                     .now = now,
                     .goal = goal});
-    run.report.add({.key = fmt::format("match-{}/reply-bytes", matches),
+    run.report.add({.key = sizeKey,
                     .title = "  its reply",
                     .value = static_cast<double>(reply.size()),
                     .unit = "B"});
@@ -173,6 +180,7 @@ void measureMatch(const Run& run, std::size_t matches, Target now, Target goal) 
 /// Through the client library, beside an echo of the same bytes and their bare streaming decode.
 void measureDecoded(const Run& run, LibraryClient& library, const Question& question,
                     const std::string& name, Target now, Target goal) {
+    if (!run.report.wants({name + "+decode/p50"})) return;
     const std::string reply = checkedReply(run.largest(), question);
     const EchoServer server(run.scratch, "decode", reply, EchoKind::Blocking);
     FrameClient echo(server.socketPath());
@@ -192,6 +200,7 @@ void measureDecoded(const Run& run, LibraryClient& library, const Question& ques
 
 /// The same match in worlds of different sizes, all at once.
 void measureSizes(const Run& run) {
+    if (!run.report.wants({"match-10/of-", "match-10/10000-against-1000"})) return;
     const Question question = Question::byPoint(10);
     std::vector<Round> rounds;
     for (const World& world : run.worlds) {

@@ -2,6 +2,7 @@
 
 #include <fmt/core.h>
 
+#include <algorithm>
 #include <utility>
 
 namespace bench {
@@ -50,7 +51,14 @@ void Report::begin(std::string title, std::string suffix) {
     sections_.push_back({std::move(title), std::move(suffix), {}});
 }
 
+bool Report::wants(std::initializer_list<std::string_view> keys) const {
+    return !only_ || std::ranges::any_of(keys, [this](std::string_view key) {
+        return std::regex_search(std::string(key) + sections_.back().suffix, *only_);
+    });
+}
+
 void Report::add(Figure figure) {
+    if (!wants({figure.key})) return;
     sections_.back().figures.push_back(std::move(figure));
 }
 

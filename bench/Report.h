@@ -1,7 +1,10 @@
 #pragma once
 
+#include <initializer_list>
 #include <optional>
+#include <regex>
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace bench {
@@ -37,8 +40,13 @@ struct Figure {
 /// The figures in the order in which they were measured, in sections (one per way of running).
 class Report {
   public:
+    /// Of figures whose keys contain a match of `only`, if one is given.
+    explicit Report(std::optional<std::regex> only) : only_(std::move(only)) {}
+
     /// Begins a section. `suffix` is appended to the keys of its figures.
     void begin(std::string title, std::string suffix);
+    /// Whether a figure with one of these keys is asked for, in the section that was begun last.
+    bool wants(std::initializer_list<std::string_view> keys) const;
     void add(Figure figure);
 
     /// Lines "key<TAB>value<TAB>unit".
@@ -52,6 +60,7 @@ class Report {
         std::string suffix;
         std::vector<Figure> figures;
     };
+    std::optional<std::regex> only_;
     std::vector<Section> sections_;
 };
 

@@ -87,6 +87,10 @@ double residentAfterMatching(const World& world, Started& started) {
 void measureScan(const Run& run, int rounds) {
     const World& world = run.largest();
     const std::size_t size = world.plugIns();
+    if (!run.report.wants({fmt::format("scan-{}/warm", size),
+                           fmt::format("scan-{}/containers-kept/warm", size),
+                           fmt::format("rss-{}", size)}))
+        return;
     readAndParse(world);
     double resident = 0;
     std::vector<double> scans, parses;
@@ -122,6 +126,8 @@ void measureScan(const Run& run, int rounds) {
 
 void measureStart(const Run& run, int rounds) {
     const World& world = run.largest();
+    const std::string key = fmt::format("start-{}/warm", world.plugIns());
+    if (!run.report.wants({key})) return;
     const std::string request = smallRequest();
     std::string reply;
     std::vector<double> starts, echoes;
@@ -135,7 +141,7 @@ void measureStart(const Run& run, int rounds) {
         FrameClient(server.socketPath()).exchange(request);
         if (i > 0) echoes.push_back(now() - start);
     }
-    run.report.add({.key = fmt::format("start-{}/warm", world.plugIns()),
+    run.report.add({.key = key,
                     .title = "start, full catalogue, to first small reply",
                     .value = median(std::move(starts)),
                     .besideSource = "echo",
@@ -146,20 +152,23 @@ void measureStart(const Run& run, int rounds) {
 
 void measureRescan(const Run& run, int rounds) {
     const World& world = run.largest();
+    const std::string key = fmt::format("rescan-{}/warm", world.plugIns());
+    const std::string residentKey = fmt::format("rss-{}/from-catalogue", world.plugIns());
+    if (!run.report.wants({key, residentKey})) return;
     double resident = 0;
     const double time = medianOf(rounds, [&] {
         Started started = startToMatch(world);
         resident = residentAfterMatching(world, started);
         return started.microseconds;
     });
-    run.report.add({.key = fmt::format("rescan-{}/warm", world.plugIns()),
+    run.report.add({.key = key,
                     .title = "start, nothing changed, to first match",
                     .value = time,
                     .besideSource = "baseline",
                     .beside = medianOf(rounds, timed([&] { statFiles(world); })),
                     .now = atMost(run, 300e3),
                     .goal = atMost(run, 100e3)});
-    run.report.add({.key = fmt::format("rss-{}/from-catalogue", world.plugIns()),
+    run.report.add({.key = residentKey,
                     .title = "resident memory, started from the catalogue",
                     .value = resident,
                     .unit = "MB"});

@@ -1,6 +1,8 @@
 #include <fmt/core.h>
 
 #include <cstdio>
+#include <optional>
+#include <regex>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -19,14 +21,18 @@ using namespace bench;
 
 constexpr unsigned kMostSeconds = 1800;
 constexpr const char* kUsage =
-    "Usage: zrd_bench [--quick] [--tsv]\n"
+    "Usage: zrd_bench [--quick] [--tsv] [--only REGEX]\n"
     "Measures the daemon against bare echoes of the same bytes.\n"
     "  --quick  few rounds and at most 1000 plug-ins, to see that everything runs\n"
-    "  --tsv    lines of key, value and unit instead of a table\n";
+    "  --tsv    lines of key, value and unit instead of a table\n"
+    "  --only   just the figures whose keys (as --tsv has them, without what stands before the "
+    "first\n"
+    "           slash) contain a match of the regular expression\n";
 
 struct Options {
     bool quick = false;
     bool tsv = false;
+    std::optional<std::regex> only{};
 };
 
 void progress(std::string_view text) {
@@ -62,7 +68,7 @@ void run(const Options& options) {
         progress(fmt::format("making {} plug-ins", size));
         worlds.emplace_back(directory.path(), size);
     }
-    Report report;
+    Report report(options.only);
     try {
         measure(worlds, options, directory.path(), report);
     } catch (const Failure&) {
@@ -85,11 +91,13 @@ int main(int argc, char** argv) {
         if (arguments.size() == 4 && arguments[0] == kEchoOption) {
             return serveEcho(arguments[1], arguments[2], arguments[3]);
         }
-        for (const std::string& argument : arguments) {
-            if (argument == "--quick") {
+        for (auto argument = arguments.begin(); argument != arguments.end(); ++argument) {
+            if (*argument == "--quick") {
                 options.quick = true;
-            } else if (argument == "--tsv") {
+            } else if (*argument == "--tsv") {
                 options.tsv = true;
+            } else if (*argument == "--only" && argument + 1 != arguments.end()) {
+                options.only = std::regex(*++argument, std::regex::extended);
             } else {
                 fmt::print(stderr, "{}", kUsage);
                 return 2;
