@@ -73,7 +73,7 @@ std::optional<std::string> ZRBundle::bundleIdentifier() const {
     auto dictionary = bundle_->infoDictionary();
     const auto* identifier = dictionary ? dictionary->find(key::kBundleIdentifier) : nullptr;
     if (!identifier || !identifier->string()) return std::nullopt;
-    return *identifier->string();
+    return identifier->string()->string();
 }
 
 std::string describe(const ZRBundle& bundle) {

@@ -120,14 +120,14 @@ std::optional<ZRError> ZRDaemonClient::errorInReply(const Reply& reply) {
     const Value* codeValue = message.find(message::kErrorCode);
     const Value* textValue = message.find(message::kError);
     std::uint64_t code = codeValue ? codeValue->unsignedInteger().value_or(0) : 0;
-    const std::string* text = textValue ? textValue->string() : nullptr;
+    const auto* text = textValue ? textValue->string() : nullptr;
     if (code == 0) {
-        if (text) ZR_INTERNAL_INCONSISTENCY("zrd reported error without a code: " + *text);
+        if (text) ZR_INTERNAL_INCONSISTENCY("zrd reported error without a code: " + text->string());
         return std::nullopt;
     }
     constexpr std::uint64_t largest = std::numeric_limits<int>::max();
     return ZRErrorWithCode(static_cast<int>(std::min(code, largest)),
-                           text ? *text : "unknown error returned by Zorvan subsystem");
+                           text ? text->string() : "unknown error returned by Zorvan subsystem");
 }
 
 std::optional<Value> ZRDaemonClient::convertToLum(Value value, std::int64_t version) {

@@ -166,7 +166,7 @@ bool isAffirmative(std::string_view text) {
 bool ZRPlugInCore::isDedicated() const {
     const Value* dedicated = pluginKey(key::kDedicated);
     if (!dedicated) return false;
-    if (const std::string* text = dedicated->string()) return isAffirmative(*text);
+    if (const auto* text = dedicated->string()) return isAffirmative(*text);
     return dedicated->isNumber() && !equalsFalse(*dedicated);
 }
 

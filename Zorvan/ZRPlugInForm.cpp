@@ -33,14 +33,14 @@ class FormBuilder {
     std::vector<Dictionary::Entry> entries_;
 };
 
-const std::string* text(const Dictionary& form, std::string_view key) {
+const platform::Text* text(const Dictionary& form, std::string_view key) {
     const Value* value = form.find(key);
     return value ? value->string() : nullptr;
 }
 
 std::optional<std::string> textFact(const Dictionary& form, std::string_view key) {
-    const std::string* found = text(form, key);
-    return found ? std::optional(*found) : std::nullopt;
+    const auto* found = text(form, key);
+    return found ? std::optional(found->string()) : std::nullopt;
 }
 
 std::optional<Dictionary> dictionaryFact(const Dictionary& form, std::string_view key) {
@@ -105,7 +105,7 @@ std::unique_ptr<ZRPlugInCore> ZRPlugInCore::initWithForm(const Dictionary& form)
 
 bool ZRPlugInCore::setupWithForm(const Dictionary& form) {
     const Value* bundleInfo = form.find(form::kBundleInfo);
-    const std::string* uuidText = text(form, form::kUuid);
+    const auto* uuidText = text(form, form::kUuid);
     if (!setup(textFact(form, form::kIdentifier), textFact(form, form::kPath),
                bundleInfo ? std::optional(*bundleInfo) : std::nullopt,
                uuidText ? Uuid::parse(*uuidText) : std::nullopt)) {

@@ -43,7 +43,7 @@ std::optional<ZRError> errorIn(const ClientConnection::Reply& reply) {
     if (!code) return std::nullopt;
     const Value* text = message.find(spawnerd::kError);
     return ZRError{"POSIX", static_cast<int>(code->numberAsInteger().value_or(EPROTO)),
-                   text && text->string() ? std::optional(*text->string()) : std::nullopt};
+                   text && text->string() ? std::optional(text->string()->string()) : std::nullopt};
 }
 
 std::optional<int> statusIn(const ClientConnection::Reply& reply) {

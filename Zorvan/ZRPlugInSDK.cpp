@@ -63,7 +63,7 @@ Array ZRPlugInCore::mergeSharedResources(const Array& sdk, const Array& into) {
     std::unordered_set<std::string_view> known;
     for (const Array* list : {&into, &sdk}) {
         for (const Value& name : *list) {
-            if (name.string() && known.insert(*name.string()).second) names.push_back(name);
+            if (name.string() && known.insert(name.string()->view()).second) names.push_back(name);
         }
     }
     return Array(std::move(names));
@@ -78,7 +78,7 @@ void ZRPlugInCore::resolveSDK(platform::SdkDictionaries& sdks) {
             return;
         }
         // Where the merge leaves no plug-in dictionary the record keeps the one that it has.
-        if (auto sdk = readSDKDictionary(sdks, *name->string())) {
+        if (auto sdk = readSDKDictionary(sdks, name->string()->string())) {
             setDictionaries(mergeDictionary(*sdk, *infoPlist));
         }
     }

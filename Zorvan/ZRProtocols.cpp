@@ -68,12 +68,12 @@ ProtocolRef ZRProtocolNamed(ObjectRuntime& runtime, const std::string& name,
 
 ProtocolRef ZRCompoundProtocol(ObjectRuntime& runtime, const platform::Value& names,
                                std::optional<ZRError>* error) {
-    if (names.string()) return ZRProtocolNamed(runtime, *names.string(), error);
+    if (names.string()) return ZRProtocolNamed(runtime, names.string()->string(), error);
     if (!names.array()) return nullptr;
     std::string name = "__XX_COMPOUND";
     for (const platform::Value& member : *names.array()) {
         if (!member.string()) return nullptr;
-        name += "__" + *member.string();
+        name.append("__").append(*member.string());
     }
     auto compound = runtime.allocateProtocol(name);
     if (!compound) {
@@ -82,7 +82,7 @@ ProtocolRef ZRCompoundProtocol(ObjectRuntime& runtime, const platform::Value& na
         return existing;
     }
     for (const platform::Value& member : *names.array()) {
-        auto protocol = ZRProtocolNamed(runtime, *member.string(), error);
+        auto protocol = ZRProtocolNamed(runtime, member.string()->string(), error);
         if (!protocol) return nullptr;
         compound->incorporated.push_back(std::move(protocol));
     }

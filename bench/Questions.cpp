@@ -161,7 +161,7 @@ std::vector<std::string> pathsIn(std::string_view frame) {
         const Value* path =
             form.dictionary() ? form.dictionary()->find(zorvan::form::kPath) : nullptr;
         if (!path || !path->string()) fail("a match has no path");
-        paths.push_back(*path->string());
+        paths.push_back(path->string()->string());
     }
     return paths;
 }

@@ -58,7 +58,7 @@ Result<std::string_view> AnnotationText::encodeAll(const Dictionary& annotations
     headSize_ = cuts[0];
     const std::size_t* cut = cuts.data();
     for (const auto& [key, annotation] : annotations) {
-        pieces_.push_back({key, cut[1] - cut[0]});
+        pieces_.push_back({key.string(), cut[1] - cut[0]});
         ++cut;
     }
     return std::string_view(whole_);

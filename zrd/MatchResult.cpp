@@ -22,7 +22,7 @@ constexpr std::size_t kMarks = 512;
 constexpr std::size_t kFrame = 4096;
 
 std::size_t encodedSize(const Dictionary& form) {
-    if (const platform::EncodedBytes* kept = form.encoded()) return kept->bytes.size();
+    if (const auto kept = form.encoded()) return kept->bytes.size();
     platform::SliceList slices;
     platform::encodeCbor(form, slices);
     return slices.size();
@@ -88,10 +88,10 @@ bool MatchResult::append(std::shared_ptr<ZRDPlugIn> plugIn, Dictionary form) {
     const Value* replaced = plugIn->replaced();
     accepted_.push_back({std::move(plugIn), std::move(form), bytes});
     if (!replaced) return true;
-    if (replaced->string()) replacers_[*replaced->string()] = index;
+    if (replaced->string()) replacers_[replaced->string()->string()] = index;
     if (!replaced->array()) return true;
     for (const Value& element : *replaced->array()) {
-        if (element.string()) replacers_[*element.string()] = index;
+        if (element.string()) replacers_[element.string()->string()] = index;
     }
     return true;
 }

@@ -29,9 +29,9 @@ std::optional<std::string> resolveAnswering(const std::string& path) {
 void RequestPaths::resolve(platform::PeerLooks::Pace& pace, const std::function<bool()>& isWanted) {
     resolved_.resize(paths_.size());
     for (std::size_t i = 0; i < paths_.size() && isWanted(); ++i) {
-        const std::string* path = paths_[i].string();
-        if (!path || !path->starts_with('/')) return;
-        resolved_[i] = resolveAnswering(*path);
+        const auto* path = paths_[i].string();
+        if (!path || !path->view().starts_with('/')) return;
+        resolved_[i] = resolveAnswering(path->string());
         pace.step();
     }
 }

@@ -18,7 +18,7 @@ constexpr std::size_t kMostTold = 256;
 /// Takes the bytes of a value's texts and data off `left`; false when there are more.
 bool takeBytes(const Value& value, std::size_t& left) {
     std::size_t bytes = 0;
-    if (const std::string* text = value.string()) bytes = text->size();
+    if (const auto* text = value.string()) bytes = text->size();
     if (const platform::Data* data = value.data()) bytes = data->bytes().size();
     if (bytes > left) return false;
     left -= bytes;
@@ -51,8 +51,8 @@ RulePattern::Content RulePattern::read(const Value& pattern,
     for (const Value& alternative : alternatives) {
         // What is no text matches nothing.
         if (!alternative.string()) continue;
-        areKnown = texts.patterns.add(*alternative.string()) && areKnown;
-        given.push_back(*alternative.string());
+        areKnown = texts.patterns.add(alternative.string()->string()) && areKnown;
+        given.push_back(alternative.string()->string());
     }
     if (!areKnown) {
         const std::size_t walks = std::max<std::size_t>(kMostTold / given.size(), 1);
@@ -61,7 +61,7 @@ RulePattern::Content RulePattern::read(const Value& pattern,
     return texts;
 }
 
-bool RulePattern::holds(const Texts& texts, const std::string& text) {
+bool RulePattern::holds(const Texts& texts, std::string_view text) {
     if (!texts.told || texts.told->walks == 0) return texts.patterns.matches(text);
     --texts.told->walks;
     return std::ranges::any_of(texts.told->patterns, [&](const std::string& pattern) {
@@ -83,7 +83,7 @@ bool RulePattern::matches(const Value* value) const {
     }
     const auto* texts = std::get_if<Texts>(&content_);
     if (!texts) return false;
-    if (const std::string* text = value->string()) return holds(*texts, *text);
+    if (const auto* text = value->string()) return holds(*texts, *text);
     const Array* elements = value->array();
     if (!elements) return false;
     return std::ranges::any_of(*elements, [&](const Value& element) {
@@ -100,7 +100,8 @@ bool RuleSet::isAffordable(const Dictionary& rules, std::size_t times) {
 
 RuleSet::RuleSet(const Dictionary& rules, const std::shared_ptr<platform::Types>& types) {
     rules_.reserve(rules.size());
-    for (const auto& [key, pattern] : rules) rules_.push_back({key, RulePattern(pattern, types)});
+    for (const auto& [key, pattern] : rules)
+        rules_.push_back({key.string(), RulePattern(pattern, types)});
 }
 
 }  // namespace zorvan

@@ -45,7 +45,7 @@ class RulePattern {
 
     static Content read(const platform::Value& pattern,
                         const std::shared_ptr<platform::Types>& types);
-    static bool holds(const Texts& texts, const std::string& text);
+    static bool holds(const Texts& texts, std::string_view text);
 
     Content content_;
 };

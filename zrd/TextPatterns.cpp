@@ -63,11 +63,11 @@ void TextPatterns::addComparison(std::string_view prefix, std::string operand) {
     }
 }
 
-bool TextPatterns::matches(const std::string& text) const {
+bool TextPatterns::matches(std::string_view text) const {
     return takesAny_ || isEqual(text) || isOrdered(text) || hasType(text);
 }
 
-bool TextPatterns::isEqual(const std::string& text) const {
+bool TextPatterns::isEqual(std::string_view text) const {
     if (equal_.size() <= kFew)
         return std::ranges::any_of(equal_, [&](const std::string& operand) {
             return compareVersionString(text, operand) == 0;
@@ -76,7 +76,7 @@ bool TextPatterns::isEqual(const std::string& text) const {
     return form && equalForms_.contains(*form);
 }
 
-bool TextPatterns::isOrdered(const std::string& text) const {
+bool TextPatterns::isOrdered(std::string_view text) const {
     return (below_ && compareVersionString(text, *below_) < 0) ||
            (atMost_ && compareVersionString(text, *atMost_) <= 0) ||
            (above_ && compareVersionString(text, *above_) > 0) ||
@@ -84,10 +84,11 @@ bool TextPatterns::isOrdered(const std::string& text) const {
            (other_ && compareVersionString(text, *other_) != 0);
 }
 
-bool TextPatterns::hasType(const std::string& text) const {
-    if (!descendants_.empty() && descendants_.contains(types_->name(text))) return true;
+bool TextPatterns::hasType(std::string_view text) const {
+    if (!descendants_.empty() && descendants_.contains(types_->name(std::string(text))))
+        return true;
     if (ancestors_.empty()) return false;
-    return std::ranges::any_of(types_->lineage(text), [this](const std::string& name) {
+    return std::ranges::any_of(types_->lineage(std::string(text)), [this](const std::string& name) {
         return ancestors_.contains(name);
     });
 }

@@ -26,13 +26,13 @@ class TextPatterns {
     bool add(const std::string& pattern);
 
     /// Whether one of them holds.
-    bool matches(const std::string& text) const;
+    bool matches(std::string_view text) const;
 
   private:
     void addComparison(std::string_view prefix, std::string operand);
-    bool isEqual(const std::string& text) const;
-    bool isOrdered(const std::string& text) const;
-    bool hasType(const std::string& text) const;
+    bool isEqual(std::string_view text) const;
+    bool isOrdered(std::string_view text) const;
+    bool hasType(std::string_view text) const;
 
     std::shared_ptr<platform::Types> types_;
     std::vector<std::string> equal_;              // each once

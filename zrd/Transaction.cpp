@@ -28,7 +28,7 @@ bool isTooLong(const platform::Array& list) {
 std::shared_ptr<RequestPaths> pathsOf(const platform::Message& request) {
     const Value* type = request.find(message::kRequest);
     if (!type || !type->string()) return nullptr;
-    const std::string& name = *type->string();
+    const std::string_view name = type->string()->view();
     const Value* tokens = request.find(message::kUuids);
     const bool isLock = name == request::kLock && !(tokens && tokens->array());
     if (name != request::kAdd && name != request::kRemove && !isLock) return nullptr;
@@ -79,7 +79,7 @@ void Transaction::dispatch() {
     server().mainQueue().assertCurrent();
 
     const Value* typeValue = request_.find(message::kRequest);
-    const std::string* type = typeValue ? typeValue->string() : nullptr;
+    const auto* type = typeValue ? typeValue->string() : nullptr;
     version_ = unsignedUnder(message::kVersion);
     if (version_ != kProtocolVersion && version_ != kProtocolVersionWithoutForms) {
         return fail(kZRErrorVersion,
@@ -88,7 +88,8 @@ void Transaction::dispatch() {
     }
     if (!client_->acceptWork()) return;
 
-    const char* typeText = type ? type->c_str() : nullptr;
+    const std::string typeCopy = type ? type->string() : "";
+    const char* typeText = type ? typeCopy.c_str() : nullptr;
     EVLOG_DEBUG(ops(), "client {} requested {}", client_->pid(), pub(typeText));
     probes::request(client_->pid(), typeText);
     if (!type) return fail(kZRErrorInvalidRequest, "invalid request format (missing type)");
@@ -127,17 +128,18 @@ const platform::Array* Transaction::requestedPaths() {
 
 std::optional<Transaction::NamedPath> Transaction::namedPath(const platform::Array& paths,
                                                              std::size_t index) {
-    const std::string* path = paths[index].string();
-    if (!path) {
+    const auto* text = paths[index].string();
+    if (!text) {
         fail(kZRErrorInvalidRequest, "invalid request format");
         return std::nullopt;
     }
-    if (!path->starts_with('/')) {
-        fail(kZRErrorPath, fmt::format("absolute path required: {}", *path));
+    const std::string path = text->string();
+    if (!path.starts_with('/')) {
+        fail(kZRErrorPath, fmt::format("absolute path required: {}", path));
         return std::nullopt;
     }
     auto resolved = paths_->resolved(index);
-    if (!resolved) return NamedPath{*path, false};
+    if (!resolved) return NamedPath{path, false};
     return NamedPath{*std::move(resolved), true};
 }
 

@@ -189,14 +189,14 @@ bool ZRDPlugIn::hasEntitlement(std::string_view name) const {
     return value && !platform::equalsFalse(*value);
 }
 
-const std::string& ZRDPlugIn::annotationKey() const {
-    return replaced_ && replaced_->string() ? *replaced_->string() : identifier();
+std::string ZRDPlugIn::annotationKey() const {
+    return replaced_ && replaced_->string() ? replaced_->string()->string() : identifier();
 }
 
 Dictionary ZRDPlugIn::prunedInfoDictionaryFor(const Dictionary& dictionary) {
     Dictionary pruned;
     for (const auto& [key, value] : dictionary) {
-        if (!key.starts_with("DT")) pruned.set(key, value);
+        if (!key.view().starts_with("DT")) pruned.set(key, value);
     }
     return pruned;
 }

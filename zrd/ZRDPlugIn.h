@@ -83,7 +83,7 @@ class ZRDPlugIn final : public ZRPlugInCore {
     const platform::Value* replaced() const { return replaced_; }
     /// The key of the user's choices about this plug-in: the identifier that it replaces, else its
     /// own.
-    const std::string& annotationKey() const;
+    std::string annotationKey() const;
 
     /// `dictionary` without the entries whose keys begin with "DT".
     static platform::Dictionary prunedInfoDictionaryFor(const platform::Dictionary& dictionary);

@@ -24,7 +24,7 @@ std::optional<std::string> ZRDPlugIn::allowForClient(const HostProcess& host,
     if (auto refusal = restriction.refusal(*this)) return refusal;
     if (!hostEntitlement_) return std::nullopt;
     // A demand that names no entitlement cannot be met by anybody.
-    if (!hostEntitlement_->string() || !host.hasEntitlement(*hostEntitlement_->string())) {
+    if (!hostEntitlement_->string() || !host.hasEntitlement(hostEntitlement_->string()->string())) {
         return fmt::format("the host does not have the \"{}\" entitlement",
                            describe(*hostEntitlement_));
     }
@@ -51,7 +51,7 @@ std::set<std::string> ZRDPlugIn::allowedVSKServices() const {
         const Value* granted = record.find(platform::kConsentGranted);
         const Value* service = record.find(platform::kConsentService);
         if (granted && granted->boolean().value_or(false) && service && service->string()) {
-            services.insert(*service->string());
+            services.insert(service->string()->string());
         }
     }
     return services;

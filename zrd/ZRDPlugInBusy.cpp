@@ -14,8 +14,8 @@ using platform::Value;
 std::optional<Dictionary> ZRDPlugIn::checkBusy() const {
     const Value* bundle = infoKey(key::kBundleIdentifier);
     if (!bundle || !bundle->string()) return std::nullopt;
-    for (const Dictionary& report :
-         context_->assertions->busyInstancesForBundleIdentifiers({*bundle->string()}, path())) {
+    for (const Dictionary& report : context_->assertions->busyInstancesForBundleIdentifiers(
+             {bundle->string()->string()}, path())) {
         const Value* reported = report.find(platform::kAssertionBundleIdentifier);
         if (reported && reported->string()) {
             return Dictionary{{conflict::kBundleIdentifier, *reported}};

@@ -148,14 +148,14 @@ std::optional<Dictionary> ZRDPlugIn::issueResourceExtensions(const Value& resour
     bool sharesTooMany = false;
     std::unordered_set<std::string_view> known;
     for (const Value* element = begin; element != end; ++element) {
-        const std::string* name = element->string();
+        const auto* name = element->string();
         if (!name || known.contains(*name)) continue;
         if (known.size() == kMaxResources) {
             sharesTooMany = true;
             break;
         }
         known.insert(*name);
-        auto token = context_->sandbox->issueReadExtension(bundle, *name, wait);
+        auto token = context_->sandbox->issueReadExtension(bundle, name->string(), wait);
         if (token) {
             extensions.set(*name, *std::move(token));
         } else if (wait == platform::Wait::Never && token.error().code == EAGAIN) {

@@ -61,15 +61,15 @@ char32_t firstCharacter(std::string_view text) {
 
 /// The election that a pattern asks for as text, or none for a pattern that cannot be used here.
 std::optional<std::string> electionPattern(const Value& pattern) {
-    const std::string* text = pattern.string();
+    const auto* text = pattern.string();
     if (!text || text->empty()) return std::nullopt;
-    if (text->front() == '=') return text->substr(1);
+    if (text->view().front() == '=') return std::string(text->view().substr(1));
     // Letters and digits in the sense of Unicode, whatever the process's locale is.
     static const locale_t unicode = newlocale(LC_CTYPE_MASK, "C.UTF-8", nullptr);
     auto first = static_cast<wint_t>(firstCharacter(*text));
     bool usable = unicode ? iswalnum_l(first, unicode) != 0
                           : first < 0x80 && std::isalnum(static_cast<int>(first)) != 0;
-    return usable ? std::optional(*text) : std::nullopt;
+    return usable ? std::optional(text->string()) : std::nullopt;
 }
 
 /// The elections that a query admits, or none when it does not narrow by election.
@@ -95,7 +95,7 @@ bool ZRDatabase::electionAdmits(const std::unordered_set<std::string>& patterns,
                                 const Dictionary& entitlements) {
     const Value* replaced = entitlements.find(entitlement::kReplacePlugIn);
     std::string key =
-        replaced && replaced->string() ? *replaced->string() : identifier.value_or("");
+        replaced && replaced->string() ? replaced->string()->string() : identifier.value_or("");
     auto stored = sync_.sync([&]() -> std::optional<std::uint64_t> {
         const Dictionary* annotation = annotations_->annotationForIdentifier(key);
         const Value* election = annotation ? annotation->find(annotation::kElection) : nullptr;

@@ -53,7 +53,7 @@ Work ask(const World& world) {
         const Value* tokens = reply.find(zorvan::message::kExtensions);
         if (!tokens || !tokens->array() || tokens->array()->size() != 1) fail("no token");
         const auto extension =
-            zorvan::ZRSandboxExtension::initWithExtension(*(*tokens->array())[0].string());
+            zorvan::ZRSandboxExtension::initWithExtension((*tokens->array())[0].string()->string());
         extension->consume();
         if (extension->handle() == 0) fail("a token is refused");
     };

@@ -1,6 +1,7 @@
 // Whatever is decoded is encoded to bytes that decode to the same and stay the same, whether or not
 // dictionaries carry them.
-// Covers: platform/values/Cbor.cpp platform/values/Utf8.cpp platform/values/ValueDescription.cpp
+// Covers: platform/values/Cbor.cpp platform/values/CborDecoder.cpp platform/values/CborHead.cpp
+// platform/values/Decoded.cpp platform/values/Utf8.cpp platform/values/ValueDescription.cpp
 
 #include "fuzz/Support.h"
 #include "platform/values/Cbor.h"

@@ -34,7 +34,7 @@ class BodyCheck {
     const char* check(const Dictionary& dictionary, int depth) {
         if (depth > kMaxCborDepth) return kTooDeep;
         for (const auto& [key, value] : dictionary) {
-            if (const char* wrong = check(key)) return wrong;
+            if (const char* wrong = check(key.view())) return wrong;
             if (const char* wrong = check(value, depth)) return wrong;
         }
         return nullptr;
@@ -47,7 +47,7 @@ class BodyCheck {
 
     const char* check(const Value& value, int depth) {
         if (++count_ > kMaxRequestValues) return "it has too many values";
-        if (const std::string* text = value.string()) return check(*text);
+        if (const auto* text = value.string()) return check(text->view());
         if (const Dictionary* dictionary = value.dictionary()) return check(*dictionary, depth + 1);
         const Array* array = value.array();
         if (!array) return nullptr;
@@ -57,9 +57,9 @@ class BodyCheck {
         return nullptr;
     }
 
-    static const char* check(const std::string& text) {
+    static const char* check(std::string_view text) {
         if (!isValidUtf8(text)) return "it has text that is not UTF-8";
-        return text.find('\0') == std::string::npos ? nullptr : "it has text with a NUL";
+        return text.find('\0') == std::string_view::npos ? nullptr : "it has text with a NUL";
     }
 
     std::size_t count_ = kValuesAround;

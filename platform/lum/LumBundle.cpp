@@ -74,7 +74,7 @@ std::optional<std::string> LumBundle::property(int number) const {
         case ExecutablePath: {
             const std::optional<Dictionary> info = infoDictionary();
             const Value* value = info ? info->find("QFBundleExecutable") : nullptr;
-            const std::string* name = value ? value->string() : nullptr;
+            const auto* name = value ? value->string() : nullptr;
             if (!name || !isSafeName(*name)) return std::nullopt;
             return joinPath(*state_->bundlePath, *name);
         }

@@ -223,7 +223,7 @@ plist_t nodeOfArray(const Array& array) {
 plist_t nodeOfDictionary(const Dictionary& dictionary) {
     plist_t node = ::plist_new_dict();
     for (const auto& [key, value] : dictionary)
-        ::plist_dict_set_item(node, key.c_str(), nodeOf(value));
+        ::plist_dict_set_item(node, key.string().c_str(), nodeOf(value));
     return node;
 }
 
@@ -241,7 +241,7 @@ plist_t nodeOf(const Value& value) {
         case Value::Kind::Data:
             return ::plist_new_data(value.data()->bytes().data(), value.data()->bytes().size());
         case Value::Kind::String:
-            return ::plist_new_string(value.string()->c_str());
+            return ::plist_new_string(value.string()->string().c_str());
         case Value::Kind::Array:
             return nodeOfArray(*value.array());
         case Value::Kind::Dictionary:

@@ -15,7 +15,7 @@ class CostSum {
   public:
     void add(const Value& value) {
         ++cost_.objects;
-        if (const std::string* text = value.string()) addText(*text);
+        if (const auto* text = value.string()) addText(*text);
         if (const Data* data = value.data()) cost_.bytes += data->bytes().size() / 3 * 4;
         if (const Array* array = value.array())
             for (const Value& element : *array) add(element);

@@ -39,7 +39,7 @@ bool ActivationOffer::addItem(const Value& item, std::size_t number, std::size_t
     typesLeft -= types->size();
     for (const Value& type : *types) {
         if (!type.string()) return false;
-        for (std::string& name : types_.lineage(*type.string())) {
+        for (std::string& name : types_.lineage(type.string()->string())) {
             Items& items = conforming_[std::move(name)];
             items.resize((count_ + kBits - 1) / kBits);
             items[number / kBits] |= std::uint64_t{1} << number % kBits;
@@ -61,7 +61,7 @@ bool ActivationOffer::isAcceptedBy(const Value& rule) const {
     for (const auto& [type, value] : *limits) {
         const std::optional<std::int64_t> most = value.numberAsInteger();
         if (!most || *most < 0) return false;
-        const auto found = conforming_.find(types_.name(type));
+        const auto found = conforming_.find(types_.name(type.string()));
         if (found == conforming_.end()) continue;
         if (countOf(found->second) > *most) return false;
         for (std::size_t i = 0; i < listed.size(); ++i) listed[i] |= found->second[i];

@@ -20,20 +20,21 @@ class FileConsent : public Consent {
         const LumBundle& application) override {
         const std::optional<Dictionary> info = application.infoDictionary();
         const Value* value = info ? info->find("QFBundleIdentifier") : nullptr;
-        const std::string* identifier = value ? value->string() : nullptr;
-        if (!identifier || !isSafeName(*identifier + ".plist")) return std::nullopt;
+        if (!value || !value->string()) return std::nullopt;
+        const std::string file = value->string()->string() + ".plist";
+        if (!isSafeName(file)) return std::nullopt;
         // Anybody may claim an identifier. Where it lies tells one application from another.
         const auto path = application.property(LumBundle::BundlePath);
         const auto place = path ? canonicalPath(*path) : std::nullopt;
         if (!place) return std::nullopt;
-        return readRecords(joinPath(folder_, *identifier + ".plist"), *place);
+        return readRecords(joinPath(folder_, file), *place);
     }
 
   private:
     static bool isOf(const Dictionary& record, const std::string& place) {
         const Value* path = record.find(kConsentPath);
-        const std::string* text = path ? path->string() : nullptr;
-        return text && text->starts_with('/') && canonicalPath(*text) == place;
+        const auto* text = path ? path->string() : nullptr;
+        return text && text->view().starts_with('/') && canonicalPath(text->string()) == place;
     }
 
     static std::optional<std::vector<Dictionary>> readRecords(const std::string& path,

@@ -51,7 +51,7 @@ std::optional<Dictionary> readList(int bundle, const char* name) {
 std::string textAt(const Dictionary& info, std::initializer_list<const char*> keys) {
     for (const char* key : keys) {
         const Value* value = info.find(key);
-        if (value && value->string()) return *value->string();
+        if (value && value->string()) return value->string()->string();
     }
     return {};
 }
@@ -104,13 +104,13 @@ std::optional<Error> readEnvironment(const Dictionary& service, Grant& grant) {
     if (!variables) return Error::posix(EINVAL, "\"EnvironmentVariables\" is no dictionary");
     std::size_t bytes = 0;
     for (const auto& [name, content] : *variables) {
-        const std::string* text = content.string();
-        if (!text || !isVariableName(name) || text->find('\0') != std::string::npos)
-            return Error::posix(EINVAL, "environment variable \"" + name + "\"");
+        const auto* text = content.string();
+        if (!text || !isVariableName(name) || text->view().find('\0') != std::string_view::npos)
+            return Error::posix(EINVAL, "environment variable \"" + name.string() + "\"");
         bytes += name.size() + text->size();
         if (bytes > kMaxStringBytes || grant.environment.size() == kMaxStrings)
             return Error::posix(E2BIG, "environment");
-        grant.environment.emplace_back(name, *text);
+        grant.environment.emplace_back(name.string(), text->string());
     }
     return std::nullopt;
 }

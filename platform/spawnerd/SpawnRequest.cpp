@@ -6,7 +6,7 @@
 
 namespace platform::spawnerd {
 
-const std::string* SpawnRequest::text(const char* key) const {
+const Text* SpawnRequest::text(const char* key) const {
     const Value* value = message_.find(key);
     return value ? value->string() : nullptr;
 }
@@ -18,12 +18,12 @@ Result<std::vector<std::string>> SpawnRequest::arguments() const {
     if (!value->array()) return Error::posix(EINVAL, "\"arguments\" is no array");
     std::size_t bytes = 0;
     for (const Value& element : *value->array()) {
-        const std::string* text = element.string();
+        const auto* text = element.string();
         if (!text) return Error::posix(EINVAL, "an argument is no text");
         bytes += text->size();
         if (bytes > kMaxStringBytes || arguments.size() == kMaxStrings)
             return Error::posix(E2BIG, "arguments");
-        arguments.push_back(*text);
+        arguments.push_back(text->string());
     }
     return arguments;
 }

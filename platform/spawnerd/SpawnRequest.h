@@ -21,7 +21,7 @@ class SpawnRequest {
         : connection_(std::move(connection)), message_(std::move(message)) {}
 
     /// The text under a key, or null.
-    const std::string* text(const char* key) const;
+    const Text* text(const char* key) const;
     /// The arguments of a "start"; none of them when the key is absent.
     Result<std::vector<std::string>> arguments() const;
     /// The number of the instance that it is about, if it has one.

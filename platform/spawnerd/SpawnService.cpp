@@ -105,7 +105,7 @@ void SpawnService::accept(const std::shared_ptr<Connection>& connection) {
 }
 
 void SpawnService::serve(const Host& host, const SpawnRequest& request) {
-    const std::string* what = request.text(kRequest);
+    const auto* what = request.text(kRequest);
     if (!what) return request.refuse(Error::posix(EINVAL, "\"request\" is missing"));
     if (*what == kStart) return start(host, request);
     if (*what == kWait) return awaitEnd(host, request, false);

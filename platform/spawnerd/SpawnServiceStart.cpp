@@ -40,12 +40,13 @@ Result<Pool::Share> SpawnService::drawFor(const Host& host) {
 }
 
 void SpawnService::start(const Host& host, const SpawnRequest& request) {
-    const std::string* executable = request.text(kExecutable);
-    if (!executable) return request.refuse(Error::posix(EINVAL, "\"executable\" is missing"));
+    const auto* text = request.text(kExecutable);
+    if (!text) return request.refuse(Error::posix(EINVAL, "\"executable\" is missing"));
+    const std::string executable = text->string();
     const auto arguments = request.arguments();
     if (!arguments) return request.refuse(arguments.error());
-    auto grant = host ? hosts_->grant(host, *executable) : nullptr;
-    if (!grant) return request.refuse(notReady(*executable));
+    auto grant = host ? hosts_->grant(host, executable) : nullptr;
+    if (!grant) return request.refuse(notReady(executable));
     auto share = drawFor(host);
     if (!share) return request.refuse(share.error());
     const std::uint64_t id = ++lastId_;

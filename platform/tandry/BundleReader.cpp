@@ -119,15 +119,15 @@ const Dictionary* dictionaryAt(const Dictionary& dictionary, std::string_view ke
     return value ? value->dictionary() : nullptr;
 }
 
-const std::string* stringAt(const Dictionary& dictionary, std::string_view key) {
+const platform::Text* stringAt(const Dictionary& dictionary, std::string_view key) {
     const Value* value = dictionary.find(key);
     return value ? value->string() : nullptr;
 }
 
 /// The first string under one of the keys: of the plug-in dictionary, then of the top level.
-const std::string* identifierAt(const Dictionary& plugIn, const Dictionary& info,
-                                std::string_view key) {
-    const std::string* text = stringAt(plugIn, key);
+const platform::Text* identifierAt(const Dictionary& plugIn, const Dictionary& info,
+                                   std::string_view key) {
+    const auto* text = stringAt(plugIn, key);
     return text ? text : stringAt(info, key);
 }
 
@@ -152,14 +152,14 @@ std::optional<Error> wrongType(const std::string& file, const Dictionary& info,
 
 /// Names from files become parts of paths.
 std::optional<Error> unsafeName(const std::string& file, std::string_view key,
-                                const std::string* name) {
+                                const platform::Text* name) {
     if (!name || isSafeName(*name)) return std::nullopt;
-    return malformed(
-        file, fmt::format("{} \"{}\" cannot be a file name", key, name->substr(0, kMaxShownName)));
+    return malformed(file, fmt::format("{} \"{}\" cannot be a file name", key,
+                                       name->view().substr(0, kMaxShownName)));
 }
 
 void appendPoint(const Value& value, std::string& points) {
-    if (const std::string* text = value.string()) points.append(*text).push_back('\0');
+    if (const auto* text = value.string()) points.append(*text).push_back('\0');
 }
 
 /// The texts that the matcher would compare with a rule on the extension point.
@@ -365,16 +365,16 @@ std::optional<Error> BundleReader::fill(const BundleFolder& folder, PlugInEntry&
     const Dictionary* extension = dictionaryAt(info, kExtension);
     if (!extension) return malformed(file, "no \"VXExtension\" dictionary, so not a plug-in");
 
-    const std::string* executable = stringAt(info, kExecutable);
+    const auto* executable = stringAt(info, kExecutable);
     if (auto error = unsafeName(file, kExecutable, executable)) return error;
     if (executable) entry.print.executable = *executable;
-    const std::string* sdk = stringAt(*extension, kPointIdentifier);
+    const auto* sdk = stringAt(*extension, kPointIdentifier);
     if (sdk && isSafeName(*sdk)) entry.print.sdk = *sdk;
     const std::size_t fixedSize = entry.print.stamps.size();
     appendNamedStamps(folder, entry.print, entry.print.stamps);
     if (executable &&
         (withDigest || !FileStamp::from(entry.print.stamps.substr(fixedSize)).settled))
-        entry.print.executableDigest = digestOf(folder, *executable, places_);
+        entry.print.executableDigest = digestOf(folder, executable->string(), places_);
 
     if (std::optional<Error> error = complete(info, entry.print.sdk))
         return Error{error->domain, error->code, fmt::format("{}: {}", file, error->text)};
@@ -410,12 +410,12 @@ std::optional<Error> BundleReader::describePlugIn(const BundleFolder& folder,
     if (!extension) return malformed(file, "the merge lost the \"VXExtension\" dictionary");
     const Dictionary& plugIn = *extension;
     if (auto error = wrongType(file, info, plugIn)) return error;
-    const std::string* bundle = stringAt(info, kBundleIdentifier);
-    const std::string* identifier = identifierAt(plugIn, info, kIdentifier);
+    const auto* bundle = stringAt(info, kBundleIdentifier);
+    const auto* identifier = identifierAt(plugIn, info, kIdentifier);
     if (!identifier) identifier = bundle;
     if (!identifier)
         return malformed(file, fmt::format("neither {} nor {}", kIdentifier, kBundleIdentifier));
-    const std::string* original = identifierAt(plugIn, info, kOriginalIdentifier);
+    const auto* original = identifierAt(plugIn, info, kOriginalIdentifier);
     if (!original) original = identifier;
     if (auto error = unsafeName(file, kBundleIdentifier, bundle)) return error;
     if (auto error = unsafeName(file, kIdentifier, identifier)) return error;
@@ -427,7 +427,7 @@ std::optional<Error> BundleReader::describePlugIn(const BundleFolder& folder,
     record.bundleIdentifier = bundle ? *bundle : *identifier;
     record.plugInIdentifier = *identifier;
     record.originalIdentifier = *original;
-    const std::string* version = stringAt(info, "QFBundleVersion");
+    const auto* version = stringAt(info, "QFBundleVersion");
     if (!version) version = stringAt(info, kShortVersion);
     if (version) record.bundleVersion = *version;
     record.onSystemPartition = isOnSystemPartition(folder.path);
@@ -467,7 +467,7 @@ BundleReader::ApplicationReading BundleReader::readApplication(const BundleFolde
         directory ? readDictionary(folder, kInfoPlist) : Result<Dictionary>(directory.error());
     const Result<Dictionary> localized = info ? localizations(folder) : Dictionary();
     if (info) {
-        const std::string* identifier = stringAt(*info, kBundleIdentifier);
+        const auto* identifier = stringAt(*info, kBundleIdentifier);
         if (auto error = unsafeName(file, kBundleIdentifier, identifier))
             EVLOG_ERROR(ops(), "application without identifier: {}", pub(error->text));
         else if (identifier)

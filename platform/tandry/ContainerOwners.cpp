@@ -79,7 +79,7 @@ std::optional<Error> ContainerOwners::read() {
         return malformed;
     wasDamaged_ = contents->contains(kDamaged);
     for (const auto& [place, entry] : *places)
-        if (!entry.dictionary() || !take(place, *entry.dictionary())) return malformed;
+        if (!entry.dictionary() || !take(place.string(), *entry.dictionary())) return malformed;
     return std::nullopt;
 }
 
@@ -89,13 +89,16 @@ bool ContainerOwners::take(const std::string& place, const Dictionary& entry) {
     const Dictionary* containers = dictionaryAt(entry, kContainers);
     if (!place.starts_with('/') || !containers || (application && !application->string()))
         return false;
-    for (const auto& [identifier, container] : *containers) {
-        const std::string* name = container.string();
-        if (!name || !isContainerOf(identifier, *name)) return false;
+    for (const auto& [key, container] : *containers) {
+        const std::string identifier = key.string();
+        const auto* name = container.string();
+        if (!name || !isContainerOf(identifier, name->string())) return false;
         Owners& owners = owners_[identifier];
         for (const auto& [other, owner] : owners)
             if (owner.container == *name) return false;
-        owners[place] = {*name, application ? std::optional(*application->string()) : std::nullopt};
+        owners[place] = {name->string(), application
+                                             ? std::optional(application->string()->string())
+                                             : std::nullopt};
     }
     return true;
 }

@@ -23,7 +23,7 @@ void addLanguage(std::string_view locale, std::vector<std::string>& languages) {
     add(locale.substr(0, locale.find('_')));
 }
 
-const std::string* stringAt(const Dictionary& dictionary, std::string_view key) {
+const platform::Text* stringAt(const Dictionary& dictionary, std::string_view key) {
     const Value* value = dictionary.find(key);
     return value ? value->string() : nullptr;
 }
@@ -54,11 +54,11 @@ LocalizedNames localizedNames(const Dictionary& infoPlist, const Dictionary& loc
         for (const std::string& language : languages) {
             const Value* names = localized.find(language);
             const Dictionary* dictionary = names ? names->dictionary() : nullptr;
-            const std::string* name = dictionary ? stringAt(*dictionary, key) : nullptr;
-            if (name) return *name;
+            const auto* name = dictionary ? stringAt(*dictionary, key) : nullptr;
+            if (name) return name->string();
         }
-        const std::string* name = stringAt(infoPlist, key);
-        return name ? std::optional(*name) : std::nullopt;
+        const auto* name = stringAt(infoPlist, key);
+        return name ? std::optional(name->string()) : std::nullopt;
     };
     LocalizedNames names{text("QFBundleDisplayName"), text("QFBundleName")};
     if (!names.display) names.display = names.brief;

@@ -30,12 +30,12 @@ std::optional<std::string_view> equalityOperand(std::string_view pattern) {
 /// The keys of the values that satisfy the pattern. None when it does not narrow.
 std::optional<std::vector<std::uint64_t>> patternKeys(const Value& pattern) {
     std::vector<std::uint64_t> keys;
-    auto add = [&keys](const std::string& text) {
+    auto add = [&keys](std::string_view text) {
         auto operand = equalityOperand(text);
         if (operand) keys.push_back(comparisonKey(*operand));
         return operand.has_value();
     };
-    if (const std::string* text = pattern.string()) {
+    if (const auto* text = pattern.string()) {
         if (!add(*text)) return std::nullopt;
         return keys;
     }

@@ -34,6 +34,39 @@ std::size_t sequenceLength(std::string_view text) {
     return length;
 }
 
+/// Of eight bytes, whether one is below 0x20 or above 0x7F. (Where one is below, the lowest of them
+/// borrows and shows, whatever that does to those above it.)
+bool hasUnusual(std::uint64_t word) {
+    return ((word | (word - 0x2020202020202020U)) & 0x8080808080808080U) != 0;
+}
+
+/// Whether there are ASCII characters only, no control characters among them, as in nearly all
+/// texts that there are.
+bool isPlain(std::string_view text) {
+    std::uint64_t word = 0x2020202020202020U;
+    const char* next = text.data();
+    std::size_t left = text.size();
+    for (; left >= sizeof word; left -= sizeof word, next += sizeof word) {
+        std::memcpy(&word, next, sizeof word);
+        if (hasUnusual(word)) return false;
+    }
+    for (; left > 0; --left, ++next)
+        if (*next < 0x20) return false;  // or above 0x7F
+    return true;
+}
+
+bool isInXml(std::string_view text) {
+    for (std::size_t i = 0; i < text.size(); ++i) {
+        const auto byte = static_cast<unsigned char>(text[i]);
+        if (byte < 0x20 && byte != '\t' && byte != '\n' && byte != '\r') return false;
+        if (byte == 0xEF && text.substr(i + 1, 1) == "\xBF") {
+            const auto last = text.substr(i + 2, 1);
+            if (last == "\xBE" || last == "\xBF") return false;
+        }
+    }
+    return true;
+}
+
 }  // namespace
 
 std::size_t validUtf8Prefix(std::string_view text) {
@@ -56,6 +89,13 @@ std::size_t validUtf8Prefix(std::string_view text) {
         i += length;
     }
     return i;
+}
+
+TextFault textFault(std::string_view text) {
+    if (isPlain(text)) return TextFault::None;
+    if (text.find('\0') != std::string_view::npos) return TextFault::Nul;
+    if (!isValidUtf8(text)) return TextFault::NotUtf8;
+    return isInXml(text) ? TextFault::None : TextFault::NotInXml;
 }
 
 }  // namespace platform

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cmath>
 
+#include "platform/values/Decoded.h"
 #include "platform/values/Utf8.h"
 
 namespace platform {
@@ -13,210 +14,174 @@ namespace {
 constexpr double kFirstStorableDate = -62135596800.0;
 constexpr double kEndOfStorableDates = 253402300800.0;
 
-/// Whether no other copy shares the storage, which its holder may then change.
-template <class T>
-bool isUnshared(const std::shared_ptr<T>& storage) {
-    if (storage.use_count() != 1) return false;
-    // The count alone orders nothing. Taking a reference and dropping it does: what another thread
-    // read before it dropped the last other copy happens before what we write now.
-    std::shared_ptr<T>(storage).reset();
-    return true;
-}
-
-const std::shared_ptr<std::vector<Value>>& emptyArray() {
-    static const auto empty = std::make_shared<std::vector<Value>>();
-    return empty;
+std::string_view keyOf(const Dictionary::Entry& entry) {
+    return entry.first.view();
 }
 
 }  // namespace
 
-Array::Array() : values_(emptyArray()) {}
+class Array::Built final : public Memory {
+  public:
+    explicit Built(std::vector<Value> elements)
+        : Memory(Use::Changed), values(std::move(elements)) {}
 
-Array::Array(std::initializer_list<Value> values)
-    : values_(std::make_shared<std::vector<Value>>(values)) {}
+    std::vector<Value> values;
+};
 
-Array::Array(std::vector<Value> values)
-    : values_(std::make_shared<std::vector<Value>>(std::move(values))) {}
+Array::Array(std::initializer_list<Value> values) : Array(std::vector<Value>(values)) {}
 
-std::size_t Array::size() const {
-    return values_->size();
+Array::Array(std::vector<Value> values) {
+    if (values.empty()) return;
+    auto* built = new Built(std::move(values));
+    *this = Array(Hold(built), built->values.data(), built->values.size());
 }
-const Value& Array::operator[](std::size_t index) const {
-    return (*values_)[index];
-}
-const Value* Array::begin() const {
-    return values_->data();
-}
-const Value* Array::end() const {
-    return values_->data() + values_->size();
-}
+
 void Array::append(Value value) {
-    unshared().push_back(std::move(value));
+    change([&](std::vector<Value>& values) { values.push_back(std::move(value)); });
 }
 void Array::set(std::size_t index, Value value) {
-    unshared()[index] = std::move(value);
+    change([&](std::vector<Value>& values) { values[index] = std::move(value); });
 }
-
 void Array::remove(std::size_t index) {
-    auto& values = unshared();
-    values.erase(values.begin() + static_cast<std::ptrdiff_t>(index));
+    change([&](std::vector<Value>& values) {
+        values.erase(values.begin() + static_cast<std::ptrdiff_t>(index));
+    });
 }
 
-std::vector<Value>& Array::unshared() {
-    if (!isUnshared(values_)) values_ = std::make_shared<std::vector<Value>>(*values_);
-    return *values_;
+template <class Change>
+void Array::change(Change change) {
+    // What was decoded is held by its message's memory, and never changed.
+    auto* built = memory_.mayChange() ? static_cast<Built*>(memory_.get()) : nullptr;
+    if (!built) {
+        built = new Built(std::vector<Value>(begin(), end()));
+        memory_ = Hold(built);
+    }
+    change(built->values);
+    values_ = built->values.data();
+    size_ = built->values.size();
 }
 
 bool Array::operator==(const Array& other) const {
-    return values_ == other.values_ || *values_ == *other.values_;
+    return values_ == other.values_ || std::ranges::equal(*this, other);
 }
 
-struct Dictionary::Storage {
-    std::vector<Entry> entries;  // sorted by key, keys unique
-    std::atomic<const EncodedBytes*> encoded{nullptr};
-
-    Storage() = default;
-    explicit Storage(std::vector<Entry> sorted) : entries(std::move(sorted)) {}
-    Storage(const Storage& other) : entries(other.entries) {}
-    Storage& operator=(const Storage&) = delete;
-    ~Storage() { dropEncoded(); }
+class Dictionary::Built final : public Memory {
+  public:
+    explicit Built(std::vector<Entry> sorted) : Memory(Use::Changed), entries(std::move(sorted)) {
+        changed();
+    }
+    ~Built() override { dropEncoded(); }
 
     void dropEncoded() { delete encoded.exchange(nullptr); }
-
+    void changed() { nodes = {entries.data(), entries.size(), {}}; }
     std::vector<Entry>::iterator at(std::string_view key) {
-        return std::ranges::lower_bound(entries, key, {}, &Entry::first);
+        return std::ranges::lower_bound(entries, key, {}, keyOf);
     }
+
+    std::vector<Entry> entries;
+    Nodes nodes;
+    std::atomic<const EncodedBytes*> encoded{nullptr};
 };
 
-Dictionary::Dictionary() {
-    static const auto empty = std::make_shared<Storage>();
-    storage_ = empty;
-}
-
-Dictionary::Dictionary(std::initializer_list<Entry> entries)
-    : storage_(std::make_shared<Storage>()) {
+Dictionary::Dictionary(std::initializer_list<Entry> entries) {
     for (const auto& [key, value] : entries) set(key, value);
 }
 
 std::optional<Dictionary> Dictionary::fromEntries(std::vector<Entry> entries) {
     auto strictlySorted = [&entries] {
-        return std::ranges::adjacent_find(entries, std::ranges::greater_equal(), &Entry::first) ==
+        return std::ranges::adjacent_find(entries, std::ranges::greater_equal(), keyOf) ==
                entries.end();
     };
     // What encoders write is sorted already.
     if (!strictlySorted()) {
-        std::ranges::sort(entries, {}, &Entry::first);
+        std::ranges::sort(entries, {}, keyOf);
         if (!strictlySorted()) return std::nullopt;
     }
-    Dictionary dictionary;
-    if (!entries.empty()) dictionary.storage_ = std::make_shared<Storage>(std::move(entries));
-    return dictionary;
-}
-
-std::size_t Dictionary::size() const {
-    return storage_->entries.size();
-}
-const Dictionary::Entry* Dictionary::begin() const {
-    return storage_->entries.data();
-}
-const Dictionary::Entry* Dictionary::end() const {
-    return begin() + size();
+    if (entries.empty()) return Dictionary();
+    auto* built = new Built(std::move(entries));
+    return Dictionary(Hold(built), &built->nodes);
 }
 
 const Value* Dictionary::find(std::string_view key) const {
-    auto found = storage_->at(key);
-    if (found == storage_->entries.end() || found->first != key) return nullptr;
-    return &found->second;
+    const Entry* found = std::ranges::lower_bound(begin(), end(), key, {}, keyOf);
+    return found != end() && found->first == key ? &found->second : nullptr;
 }
 
 void Dictionary::set(std::string_view key, Value value) {
-    Storage& storage = unshared();
-    auto found = storage.at(key);
-    if (found != storage.entries.end() && found->first == key) {
+    Built& built = unshared();
+    const auto found = built.at(key);
+    if (found != built.entries.end() && found->first == key) {
         found->second = std::move(value);
     } else {
-        storage.entries.emplace(found, key, std::move(value));
+        built.entries.emplace(found, key, std::move(value));
     }
+    built.changed();
 }
 
 void Dictionary::remove(std::string_view key) {
     if (!contains(key)) return;
-    Storage& storage = unshared();
-    storage.entries.erase(storage.at(key));
+    Built& built = unshared();
+    built.entries.erase(built.at(key));
+    built.changed();
 }
 
-const EncodedBytes* Dictionary::encoded() const {
-    return storage_->encoded.load(std::memory_order_acquire);
+std::optional<EncodedBytes> Dictionary::encoded() const {
+    if (!nodes_) return std::nullopt;
+    if (!nodes_->encoded.empty())
+        return EncodedBytes{static_cast<Decoded*>(memory_.get())->bytes(), nodes_->encoded};
+    if (memory_.get()->use() == Memory::Use::Fixed) return std::nullopt;
+    const auto* kept = static_cast<Built*>(memory_.get())->encoded.load(std::memory_order_acquire);
+    return kept ? std::optional(*kept) : std::nullopt;
 }
 
 void Dictionary::keepEncoded(EncodedBytes bytes) const {
-    // All empty dictionaries share their storage, which would keep the bytes' owner for ever.
-    if (empty()) return;
+    if (empty() || memory_.get()->use() == Memory::Use::Fixed) return;
     auto* kept = new EncodedBytes(std::move(bytes));
     const EncodedBytes* none = nullptr;
-    if (!storage_->encoded.compare_exchange_strong(none, kept, std::memory_order_acq_rel))
+    if (!static_cast<Built*>(memory_.get())
+             ->encoded.compare_exchange_strong(none, kept, std::memory_order_acq_rel))
         delete kept;
 }
 
-Dictionary::Storage& Dictionary::unshared() {
-    if (isUnshared(storage_)) {
-        storage_->dropEncoded();
+Dictionary::Built& Dictionary::unshared() {
+    auto* built = memory_.mayChange() ? static_cast<Built*>(memory_.get()) : nullptr;
+    if (built) {
+        built->dropEncoded();
     } else {
-        storage_ = std::make_shared<Storage>(*storage_);
+        built = new Built(std::vector<Entry>(begin(), end()));
+        *this = Dictionary(Hold(built), &built->nodes);
     }
-    return *storage_;
+    return *built;
 }
 
 bool Dictionary::operator==(const Dictionary& other) const {
-    return storage_ == other.storage_ || storage_->entries == other.storage_->entries;
+    return nodes_ == other.nodes_ || std::ranges::equal(*this, other);
 }
 
-/// Either the value or the bytes.
-struct Packed::Content {
-    std::optional<Value> value;
-    EncodedBytes bytes;
+class Packed::Made final : public Memory {
+  public:
+    explicit Made(Value made) : Memory(Use::Fixed), value(std::move(made)) {}
+
+    const Value value;
 };
 
-Packed::Packed(Value value)
-    : content_(std::make_shared<const Content>(Content{std::move(value), {}})) {}
-Packed::Packed(EncodedBytes bytes)
-    : content_(std::make_shared<const Content>(Content{std::nullopt, std::move(bytes)})) {}
+Packed::Packed(Value value) : bytes_(Hold(new Made(std::move(value))), {}) {}
+
+Packed::Packed(const EncodedBytes& bytes)
+    : bytes_(Hold(new Decoded(bytes.owner)), bytes.bytes.empty() ? "" : bytes.bytes) {}
 
 const Value* Packed::value() const {
-    return content_->value ? &*content_->value : nullptr;
+    return bytes_.view().data() ? nullptr : &static_cast<Made*>(bytes_.memory())->value;
 }
-const EncodedBytes& Packed::bytes() const {
-    return content_->bytes;
+
+EncodedBytes Packed::bytes() const {
+    if (value()) return {};
+    return {static_cast<Decoded*>(bytes_.memory())->bytes(), bytes_.view()};
 }
 
 bool Packed::operator==(const Packed& other) const {
-    return content_ == other.content_ ||
-           (content_->value == other.content_->value && bytes().bytes == other.bytes().bytes);
-}
-
-Value::Kind Value::kind() const {
-    static constexpr Kind kinds[] = {Kind::Boolean, Kind::Integer,    Kind::Integer, Kind::Real,
-                                     Kind::Date,    Kind::Data,       Kind::String,  Kind::Uuid,
-                                     Kind::Array,   Kind::Dictionary, Kind::Packed};
-    return kinds[content_.index()];
-}
-
-const std::string* Value::string() const {
-    const auto* shared = std::get_if<String>(&content_);
-    return shared ? shared->get() : nullptr;
-}
-
-const Array* Value::array() const {
-    return std::get_if<Array>(&content_);
-}
-const Dictionary* Value::dictionary() const {
-    return std::get_if<Dictionary>(&content_);
-}
-const Data* Value::data() const {
-    return std::get_if<Data>(&content_);
-}
-const Packed* Value::packed() const {
-    return std::get_if<Packed>(&content_);
+    if (value() && other.value()) return *value() == *other.value();
+    return !value() && !other.value() && bytes_.view() == other.bytes_.view();
 }
 
 namespace {
@@ -312,7 +277,6 @@ struct NumberEquality {
 bool Value::operator==(const Value& other) const {
     if (isNumber() || other.isNumber())
         return std::visit(NumberEquality{}, content_, other.content_);
-    if (const auto* text = string()) return other.string() && *text == *other.string();
     return content_ == other.content_;
 }
 
@@ -325,18 +289,8 @@ bool equalsFalse(const Value& value) {
 
 namespace {
 
-/// Whether text holds only characters of XML 1.0: no control character but tab, line feed and
-/// carriage return, not U+FFFE or U+FFFF, and nothing that is not UTF-8.
 bool isXmlText(std::string_view text) {
-    for (std::size_t i = 0; i < text.size(); ++i) {
-        auto byte = static_cast<unsigned char>(text[i]);
-        if (byte < 0x20 && byte != '\t' && byte != '\n' && byte != '\r') return false;
-        if (byte == 0xEF && text.substr(i + 1, 1) == "\xBF") {
-            auto last = text.substr(i + 2, 1);
-            if (last == "\xBE" || last == "\xBF") return false;
-        }
-    }
-    return isValidUtf8(text);
+    return textFault(text) == TextFault::None;
 }
 
 bool isPropertyListWithin(const Value& value, int levels) {
@@ -370,6 +324,35 @@ bool isPropertyListWithin(const Value& value, int levels) {
 
 bool isPropertyList(const Value& value, int levels) {
     return isPropertyListWithin(value, levels);
+}
+
+namespace {
+
+Value detachedValue(const Value& value) {
+    if (const Text* text = value.string()) return text->view();
+    if (const Data* data = value.data()) return Data(data->bytes());
+    if (const Dictionary* dictionary = value.dictionary()) return detached(*dictionary);
+    if (const Array* array = value.array()) {
+        std::vector<Value> values;
+        values.reserve(array->size());
+        for (const Value& element : *array) values.push_back(detachedValue(element));
+        return Array(std::move(values));
+    }
+    if (const Packed* packed = value.packed(); packed && !packed->value()) {
+        auto own = std::make_shared<const std::string>(packed->bytes().bytes);
+        return Packed(EncodedBytes{own, *own});
+    }
+    return value;
+}
+
+}  // namespace
+
+Dictionary detached(const Dictionary& value) {
+    std::vector<Dictionary::Entry> entries;
+    entries.reserve(value.size());
+    for (const auto& [key, element] : value)
+        entries.emplace_back(Text(key.view()), detachedValue(element));
+    return *Dictionary::fromEntries(std::move(entries));
 }
 
 std::size_t countValues(const Value& value, std::size_t limit) {

@@ -13,6 +13,8 @@
 #include <variant>
 #include <vector>
 
+#include "platform/values/Memory.h"
+#include "platform/values/Text.h"
 #include "platform/values/Uuid.h"
 
 namespace platform {
@@ -25,20 +27,6 @@ struct Date {
     bool operator==(const Date&) const = default;
 };
 
-/// An immutable string of bytes; copies share it.
-class Data {
-  public:
-    Data() : bytes_(std::make_shared<const std::string>()) {}
-    explicit Data(std::string bytes)
-        : bytes_(std::make_shared<const std::string>(std::move(bytes))) {}
-
-    std::string_view bytes() const { return *bytes_; }
-    bool operator==(const Data& other) const { return bytes() == other.bytes(); }
-
-  private:
-    std::shared_ptr<const std::string> bytes_;
-};
-
 /// The encoded form (platform/values/Cbor.h) of a value, which may be a slice of a larger buffer
 /// that it keeps alive. Immutable.
 struct EncodedBytes {
@@ -46,18 +34,28 @@ struct EncodedBytes {
     std::string_view bytes;
 };
 
-/// An ordered list of values. A value type: copies share their storage until one of them is
-/// changed, and reading shared storage from several threads is safe.
+/// An ordered list of values. A value type: copies share its memory until one of them is changed,
+/// and reading shared memory from several threads is safe.
 class Array {
   public:
-    Array();
+    Array() = default;
+    Array(const Array&) = default;
+    Array(Array&& other) noexcept { swap(other); }
+    Array& operator=(Array other) noexcept {
+        swap(other);
+        return *this;
+    }
+    ~Array() = default;
     Array(std::initializer_list<Value> values);
     explicit Array(std::vector<Value> values);
+    /// Values that lie in the memory.
+    Array(Hold memory, const Value* values, std::size_t size)
+        : memory_(std::move(memory)), values_(values), size_(size) {}
 
-    std::size_t size() const;
-    bool empty() const { return size() == 0; }
+    std::size_t size() const { return size_; }
+    bool empty() const { return size_ == 0; }
     const Value& operator[](std::size_t index) const;
-    const Value* begin() const;
+    const Value* begin() const { return values_; }
     const Value* end() const;
 
     void append(Value value);
@@ -68,30 +66,55 @@ class Array {
     bool operator==(const Array& other) const;
 
   private:
-    std::vector<Value>& unshared();
+    class Built;
 
-    std::shared_ptr<std::vector<Value>> values_;
+    template <class Change>
+    void change(Change change);
+    void swap(Array& other) noexcept {
+        std::swap(memory_, other.memory_);
+        std::swap(values_, other.values_);
+        std::swap(size_, other.size_);
+    }
+
+    Hold memory_;
+    const Value* values_ = nullptr;
+    std::size_t size_ = 0;
 };
 
 /// A map from text keys to values, iterated in the byte order of its keys. A value type: copies
-/// share their storage until one of them is changed, and reading shared storage from several
-/// threads is safe.
+/// share its memory until one of them is changed, and reading shared memory from several threads is
+/// safe.
 ///
-/// Shared storage may carry its own encoded bytes (`keepEncoded`), so that a dictionary that is
-/// sent often is encoded once; changing a dictionary drops them for that copy.
+/// It may carry its own encoded bytes, so that a dictionary that is sent often is encoded once;
+/// changing a dictionary drops them for that copy.
 class Dictionary {
   public:
-    using Entry = std::pair<std::string, Value>;
+    using Entry = std::pair<Text, Value>;
+    /// What is in it, all of which lies in its memory.
+    struct Nodes {
+        const Entry* entries;  // sorted by key, keys unique
+        std::size_t size;
+        /// The bytes that it was decoded from, if it carries them; its memory is `Decoded` then.
+        std::string_view encoded;
+    };
 
-    Dictionary();
+    Dictionary() = default;
+    Dictionary(const Dictionary&) = default;
+    Dictionary(Dictionary&& other) noexcept { swap(other); }
+    Dictionary& operator=(Dictionary other) noexcept {
+        swap(other);
+        return *this;
+    }
+    ~Dictionary() = default;
     /// The later of two entries of one key wins.
     Dictionary(std::initializer_list<Entry> entries);
     /// Takes entries in any order. None when two of them have the same key.
     static std::optional<Dictionary> fromEntries(std::vector<Entry> entries);
+    Dictionary(Hold memory, const Nodes* nodes) : memory_(std::move(memory)), nodes_(nodes) {}
 
-    std::size_t size() const;
+    std::size_t size() const { return nodes_ ? nodes_->size : 0; }
     bool empty() const { return size() == 0; }
-    const Entry* begin() const;
+    const Entry* begin() const { return nodes_ ? nodes_->entries : nullptr; }
     const Entry* end() const;
 
     /// The value under `key`, or null. The pointer is good until this copy is changed or goes away.
@@ -102,21 +125,26 @@ class Dictionary {
     /// Removes the entry under `key`; does nothing, and unshares nothing, when there is none.
     void remove(std::string_view key);
 
-    /// The encoded bytes that this storage carries, or null.
-    const EncodedBytes* encoded() const;
-    /// Gives this storage its encoded bytes, which must be the encoding of just these entries. Safe
-    /// to call while other threads read; does nothing when the storage carries bytes already, and
-    /// nothing for an empty dictionary.
+    /// The encoded bytes that it carries, if it does.
+    std::optional<EncodedBytes> encoded() const;
+    /// Gives its memory its encoded bytes, which must be the encoding of just these entries. Safe
+    /// to call while other threads read; does nothing when it carries bytes already, for an empty
+    /// dictionary, and for one that was decoded.
     void keepEncoded(EncodedBytes bytes) const;
 
     bool operator==(const Dictionary& other) const;
 
   private:
-    struct Storage;
+    class Built;
 
-    Storage& unshared();
+    Built& unshared();
+    void swap(Dictionary& other) noexcept {
+        std::swap(memory_, other.memory_);
+        std::swap(nodes_, other.nodes_);
+    }
 
-    std::shared_ptr<Storage> storage_;
+    Hold memory_;
+    const Nodes* nodes_ = nullptr;
 };
 
 /// A property list in its message encoding: one opaque value of a message (platform/values/Cbor.h
@@ -126,19 +154,21 @@ class Dictionary {
 class Packed {
   public:
     explicit Packed(Value value);
-    explicit Packed(EncodedBytes bytes);
+    explicit Packed(const EncodedBytes& bytes);
+    /// A slice of `Decoded` memory.
+    explicit Packed(Bytes slice) : bytes_(std::move(slice)) {}
 
     /// The value it was made from, or null when it was made from bytes.
     const Value* value() const;
     /// The bytes it was made from; empty when it was made from a value.
-    const EncodedBytes& bytes() const;
+    EncodedBytes bytes() const;
 
     bool operator==(const Packed& other) const;
 
   private:
-    struct Content;
+    class Made;
 
-    std::shared_ptr<const Content> content_;
+    Bytes bytes_;  // at a null pointer: of the value in its memory
 };
 
 /// The one value type of the system, which property lists and messages share. There is no null: an
@@ -160,23 +190,24 @@ class Value {
         : content_(integer(value)) {}
     Value(Date value) : content_(value) {}
     Value(Data value) : content_(std::move(value)) {}
-    Value(std::string value) : content_(std::make_shared<const std::string>(std::move(value))) {}
-    Value(std::string_view value) : Value(std::string(value)) {}
-    Value(const char* value) : Value(std::string(value)) {}
+    Value(Text value) : content_(std::move(value)) {}
+    Value(const std::string& value) : Value(Text(value)) {}
+    Value(std::string_view value) : Value(Text(value)) {}
+    Value(const char* value) : Value(Text(value)) {}
     Value(Uuid value) : content_(value) {}
     Value(Array value) : content_(std::move(value)) {}
     Value(Dictionary value) : content_(std::move(value)) {}
     Value(Packed value) : content_(std::move(value)) {}
 
-    Kind kind() const;
+    Kind kind() const { return kKinds[content_.index()]; }
 
     /// Each answers null, or none, when the value is of another kind. A pointer is good as long as
     /// this value is neither changed nor destroyed.
-    const std::string* string() const;
-    const Array* array() const;
-    const Dictionary* dictionary() const;
-    const Data* data() const;
-    const Packed* packed() const;
+    const Text* string() const { return std::get_if<Text>(&content_); }
+    const Array* array() const { return std::get_if<Array>(&content_); }
+    const Dictionary* dictionary() const { return std::get_if<Dictionary>(&content_); }
+    const Data* data() const { return std::get_if<Data>(&content_); }
+    const Packed* packed() const { return std::get_if<Packed>(&content_); }
     std::optional<bool> boolean() const;
     std::optional<double> real() const;
     std::optional<Date> date() const;
@@ -198,9 +229,11 @@ class Value {
     bool operator==(const Value& other) const;
 
   private:
-    using String = std::shared_ptr<const std::string>;
-    using Content = std::variant<bool, std::int64_t, std::uint64_t, double, Date, Data, String,
-                                 Uuid, Array, Dictionary, Packed>;
+    using Content = std::variant<bool, std::int64_t, std::uint64_t, double, Date, Data, Text, Uuid,
+                                 Array, Dictionary, Packed>;
+    static constexpr Kind kKinds[] = {Kind::Boolean, Kind::Integer,    Kind::Integer, Kind::Real,
+                                      Kind::Date,    Kind::Data,       Kind::String,  Kind::Uuid,
+                                      Kind::Array,   Kind::Dictionary, Kind::Packed};
 
     /// Integers are held as int64 when they fit, so that each has one form only.
     template <std::integral T>
@@ -237,5 +270,18 @@ bool isPropertyList(const Value& value, int levels = kMessagePropertyListLevels)
 /// The number of values in `value`, itself and dictionary keys' values included; counting stops
 /// above `limit`.
 std::size_t countValues(const Value& value, std::size_t limit);
+
+/// A copy with memory of its own: what is kept for long must not keep all of a message.
+Dictionary detached(const Dictionary& value);
+
+inline const Value& Array::operator[](std::size_t index) const {
+    return values_[index];
+}
+inline const Value* Array::end() const {
+    return values_ + size_;
+}
+inline const Dictionary::Entry* Dictionary::end() const {
+    return begin() + size();
+}
 
 }  // namespace platform

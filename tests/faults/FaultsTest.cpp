@@ -263,7 +263,7 @@ TEST_F(Faults, WhatAFirstStartHasShownStaysAsItIs) {
         const auto matches = packed ? client_->convertFromLum(*packed) : std::nullopt;
         if (matches) {
             for (const Value& form : *matches->array())
-                shown[*form.dictionary()->find("identifier")->string()] =
+                shown[form.dictionary()->find("identifier")->string()->string()] =
                     *Uuid::parse(*form.dictionary()->find("uuid")->string());
         }
         zrd_->signal(SIGKILL);

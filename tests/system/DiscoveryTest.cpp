@@ -99,7 +99,8 @@ TEST_F(Discovery, ReplacersAreMarkedAndElectThemselves) {
         EXPECT_EQ(found.size(), run == 1 ? 1u : 2u);
         EXPECT_EQ(*found.at(0).find("annotations"), Value(Dictionary{{"election", 1}}));
         std::map<std::string, Dictionary> byName;
-        for (const auto& form : forms(kPoint)) byName[*form.find("identifier")->string()] = form;
+        for (const auto& form : forms(kPoint))
+            byName[form.find("identifier")->string()->string()] = form;
         EXPECT_EQ(*byName["one"].find("overrider"), *byName["better"].find("uuid"));
         EXPECT_EQ(*byName["better"].find("overriding"), Value("one"));
         EXPECT_EQ(*byName["two"].find("annotations"), Value(Dictionary()));
@@ -127,7 +128,7 @@ TEST_F(Discovery, TheApplicationAroundTheHostDecidesWhatItMayUse) {
         const auto forms = platform::parsePropertyList(process->out());
         if (!forms) return identifiers;
         for (const Value& form : *forms->array())
-            identifiers.push_back(*form.dictionary()->find("identifier")->string());
+            identifiers.push_back(form.dictionary()->find("identifier")->string()->string());
         std::ranges::sort(identifiers);
         return identifiers;
     };

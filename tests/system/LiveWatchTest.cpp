@@ -43,7 +43,7 @@ class LiveWatch : public SystemTest {
     }
     std::string uuidOf(const std::string& identifier) {
         const auto found = forms({{"VXExtensionIdentifier", identifier}});
-        return found.size() == 1 ? *found[0].find("uuid")->string() : "";
+        return found.size() == 1 ? found[0].find("uuid")->string()->string() : "";
     }
 
     std::vector<Clock::duration> delays_;

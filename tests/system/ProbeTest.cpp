@@ -42,7 +42,7 @@ TEST_F(SystemTest, TracersAreToldOfEveryProbe) {
     const auto tracer = spawn(debugger, {"-q", "-nx", "-batch", "-x", file, ZRD_PROGRAM});
     ASSERT_TRUE(waitUntil([&] { return std::filesystem::exists(socket_); }));
     client_ = ZRDaemonClient::initWithServiceName(nullptr);
-    const std::string uuid = *forms().at(0).find("uuid")->string();
+    const std::string uuid = forms().at(0).find("uuid")->string()->string();
     EXPECT_EQ(add({path}), "");
     EXPECT_NE(remove({path}), "");
     ask([&](auto& client, auto& reply) {

@@ -27,7 +27,7 @@ class Ready : public PlugInTest {
         EXPECT_EQ(errorOf(reply), "");
         std::vector<std::string> tokens;
         for (const Value& token : *std::get<platform::Message>(reply).find("extensions")->array())
-            tokens.push_back(*token.string());
+            tokens.push_back(token.string()->string());
         return tokens;
     }
     /// What a token lets read of the bundle's executable, or nothing.
@@ -159,7 +159,7 @@ TEST_F(Ready, TokensGiveAccessToTheBundleAndNothingElseDoes) {
     EXPECT_EQ(readable(token), size);
     const auto form = forms().at(0);
     const Dictionary* extensions = form.find("extensions")->dictionary();
-    EXPECT_EQ(readable(*extensions->find(".")->string()), size);
+    EXPECT_EQ(readable(extensions->find(".")->string()->string()), size);
     const auto process = zrctl({"access", "com.test.upper", uuid_.string()});
     const std::string lines = process->out();
     EXPECT_EQ(std::ranges::count(lines, '\n'), 2);

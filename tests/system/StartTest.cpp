@@ -27,7 +27,7 @@ class Start : public SystemTest {
   protected:
     std::string uuidOf(const char* identifier) {
         const auto found = forms({{"VXExtensionIdentifier", identifier}});
-        return found.size() == 1 ? *found[0].find("uuid")->string() : "";
+        return found.size() == 1 ? found[0].find("uuid")->string()->string() : "";
     }
 };
 

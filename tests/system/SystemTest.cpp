@@ -121,7 +121,8 @@ std::vector<Dictionary> SystemTest::forms(const Dictionary& rules, std::uint64_t
 std::vector<std::string> SystemTest::match(const Dictionary& rules, std::uint64_t flags) {
     std::vector<std::string> found;
     for (const Dictionary& form : forms(rules, flags))
-        found.push_back(*form.find("identifier")->string() + ' ' + describe(*form.find("version")));
+        found.push_back(form.find("identifier")->string()->string() + ' ' +
+                        describe(*form.find("version")));
     std::ranges::sort(found);
     return found;
 }

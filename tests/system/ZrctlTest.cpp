@@ -37,7 +37,7 @@ class Zrctl : public SystemTest {
 
 TEST_F(Zrctl, ChoicesReachThePlugInsThatAreNamed) {
     start();
-    EXPECT_EQ(run({"elect", "use", "one", *plugIn("two").find("uuid")->string()}), "0 ");
+    EXPECT_EQ(run({"elect", "use", "one", plugIn("two").find("uuid")->string()->string()}), "0 ");
     EXPECT_EQ(annotations("one"), Value(Dictionary{{"election", 1}}));
     EXPECT_EQ(annotations("two"), Value(Dictionary{{"election", 1}}));
     EXPECT_EQ(run({"elect", "ignore", "one"}), "0 ");

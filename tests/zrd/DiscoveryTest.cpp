@@ -110,9 +110,9 @@ class MatchResultTest : public testing::Test {
         for (const Value& value : forms) {
             const Dictionary& form = *value.dictionary();
             const Value* overriding = form.find("overriding");
-            names.push_back(*form.find("localizedDisplayName")->string() +
+            names.push_back(form.find("localizedDisplayName")->string()->string() +
                             (form.contains("overrider") ? "+" : "") +
-                            (overriding ? ">" + *overriding->string() : ""));
+                            (overriding ? ">" + overriding->string()->string() : ""));
         }
         return names;
     }

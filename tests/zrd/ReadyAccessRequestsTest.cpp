@@ -300,7 +300,7 @@ TEST(Enabling, AFormsTokenIsUsedAgainOnlyWhileTheBundleIsInItsPlace) {
         auto draft = record->draftForm(untouched, error);
         const auto form = record->completedForm(*draft, platform::Wait::Never);
         const Value* found = form->find("extensions")->dictionary()->find(".");
-        return found ? *found->string() : std::string("none");
+        return found ? found->string()->string() : std::string("none");
     };
     const std::string first = token();
     EXPECT_EQ(token(), first);

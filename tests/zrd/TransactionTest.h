@@ -83,7 +83,7 @@ class TransactionTest : public testing::Test {
         const Value* matches = reply.find("matches");
         if (!matches || !matches->packed()) return {"no matches"};
         for (const Value& form : *matches->packed()->value()->array())
-            found.push_back(*form.dictionary()->find("identifier")->string());
+            found.push_back(form.dictionary()->find("identifier")->string()->string());
         return found;
     }
 

@@ -30,7 +30,7 @@ std::string conflictsIn(const zorvan::ZRDaemonClient::Reply& reply) {
     for (const Value& entry : *conflicts->array()) {
         const auto* conflict = entry.dictionary();
         const Value* who = conflict ? conflict->find(zorvan::conflict::kBundleIdentifier) : nullptr;
-        if (who && who->string()) text += (text.empty() ? ": " : ", ") + *who->string();
+        if (who && who->string()) text.append(text.empty() ? ": " : ", ").append(*who->string());
     }
     return text;
 }

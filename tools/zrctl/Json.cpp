@@ -54,7 +54,7 @@ json toJson(const Value& value) {
         case Value::Kind::Data:
             return base64(value.data()->bytes());
         case Value::Kind::String:
-            return *value.string();
+            return value.string()->string();
         case Value::Kind::Uuid:
             return value.uuid()->string();
         case Value::Kind::Array:

@@ -30,7 +30,8 @@ Outcome runAccess(const Options& options) {
                 return Outcome::failure("zrd's reply has no tokens");
             Outcome outcome;
             for (const Value& token : *tokens->array())
-                outcome.output += (token.string() ? *token.string() : std::string()) + '\n';
+                outcome.output +=
+                    (token.string() ? token.string()->string() : std::string()) + '\n';
             return outcome;
         });
 }

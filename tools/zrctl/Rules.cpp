@@ -53,10 +53,10 @@ std::optional<Error> misplacedOperator(const std::string& text) {
 std::string textOf(const Value& pattern) {
     if (platform::equalsTrue(pattern)) return "true";
     if (platform::equalsFalse(pattern)) return "false";
-    const std::string* text = pattern.string();
+    const auto* text = pattern.string();
     if (!text) return describe(pattern);
     // The words would be read as booleans; with the operator they are the same pattern.
-    return *text == "true" || *text == "false" ? "=" + *text : *text;
+    return *text == "true" || *text == "false" ? "=" + text->string() : text->string();
 }
 
 }  // namespace
@@ -87,11 +87,11 @@ std::vector<std::string> ruleTexts(const Dictionary& rules) {
     for (const auto& [key, pattern] : rules) {
         const Array* alternatives = pattern.array();
         if (!alternatives || alternatives->empty()) {
-            texts.push_back(key + '=' + textOf(pattern));
+            texts.push_back(key.string() + '=' + textOf(pattern));
             continue;
         }
         for (const Value& alternative : *alternatives)
-            texts.push_back(key + '=' + textOf(alternative));
+            texts.push_back(key.string() + '=' + textOf(alternative));
     }
     if (texts.empty()) texts.emplace_back();
     return texts;

@@ -123,7 +123,7 @@ TEST_F(HostTest, HostsThatBelongTogetherHaveAQuarterOfTheInstances) {
     EXPECT_EQ(grant(executable), 0);
     const Message refused = start(executable);
     ASSERT_EQ(number(refused, kErrorCode), EAGAIN);
-    EXPECT_NE(refused.find(kError)->string()->find("belongs with"), std::string::npos);
+    EXPECT_NE(refused.find(kError)->string()->view().find("belongs with"), std::string_view::npos);
     hosts.clear();
     EXPECT_TRUE(stepUntil([&] { return processesWith(executable).empty(); }));
     EXPECT_GT(number(start(executable), kInstance), 0);

@@ -322,7 +322,7 @@ TEST_F(LauncherTest, NothingRunsWithoutBubblewrap) {
     EXPECT_EQ(grant(executable, overlay(Dictionary{{"HOME", home.path()}})), 0);
     const Message reply = start(executable);
     EXPECT_EQ(number(reply, kErrorCode), ENOENT);
-    EXPECT_NE(reply.find(kError)->string()->find(home.path("bwrap")), std::string::npos);
+    EXPECT_NE(reply.find(kError)->string()->view().find(home.path("bwrap")), std::string::npos);
     EXPECT_EQ(errorLines("cannot confine plug-ins without"), 1u);
 
     useLauncher({.bubblewrap = "/bin/false"});

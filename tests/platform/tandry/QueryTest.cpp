@@ -79,14 +79,14 @@ bool accepts(const Value& pattern, const Value* value) {
         return std::any_of(
             alternatives->begin(), alternatives->end(),
             [value](const Value& element) { return element.string() && accepts(element, value); });
-    const std::string* text = pattern.string();
-    if (!text || std::string("<>?").find(text->front()) != std::string::npos) return true;
+    const auto* text = pattern.string();
+    if (!text || std::string("<>?").find(text->view().front()) != std::string::npos) return true;
     if (!value) return false;
     if (const Array* array = value->array())
         return std::any_of(array->begin(), array->end(),
                            [&](const Value& element) { return accepts(pattern, &element); });
-    const std::string operand = text->front() == '=' ? text->substr(1) : *text;
-    return value->string() && normalised(*value->string()) == normalised(operand);
+    const std::string operand = text->view().front() == '=' ? std::string(text->view().substr(1)) : text->string();
+    return value->string() && normalised(value->string()->string()) == normalised(operand);
 }
 
 bool accepts(const TDPlugInProxy& plugIn, const Dictionary& query) {

@@ -51,15 +51,15 @@ TEST(Dictionary, ChangingACopyLeavesTheOriginal) {
     changed.remove("a");
     EXPECT_EQ(original, (Dictionary{{"a", 2}, {"b", 3}}));
     EXPECT_EQ(changed, (Dictionary{{"b", 3}, {"c", 4}}));
-    EXPECT_NE(original.encoded(), nullptr);
-    EXPECT_EQ(changed.encoded(), nullptr);
+    EXPECT_TRUE(original.encoded().has_value());
+    EXPECT_FALSE(changed.encoded().has_value());
     original.remove("absent");
-    EXPECT_NE(original.encoded(), nullptr);
+    EXPECT_TRUE(original.encoded().has_value());
     original.set("a", 2);  // alone in its storage now
-    EXPECT_EQ(original.encoded(), nullptr);
+    EXPECT_FALSE(original.encoded().has_value());
 
     Dictionary().keepEncoded({nullptr, "bytes"});
-    EXPECT_EQ(Dictionary().encoded(), nullptr);
+    EXPECT_FALSE(Dictionary().encoded().has_value());
     EXPECT_FALSE(Dictionary::fromEntries({{"b", 1}, {"a", 1}, {"b", 2}}));
     EXPECT_EQ(Dictionary::fromEntries({{"b", 1}, {"a", 2}}), (Dictionary{{"a", 2}, {"b", 1}}));
 
