@@ -2,7 +2,7 @@
 // read as it was. Rows of numbers behind those of the tables say what changes then, and what is
 // looked for.
 // Covers: platform/tandry/CatalogueTables.cpp platform/tandry/Sqlite.cpp
-// Covers: platform/tandry/Snapshot.cpp platform/values/LazyDictionary.cpp
+// Covers: platform/tandry/Snapshot.cpp platform/tandry/TextIndex.cpp platform/values/LazyDictionary.cpp
 
 #include <fmt/format.h>
 

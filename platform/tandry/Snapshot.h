@@ -9,17 +9,16 @@
 #include <vector>
 
 #include "platform/tandry/RegistryState.h"
+#include "platform/tandry/RuleIndexes.h"
+#include "platform/tandry/TextIndex.h"
 
 namespace platform::tandry {
-
-/// A number of a text such that texts which compare equal in rules (digit runs by their numeric
-/// value, everything else byte by byte) have the same number. Others hardly ever share one.
-std::uint64_t comparisonKey(std::string_view text);
 
 /// The installed plug-ins at one moment, with indexes. Immutable; usable from any thread.
 class Snapshot {
   public:
     explicit Snapshot(const RegistryState& state);
+    Snapshot(const Snapshot&) = delete;
     /// The same for a state that differs from the one of `before` by `changes`, at a fraction of
     /// the cost.
     Snapshot(const Snapshot& before, const RegistryState& state, const RegistryChanges& changes);
@@ -35,19 +34,14 @@ class Snapshot {
     TDPlugInProxyList candidates(const Dictionary& query) const;
 
   private:
-    using Position = std::uint32_t;  // in plugIns_
-    /// From a key to the plug-ins that have it, sorted.
-    using Index = std::vector<std::pair<std::uint64_t, Position>>;
-    using Positions = std::vector<Position>;
-
-    std::optional<Positions> find(const Index& index, const Value* pattern) const;
     void append(const PlugInEntry& entry);
     void sort();
 
     TDPlugInProxyList plugIns_;
     std::vector<std::pair<Uuid, Position>> uuids_;  // sorted
-    Index points_;
-    Index identifiers_;
+    TextIndex points_;
+    TextIndex identifiers_;
+    RuleIndexes rules_{plugIns_};
 };
 
 }  // namespace platform::tandry

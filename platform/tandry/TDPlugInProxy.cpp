@@ -6,6 +6,8 @@ namespace platform {
 
 namespace {
 
+constexpr std::string_view kExtension = "VXExtension";
+
 const Dictionary* dictionaryAt(const Dictionary& dictionary, std::string_view key) {
     const Value* value = dictionary.find(key);
     return value ? value->dictionary() : nullptr;
@@ -14,12 +16,16 @@ const Dictionary* dictionaryAt(const Dictionary& dictionary, std::string_view ke
 }  // namespace
 
 const Dictionary* TDPlugInProxy::plugInDictionary() const {
-    return dictionaryAt(infoPlist.get(), "VXExtension");
+    return dictionaryAt(infoPlist.get(), kExtension);
+}
+
+const Dictionary* TDPlugInProxy::attributesIn(const Dictionary& infoPlist) {
+    const Dictionary* plugIn = dictionaryAt(infoPlist, kExtension);
+    return plugIn ? dictionaryAt(*plugIn, "VXExtensionAttributes") : nullptr;
 }
 
 const Dictionary* TDPlugInProxy::attributes() const {
-    const Dictionary* plugIn = plugInDictionary();
-    return plugIn ? dictionaryAt(*plugIn, "VXExtensionAttributes") : nullptr;
+    return attributesIn(infoPlist.get());
 }
 
 std::string describe(const TDPlugInProxy& proxy) {

@@ -39,6 +39,8 @@ struct TDPlugInProxy {
     /// attributes.
     const Dictionary* plugInDictionary() const;
     const Dictionary* attributes() const;
+    /// The same of an Info.plist.
+    static const Dictionary* attributesIn(const Dictionary& infoPlist);
 };
 
 using TDPlugInProxyRef = std::shared_ptr<const TDPlugInProxy>;

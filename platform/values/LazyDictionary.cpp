@@ -18,7 +18,7 @@ LazyDictionary::LazyDictionary(EncodedBytes bytes, FaultHandler onFault)
 const Dictionary& LazyDictionary::get() const {
     // A finished flag costs a system call to set, which records without bytes need not pay.
     if (!state_->isEncoded) return state_->dictionary;
-    std::call_once(state_->decoded, [&state = *state_] {
+    std::call_once(state_->once, [&state = *state_] {
         auto value = decodeCbor(state.bytes, CborOptions::KeepEncoded);
         if (!value) {
             state.onFault(describe(value.error()));
@@ -27,9 +27,16 @@ const Dictionary& LazyDictionary::get() const {
         } else {
             state.onFault("it holds another kind of value");
         }
-        state.bytes = {};
+        state.isDecoded.store(true, std::memory_order_release);
     });
     return state_->dictionary;
+}
+
+void LazyDictionary::look(const std::function<void(const Dictionary&)>& see) const {
+    if (!state_->isEncoded || state_->isDecoded.load(std::memory_order_acquire)) return see(get());
+    // Who looks while another thread decodes reads the same bytes: these stay.
+    const auto value = decodeCbor(state_->bytes, CborOptions::Plain);
+    see(value && value->dictionary() ? *value->dictionary() : get());
 }
 
 }  // namespace platform

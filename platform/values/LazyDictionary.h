@@ -1,5 +1,7 @@
 #pragma once
 
+#include <atomic>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <string_view>
@@ -23,13 +25,16 @@ class LazyDictionary {
     /// The dictionary; the reference is good as long as this object. Made from bytes, it and every
     /// dictionary inside it carry their encoded bytes.
     const Dictionary& get() const;
+    /// Shows it to `see`, without keeping what had to be decoded for that.
+    void look(const std::function<void(const Dictionary&)>& see) const;
 
   private:
     struct State {
         bool isEncoded = false;  // made from bytes
         EncodedBytes bytes;
         FaultHandler onFault = nullptr;
-        std::once_flag decoded;
+        std::once_flag once;
+        std::atomic<bool> isDecoded = false;
         Dictionary dictionary;
     };
     std::shared_ptr<State> state_;

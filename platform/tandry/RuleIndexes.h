@@ -1,0 +1,69 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "platform/tandry/TextIndex.h"
+#include "platform/tandry/Workspace.h"
+
+namespace platform::tandry {
+
+/// What plug-ins have under one key that rules ask for. Immutable once shared.
+class RuleIndex {
+  public:
+    /// Of those at `positions`, which are in order.
+    RuleIndex(std::string key, const TDPlugInProxyList& plugIns, const Positions& positions);
+    /// Takes over what an index of the same key knows of those that have moved.
+    void takeOver(const RuleIndex& before, const Moves& moves);
+
+    const std::string& key() const { return key_; }
+    /// All plug-ins under whose key something satisfies the pattern, and hardly any others, in
+    /// order. None: the pattern takes plug-ins that have nothing there.
+    std::optional<Positions> find(const Value& pattern, std::size_t plugIns) const;
+
+  private:
+    void add(const TDPlugInProxy& plugIn, Position position);
+
+    std::string key_;
+    Positions present_;  // who has anything there, in order
+    TextIndex texts_;
+};
+
+/// The indexes of a snapshot's plug-ins by keys that rules have asked for: each is made when it is
+/// asked for first, and the number is bounded. Usable from any thread.
+class RuleIndexes {
+  public:
+    /// `plugIns` outlives this.
+    explicit RuleIndexes(const TDPlugInProxyList& plugIns) : plugIns_(plugIns) {}
+
+    /// Brings the indexes of a snapshot before up to date: plug-ins at `fresh` are new.
+    void takeOver(const RuleIndexes& before, const Moves& moves, const Positions& fresh);
+
+    /// What the query leaves of the plug-ins by the rule that leaves the fewest, in order; none
+    /// when no rule narrows. Makes one index at the most: it costs a look at every plug-in.
+    std::optional<Positions> find(const Dictionary& query) const;
+
+  private:
+    using Shared = std::shared_ptr<const RuleIndex>;
+    struct Entry {
+        Shared index;
+        std::uint64_t asked;  // when, for the last time
+    };
+
+    static bool isIndexed(std::string_view key);
+    Shared known(std::string_view key) const;
+    Shared make(std::string_view key) const;
+
+    const TDPlugInProxyList& plugIns_;
+    mutable std::mutex mutex_;  // guards what follows
+    mutable std::vector<Entry> entries_;
+    mutable std::uint64_t clock_ = 0;
+};
+
+}  // namespace platform::tandry
