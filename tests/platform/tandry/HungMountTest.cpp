@@ -1,5 +1,6 @@
 #include "tests/support/HungMount.h"
 
+#include <atomic>
 #include <filesystem>
 
 #include "tests/platform/tandry/RegistryFixture.h"
@@ -42,6 +43,7 @@ class HungMountTest : public RegistryTest {
                             {"VXExtensionPointIdentifier", "point"}};
     std::map<std::string, Uuid> uuids;
     test::HungMount hung;
+    std::atomic<bool> isHung = false;
 };
 
 TEST_F(HungMountTest, WhatLeadsThereStaysAsItIsWhileOthersComeAndGo) {
@@ -64,9 +66,10 @@ TEST_F(HungMountTest, WhatLeadsThereStaysAsItIsWhileOthersComeAndGo) {
 TEST_F(HungMountTest, AWalkIsGivenUpInItsMidst) {
     ErrorLines errors;
     onMerge = [&] {
-        onMerge = nullptr;
+        if (isHung.exchange(true)) return;
         EXPECT_TRUE(hung.begin(files.path(apps + "B.app")));
     };
+    settle();  // the threads that walk see it
     addPlugIn(apps + "B.app/PlugIns/B.appex", "b", {}, {{"changed", true}});
     addPlugIn(apps + "A.app/PlugIns/A.appex", "a", kPoint, {{"changed", true}});
     EXPECT_THAT(recorder.take(2), ElementsAre("-a", "+a"));
