@@ -56,7 +56,9 @@ std::string textOf(const Value& pattern) {
     const auto* text = pattern.string();
     if (!text) return describe(pattern);
     // The words would be read as booleans; with the operator they are the same pattern.
-    return *text == "true" || *text == "false" ? "=" + text->string() : text->string();
+    std::string words = text->string();
+    if (*text == "true" || *text == "false") words.insert(0, 1, '=');
+    return words;
 }
 
 }  // namespace
