@@ -56,7 +56,7 @@ Value likeAHosts(const Value& value) {
         Dictionary made;
         for (const auto& [key, element] : *dictionary) {
             const Data* name = element.data();
-            made.set(name ? name->bytes() : key, likeAHosts(element));
+            made.set(name ? name->bytes() : key.view(), likeAHosts(element));
         }
         return made;
     }

@@ -36,6 +36,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     (void)describe(*bundle);
     if (const auto found = consent->copyConsentInformation(*bundle))
         for (const Dictionary& record : *found)
-            fuzz::require(canonicalPath(*record.find(kConsentPath)->string()) == application);
+            fuzz::require(canonicalPath(record.find(kConsentPath)->string()->string()) ==
+                          application);
     return 0;
 }

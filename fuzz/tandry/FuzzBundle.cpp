@@ -120,7 +120,9 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     ::setenv("LC_ALL", languages.substr(languages.rfind(':') + 1).c_str(), 1);
 
     SdkDictionaries sdks(directories);
-    BundleReader reader(sdks, &zorvan::ZRPlugInCore::mergeDictionary, userLanguages());
+    ForeignPlaces places;
+    places.beginWalk();
+    BundleReader reader(sdks, &zorvan::ZRPlugInCore::mergeDictionary, userLanguages(), places);
     reader.beginPass();
     const BundleFolder folder(bundle);
     const auto application = reader.readApplication(folder);

@@ -2,7 +2,8 @@
 // read as it was. Rows of numbers behind those of the tables say what changes then, and what is
 // looked for.
 // Covers: platform/tandry/CatalogueTables.cpp platform/tandry/Sqlite.cpp
-// Covers: platform/tandry/Snapshot.cpp platform/tandry/TextIndex.cpp platform/values/LazyDictionary.cpp
+// Covers: platform/tandry/Snapshot.cpp platform/tandry/TextIndex.cpp
+// platform/values/LazyDictionary.cpp
 
 #include <fmt/format.h>
 
@@ -125,7 +126,7 @@ void lookAt(const Snapshot& snapshot) {
 std::set<std::string> texts(const Array& row) {
     std::set<std::string> texts;
     for (const Value& element : row)
-        if (element.string()) texts.insert(*element.string());
+        if (element.string()) texts.insert(element.string()->string());
     return texts;
 }
 

@@ -18,13 +18,14 @@ namespace {
 std::optional<ContainerClaim> claimIn(const Value& value) {
     const Array* fields = isPropertyList(value) ? value.array() : nullptr;
     if (!fields || fields->size() < 2) return std::nullopt;
-    const std::string* identifier = (*fields)[0].string();
-    const std::string* place = (*fields)[1].string();
+    const Text* identifier = (*fields)[0].string();
+    const Text* place = (*fields)[1].string();
     if (!identifier || !isSafeName(*identifier) || !place) return std::nullopt;
-    ContainerClaim claim{*identifier, *place, std::nullopt};
+    ContainerClaim claim{identifier->string(), place->string(), std::nullopt};
     if (claim.place.starts_with('@')) claim.place.replace(0, 1, fuzz::home().path());
     if (!claim.place.starts_with('/')) return std::nullopt;
-    if (fields->size() > 2 && (*fields)[2].string()) claim.application = *(*fields)[2].string();
+    if (fields->size() > 2 && (*fields)[2].string())
+        claim.application = (*fields)[2].string()->string();
     claim.isRemembered = fields->size() > 3;
     return claim;
 }

@@ -29,7 +29,7 @@ void change(ZRDAnnotationStore& store, const Dictionary& changes) {
     static const PlugIns plugIns;
     static const Origin origin = Origin::of(*AuditToken::ofSelf());
     for (const auto& [identifier, value] : changes) {
-        const auto plugIn = plugIns.all.find(identifier);
+        const auto plugIn = plugIns.all.find(identifier.string());
         if (plugIn == plugIns.all.end() || !isPropertyList(value)) continue;
         const Dictionary* annotation = value.dictionary();
         if (!annotation)

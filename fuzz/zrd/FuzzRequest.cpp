@@ -162,9 +162,9 @@ std::optional<Message> requestIn(std::string_view payload) {
     if (!given || !given->array()) return request;
     Array paths = *given->array();
     for (std::size_t i = 0; i < paths.size(); ++i) {
-        const std::string* path = paths[i].string();
-        if (path && path->starts_with('@'))
-            paths.set(i, fuzz::home().path(std::string_view(*path).substr(1)));
+        const Text* path = paths[i].string();
+        if (path && path->view().starts_with('@'))
+            paths.set(i, fuzz::home().path(path->view().substr(1)));
     }
     request.set(zorvan::message::kPaths, std::move(paths));
     return request;
