@@ -40,7 +40,7 @@ TEST_F(SystemTest, TracersAreToldOfEveryProbe) {
     }
     const std::string file = home_.write("script", script + "run\n");
     const auto tracer = spawn(debugger, {"-q", "-nx", "-batch", "-x", file, ZRD_PROGRAM});
-    ASSERT_TRUE(waitUntil([&] { return std::filesystem::exists(socket_); }));
+    ASSERT_TRUE(waitUntil([&] { return RawClient(socket_).isConnected(); }));
     client_ = ZRDaemonClient::initWithServiceName(nullptr);
     const std::string uuid = forms().at(0).find("uuid")->string()->string();
     EXPECT_EQ(add({path}), "");
