@@ -26,7 +26,9 @@ bool setProcessLimits(pid_t first, const InstanceLimits& limits) {
     return setLimit(first, RLIMIT_NPROC, limits.processes) &&
            setLimit(first, RLIMIT_NOFILE, limits.descriptors) &&
            setLimit(first, RLIMIT_SIGPENDING, kMostSignals) &&
-           setLimit(first, RLIMIT_MSGQUEUE, kMostQueueBytes) && setLimit(first, RLIMIT_CORE, 0);
+           setLimit(first, RLIMIT_MSGQUEUE, kMostQueueBytes) && setLimit(first, RLIMIT_CORE, 0) &&
+           // What an administrator lets the user have, for sound for example, is not a plug-in's.
+           setLimit(first, RLIMIT_RTPRIO, 0) && setLimit(first, RLIMIT_NICE, 0);
 }
 
 }  // namespace platform::spawnerd
