@@ -472,12 +472,9 @@ void SandboxExtension::tryMountsThatHang() {
         "rootmode=40000,user_id=0,group_id=0,fd=" + std::to_string(fuse.get());
     if (::mount("hung", home_.path("hung").c_str(), "fuse", 0, options.c_str()) != 0)
         GTEST_SKIP() << "may not mount";
+    const std::string path = *lum::socketPath(directories_, "test.sandbox");
     std::vector<lum::RawPeer> waiting;
-    for (int i = 0; i < 40; ++i)
-        waiting
-            .emplace_back(
-                lum::unixSocket(*lum::socketPath(directories_, "test.sandbox"), ::connect))
-            .write(hung);
+    for (int i = 0; i < 40; ++i) waiting.emplace_back(lum::unixSocket(path, ::connect)).write(hung);
     const auto begin = std::chrono::steady_clock::now();
     EXPECT_EQ(runTests("SandboxedConsumer.DISABLED_HasItsTurn",
                        {"env", std::string(kTokenVariable) + "=" + token, "setsid", "--wait",
