@@ -1,14 +1,18 @@
 // What peers send to the broker of tokens. Each part of an input is sent by the peer that came
 // last, unless its first letter says something else: see `take`. "@" stands for the token, "~" for
-// that of a bundle that is gone.
+// that of a bundle that is gone. Crowds of other sessions fill the broker: they are other origins.
 // Covers: platform/sandbox/SandboxBroker.cpp
 
 #include <poll.h>
 #include <sys/socket.h>
 #include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
+#include <csignal>
 #include <cstring>
 #include <deque>
+#include <vector>
 
 #include "fuzz/Support.h"
 #include "platform/lum/Listener.h"
@@ -21,6 +25,7 @@ using namespace platform;
 namespace {
 
 constexpr std::size_t kMaxPeers = 72;  // more than one origin may have
+constexpr std::size_t kCrowd = 64, kMaxCrowds = 4;
 constexpr std::chrono::milliseconds kStep{10};
 
 struct Broker {
@@ -53,11 +58,14 @@ class Peers {
         if (part.starts_with('+')) return connect(), send(part.substr(1));
         if (part.starts_with('-')) return leave();
         if (part.starts_with('!')) return await();
+        if (part.starts_with('*')) return crowd(part.substr(1));
         send(part);
     }
 
     /// Whoever has sent something that is whole has its answer soon.
     void end() {
+        strangers_.clear();
+        broker_.settle();
         while (!all_.empty()) {
             ::shutdown(all_.front().socket.get(), SHUT_WR);
             broker_.settle();
@@ -74,27 +82,63 @@ class Peers {
 
     void connect() {
         if (all_.size() == kMaxPeers) return;
-        UniqueFd socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-        sockaddr_un address{};
-        address.sun_family = AF_UNIX;
-        std::strncpy(address.sun_path, broker_.socket.c_str(), sizeof address.sun_path - 1);
-        fuzz::require(
-            ::connect(socket.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) == 0);
+        UniqueFd socket = makeSocket();
+        fuzz::require(connectsToBroker(socket));
         all_.push_back({std::move(socket)});
         broker_.settle();
     }
 
+    static UniqueFd makeSocket() {
+        return UniqueFd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    }
+
+    bool connectsToBroker(const UniqueFd& socket) const {
+        sockaddr_un address{};
+        address.sun_family = AF_UNIX;
+        std::strncpy(address.sun_path, broker_.socket.c_str(), sizeof address.sun_path - 1);
+        return ::connect(socket.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
+    }
+
+    /// As many as one origin may be, of a session of their own, who all say the same.
+    void crowd(std::string_view part) {
+        if (crowds_++ == kMaxCrowds) return;
+        std::vector<UniqueFd> sockets;
+        while (sockets.size() < kCrowd) sockets.push_back(makeSocket());
+        const pid_t leader = ::fork();
+        if (leader == 0) {
+            ::setsid();
+            for (const UniqueFd& socket : sockets) connectsToBroker(socket);
+            ::raise(SIGSTOP);
+            ::_exit(0);
+        }
+        fuzz::require(leader > 0 && ::waitpid(leader, nullptr, WUNTRACED) == leader);
+        broker_.settle();
+        const std::string bytes = withTokens(part);
+        for (UniqueFd& socket : sockets) {
+            (void)::send(socket.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL | MSG_DONTWAIT);
+            strangers_.push_back(std::move(socket));
+        }
+        broker_.settle();
+        ::kill(leader, SIGKILL);
+        ::waitpid(leader, nullptr, 0);
+    }
+
     void send(std::string_view part) {
         if (all_.empty()) return;
+        const std::string bytes = withTokens(part);
+        (void)::send(all_.back().socket.get(), bytes.data(), bytes.size(),
+                     MSG_NOSIGNAL | MSG_DONTWAIT);
+        all_.back().hasAsked |= bytes.ends_with('\n');
+        broker_.settle();
+    }
+
+    std::string withTokens(std::string_view part) const {
         std::string bytes(part);
         if (const std::size_t at = bytes.find('@'); at != bytes.npos)
             bytes.replace(at, 1, broker_.token);
         if (const std::size_t at = bytes.find('~'); at != bytes.npos)
             bytes.replace(at, 1, broker_.stale);
-        (void)::send(all_.back().socket.get(), bytes.data(), bytes.size(),
-                     MSG_NOSIGNAL | MSG_DONTWAIT);
-        all_.back().hasAsked |= bytes.ends_with('\n');
-        broker_.settle();
+        return bytes;
     }
 
     void leave() {
@@ -113,6 +157,8 @@ class Peers {
 
     Broker& broker_;
     std::deque<Peer> all_;
+    std::vector<UniqueFd> strangers_;
+    std::size_t crowds_ = 0;
     int patience_ = 20;  // steps that an input may take in all
 };
 

@@ -123,6 +123,8 @@ class Host {
                 return;
             case '+':  // another connection
                 return connect();
+            case '^':  // a request, and the plug-in is made ready anew while it starts
+                return sendInTurn(frame(rest));
             case '~':  // the bundle has gone
                 return service_.move(true);
             default:
@@ -155,6 +157,14 @@ class Host {
         std::string all;
         while (--count >= 0) all += frame;
         send(all);
+    }
+
+    /// What is looked at elsewhere meanwhile was granted before.
+    void sendInTurn(const std::string& bytes) {
+        (void)::send(socket_.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL | MSG_DONTWAIT);
+        while (service_.loop->poll() > 0) continue;
+        service_.grant();
+        service_.settle();
     }
 
     /// What takes its time is awaited, if it is answered at all.
