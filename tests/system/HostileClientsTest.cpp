@@ -133,6 +133,7 @@ TEST_F(HostileClients, AnotherUserIsNotLetIn) {
         ::waitpid(child, &status, 0);
         return WEXITSTATUS(status);
     };
+    expectService();  // until then it makes sockets, and closes their directories
     EXPECT_EQ(connectsAsNobody(), 0);  // the directories keep it out
     for (std::string path = socket_; path.size() >= home_.path().size();
          path = std::filesystem::path(path).parent_path())
