@@ -28,6 +28,17 @@ constexpr timeval kPatience{20, 0};
 // handle.
 constexpr int kLeastHandle = 3;
 
+/// The outcome of a call with a limit of time, which a signal ends early, and even a stop of the
+/// process that it knows nothing of.
+template <class Call>
+ssize_t uninterrupted(Call call) {
+    ssize_t outcome = -1;
+    do {
+        outcome = call();
+    } while (outcome < 0 && errno == EINTR);
+    return outcome;
+}
+
 UniqueFd connectTo(const std::string& path) {
     UniqueFd socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
     sockaddr_un address{};
@@ -36,7 +47,10 @@ UniqueFd connectTo(const std::string& path) {
     if (!socket ||
         ::setsockopt(socket.get(), SOL_SOCKET, SO_SNDTIMEO, &kPatience, sizeof kPatience) != 0 ||
         ::setsockopt(socket.get(), SOL_SOCKET, SO_RCVTIMEO, &kPatience, sizeof kPatience) != 0 ||
-        ::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
+        uninterrupted([&] {
+            return ::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address),
+                             sizeof address);
+        }) != 0)
         return {};
     return socket;
 }
@@ -53,7 +67,8 @@ UniqueFd receiveAnswer(int socket) {
     message.msg_iovlen = 1;
     message.msg_control = control;
     message.msg_controllen = sizeof control;
-    const ssize_t count = ::recvmsg(socket, &message, MSG_CMSG_CLOEXEC);
+    const ssize_t count =
+        uninterrupted([&] { return ::recvmsg(socket, &message, MSG_CMSG_CLOEXEC); });
     if (count < 0) return {};
     const cmsghdr* header = CMSG_FIRSTHDR(&message);
     if (header && header->cmsg_level == SOL_SOCKET && header->cmsg_type == SCM_RIGHTS &&
@@ -78,9 +93,8 @@ UniqueFd consume(const std::string& token) {
     }
     const UniqueFd socket = connectTo(*path);
     const std::string line = token + "\n";
-    if (!socket || ::send(socket.get(), line.data(), line.size(), MSG_NOSIGNAL) !=
-                       static_cast<ssize_t>(line.size()))
-        return {};
+    const auto send = [&] { return ::send(socket.get(), line.data(), line.size(), MSG_NOSIGNAL); };
+    if (!socket || uninterrupted(send) != static_cast<ssize_t>(line.size())) return {};
     return receiveAnswer(socket.get());
 }
 

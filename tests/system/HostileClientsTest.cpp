@@ -133,6 +133,8 @@ TEST_F(HostileClients, AnotherUserIsNotLetIn) {
         ::waitpid(child, &status, 0);
         return WEXITSTATUS(status);
     };
+    // Until then it makes sockets, and closes their directories.
+    expectService();
     EXPECT_EQ(connectsAsNobody(), 0);  // the directories keep it out
     for (std::string path = socket_; path.size() >= home_.path().size();
          path = std::filesystem::path(path).parent_path())

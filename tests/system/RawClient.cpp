@@ -4,6 +4,7 @@
 #include <sys/socket.h>
 #include <sys/un.h>
 
+#include <cerrno>
 #include <cstring>
 
 #include "platform/lum/Frame.h"
@@ -30,12 +31,24 @@ void RawClient::sendNothingMore() const {
     ::shutdown(socket_.get(), SHUT_WR);
 }
 
+/// Whether all of it has come. Because of the limit of time, a stop of this process (by whoever
+/// wants the machine for himself for a while) ends a receive early.
+bool RawClient::receiveAll(void* buffer, std::size_t size) const {
+    for (auto* place = static_cast<char*>(buffer); size > 0;) {
+        const ssize_t count = ::recv(socket_.get(), place, size, MSG_WAITALL);
+        if (count < 0 && errno == EINTR) continue;
+        if (count <= 0) return false;
+        place += count;
+        size -= static_cast<std::size_t>(count);
+    }
+    return true;
+}
+
 std::string RawClient::receive() const {
     std::uint32_t size = 0;
-    if (::recv(socket_.get(), &size, sizeof size, MSG_WAITALL) != sizeof size) return {};
+    if (!receiveAll(&size, sizeof size)) return {};
     std::string payload(ntohl(size), '\0');
-    const ssize_t count = ::recv(socket_.get(), payload.data(), payload.size(), MSG_WAITALL);
-    return count == static_cast<ssize_t>(payload.size()) ? payload : std::string();
+    return receiveAll(payload.data(), payload.size()) ? payload : std::string();
 }
 
 std::string RawClient::frame(std::string_view payload) {

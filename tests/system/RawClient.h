@@ -28,6 +28,8 @@ class RawClient {
     static std::string request(const platform::Dictionary& contents);
 
   private:
+    bool receiveAll(void* buffer, std::size_t size) const;
+
     platform::UniqueFd socket_;
 };
 

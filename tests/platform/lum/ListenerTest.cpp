@@ -11,6 +11,7 @@
 #include <fstream>
 #include <memory>
 
+#include "platform/lum/PeerConnection.h"
 #include "tests/platform/lum/LumFixture.h"
 
 namespace platform::lum {
@@ -242,6 +243,34 @@ TEST_F(ListenerTest, AMalformedFrameEndsItsConnectionAlone) {
     EXPECT_TRUE(stepUntil([&] { return events.size() == 1; }));
     EXPECT_EQ(errorLines("out-of-band data"), 1u);
     EXPECT_TRUE(ask(bystander, 2));
+}
+
+TEST_F(ListenerTest, AWakeForNothingCutsNobodyOff) {
+    int ends[2];
+    ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, ends), 0);
+    RawPeer peer{UniqueFd(ends[1])};
+    Pool pool(4);
+    const PeerConnection::Common common{std::make_shared<ReplyBudget>(loop),
+                                        std::make_shared<ReceiveBudget>(loop),
+                                        std::make_shared<Decoder>()};
+    const AuditToken self = *AuditToken::ofSelf();
+    const auto connection = std::make_shared<PeerConnection>(
+        UniqueFd(ends[0]), self, *pool.draw(Origin::of(self)), queue, common);
+    connection->setEventHandler([&](const ConnectionEvent& event) { handle(connection, event); });
+    connection->resume();
+    while (loop.poll() > 0) continue;
+    // The loop has been woken when somebody takes what woke it.
+    ASSERT_EQ(::send(peer.fd(), "!", 1, MSG_OOB), 1);
+    char byte = 0;
+    loop.post([&] { EXPECT_EQ(::recv(ends[0], &byte, 1, MSG_OOB), 1); });
+    while (loop.poll() > 0) continue;
+    EXPECT_EQ(byte, '!');
+    peer.write(requestFrame(1));
+    EXPECT_TRUE(stepUntil([&] { return !events.empty(); }));
+    EXPECT_THAT(events, ElementsAre("message 1"));
+    ASSERT_EQ(::send(peer.fd(), "!", 1, MSG_OOB | MSG_NOSIGNAL), 1);
+    EXPECT_TRUE(stepUntil([&] { return events.size() == 2; })) << "it is awaited again";
+    EXPECT_EQ(errorLines("out-of-band data"), 1u);
 }
 
 TEST_F(ListenerTest, UnknownObjectsAreEventsAndNothingMore) {

@@ -33,7 +33,7 @@ class PeerLooksTest : public testing::Test {
 TEST_F(PeerLooksTest, WhoHangsIsGivenUpAndTakesAQuarterOfTheThreadsAtTheMost) {
     constexpr std::size_t kQuarter = PeerLooks::kMostThreads / 4;
     int done = 0, givenUp = 0, others = 0, none = 0;
-    PeerLooks looks(loop_, milliseconds(100));
+    PeerLooks looks(loop_, milliseconds(1000));
     for (std::size_t i = 0; i < kQuarter - 1; ++i)
         looks.look(one_, hanging(), counting(done, givenUp));
     looks.look(
@@ -58,7 +58,7 @@ TEST_F(PeerLooksTest, WhoHangsIsGivenUpAndTakesAQuarterOfTheThreadsAtTheMost) {
 }
 
 TEST_F(PeerLooksTest, WhatGetsOnIsNotGivenUpAndWhatItFoundBeforeItHangsCounts) {
-    PeerLooks looks(loop_, milliseconds(400));
+    PeerLooks looks(loop_, milliseconds(1000));
     std::vector<int> found(8);
     std::optional<std::size_t> steps;
     looks.look(
@@ -67,7 +67,7 @@ TEST_F(PeerLooksTest, WhatGetsOnIsNotGivenUpAndWhatItFoundBeforeItHangsCounts) {
             for (int& value : found) {
                 value = 7;
                 pace.step();
-                gate_.wait_for(milliseconds(60));
+                gate_.wait_for(milliseconds(150));
             }
             gate_.wait();
         },
@@ -82,11 +82,11 @@ TEST_F(PeerLooksTest, WhatGetsOnIsNotGivenUpAndWhatItFoundBeforeItHangsCounts) {
 }
 
 TEST_F(PeerLooksTest, WhoHasWaitedForItsTurnHasAllOfTheTimeThen) {
-    PeerLooks looks(loop_, milliseconds(1000), 1);
+    PeerLooks looks(loop_, milliseconds(2000), 1);
     int done = 0, givenUp = 0;
     for (int i = 0; i < 2; ++i)
         looks.look(
-            one_, [gate = gate_](PeerLooks::Pace&) { gate.wait_for(milliseconds(700)); },
+            one_, [gate = gate_](PeerLooks::Pace&) { gate.wait_for(milliseconds(1200)); },
             counting(done, givenUp));
     runUntil([&] { return done + givenUp == 2; });
     EXPECT_EQ(done, 2);

@@ -14,6 +14,7 @@
 #include <atomic>
 #include <cerrno>
 #include <chrono>
+#include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
@@ -186,6 +187,25 @@ TEST_F(SandboxExtension, GrantsReadingAndNothingElse) {
     start();
     EXPECT_EQ(Handle(token).fd, 0) << "of an earlier start";
     EXPECT_GT(Handle(issue()).fd, 0);
+}
+
+TEST_F(SandboxExtension, SignalsOfItsOwnCostAProcessNothing) {
+    static std::atomic<int> handled;
+    ::signal(SIGUSR1, [](int) { ++handled; });
+    start();
+    const std::string token = issue();
+    std::atomic<bool> isDone = false;
+    std::thread disturber([&, disturbed = pthread_self()] {
+        while (!isDone) {
+            const int before = handled;
+            pthread_kill(disturbed, SIGUSR1);
+            while (handled == before && !isDone) std::this_thread::yield();
+        }
+    });
+    for (int i = 0; i < 20; ++i) EXPECT_GT(Handle(token).fd, 0);
+    isDone = true;
+    disturber.join();
+    ::signal(SIGUSR1, SIG_DFL);
 }
 
 TEST_F(SandboxExtension, MeansTheVeryFile) {

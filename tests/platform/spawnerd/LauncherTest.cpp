@@ -192,6 +192,17 @@ TEST_F(LauncherTest, TheAdministratorWidensAndNarrowsLimits) {
     EXPECT_EQ(errorLines("ignoring the limit"), 6u);
 }
 
+TEST_F(LauncherTest, WhatTheUserMayDoToTheSchedulerIsNotThePlugIns) {
+    constexpr rlimit kMuch{20, 20};
+    for (const auto resource : {RLIMIT_RTPRIO, RLIMIT_NICE})
+        if (::setrlimit(resource, &kMuch) != 0) GTEST_SKIP() << "may not raise its own limits";
+    useLauncher({});
+    const std::string executable = plugIn("one", "grep priority /proc/self/limits | tr -s ' '");
+    EXPECT_EQ(grant(executable), 0);
+    EXPECT_EQ(talk(start(executable).takeDescriptor()),
+              "Max nice priority 0 0 \nMax realtime priority 0 0 \n");
+}
+
 TEST_F(LauncherTest, BadGrantsAreRefused) {
     const std::string good = plugIn("one", "");
     const std::string bare = home.write("bare/run", "");

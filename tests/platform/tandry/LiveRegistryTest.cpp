@@ -31,7 +31,6 @@ TEST_F(LiveRegistryTest, FollowsAnApplicationThroughItsLife) {
     fs::create_directories(at(apps));
     fs::rename(at("new/A.app"), at(apps + "A.app"));
     EXPECT_THAT(recorder.take(2), ElementsAre("+a", "+b"));
-    const Uuid uuid = plugIn("a")->plugInUuid;
     EXPECT_TRUE(fs::exists(at("home/zorvan/Containers/a/tmp")));
     // A walk that finds nothing new looks at containers, too. (All go at once: one may be in the
     // making.)
@@ -39,11 +38,17 @@ TEST_F(LiveRegistryTest, FollowsAnApplicationThroughItsLife) {
     fs::rename(containers, at("old-containers"));
     files.write(apps + "A.app/PlugIns/note", "");
     const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(30);
-    const auto areThere = [&] {
-        return fs::exists(containers / "a/tmp") && fs::exists(containers / "b/tmp");
+    const auto hasContainer = [&](const char* name) {
+        const auto found = plugIn(name);
+        return found && found->dataContainerPath && fs::exists(containers / name / "tmp");
     };
+    const auto areThere = [&] { return hasContainer("a") && hasContainer("b"); };
     while (!areThere() && std::chrono::steady_clock::now() < end) settle();
     EXPECT_TRUE(areThere());
+    // A walk may have seen one of them while it had none.
+    settle();
+    recorder.take();
+    const Uuid uuid = plugIn("a")->plugInUuid;
 
     // A new file under an old name.
     addPlugIn("new/A.appex", "a", {}, {{"changed", true}});
