@@ -1,6 +1,7 @@
 #include "platform/system/Process.h"
 
 #include <fcntl.h>
+#include <malloc.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <systemd/sd-daemon.h>
@@ -13,6 +14,12 @@
 #include "platform/system/Files.h"
 
 namespace platform {
+
+namespace {
+
+constexpr int kMostKeptMemory = 1 << 20;  // free, at the end of each of the allocator's arenas
+
+}  // namespace
 
 pid_t parentOf(pid_t process) {
     constexpr std::size_t kMostStat = 4096;
@@ -34,6 +41,9 @@ void openStandardDescriptors() {
 }
 
 void prepareDaemonProcess() {
+    // Left alone, the allocator keeps ever more for itself once something large has been freed.
+    mallopt(M_MMAP_THRESHOLD, kMostKeptMemory);
+    mallopt(M_TRIM_THRESHOLD, kMostKeptMemory);
     umask(077);
     std::signal(SIGPIPE, SIG_IGN);
     std::signal(SIGXFSZ, SIG_IGN);

@@ -14,7 +14,8 @@ void openStandardDescriptors();
 
 /// What a daemon settles about its own process before it does anything else: files are its user's
 /// alone (umask 077), writing to a closed pipe or beyond a size limit is an error and no signal,
-/// and as many descriptors may be open as the system lets it have.
+/// as many descriptors may be open as the system lets it have, and memory that was freed goes back
+/// to the system but for a little.
 void prepareDaemonProcess();
 
 /// Tells the service manager, when there is one, that the daemon serves.
