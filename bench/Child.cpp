@@ -9,6 +9,7 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <filesystem>
 #include <fstream>
 #include <limits>
 #include <string>
@@ -116,6 +117,19 @@ double Child::residentMegabytes() const {
         if (word == "VmRSS:" && status >> kibibytes) return kibibytes * 1024 / 1e6;
     }
     fail("the resident memory of process {} cannot be read", pid_);
+}
+
+long Child::sleeps() const {
+    long sum = 0;
+    const std::filesystem::directory_iterator threads(fmt::format("/proc/{}/task", pid_));
+    for (const auto& thread : threads) {
+        std::ifstream status(thread.path() / "status");
+        for (std::string word; status >> word;) {
+            long count = 0;
+            if (word == "voluntary_ctxt_switches:" && status >> count) sum += count;
+        }
+    }
+    return sum;
 }
 
 cpu_set_t allowedCpus() {

@@ -31,6 +31,8 @@ class Child {
     void waitUntilIdle() const;
     /// VmRSS of the process, in MB (10^6 bytes).
     double residentMegabytes() const;
+    /// How often any of its threads has gone to sleep: each time, something has woken it.
+    long sleeps() const;
 
   private:
     long cpuTicks() const;

@@ -29,6 +29,12 @@ void measureReplies(const Run& run);
 /// How fast plug-ins are made ready and started.
 void measurePlugIns(const Run& run);
 
+/// What does not depend on the machine's speed: how often what costs is done.
+void measureCounts(const Run& run);
+
+/// What ten times as many plug-ins cost. Making them takes minutes.
+void measureLarge(const Run& run);
+
 /// How fast choices get to the disk, and how soon an installed bundle is found.
 void measureChanges(const Run& run);
 

@@ -208,14 +208,16 @@ void measureSizes(const Run& run) {
         rounds.push_back(exchangeRound(world.socketPath(), question.frame));
     }
     const auto p50 = medianOfEach(planForMatches(run, 10), rounds);
+    const Target limit{Target::Kind::ValueAtMost, 1.5};
     for (std::size_t i = 0; i < p50.size(); ++i) {
         const std::size_t size = run.worlds[i].plugIns();
+        const Target now{Target::Kind::ValueAtMost, i > 0 ? limit.limit * p50[i - 1] : 0};
         run.report.add({.key = fmt::format("match-10/of-{}/p50", size),
                         .title = fmt::format("match of 10 with {} installed, p50", size),
-                        .value = p50[i]});
+                        .value = p50[i],
+                        .now = i > 0 ? now : Target{}});
     }
     const std::size_t last = p50.size() - 1;
-    const Target limit{Target::Kind::ValueAtMost, 1.5};
     run.report.add(
         {.key = fmt::format("match-10/{}-against-{}", run.worlds[last].plugIns(),
                             run.worlds[last - 1].plugIns()),

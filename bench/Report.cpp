@@ -34,17 +34,17 @@ std::optional<double> Figure::ratio() const {
     return value / *beside;
 }
 
+std::optional<double> Figure::limitOf(const Target& target) const {
+    if (target.kind == Target::Kind::None) return {};
+    if (target.kind == Target::Kind::ValueAtMost) return target.limit;
+    if (!beside) return {};
+    return target.limit * *beside;
+}
+
 std::optional<bool> Figure::met() const {
-    switch (now.kind) {
-        case Target::Kind::RatioAtMost:
-            return ratio() && *ratio() <= now.limit;
-        case Target::Kind::RatioAtLeast:
-            return ratio() && *ratio() >= now.limit;
-        case Target::Kind::ValueAtMost:
-            return value <= now.limit;
-        default:
-            return {};
-    }
+    if (now.kind == Target::Kind::None) return {};
+    const auto limit = limitOf(now);
+    return limit && (now.kind == Target::Kind::RatioAtLeast ? value >= *limit : value <= *limit);
 }
 
 void Report::begin(std::string title, std::string suffix) {
@@ -68,6 +68,10 @@ std::string Report::tsv() const {
         for (const Figure& figure : section.figures) {
             const std::string key = figure.key + section.suffix;
             out += fmt::format("zrd/{}\t{:.2f}\t{}\n", key, figure.value, figure.unit);
+            for (const auto& [name, target] :
+                 {std::pair("limit", figure.now), {"goal", figure.goal}})
+                if (const auto limit = figure.limitOf(target))
+                    out += fmt::format("{}/{}\t{:.2f}\t{}\n", name, key, *limit, figure.unit);
             if (!figure.beside) continue;
             out += fmt::format("{}/{}\t{:.2f}\t{}\n", figure.besideSource, key, *figure.beside,
                                figure.unit);

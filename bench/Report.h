@@ -33,6 +33,8 @@ struct Figure {
     Target goal = {};  // where we are going
 
     std::optional<double> ratio() const;
+    /// A target in the figure's own unit; none without one.
+    std::optional<double> limitOf(const Target& target) const;
     /// None without a target.
     std::optional<bool> met() const;
 };

@@ -58,8 +58,8 @@ std::string World::socketPath() const {
     return runtimeDirectory() + "/zorvan/services/" + zorvan::kDefaultServiceName;
 }
 
-Child World::startDaemon() const {
-    const std::vector<std::string> environment{
+Child World::startDaemon(const std::vector<std::string>& more) const {
+    std::vector<std::string> environment{
         "PATH=/usr/bin:/bin",
         "LANG=C.UTF-8",
         "HOME=" + root_ + "/home",
@@ -69,6 +69,7 @@ Child World::startDaemon() const {
         "XDG_CONFIG_HOME=" + root_ + "/config",
         "XDG_STATE_HOME=" + root_ + "/state",
     };
+    environment.insert(environment.end(), more.begin(), more.end());
     return Child(ZRD_PROGRAM, {}, environment, root_ + "/zrd.log");
 }
 

@@ -45,7 +45,8 @@ class World {
     /// Every file that a first scan reads.
     const std::vector<std::string>& files() const { return files_; }
 
-    Child startDaemon() const;
+    /// With `more` in its environment.
+    Child startDaemon(const std::vector<std::string>& more = {}) const;
     /// Removes all that daemons have made here, but the plug-ins' data containers when
     /// `keepContainers`, and waits until the file system is done with it.
     void forget(bool keepContainers) const;

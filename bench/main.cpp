@@ -21,9 +21,10 @@ using namespace bench;
 
 constexpr unsigned kMostSeconds = 1800;
 constexpr const char* kUsage =
-    "Usage: zrd_bench [--quick] [--tsv] [--only REGEX]\n"
+    "Usage: zrd_bench [--quick] [--large] [--tsv] [--only REGEX]\n"
     "Measures the daemon against bare echoes of the same bytes.\n"
     "  --quick  few rounds and at most 1000 plug-ins, to see that everything runs\n"
+    "  --large  also 100000 plug-ins, which takes minutes\n"
     "  --tsv    lines of key, value and unit instead of a table\n"
     "  --only   just the figures whose keys (as --tsv has them, without what stands before the "
     "first\n"
@@ -31,6 +32,7 @@ constexpr const char* kUsage =
 
 struct Options {
     bool quick = false;
+    bool large = false;
     bool tsv = false;
     std::optional<std::regex> only{};
 };
@@ -55,6 +57,8 @@ void measure(const std::vector<World>& worlds, const Options& options, const std
         measureReplies(run);
         measurePlugIns(run);
         measureChanges(run);
+        if (onOneCpu) measureCounts(run);
+        if (onOneCpu && options.large) measureLarge(run);
     }
 }
 
@@ -94,6 +98,8 @@ int main(int argc, char** argv) {
         for (auto argument = arguments.begin(); argument != arguments.end(); ++argument) {
             if (*argument == "--quick") {
                 options.quick = true;
+            } else if (*argument == "--large") {
+                options.large = true;
             } else if (*argument == "--tsv") {
                 options.tsv = true;
             } else if (*argument == "--only" && argument + 1 != arguments.end()) {
