@@ -20,8 +20,9 @@ using platform::Array;
 
 namespace {
 
-/// Tokens that are issued in one go, some 25 µs each; then others have their turn.
-constexpr std::size_t kMostTokensAtOnce = 32;
+/// Tokens that are issued, or plug-ins that are prepared, in one go, some 25 µs each; then others
+/// have their turn.
+constexpr std::size_t kMostAtOnce = 32;
 
 }  // namespace
 
@@ -61,12 +62,23 @@ void Transaction::readyPlugIns() {
 
 void Transaction::prepareNext(const std::shared_ptr<Enabling>& enabling) {
     if (!client_->acceptWork()) return;
-    const std::size_t next = enabling->prepared.size();
-    if (next == enabling->plugIns.size()) return enable(*enabling);
-    const auto plugIn = enabling->plugIns[next];
+    auto& done = enabling->prepared;
+    std::shared_ptr<ZRDPlugIn> plugIn;
+    platform::Dictionary overlay;
+    for (std::size_t atOnce = 0; !plugIn; ++atOnce) {
+        if (done.size() == enabling->plugIns.size()) return enable(*enabling);
+        if (atOnce == kMostAtOnce)
+            return onServiceQueue([this, enabling] { prepareNext(enabling); })();
+        const auto& next = enabling->plugIns[done.size()];
+        overlay = next->overlayForClient(*client_);
+        if (auto again = next->prepareAgain(overlay))
+            done.push_back(*std::move(again));
+        else
+            plugIn = next;
+    }
     const auto prepared = std::make_shared<ZRDPlugIn::Preparation>();
-    platform::PlaceLooks::Look look{plugIn->path(), [plugIn, client = client_, prepared] {
-                                        *prepared = plugIn->prepareForClient(*client);
+    platform::PlaceLooks::Look look{plugIn->path(), [plugIn, overlay, client = client_, prepared] {
+                                        *prepared = plugIn->prepareForClient(*client, overlay);
                                     }};
     lookAtBundles({std::move(look)}, [=, this](const std::vector<bool>& isDone) {
         enabling->prepared.push_back(isDone[0] ? std::move(*prepared)
@@ -102,7 +114,7 @@ void Transaction::accessFrom(std::size_t first, Array tokens) {
     bool isPausing = false;
     const bool completed = processUuidList(
         [&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
-            isPausing = tokens.size() == first + kMostTokensAtOnce;
+            isPausing = tokens.size() == first + kMostAtOnce;
             if (isPausing) return Walk::Stop;
             auto token =
                 sandbox->issueReadExtension(plugIn->bundleDirectory(), ".", platform::Wait::Never);
@@ -123,7 +135,7 @@ void Transaction::accessFrom(std::size_t first, Array tokens) {
     }
     if (isPausing)
         return server().submitWork(
-            [self = shared_from_this(), next = first + kMostTokensAtOnce,
+            [self = shared_from_this(), next = first + kMostAtOnce,
              tokens = std::move(tokens)]() mutable { self->accessFrom(next, std::move(tokens)); });
     if (!late) return;
     const auto token = std::make_shared<platform::Result<std::string>>(std::string());

@@ -109,9 +109,15 @@ class ZRDPlugIn final : public ZRPlugInCore {
         std::shared_ptr<const platform::CheckedService> service;  // null when there is an error
         std::optional<ZRError> error{};
     };
+    /// The activation overlay for a start by a host, which the log is told of: to be prepared next.
+    platform::Dictionary overlayForClient(const HostProcess& host) const;
+    /// Prepares the start as it was prepared before, while that holds: without waiting for anybody.
+    /// None when only `prepareForClient` tells.
+    std::optional<Preparation> prepareAgain(const platform::Dictionary& overlay) const;
     /// Prepares the start by a host. Waits for the bundle's file system, so not on the service
     /// queue.
-    Preparation prepareForClient(const HostProcess& host) const;
+    Preparation prepareForClient(const HostProcess& host,
+                                 const platform::Dictionary& overlay) const;
     /// What comes of it when it met an errno, which it logs.
     Preparation couldNotPrepareFor(const HostProcess& host, int failure) const;
     /// Tells the launcher that the host may start this plug-in, as it was prepared. The error says
@@ -170,6 +176,7 @@ class ZRDPlugIn final : public ZRPlugInCore {
     mutable std::optional<std::string> localizedContainingName_;
     std::uint64_t nameChanges_ = 0;
     mutable std::optional<platform::Dictionary> form_;
+    mutable std::shared_ptr<const platform::CheckedService> checked_;  // by the last preparation
 };
 
 }  // namespace zorvan

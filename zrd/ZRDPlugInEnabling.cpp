@@ -93,11 +93,28 @@ Dictionary ZRDPlugIn::launchService() const {
     return service;
 }
 
-ZRDPlugIn::Preparation ZRDPlugIn::prepareForClient(const HostProcess& host) const {
-    const Dictionary overlay{{overlay::kService, launchService()},
-                             {overlay::kPackageType, overlay::kLumPackage}};
+Dictionary ZRDPlugIn::overlayForClient(const HostProcess& host) const {
+    Dictionary overlay{{overlay::kService, launchService()},
+                       {overlay::kPackageType, overlay::kLumPackage}};
     EVLOG_DEFAULT(ops(), "allowing host {} {} to use plug-in {}({}) uuid={} at {}", host.pid(),
                   host.path(), identifier(), version(), pub(uuid()), path());
+    return overlay;
+}
+
+std::optional<ZRDPlugIn::Preparation> ZRDPlugIn::prepareAgain(const Dictionary& overlay) const {
+    std::shared_ptr<const platform::CheckedService> checked;
+    {
+        const std::lock_guard lock(mutex_);
+        checked = checked_;
+    }
+    if (checked) checked = context_->launcher->renewExternalService(*checked, overlay);
+    if (!checked) return std::nullopt;
+    EVLOG_DEBUG(ops(), "activation overlay={}", overlay);
+    return Preparation{.service = std::move(checked)};
+}
+
+ZRDPlugIn::Preparation ZRDPlugIn::prepareForClient(const HostProcess& host,
+                                                   const Dictionary& overlay) const {
     const auto bundle = ZRBundle::initWithPath(path());
     const auto executable = bundle ? bundle->executablePath() : std::nullopt;
     if (!executable) {
@@ -115,6 +132,8 @@ ZRDPlugIn::Preparation ZRDPlugIn::prepareForClient(const HostProcess& host) cons
         return couldNotPrepareFor(host, error->code);
     auto checked = context_->launcher->checkExternalService(service, overlay);
     if (!checked) return couldNotPrepareFor(host, checked.error().code);
+    const std::lock_guard lock(mutex_);
+    checked_ = *checked;
     return {.service = *std::move(checked)};
 }
 

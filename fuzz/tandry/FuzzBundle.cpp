@@ -59,7 +59,8 @@ void makeReady(const zorvan::FakeWorld& world, const TDPlugInProxy& record) {
         const auto plugIn = world.record(copy);
         if (!plugIn) continue;
         (void)plugIn->allowForClient(host);
-        (void)plugIn->enableForClient(host, plugIn->prepareForClient(host));
+        (void)plugIn->enableForClient(
+            host, plugIn->prepareForClient(host, plugIn->overlayForClient(host)));
         std::optional<zorvan::ZRError> error;
         auto draft = plugIn->draftForm({}, error);
         const auto form = draft ? plugIn->completedForm(*draft, Wait::Allowed) : std::nullopt;

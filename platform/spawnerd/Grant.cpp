@@ -15,11 +15,14 @@
 #include "platform/system/Directories.h"
 #include "platform/system/Files.h"
 #include "platform/system/OpenBeneath.h"
+#include "platform/system/OwnMounts.h"
 
 namespace platform::spawnerd {
 
 namespace {
 
+constexpr const char* kInfoPlist = "Info.plist";
+constexpr const char* kEntitlements = "Entitlements.plist";
 constexpr const char* kExtension = "VXExtension";
 constexpr const char* kExtensionPoint = "VXExtensionPointIdentifier";
 
@@ -88,7 +91,7 @@ void readIdentifiers(const Dictionary& info, Grant& grant) {
 }
 
 bool asksForNetwork(int bundle) {
-    const auto entitlements = readList(bundle, "Entitlements.plist");
+    const auto entitlements = readList(bundle, kEntitlements);
     const Value* value = entitlements ? entitlements->find(kNetworkEntitlement) : nullptr;
     return value && value->boolean().value_or(false);
 }
@@ -127,7 +130,25 @@ std::optional<Error> readOverlay(const Dictionary& overlay, Grant& grant) {
     return readEnvironment(*service, grant);
 }
 
+/// Whether a data container that was good is there in whole still, as far as that can be told
+/// without waiting.
+bool isWhole(const std::string& container) {
+    const auto directory =
+        openWithoutLinks(AT_FDCWD, container, O_PATH | O_DIRECTORY | O_NOFOLLOW, Wait::Never);
+    struct stat status {};
+    return directory && isOnOwnMount(directory->get()) && ::fstat(directory->get(), &status) == 0 &&
+           status.st_uid == ::geteuid() &&
+           openBeneath(directory->get(), "tmp", O_PATH | O_NOFOLLOW);
+}
+
 }  // namespace
+
+GrantStamps GrantStamps::of(int bundle, const std::string& executable) {
+    const auto stampOf = [bundle](const std::string& name) {
+        return FileStamp::ofOpened(openBeneath(bundle, name, O_PATH));
+    };
+    return {stampOf(kInfoPlist), stampOf(kEntitlements), stampOf(executable)};
+}
 
 Result<UniqueFd> openContainer(const Directories& directories, const std::string& path) {
     const std::string root = joinPath(directories.zorvanData(), "Containers");
@@ -163,7 +184,8 @@ Result<Grant> Grant::make(const Directories& directories, const ExternalService&
     const std::string name = pathWithin(service.bundle.path, service.executable);
     if (name.empty()) return Error::posix(EINVAL, service.executable + " is not in its bundle");
     if (auto error = checkExecutable(bundle->get(), name, service.executable)) return *error;
-    const auto info = readList(bundle->get(), "Info.plist");
+    const auto stamps = GrantStamps::of(bundle->get(), name);
+    const auto info = readList(bundle->get(), kInfoPlist);
     if (!info) return Error::posix(EINVAL, "the Info.plist of " + service.bundle.path);
 
     if (!statesOneExtensionPoint(*info))
@@ -184,6 +206,23 @@ Result<Grant> Grant::make(const Directories& directories, const ExternalService&
             return container.error();
     }
     if (auto error = readOverlay(overlay, grant)) return *error;
+    // Who asks has read the executable's name at another time, and the container may come.
+    const bool isAllKnown = stamps.areSettled() && textAt(*info, {"QFBundleExecutable"}) == name &&
+                            grant.container == service.container;
+    if (isAllKnown) grant.stamps = std::make_shared<const GrantStamps>(stamps);
+    return grant;
+}
+
+std::optional<Grant> Grant::renewed(const Dictionary& overlay) const {
+    if (!stamps) return std::nullopt;
+    const Result<UniqueFd> place = bundle.open(Wait::Never);
+    if (!place || !isOnOwnMount(place->get()) ||
+        GrantStamps::of(place->get(), pathWithin(bundle.path, executable)) != *stamps)
+        return std::nullopt;
+    if (!container.empty() && !isWhole(container)) return std::nullopt;
+    Grant grant = *this;
+    grant.environment.clear();
+    if (readOverlay(overlay, grant)) return std::nullopt;
     return grant;
 }
 

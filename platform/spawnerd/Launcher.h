@@ -48,6 +48,11 @@ class Launcher {
     /// is no directory of this user's own below the containers. From any thread.
     virtual Result<std::shared_ptr<const CheckedService>> checkExternalService(
         const ExternalService& service, const Dictionary& overlay) = 0;
+    /// What was checked, under another overlay: at once, without waiting for anybody, while all of
+    /// it is on disk as it was then. Null when that cannot be told, or something is different: only
+    /// checking it anew tells what comes of that. From any thread.
+    virtual std::shared_ptr<const CheckedService> renewExternalService(
+        const CheckedService& checked, const Dictionary& overlay) = 0;
     /// Lets a process start what this launcher has looked at. Holds for that very process and as
     /// long as it lives, and for that very bundle: an instance is started only while the bundle's
     /// path leads to it. The last one for an executable counts. Answers 0, or the number of a

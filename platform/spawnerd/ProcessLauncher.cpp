@@ -50,6 +50,12 @@ Result<std::shared_ptr<const CheckedService>> ProcessLauncher::checkExternalServ
     return grant.error();
 }
 
+std::shared_ptr<const CheckedService> ProcessLauncher::renewExternalService(
+    const CheckedService& checked, const Dictionary& overlay) {
+    auto grant = static_cast<const Checked&>(checked).grant.renewed(overlay);
+    return grant ? std::make_shared<const Checked>(*std::move(grant)) : nullptr;
+}
+
 int ProcessLauncher::grantExternalService(const AuditToken& host,
                                           const std::shared_ptr<const CheckedService>& service) {
     return service_->grant(host, static_cast<const Checked&>(*service).grant);

@@ -19,6 +19,8 @@ class ProcessLauncher final : public Launcher {
 
     Result<std::shared_ptr<const CheckedService>> checkExternalService(
         const ExternalService& service, const Dictionary& overlay) override;
+    std::shared_ptr<const CheckedService> renewExternalService(const CheckedService& checked,
+                                                               const Dictionary& overlay) override;
     int grantExternalService(const AuditToken& host,
                              const std::shared_ptr<const CheckedService>& service) override;
     void removeExternalServices(const std::string& bundlePath) override;

@@ -67,9 +67,13 @@ FileStamp FileStamp::beneath(int dirfd, const std::string& folder, const std::st
     if (!S_ISLNK(status.st_mode)) return of(status);
     const auto directory = openWithoutLinks(dirfd, folder, O_PATH | O_DIRECTORY | O_NOFOLLOW);
     if (!directory) return ofFailure(directory.error().code);
-    const auto target = openBeneath(directory->get(), file, O_PATH);
-    if (!target) return ofFailure(target.error().code);
-    return ::fstat(target->get(), &status) == 0 ? of(status) : ofFailure(errno);
+    return ofOpened(openBeneath(directory->get(), file, O_PATH));
+}
+
+FileStamp FileStamp::ofOpened(const Result<UniqueFd>& file) {
+    struct stat status;
+    if (!file) return ofFailure(file.error().code);
+    return ::fstat(file->get(), &status) == 0 ? of(status) : ofFailure(errno);
 }
 
 bool FileStamp::isMissing() const {

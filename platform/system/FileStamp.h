@@ -5,6 +5,9 @@
 #include <string>
 #include <string_view>
 
+#include "platform/system/Error.h"
+#include "platform/system/UniqueFd.h"
+
 struct stat;
 
 namespace platform {
@@ -27,6 +30,9 @@ struct FileStamp {
     /// `dirfd` (borrowed, or AT_FDCWD). Symbolic links are followed as far as `openBeneath` goes
     /// from there: what they lead to elsewhere is not looked at.
     static FileStamp beneath(int dirfd, const std::string& folder, const std::string& file);
+
+    /// That of what was opened, or was not.
+    static FileStamp ofOpened(const Result<UniqueFd>& file);
 
     bool exists() const { return error == 0; }
     /// There is no such file. One that cannot be looked at is neither here nor missing: reading it

@@ -5,14 +5,18 @@
 #include <sys/sysmacros.h>
 
 #include <algorithm>
+#include <array>
 #include <fstream>
-#include <set>
 #include <sstream>
 #include <string_view>
 
 namespace platform {
 
 namespace {
+
+constexpr std::array<std::string_view, 14> kOwn{"ext2", "ext3",  "ext4",  "xfs",     "btrfs",
+                                                "f2fs", "tmpfs", "ramfs", "overlay", "squashfs",
+                                                "vfat", "erofs", "zfs",   "bcachefs"};
 
 constexpr const char* kTable = "/proc/thread-self/mountinfo";
 
@@ -36,6 +40,10 @@ std::string unescaped(std::string_view field) {
 }
 
 }  // namespace
+
+bool MountTable::Mount::isOwn() const {
+    return std::ranges::find(kOwn, type) != kOwn.end();
+}
 
 /// The kernel says so of a table that is open. One that cannot be opened may always have changed.
 bool MountTable::hasChanged() {
@@ -72,8 +80,11 @@ void MountTable::refresh() {
     if (mounts.empty()) return;
     mounts_ = std::move(mounts);
     root_ = nullptr;
-    for (const auto& [place, mount] : mounts_)
+    own_.clear();
+    for (const auto& [place, mount] : mounts_) {
         if (place.second == "/" && !ids.contains(place.first)) root_ = &mount;
+        if (mount.isOwn()) own_.insert(mount.id);
+    }
 }
 
 /// The mount on top of those at a place, when one comes there on `mount`.

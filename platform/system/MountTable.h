@@ -3,6 +3,7 @@
 #include <sys/types.h>
 
 #include <map>
+#include <set>
 #include <string>
 #include <utility>
 #include <vector>
@@ -20,6 +21,10 @@ class MountTable {
         dev_t device = 0;
         std::string place;  // canonical
         std::string type;
+
+        /// Whether its file system is one of the kernel's own, on disks and in memory, which waits
+        /// for no server and no program.
+        bool isOwn() const;
     };
 
     /// Learns what has changed; to be called before the first question. What cannot be read stays
@@ -29,6 +34,8 @@ class MountTable {
     /// The mount that a canonical path lies on, be there anything or not. What another one covers
     /// is not on the way. Null when nothing is known. Good until something has changed.
     const Mount* of(const std::string& path) const;
+    /// Whether that mount's file system is one of the kernel's own (see `Mount::isOwn`).
+    bool isOwn(int id) const { return own_.contains(id); }
     /// The mounts that can be reached at places inside a canonical path.
     std::vector<const Mount*> within(const std::string& path) const;
 
@@ -40,6 +47,7 @@ class MountTable {
 
     UniqueFd table_;
     std::map<Place, Mount> mounts_;
+    std::set<int> own_;            // of these, by their ids
     const Mount* root_ = nullptr;  // what nothing else is beneath
 };
 

@@ -45,21 +45,29 @@ void ChangeGatherer::awaitChanges() {
     });
 }
 
-void ChangeGatherer::gather(Scopes touched) {
+void ChangeGatherer::gather(const Touches& touched) {
     // Nothing that matters: what was published still holds.
     if (touched.empty()) return published();
     const Clock::time_point now = Clock::now();
     if (touched_.empty()) burstBegan_ = now;
-    touched_.merge(touched);
-    if (touched_.size() > kMostScopes) touched_ = {std::string()};
+    for (const auto& [scope, isWhole] : touched) {
+        touched_.insert(scope);
+        if (isWhole)
+            inPieces_.erase(scope);
+        else
+            inPieces_.insert(scope);
+    }
+    if (touched_.size() > kMostScopes) touched_ = inPieces_ = {std::string()};
     const auto rest = burstBegan_ + settings_.longest - now;
-    const auto delay = std::clamp(std::chrono::ceil<std::chrono::milliseconds>(rest),
-                                  std::chrono::milliseconds(0), settings_.quiet);
+    const auto delay =
+        std::clamp(std::chrono::ceil<std::chrono::milliseconds>(rest), std::chrono::milliseconds(0),
+                   inPieces_.empty() ? settings_.quietWhenWhole : settings_.quiet);
     burstTimer_.start(delay, [this] { finishBurst(); });
 }
 
 void ChangeGatherer::finishBurst() {
     burstTimer_.cancel();
+    inPieces_.clear();
     handler_(std::exchange(touched_, {}));
 }
 

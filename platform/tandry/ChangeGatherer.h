@@ -14,6 +14,8 @@ namespace platform::tandry {
 struct WatchSettings {
     /// A burst of changes is over after this time without any, ...
     std::chrono::milliseconds quiet{200};
+    /// ... or after this time, once everything that it touched was renamed into place in whole, ...
+    std::chrono::milliseconds quietWhenWhole{5};
     /// ... or this time after its first.
     std::chrono::milliseconds longest{400};
     /// How often everything is looked at while something cannot be watched or read.
@@ -46,7 +48,7 @@ class ChangeGatherer {
     using Clock = std::chrono::steady_clock;
 
     void awaitChanges();
-    void gather(Scopes touched);
+    void gather(const Touches& touched);
     void finishBurst();
 
     RunLoop& loop_;
@@ -57,6 +59,7 @@ class ChangeGatherer {
     RunLoop::Timer burstTimer_;
     RunLoop::Timer retryTimer_;
     Scopes touched_;
+    Scopes inPieces_;  // of these, what may not be there in whole
     Clock::time_point burstBegan_;
     bool willRetry_ = false;
 };

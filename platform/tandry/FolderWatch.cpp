@@ -199,9 +199,9 @@ bool FolderWatch::isQuiet() const {
     return isSettled_ && ::ioctl(inotify_.get(), FIONREAD, &waiting) == 0 && waiting == 0;
 }
 
-Scopes FolderWatch::takeTouched() {
+Touches FolderWatch::takeTouched() {
     disturb();
-    Scopes touched;
+    Touches touched;
     alignas(inotify_event) std::array<char, kBufferSize> buffer;
     for (int i = 0; i < kMostBuffers; ++i) {
         const ssize_t count = ::read(inotify_.get(), buffer.data(), buffer.size());
@@ -217,26 +217,32 @@ Scopes FolderWatch::takeTouched() {
     return touched;
 }
 
-void FolderWatch::take(const inotify_event& event, std::string_view name, Scopes& touched) {
-    if (event.mask & IN_Q_OVERFLOW) touched.emplace();
+void FolderWatch::take(const inotify_event& event, std::string_view name, Touches& touched) {
+    constexpr std::uint32_t kDirectoryCame = IN_MOVED_TO | IN_ISDIR;
+    const auto touch = [&touched](const std::string& scope, bool isWhole = false) {
+        touched[scope] = isWhole;
+    };
+    const std::string everything;
+    if (event.mask & IN_Q_OVERFLOW) touch(everything);
     auto found = watches_.find(event.wd);
     if (found == watches_.end()) return;
     const Watched& watched = found->second;
     for (const Reason& reason : watched.reasons) switch (reason.kind) {
             case Kind::Self:
-                if (name.empty()) touched.emplace();
+                if (name.empty()) touch(everything);
                 break;
             case Kind::Name:
-                if (name == reason.name || name.empty()) touched.emplace();
+                if (name == reason.name || name.empty()) touch(everything);
                 break;
             case Kind::Entries:
                 if (name.empty())
-                    touched.emplace();
+                    touch(everything);
                 else if (name.ends_with(reason.name))
-                    touched.insert(joinPath(reason.scope, name));
+                    touch(joinPath(reason.scope, name),
+                          (event.mask & kDirectoryCame) == kDirectoryCame);
                 break;
             case Kind::Contents:
-                touched.insert(reason.scope);
+                touch(reason.scope);
                 break;
         }
     if (event.mask & IN_IGNORED) {

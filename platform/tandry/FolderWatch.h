@@ -19,6 +19,10 @@ namespace platform::tandry {
 /// Parts of the disk that a walk has to look at again, as canonical paths; "" is everything.
 using Scopes = std::set<std::string>;
 
+/// Scopes that have been touched, and whether the last that happened to each was that a directory
+/// was renamed into its place: then it is there in whole.
+using Touches = std::map<std::string, bool>;
+
 /// The directories that walks over the disk depend on, watched by inotify. A walk marks each
 /// directory before it looks into it, so that no later change is lost; at the walk's end the
 /// directories that it did not mark any more are let go. Belongs to the registry's thread, but for
@@ -64,7 +68,7 @@ class FolderWatch {
     int descriptor() const { return inotify_.get(); }
     /// What has been touched since the last call. Does not wait; after a flood some may be left for
     /// the next call.
-    Scopes takeTouched();
+    Touches takeTouched();
 
     /// All that was taken has been acted upon, and what walks found is there for all to see.
     void settle();
@@ -91,7 +95,7 @@ class FolderWatch {
     void mark(const std::string& path, Reason reason);
     Descriptor add(const std::string& path, Kind kind, bool isKnown);
     void release(std::map<std::string, Descriptor>::iterator place);
-    void take(const inotify_event& event, std::string_view name, Scopes& touched);
+    void take(const inotify_event& event, std::string_view name, Touches& touched);
     void disturb();
 
     std::size_t mostWatches_;

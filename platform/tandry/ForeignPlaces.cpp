@@ -1,7 +1,6 @@
 #include "platform/tandry/ForeignPlaces.h"
 
 #include <algorithm>
-#include <array>
 #include <filesystem>
 #include <string_view>
 #include <utility>
@@ -12,15 +11,11 @@ namespace platform::tandry {
 
 namespace {
 
-/// The kernel's own, on disks and in memory.
-constexpr std::array<std::string_view, 14> kOwn{"ext2", "ext3",  "ext4",  "xfs",     "btrfs",
-                                                "f2fs", "tmpfs", "ramfs", "overlay", "squashfs",
-                                                "vfat", "erofs", "zfs",   "bcachefs"};
 constexpr int kMostLinks = 40;
 
 bool isForeign(const MountTable::Mount* mount) {
     // Without the root nothing goes on anyhow.
-    return mount && mount->place != "/" && std::ranges::find(kOwn, mount->type) == kOwn.end();
+    return mount && mount->place != "/" && !mount->isOwn();
 }
 
 /// Takes the first component off a path.

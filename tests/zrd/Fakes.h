@@ -126,6 +126,12 @@ struct FakeLauncher final : platform::Launcher {
         if (refused.contains(service.executable)) return platform::Error::posix(EACCES, "refused");
         return std::shared_ptr<const platform::CheckedService>(new Checked(service, overlay));
     }
+    std::shared_ptr<const platform::CheckedService> renewExternalService(
+        const platform::CheckedService& checked, const Dictionary& overlay) override {
+        const auto& service = static_cast<const Checked&>(checked).contents.first;
+        return renews ? std::make_shared<const Checked>(service, overlay) : nullptr;
+    }
+    bool renews = false;
     int grantExternalService(
         const platform::AuditToken&,
         const std::shared_ptr<const platform::CheckedService>& checked) override {

@@ -59,6 +59,18 @@ TEST_F(ReadyAccessTest, AllAreAdmittedBeforeAnyIsEnabled) {
                            workspace_->installed[3]->plugInUuid.string() + ")"));
 }
 
+TEST_F(ReadyAccessTest, WhatIsAsItWasNeedsNoLook) {
+    int checks = 0;
+    launcher_->onCheck = [&] { ++checks; };
+    for (const bool renews : {true, true, false}) {
+        launcher_->renews = renews;
+        EXPECT_EQ(ask("ready", {0, 3}), Dictionary());
+    }
+    EXPECT_EQ(checks, 4);
+    EXPECT_EQ(launcher_->granted.size(), 6u);
+    EXPECT_EQ(launcher_->granted[2], launcher_->granted[0]);
+}
+
 TEST_F(ReadyAccessTest, WhatIsHeldWhileItIsLookedAtIsNotEnabled) {
     const auto plugIn = server_->findPlugIn(workspace_->installed[0]->plugInUuid);
     launcher_->onCheck = [&] {
@@ -166,7 +178,8 @@ TEST_F(ReadyAccessTest, MatchGivesTokensWithEachForm) {
 }
 
 std::optional<ZRError> enable(const ZRDPlugIn& plugIn, const FakeHost& host) {
-    return plugIn.enableForClient(host, plugIn.prepareForClient(host));
+    return plugIn.enableForClient(host,
+                                  plugIn.prepareForClient(host, plugIn.overlayForClient(host)));
 }
 
 /// The overlay with which a record is enabled for a host.

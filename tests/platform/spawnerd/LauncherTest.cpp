@@ -282,6 +282,50 @@ TEST_F(LauncherTest, OnlyTheVeryBundleInItsPlaceIsGrantedAndStarted) {
     EXPECT_EQ(talk(start(executable).takeDescriptor()), "fine\n");
 }
 
+TEST_F(LauncherTest, WhatWasCheckedIsRenewedWhileAllIsAsItWas) {
+    namespace fs = std::filesystem;
+    const std::string executable = plugIn("one", "echo $WORD");
+    writeInfo("one", {{"QFBundleIdentifier", "one"}, {"QFBundleExecutable", "run"}});
+    const std::string place = container("one");
+    fs::create_directory(place + "/tmp");
+    const ExternalService one = service(executable);
+    const Dictionary later = overlay(Dictionary{{"WORD", "later"}});
+    const auto check = [&] { return *launcher->checkExternalService(one, overlay()); };
+    // Files that have just been written may be written again without another stamp.
+    ASSERT_TRUE(stepUntil([&] { return launcher->renewExternalService(*check(), later); }));
+    const auto holdsAfter = [&](const auto& change, const auto& undo) {
+        EXPECT_TRUE(stepUntil([&] { return launcher->renewExternalService(*check(), later); }));
+        const auto before = check();
+        change();
+        const bool holds = launcher->renewExternalService(*before, later) != nullptr;
+        undo();
+        return holds;
+    };
+    const auto renamed = [&](const std::string& path) {
+        return holdsAfter([&] { fs::rename(path, home.path("away")); },
+                          [&] { fs::rename(home.path("away"), path); });
+    };
+    const auto nothing = [] {};
+    for (const std::string& path : {one.bundle.path, executable, place, place + "/tmp"})
+        EXPECT_FALSE(renamed(path)) << path;
+    EXPECT_FALSE(holdsAfter([&] { fs::permissions(executable, fs::perms::owner_read); },
+                            [&] { fs::permissions(executable, fs::perms::owner_all); }));
+    const std::string entitlements = "one.appex/Entitlements.plist";
+    EXPECT_FALSE(holdsAfter([&] { home.write(entitlements, ""); }, nothing));
+    const Dictionary other{{"QFBundleIdentifier", "two"}, {"QFBundleExecutable", "run"}};
+    EXPECT_FALSE(holdsAfter([&] { writeInfo("one", other); }, nothing));
+    const auto before = check();
+    EXPECT_TRUE(holdsAfter(nothing, nothing));
+    EXPECT_FALSE(launcher->renewExternalService(*before, {}));
+    const auto renewed = launcher->renewExternalService(*check(), later);
+    ASSERT_EQ(launcher->grantExternalService(*AuditToken::ofSelf(), renewed), 0);
+    EXPECT_EQ(talk(start(executable).takeDescriptor()), "later\n");
+    // The name of the executable was read at another time.
+    writeInfo("one", {{"QFBundleIdentifier", "one"}, {"QFBundleExecutable", "Info.plist"}});
+    while (!FileStamp::of(one.bundle.path + "/Info.plist").settled) loop.poll();
+    EXPECT_FALSE(launcher->renewExternalService(*check(), later));
+}
+
 TEST_F(LauncherTest, WhatABundleLinksToOutsideIsNotUsed) {
     const std::string inside = plugIn("one", "echo fine"), outside = plugIn("two", "echo other");
     std::filesystem::create_symlink("run", home.path("one.appex/link"));

@@ -12,6 +12,14 @@ namespace {
 
 namespace fs = std::filesystem;
 
+Touches::value_type inWhole(const std::string& scope) {
+    return {scope, true};
+}
+
+Touches::value_type inPieces(const std::string& scope) {
+    return {scope, false};
+}
+
 class FolderWatchTest : public testing::Test {
   protected:
     test::TemporaryDirectory files;
@@ -28,20 +36,28 @@ TEST_F(FolderWatchTest, TellsWhatWasTouched) {
     EXPECT_THAT(watch.takeTouched(), IsEmpty());
 
     files.write("folder/A.app/Info.plist", "x");
-    EXPECT_THAT(watch.takeTouched(), ElementsAre("the bundle"));
+    EXPECT_THAT(watch.takeTouched(), ElementsAre(inPieces("the bundle")));
     // A writer may keep its file open for ever.
     std::ofstream open(bundle + "/Info.plist");
     open << "y" << std::flush;
-    EXPECT_THAT(watch.takeTouched(), ElementsAre("the bundle"));
+    EXPECT_THAT(watch.takeTouched(), ElementsAre(inPieces("the bundle")));
     files.makeDirectory("folder/.B.app.tmp");
     EXPECT_THAT(watch.takeTouched(), IsEmpty());
     fs::rename(files.path("folder/.B.app.tmp"), files.path("folder/B.app"));
-    EXPECT_THAT(watch.takeTouched(), ElementsAre(folder + "/B.app"));
+    EXPECT_THAT(watch.takeTouched(), ElementsAre(inWhole(folder + "/B.app")));
     fs::rename(bundle, files.path("folder/C.app"));
     EXPECT_THAT(watch.takeTouched(),
-                ElementsAre(folder + "/A.app", folder + "/C.app", "the bundle"));
+                ElementsAre(inPieces(folder + "/A.app"), inWhole(folder + "/C.app"),
+                            inPieces("the bundle")));
+    // What happens last to a scope counts.
+    fs::rename(files.path("folder/B.app"), files.path("old"));
+    fs::rename(files.path("folder/C.app"), files.path("folder/B.app"));
+    fs::rename(files.path("folder/B.app"), files.path("folder/C.app"));
+    EXPECT_THAT(watch.takeTouched(),
+                ElementsAre(inPieces(folder + "/B.app"), inWhole(folder + "/C.app"),
+                            inPieces("the bundle")));
     fs::rename(folder, files.path("elsewhere"));
-    EXPECT_THAT(watch.takeTouched(), ElementsAre(""));
+    EXPECT_THAT(watch.takeTouched(), ElementsAre(inPieces("")));
 }
 
 TEST_F(FolderWatchTest, AWayIsFollowedThroughMissingFoldersAndLinks) {
@@ -59,7 +75,7 @@ TEST_F(FolderWatchTest, AWayIsFollowedThroughMissingFoldersAndLinks) {
         if (fs::exists(files.path("one"))) files.write("one/bustle", "x");
         EXPECT_THAT(watch.takeTouched(), IsEmpty());
         change();
-        return watch.takeTouched() == Scopes{""};
+        return watch.takeTouched() == Touches{inPieces("")};
     };
     const fs::path target = files.path("one/target");
     EXPECT_TRUE(changesAfter([&] { fs::create_directory(target / "late"); }));
@@ -89,12 +105,12 @@ TEST_F(FolderWatchTest, AnOverflowTouchesEverything) {
     // Equal events in a row count once.
     for (int i = 0; i <= most / 2; ++i)
         for (const std::string& file : {a, b}) ::chmod(file.c_str(), 0600);
-    Scopes touched;
-    for (Scopes next = watch.takeTouched(); !next.empty(); next = watch.takeTouched())
+    Touches touched;
+    for (Touches next = watch.takeTouched(); !next.empty(); next = watch.takeTouched())
         touched.merge(next);
-    EXPECT_THAT(touched, ElementsAre("", "folder"));
+    EXPECT_THAT(touched, ElementsAre(inPieces(""), inPieces("folder")));
     files.write("folder/c", "");
-    EXPECT_THAT(watch.takeTouched(), ElementsAre("folder"));
+    EXPECT_THAT(watch.takeTouched(), ElementsAre(inPieces("folder")));
 }
 
 }  // namespace

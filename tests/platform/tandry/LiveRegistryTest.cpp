@@ -83,6 +83,20 @@ TEST_F(LiveRegistryTest, FollowsAnApplicationThroughItsLife) {
     EXPECT_EQ(plugIn("b")->plugInUuid, last);
 }
 
+TEST_F(LiveRegistryTest, WhatIsRenamedIntoPlaceInWholeNeedsNoQuiet) {
+    fs::create_directories(at(apps));
+    watching = {.quiet = std::chrono::hours(1), .longest = std::chrono::hours(1)};
+    start();
+    addPlugIn("new/A.app/PlugIns/A.appex", "a");
+    fs::rename(at("new/A.app"), at(apps + "A.app"));
+    EXPECT_THAT(recorder.take(1), ElementsAre("+a"));
+    // So is the next version, though the one before goes first.
+    addPlugIn("new/A.app/PlugIns/A.appex", "b");
+    fs::rename(at(apps + "A.app"), at("old"));
+    fs::rename(at("new/A.app"), at(apps + "A.app"));
+    EXPECT_THAT(recorder.take(2), ElementsAre("-a", "+b"));
+}
+
 TEST_F(LiveRegistryTest, TellsAtOnceThatABundleMayHaveBeenExchanged) {
     const std::string linked = addPlugIn("opt/Linked.appex", "linked");
     const std::string bundle = addPlugIn(apps + "A.app/PlugIns/A.appex", "a");

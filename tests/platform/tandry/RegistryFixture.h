@@ -148,7 +148,9 @@ class RegistryTest : public testing::Test {
 
     const std::string apps = "home/zorvan/Applications/";
     /// Nothing is noticed by itself, unless a test wants that.
-    WatchSettings watching{.quiet = std::chrono::hours(1), .longest = std::chrono::hours(1)};
+    WatchSettings watching{.quiet = std::chrono::hours(1),
+                           .quietWhenWhole = std::chrono::hours(1),
+                           .longest = std::chrono::hours(1)};
     test::TemporaryDirectory files;
     Directories directories;
     std::unique_ptr<SdkDictionaries> sdks;
