@@ -142,7 +142,7 @@ std::optional<Value> ZRPlugInCore::embeddedProtocolSpec() const {
 }
 
 bool ZRPlugInCore::isAppExtension() const {
-    return path_.ends_with(".appex");
+    return isAppExtensionPath(path_);
 }
 
 bool ZRPlugInCore::isHybrid() const {

@@ -112,7 +112,7 @@ class ZRPlugInCore {
     std::optional<std::string> embeddedCodePath() const { return std::nullopt; }
     std::optional<platform::Value> embeddedProtocolSpec() const;
     /// The path ends in ".appex".
-    bool isAppExtension() const;
+    virtual bool isAppExtension() const;
     bool isMultiplexed() const { return false; }
     bool isHybrid() const;
     /// Available only inside the application that contains it: "Dedicated" is a number other than
@@ -170,6 +170,7 @@ class ZRPlugInCore {
                std::optional<platform::Value> bundleInfo, std::optional<platform::Uuid> uuid);
     bool setupWithForm(const platform::Dictionary& form);
     bool setDictionaries(const platform::Value& infoPlist);
+    static bool isAppExtensionPath(std::string_view path) { return path.ends_with(".appex"); }
     /// A hook for builders that adjust an Info.plist first.
     virtual platform::Value normalizeInfoDictionary(platform::Value infoPlist) const {
         return infoPlist;

@@ -26,6 +26,7 @@ class HoldList {
     /// The same with the oldest hold of this very client.
     Hold takeOldestOf(const ZRDLumClient& client);
 
+    bool empty() const { return holds_.empty(); }
     /// Whether any hold has the plug-in: it is one of those that were blocked, or lies where one of
     /// them did, or in an application that is held.
     bool has(const ZRDPlugIn& plugIn) const;

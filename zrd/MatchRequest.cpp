@@ -143,6 +143,7 @@ void Transaction::completeForms(const std::shared_ptr<Matching>& matching, std::
 /// Gives tokens to those whose file systems have to be asked, beside the service queue.
 void Transaction::completeLateForms(const std::shared_ptr<Matching>& matching) {
     std::erase_if(matching->late, [](const auto& late) { return late.isComplete; });
+    if (matching->late.empty()) return answerMatch(matching->result);
     // Those at the end may not get their turn in time: they are others in each match.
     std::shuffle(matching->late.begin(), matching->late.end(), std::random_device());
     const auto forms = std::make_shared<std::vector<Dictionary>>(matching->late.size());
@@ -175,9 +176,10 @@ void Transaction::completeLateForms(const std::shared_ptr<Matching>& matching) {
 
 void Transaction::answerMatch(MatchResult& result) {
     result.linkOverrides();
-    EVLOG_INFO(ops(), "match returned {} plug-ins", result.size());
+    auto forms = result.takeForms();
+    EVLOG_INFO(ops(), "match returned {} plug-ins", forms.size());
     if (auto matches =
-            ZRDaemonClient::convertToLum(result.forms(), static_cast<std::int64_t>(version()))) {
+            ZRDaemonClient::convertToLum(std::move(forms), static_cast<std::int64_t>(version()))) {
         reply_.set(message::kMatches, *std::move(matches));
     }
     EVLOG_DEBUG(ops(), "reply marshalled");

@@ -54,11 +54,10 @@ bool MatchResult::wins(const ZRDPlugIn& plugIn, const Dictionary& accepted,
 
 bool MatchResult::admit(const ZRDPlugIn& plugIn) {
     constexpr std::uint64_t kKeepAll = ZRDiscoverVersions | ZRDiscoverDuplicates;
-    // Where the one that is admitted is put.
-    place_ = &byIdentifier_[plugIn.identifier()];
+    rivals_ = &byIdentifier_[plugIn.identifier()];
     beaten_.reset();
     if ((flags_ & kKeepAll) == kKeepAll) return true;
-    for (std::size_t index : *place_) {
+    for (std::size_t index = rivals_->first; index != kNone; index = accepted_[index].next) {
         Accepted& rival = accepted_[index];
         if (rival.displaced) continue;
         int order = compareVersions(plugIn.version(), rival.form.find(form::kVersion));
@@ -84,7 +83,8 @@ bool MatchResult::append(std::shared_ptr<ZRDPlugIn> plugIn, Dictionary form) {
     }
     bytes_ += bytes;
     std::size_t index = accepted_.size();
-    place_->push_back(index);
+    (rivals_->first == kNone ? rivals_->first : accepted_[rivals_->last].next) = index;
+    rivals_->last = index;
     const Value* replaced = plugIn->replaced();
     accepted_.push_back({std::move(plugIn), std::move(form), bytes});
     if (!replaced) return true;
@@ -121,15 +121,12 @@ void MatchResult::linkOverrides() {
     }
 }
 
-std::size_t MatchResult::size() const {
-    return std::ranges::count(accepted_, false, &Accepted::displaced);
-}
-
-platform::Array MatchResult::forms() const {
-    return arrayWithValues(accepted_, [](const Accepted& accepted) -> std::optional<Value> {
-        if (accepted.displaced) return std::nullopt;
-        return accepted.form;
-    });
+platform::Array MatchResult::takeForms() {
+    std::vector<Value> forms;
+    forms.reserve(accepted_.size());
+    for (Accepted& accepted : accepted_)
+        if (!accepted.displaced) forms.emplace_back(std::move(accepted.form));
+    return platform::Array(std::move(forms));
 }
 
 }  // namespace zorvan

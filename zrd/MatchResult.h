@@ -3,6 +3,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <memory>
+#include <memory_resource>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -40,28 +41,35 @@ class MatchResult {
     /// Sets "overrider" on the form of each replaced plug-in and "overriding" on its replacer's.
     void linkOverrides();
 
-    std::size_t size() const;
-    /// The accepted forms, in the order of their acceptance.
-    platform::Array forms() const;
+    /// The forms that stand, in the order of their acceptance. The last that is asked of this.
+    platform::Array takeForms();
 
   private:
+    static constexpr std::size_t kNone = ~std::size_t{0};
     /// Stays where it is, so that its index stays good, also when it is displaced.
     struct Accepted {
         std::shared_ptr<ZRDPlugIn> plugIn;
         platform::Dictionary form;
         std::size_t bytes = 0;  // that the form takes in a reply
         bool displaced = false;
+        std::size_t next = kNone;  // of the same identifier
     };
-    using Indexes = std::vector<std::size_t>;  // of `accepted_`
+    /// Those of one identifier, by their indexes.
+    struct Rivals {
+        std::size_t first = kNone;
+        std::size_t last = kNone;
+    };
 
     bool wins(const ZRDPlugIn& plugIn, const platform::Dictionary& accepted,
               int versionOrder) const;
 
     std::uint64_t flags_;
     std::vector<Accepted> accepted_;
-    std::size_t bytes_ = 0;  // of the accepted forms that were not displaced
-    std::unordered_map<std::string_view, Indexes> byIdentifier_;  // keys of accepted plug-ins
-    Indexes* place_ = nullptr;           // of the plug-in that was admitted last
+    std::size_t bytes_ = 0;                      // of the accepted forms that were not displaced
+    std::pmr::monotonic_buffer_resource nodes_;  // of the map
+    /// By identifiers of plug-ins that were met.
+    std::pmr::unordered_map<std::string_view, Rivals> byIdentifier_{&nodes_};
+    Rivals* rivals_ = nullptr;           // of the plug-in that was admitted last
     std::optional<std::size_t> beaten_;  // by it
     /// Who replaces an identifier. It stays so when it is displaced itself.
     std::unordered_map<std::string, std::size_t> replacers_;

@@ -70,7 +70,7 @@ bool TextPatterns::matches(std::string_view text) const {
 bool TextPatterns::isEqual(std::string_view text) const {
     if (equal_.size() <= kFew)
         return std::ranges::any_of(equal_, [&](const std::string& operand) {
-            return compareVersionString(text, operand) == 0;
+            return text == operand || compareVersionString(text, operand) == 0;
         });
     const auto form = canonicalVersionString(text, longestForm_);
     return form && equalForms_.contains(*form);

@@ -148,7 +148,7 @@ Dictionary ZRDAnnotationStore::merged(const Dictionary& annotation, const std::s
 }
 
 bool ZRDAnnotationStore::hasRoomFor(const Dictionary& annotation, const ZRDPlugIn& plugIn) const {
-    const std::string key = plugIn.annotationKey();
+    const std::string key(plugIn.annotationKey());
     platform::PropertyListCost after = cost_;
     after += costOf(key, merged(annotation, key));
     if (const Value* current = annotations_.find(key)) after -= costOf(key, *current);
@@ -159,7 +159,7 @@ bool ZRDAnnotationStore::hasRoomFor(const Dictionary& annotation, const ZRDPlugI
 
 bool ZRDAnnotationStore::hasShareFor(const Dictionary& annotation, const ZRDPlugIn& plugIn,
                                      const platform::Origin& origin) const {
-    const std::string key = plugIn.annotationKey();
+    const std::string key(plugIn.annotationKey());
     return shares_.hasRoomFor(origin, key, costOf(key, merged(annotation, key)));
 }
 
@@ -167,7 +167,7 @@ void ZRDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotati
                                        const ZRDPlugIn& plugIn,
                                        const std::optional<platform::Origin>& origin,
                                        platform::Sync sync) {
-    const std::string key = plugIn.annotationKey();
+    const std::string key(plugIn.annotationKey());
     std::optional<platform::PropertyListCost> cost;
     if (const Value* current = annotations_.find(key)) cost_ -= costOf(key, *current);
     if (annotation) {

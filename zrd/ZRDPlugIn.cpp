@@ -31,6 +31,7 @@ ZRDPlugIn::ZRDPlugIn(platform::TDPlugInProxyRef proxy, std::shared_ptr<const Plu
       registeredPlugIn_(tdproxy_->plugInDictionary()),
       registeredAttributes_(tdproxy_->attributes()),
       isDedicated_(ZRPlugInCore::isDedicated()),
+      isAppExtension_(isAppExtensionPath(*tdproxy_->bundlePath)),
       hostEntitlement_(pluginKey(key::kHostEntitlement)),
       replaced_(tdproxy_->entitlements.get().find(entitlement::kReplacePlugIn)),
       extensionPoint_(attributeOrInfoKey(key::kExtensionPoint)),
@@ -189,8 +190,8 @@ bool ZRDPlugIn::hasEntitlement(std::string_view name) const {
     return value && !platform::equalsFalse(*value);
 }
 
-std::string ZRDPlugIn::annotationKey() const {
-    return replaced_ && replaced_->string() ? replaced_->string()->string() : identifier();
+std::string_view ZRDPlugIn::annotationKey() const {
+    return replaced_ && replaced_->string() ? replaced_->string()->view() : identifier();
 }
 
 Dictionary ZRDPlugIn::prunedInfoDictionaryFor(const Dictionary& dictionary) {

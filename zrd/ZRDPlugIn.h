@@ -49,6 +49,7 @@ class ZRDPlugIn final : public ZRPlugInCore {
     const platform::Value* pluginKey(std::string_view key) const override;
     const platform::Value* attribute(std::string_view key) const override;
     bool isDedicated() const override { return isDedicated_; }
+    bool isAppExtension() const override { return isAppExtension_; }
     std::optional<std::string> localizedName() const override;
     void setLocalizedName(std::optional<std::string> value) override;
     std::optional<std::string> localizedShortName() const override;
@@ -83,7 +84,7 @@ class ZRDPlugIn final : public ZRPlugInCore {
     const platform::Value* replaced() const { return replaced_; }
     /// The key of the user's choices about this plug-in: the identifier that it replaces, else its
     /// own.
-    std::string annotationKey() const;
+    std::string_view annotationKey() const;
 
     /// `dictionary` without the entries whose keys begin with "DT".
     static platform::Dictionary prunedInfoDictionaryFor(const platform::Dictionary& dictionary);
@@ -166,6 +167,7 @@ class ZRDPlugIn final : public ZRPlugInCore {
     const platform::Dictionary* const registeredAttributes_;
     // What every discovery asks of every candidate.
     const bool isDedicated_;
+    const bool isAppExtension_;
     const platform::Value* const hostEntitlement_;
     const platform::Value* const replaced_;
     const platform::Value* const extensionPoint_;

@@ -83,7 +83,8 @@ class ZRDServer final : public ZRDatabase,
     platform::SerialQueue lumQueue_;
     platform::Pool holdPool_{kMaxHolds};
     platform::SyncQueue syncQueue_{"serverSync"};
-    HoldList holds_;  // guarded by syncQueue_
+    HoldList holds_;                     // guarded by syncQueue_
+    std::atomic<bool> areHolds_{false};  // whether it has any; changed there
     std::unique_ptr<platform::Listener> service_;
     std::unique_ptr<ZRDUserPrefs> userPrefs_;
     // The last members: they go first, and the work that still waits in them uses the others.

@@ -8,7 +8,8 @@
 namespace zorvan {
 
 bool ZRDServer::holdOnPlugIn(const ZRDPlugIn& plugIn) {
-    return syncQueue_.sync([&] { return holds_.has(plugIn); });
+    // Asked of every candidate; mostly there are none.
+    return areHolds_ && syncQueue_.sync([&] { return holds_.has(plugIn); });
 }
 
 std::vector<std::shared_ptr<ZRDPlugInHold>> ZRDServer::holds() {
@@ -16,7 +17,10 @@ std::vector<std::shared_ptr<ZRDPlugInHold>> ZRDServer::holds() {
 }
 
 void ZRDServer::addHold(const std::shared_ptr<ZRDPlugInHold>& hold) {
-    syncQueue_.sync([&] { holds_.add(hold); });
+    syncQueue_.sync([&] {
+        holds_.add(hold);
+        areHolds_ = true;
+    });
     // Once the hold is there, "ready" refuses; what it granted before must not outlast that.
     for (const auto& plugIn : hold->blocked())
         services().launcher->removeExternalServices(plugIn->path());
@@ -26,6 +30,7 @@ void ZRDServer::addHold(const std::shared_ptr<ZRDPlugInHold>& hold) {
 void ZRDServer::unholdToken(const platform::Uuid& token) {
     syncQueue_.sync([&] {
         if (!holds_.take(token)) return;
+        areHolds_ = !holds_.empty();
         EVLOG_DEBUG(ops(), "releasing plug-in hold {} at client's request", pub(token));
         notifyAnnotationChange();
     });
@@ -34,6 +39,7 @@ void ZRDServer::unholdToken(const platform::Uuid& token) {
 void ZRDServer::unholdClient(const ZRDLumClient& client) {
     syncQueue_.sync([&] {
         while (const auto hold = holds_.takeOldestOf(client)) {
+            areHolds_ = !holds_.empty();
             EVLOG_DEBUG(ops(), "releasing plug-in hold {} for dead client pid {}",
                         pub(hold->uuid()), client.pid());
             notifyAnnotationChange();

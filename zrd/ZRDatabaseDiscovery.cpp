@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cctype>
 #include <cwctype>
+#include <memory_resource>
 #include <string>
 #include <unordered_set>
 #include <vector>
@@ -137,7 +138,8 @@ std::optional<ZRDPlugInList> ZRDatabase::findPlugIns(const Dictionary* query) {
     if (!proxies) return std::nullopt;
     ZRDPlugInList plugIns;
     plugIns.reserve(proxies->size());
-    std::unordered_set<platform::Uuid> seen(proxies->size());
+    std::pmr::monotonic_buffer_resource nodes;
+    std::pmr::unordered_set<platform::Uuid> seen(proxies->size(), &nodes);
     // Entered once for all: thousands pass through here at a request.
     sync_.sync([&] {
         for (const auto& proxy : *proxies) {

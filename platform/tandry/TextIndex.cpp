@@ -47,6 +47,7 @@ std::optional<std::vector<std::uint64_t>> patternKeys(const Value& pattern) {
 
 template <class List>
 void sortUnique(List& list) {
+    if (std::ranges::adjacent_find(list, std::ranges::greater_equal()) == list.end()) return;
     std::ranges::sort(list);
     list.erase(std::unique(list.begin(), list.end()), list.end());
 }
@@ -93,9 +94,10 @@ std::optional<Positions> TextIndex::find(const Value& pattern, std::size_t plugI
         // One plug-in may have many texts.
         if (found.size() > plugIns) return std::nullopt;
         using Entry = std::pair<std::uint64_t, Position>;
-        for (auto place = std::ranges::lower_bound(entries_, key, {}, &Entry::first);
-             place != entries_.end() && place->first == key; ++place)
-            found.push_back(place->second);
+        const auto first = std::ranges::lower_bound(entries_, key, {}, &Entry::first);
+        const auto last = std::ranges::upper_bound(first, entries_.end(), key, {}, &Entry::first);
+        if (found.empty()) found.reserve(static_cast<std::size_t>(last - first));
+        for (auto place = first; place != last; ++place) found.push_back(place->second);
     }
     sortUnique(found);
     return found;
