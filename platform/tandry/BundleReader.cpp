@@ -199,6 +199,14 @@ BundleFolder BundleFolder::reachedBy(int directory) const {
     return folder;
 }
 
+FileIdentity BundleFolder::identity() const {
+    return FileIdentity::at(dirfd, name.c_str());
+}
+
+bool BundleFolder::isEntry() const {
+    return dirfd != AT_FDCWD;
+}
+
 BundleReader::BundleReader(SdkDictionaries& sdks, SdkMerge merge,
                            std::vector<std::string> languages, ForeignPlaces& places)
     : sdks_(sdks), places_(places), merge_(std::move(merge)), languages_(std::move(languages)) {
@@ -254,10 +262,10 @@ bool BundleReader::areApplicationStampsLike(std::string_view a, std::string_view
     return areLike(a, b, kStampsToLocalized);
 }
 
-void BundleReader::appendFixedStamps(const BundleFolder& folder, std::string& stamps) {
-    const FileIdentity identity = FileIdentity::at(folder.dirfd, folder.name.c_str());
-    isUnsure_ = isUnsure_ || identity == FileIdentity();
-    identity.appendTo(stamps);
+void BundleReader::appendFixedStamps(const BundleFolder& folder, const FileIdentity& directory,
+                                     std::string& stamps) {
+    isUnsure_ = isUnsure_ || directory == FileIdentity();
+    directory.appendTo(stamps);
     appendStamp(folder, kInfoPlist, stamps);
     appendStamp(folder, kEntitlements, stamps);
     appendLocalizedStamp(folder, stamps);
@@ -283,13 +291,19 @@ void BundleReader::appendNamedStamps(const BundleFolder& folder, const Fingerpri
     if (!print.sdk.empty()) stamps += sdkStamps(print.sdk);
 }
 
-bool BundleReader::isUnchanged(const BundleFolder& folder, const Fingerprint& print) {
-    return refreshed(folder, {print.executable, print.sdk, {}}).stamps == print.stamps;
+bool BundleReader::isUnchanged(const BundleFolder& folder, const FileIdentity& directory,
+                               const Fingerprint& print) {
+    if (directory != print.directory()) return false;
+    std::string stamps;
+    stamps.reserve(print.stamps.size());
+    appendFixedStamps(folder, directory, stamps);
+    appendNamedStamps(folder, print, stamps);
+    return stamps == print.stamps;
 }
 
 Fingerprint BundleReader::refreshed(const BundleFolder& folder, Fingerprint print) {
     print.stamps.clear();
-    appendFixedStamps(folder, print.stamps);
+    appendFixedStamps(folder, folder.identity(), print.stamps);
     appendNamedStamps(folder, print, print.stamps);
     return print;
 }
@@ -315,7 +329,7 @@ BundleReader::Reading BundleReader::readPlugIn(const BundleFolder& place, bool w
     }
     const BundleFolder folder = place.reachedBy(directory->get());
     // Stamps are older than what is read, so a change in between is seen by the next walk.
-    appendFixedStamps(folder, reading.entry.print.stamps);
+    appendFixedStamps(folder, folder.identity(), reading.entry.print.stamps);
     reading.refusal = fill(folder, reading.entry, withDigest);
     return reading;
 }
