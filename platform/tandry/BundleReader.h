@@ -101,7 +101,8 @@ class BundleReader {
                            std::string& stamps);
     bool areLike(std::string_view a, std::string_view b, int stampsToLocalized) const;
     const std::string& sdkStamps(const std::string& sdk);
-    std::optional<Error> fill(const BundleFolder& folder, PlugInEntry& entry, bool withDigest);
+    std::optional<Error> fill(const BundleFolder& folder, PlugInEntry& entry, std::string& stamps,
+                              bool withDigest);
     std::optional<Error> encode(const BundleFolder& folder, const Dictionary& info,
                                 PlugInEntry& entry);
     std::optional<Error> describePlugIn(const BundleFolder& folder, const Dictionary& info,

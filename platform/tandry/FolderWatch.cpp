@@ -109,8 +109,7 @@ bool FolderWatch::Reason::operator==(const Reason& other) const {
 }
 
 void FolderWatch::mark(const std::string& path, Kind kind, std::string_view text) {
-    if (!lastText_ || *lastText_ != text) lastText_ = std::make_shared<const std::string>(text);
-    const Reason reason{kind, lastText_};
+    const Reason reason{kind, texts_.of(text)};
     auto known = paths_.find(path);
     const Descriptor before = known == paths_.end() ? -1 : known->second;
     if (known != paths_.end()) {

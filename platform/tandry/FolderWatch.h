@@ -5,7 +5,6 @@
 #include <cstdint>
 #include <limits>
 #include <map>
-#include <memory>
 #include <mutex>
 #include <set>
 #include <string>
@@ -14,6 +13,7 @@
 #include <vector>
 
 #include "platform/system/UniqueFd.h"
+#include "platform/tandry/SharedTexts.h"
 
 namespace platform::tandry {
 
@@ -84,7 +84,7 @@ class FolderWatch {
         Kind kind;
         /// `Name`: which one matters, `Entries`: the suffix of those that do, `Contents`: the
         /// scope.
-        std::shared_ptr<const std::string> text;
+        SharedText text;
         bool operator==(const Reason& other) const;
     };
     struct Watched {
@@ -104,7 +104,7 @@ class FolderWatch {
     UniqueFd inotify_;  // the same one from the first walk that marks something
     std::unordered_map<Descriptor, Watched> watches_;
     std::map<std::string, Descriptor> paths_;
-    std::shared_ptr<const std::string> lastText_;  // of a reason: neighbours have the same
+    SharedTexts texts_;  // of reasons: neighbours have the same
     std::uint32_t walk_ = 0;
     bool isOverEverything_ = false;
     bool isPostponed_ = false;
