@@ -9,6 +9,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <csignal>
 #include <cstring>
 #include <deque>
@@ -111,7 +112,8 @@ class Peers {
             ::raise(SIGSTOP);
             ::_exit(0);
         }
-        fuzz::require(leader > 0 && ::waitpid(leader, nullptr, WUNTRACED) == leader);
+        fuzz::require(leader > 0);
+        await(leader, WUNTRACED);
         broker_.settle();
         const std::string bytes = withTokens(part);
         for (UniqueFd& socket : sockets) {
@@ -120,7 +122,12 @@ class Peers {
         }
         broker_.settle();
         ::kill(leader, SIGKILL);
-        ::waitpid(leader, nullptr, 0);
+        await(leader, 0);
+    }
+
+    /// The fuzzer has a timer, which interrupts.
+    static void await(pid_t process, int options) {
+        while (::waitpid(process, nullptr, options) < 0) fuzz::require(errno == EINTR);
     }
 
     void send(std::string_view part) {

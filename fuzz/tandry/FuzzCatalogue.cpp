@@ -100,7 +100,8 @@ RegistryChanges change(RegistryState& state, const std::set<std::string>& gone,
         state.applications.erase(path);
     }
     for (auto& [path, entry] : state.plugIns)
-        if (restamped.contains(path)) entry.print.stamps += "later";
+        if (restamped.contains(path))
+            entry.print.stamps = PackedBytes(entry.print.stamps.unpacked() + "later");
     changes.restamped = restamped;
     return changes;
 }

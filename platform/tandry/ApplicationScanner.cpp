@@ -1,5 +1,6 @@
 #include "platform/tandry/ApplicationScanner.h"
 
+#include <fcntl.h>
 #include <fmt/format.h>
 
 #include <algorithm>
@@ -203,12 +204,13 @@ void ApplicationScanner::visitFolder(const std::string& folder) {
         if (!isApplication(name)) continue;
         const std::string entry = joinPath(folder, name);
         if (!target.empty()) noteLink(entry, target);
-        const std::string& path = target.empty() ? entry : target;
-        if (isApplication(path))
-            visitApplication(path);
+        if (target.empty())
+            visitApplication(BundleFolder(found->directory(), folder, name));
+        else if (isApplication(target))
+            visitApplication(BundleFolder(target));
         else
             complaints_.add(entry, "skipping",
-                            fmt::format("{}: {} is not an application directory", entry, path));
+                            fmt::format("{}: {} is not an application directory", entry, target));
     }
 }
 
@@ -219,17 +221,18 @@ void ApplicationScanner::noteLink(const std::string& link, const std::string& ta
 
 void ApplicationScanner::visitPath(const std::string& path) {
     if (isApplication(path))
-        visitApplication(path);
+        visitApplication(BundleFolder(path));
     else
         visitPlugIn(BundleFolder(path), applicationOf(path), path);
 }
 
-void ApplicationScanner::visitApplication(const std::string& path) {
+void ApplicationScanner::visitApplication(const BundleFolder& place) {
+    const std::string& path = place.path;
     // Two links may lead to one application.
     auto known = state_.applications.find(path);
     if (known != state_.applications.end() && known->second.plugInsPass == pass_) return;
-    if (!canSee(path)) return;
-    if (isUntrusted(path, "an application")) return;
+    if (!canSee(place)) return;
+    if (isUntrusted(path, place.identity(), "an application")) return;
     watch_.markContents(path, path);
     std::string folder = joinPath(path, kPlugIns);
     std::error_code ignored;
@@ -240,15 +243,16 @@ void ApplicationScanner::visitApplication(const std::string& path) {
         folder = std::move(target);
         if (isUntrusted(folder, "plug-ins")) return;
     }
-    visitPlugIns(path, folder);
+    visitPlugIns(place, folder);
 }
 
 /// An application that cannot be looked into is not known.
-void ApplicationScanner::visitPlugIns(const std::string& application, const std::string& folder) {
+void ApplicationScanner::visitPlugIns(const BundleFolder& place, const std::string& folder) {
+    const std::string& application = place.path;
     if (!canSee(folder)) {
         unreachable_.push_back(application);
         if (!state_.applications.contains(application)) return;
-        static_cast<void>(applicationAt(application));
+        static_cast<void>(applicationAt(place));
         state_.applications[application].plugInsPass = pass_;
         return;
     }
@@ -261,7 +265,7 @@ void ApplicationScanner::visitPlugIns(const std::string& application, const std:
         if (noteTransient(found.error())) isIncomplete_ = true;
         return;
     }
-    TDApplicationProxyRef record = applicationAt(application);
+    TDApplicationProxyRef record = applicationAt(place);
     state_.applications[application].plugInsPass = pass_;
     if (!found) return;
     noteLost(*found);
@@ -276,11 +280,11 @@ void ApplicationScanner::visitPlugIns(const std::string& application, const std:
         }
 }
 
-TDApplicationProxyRef ApplicationScanner::applicationAt(const std::string& path) {
+TDApplicationProxyRef ApplicationScanner::applicationAt(const BundleFolder& folder) {
+    const std::string& path = folder.path;
     ApplicationEntry& entry = state_.applications[path];
     if (std::exchange(entry.pass, pass_) == pass_) return entry.record;
     watch_.markContents(path, path);
-    BundleFolder folder(path);
     if (entry.record && reader_.applicationStamps(folder) == entry.stamps) return entry.record;
     BundleReader::ApplicationReading reading = reader_.readApplication(folder);
     // What cannot be read just now is not known to have changed.
@@ -308,13 +312,14 @@ bool ApplicationScanner::noteTransient(const Error& error) {
 
 TDApplicationProxyRef ApplicationScanner::applicationOf(const std::string& plugInPath) {
     std::string path = applicationAbove(plugInPath);
-    return path.empty() ? nullptr : applicationAt(path);
+    return path.empty() ? nullptr : applicationAt(BundleFolder(std::move(path)));
 }
 
 /// Whether a bundle lies where none is taken from. What an earlier walk took from there goes at
 /// once, also when this one turns out to be incomplete.
-bool ApplicationScanner::isUntrusted(const std::string& path, const char* kind) {
-    const char* place = untrusted_.around(path);
+bool ApplicationScanner::isUntrusted(const std::string& path, const FileIdentity& directory,
+                                     const char* kind) {
+    const char* place = untrusted_.around(path, directory);
     if (!place) return false;
     const std::string reason = fmt::format("{}: it lies in {}", path, place);
     complaints_.add(path, "leaving out", fmt::format("{}: {}", kind, reason));
@@ -327,6 +332,10 @@ bool ApplicationScanner::isUntrusted(const std::string& path, const char* kind) 
     return true;
 }
 
+bool ApplicationScanner::isUntrusted(const std::string& path, const char* kind) {
+    return isUntrusted(path, FileIdentity::at(AT_FDCWD, path.c_str()), kind);
+}
+
 /// Nothing is left of a forgotten bundle that its content could be compared with.
 bool ApplicationScanner::isForgotten(const BundleFolder& folder) {
     auto found = state_.forgotten.find(folder.path);
@@ -337,12 +346,13 @@ bool ApplicationScanner::isForgotten(const BundleFolder& folder) {
     return true;
 }
 
-bool ApplicationScanner::isRefused(const BundleFolder& folder, const std::string& application) {
+bool ApplicationScanner::isRefused(const BundleFolder& folder, const FileIdentity& directory,
+                                   const std::string& application) {
     auto found = state_.refusals.find(folder.path);
     if (found == state_.refusals.end()) return false;
     Refusal& refusal = found->second;
     if (refusal.pass == pass_) return true;
-    if (!reader_.isUnchanged(folder, refusal.print)) return false;
+    if (!reader_.isUnchanged(folder, directory, refusal.print)) return false;
     if (refusal.size != 0 && !room_.excess(application, refusal.size)) return false;
     // Remembered from an earlier run: its author has to be told in this one as well.
     if (std::exchange(refusal.pass, pass_) == 0) complaints_.say(kLeavingOut, refusal.reason);
@@ -391,20 +401,21 @@ bool ApplicationScanner::isSame(PlugInEntry& known, const PlugInEntry& read) {
 void ApplicationScanner::visitPlugIn(const BundleFolder& folder,
                                      const TDApplicationProxyRef& application,
                                      const std::string& scope) {
-    if (!canSee(folder.path)) return;
-    if (isUntrusted(folder.path, "a plug-in")) return;
+    if (!canSee(folder)) return;
+    const FileIdentity directory = folder.identity();
+    if (isUntrusted(folder.path, directory, "a plug-in")) return;
     watch_.markContents(folder.path, scope);
     auto found = state_.plugIns.find(folder.path);
     PlugInEntry* known = found == state_.plugIns.end() ? nullptr : &found->second;
     if (known && known->pass == pass_) return static_cast<void>(++metPlugIns_);
     const bool isInPlace =
         known && known->record->containingApplication == application && !isBeyondRoom(*known);
-    if (isInPlace && reader_.isUnchanged(folder, known->print)) {
+    if (isInPlace && reader_.isUnchanged(folder, directory, known->print)) {
         ++metPlugIns_;
         return keep(*known);
     }
     if (isForgotten(folder)) return;
-    if (isRefused(folder, application ? application->bundlePath : std::string())) return;
+    if (isRefused(folder, directory, application ? application->bundlePath : std::string())) return;
     const bool hasDigest = known && !known->print.executableDigest.empty();
     BundleReader::Reading reading = reader_.readPlugIn(folder, hasDigest);
     // One that cannot be read is not known to have changed.

@@ -63,27 +63,30 @@ class ApplicationScanner {
     void keepUnseen(const std::string& path);
     void noteLost(const FolderEntries& found);
     bool canSee(const std::string& path);
+    bool canSee(const BundleFolder& folder);
     void visitFolder(const std::string& folder);
     void visitRegistration(const std::string& path);
     bool visitScope(const std::string& path);
     void visitPath(const std::string& path);
-    void visitApplication(const std::string& path);
-    void visitPlugIns(const std::string& application, const std::string& folder);
+    void visitApplication(const BundleFolder& place);
+    void visitPlugIns(const BundleFolder& application, const std::string& folder);
     void visitPlugIn(const BundleFolder& folder, const TDApplicationProxyRef& application,
                      const std::string& scope);
     bool isUntrusted(const std::string& path, const char* kind);
+    bool isUntrusted(const std::string& path, const FileIdentity& directory, const char* kind);
     void refuse(const BundleFolder& folder, BundleReader::Reading reading);
     bool noteTransient(const Error& error);
     void install(const BundleFolder& folder, BundleReader::Reading reading,
                  const TDApplicationProxyRef& application);
-    TDApplicationProxyRef applicationAt(const std::string& path);
+    TDApplicationProxyRef applicationAt(const BundleFolder& folder);
     TDApplicationProxyRef applicationOf(const std::string& plugInPath);
     void keep(PlugInEntry& entry);
     void replace(PlugInEntry& entry);
     bool isSame(PlugInEntry& known, const PlugInEntry& read);
     bool isBeyondRoom(const PlugInEntry& entry) const;
     bool isForgotten(const BundleFolder& folder);
-    bool isRefused(const BundleFolder& folder, const std::string& application);
+    bool isRefused(const BundleFolder& folder, const FileIdentity& directory,
+                   const std::string& application);
     bool isAllMet(const std::string& scope);
     bool isSelfContained(const std::string& scope) const;
     bool isOutdated(const std::string& application) const;

@@ -46,10 +46,13 @@ void ApplicationScanner::dropUnmet(const std::string& scope) {
 }
 
 void ApplicationScanner::noteUnwatched(const std::string& scope) {
+    // It is not asked about anything yet.
+    if (watch_.isPostponed()) return;
     forEachWithin(unwatched_, scope, [this](auto path) { unwatched_.erase(path); });
     std::string known;
     forEachWithin(state_.plugIns, scope, [&](auto entry) {
-        if (places_.answersWithin(entry->first) && watch_.seesExchangeOf(entry->first, known))
+        if (watch_.watchesWayTo(entry->first, known) && places_.answersWithin(entry->first) &&
+            FolderWatch::isLocal(entry->first))
             known = entry->first;
         else
             unwatched_.insert(entry->first);
@@ -64,6 +67,7 @@ RegistryChanges ApplicationScanner::finish(const Scopes& scopes) {
         for (auto& [path, entry] : state_.plugIns)
             if (entry.pass == 0) keep(entry);
     watch_.endWalk();
+    containers_.endWalk();
     for (const std::string& scope : scopes) noteUnwatched(scope);
     return std::exchange(changes_, {});
 }
@@ -92,6 +96,13 @@ void ApplicationScanner::noteLost(const FolderEntries& found) {
 bool ApplicationScanner::canSee(const std::string& path) {
     const bool result = places_.answersWithin(path);
     if (!result) keepUnseen(path);
+    return result;
+}
+
+bool ApplicationScanner::canSee(const BundleFolder& folder) {
+    if (!folder.isEntry()) return canSee(folder.path);
+    const bool result = places_.entryAnswersWithin(folder.path);
+    if (!result) keepUnseen(folder.path);
     return result;
 }
 

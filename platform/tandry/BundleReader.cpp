@@ -199,6 +199,14 @@ BundleFolder BundleFolder::reachedBy(int directory) const {
     return folder;
 }
 
+FileIdentity BundleFolder::identity() const {
+    return FileIdentity::at(dirfd, name.c_str());
+}
+
+bool BundleFolder::isEntry() const {
+    return dirfd != AT_FDCWD;
+}
+
 BundleReader::BundleReader(SdkDictionaries& sdks, SdkMerge merge,
                            std::vector<std::string> languages, ForeignPlaces& places)
     : sdks_(sdks), places_(places), merge_(std::move(merge)), languages_(std::move(languages)) {
@@ -240,13 +248,13 @@ bool BundleReader::areLike(std::string_view a, std::string_view b, int stampsToL
 
 bool BundleReader::isLike(const Fingerprint& a, const Fingerprint& b) const {
     constexpr int kStampsToLocalized = 3;
-    const auto filesOf = [](const Fingerprint& print) {
-        return std::string_view(print.stamps)
-            .substr(std::min(print.stamps.size(), FileIdentity::kStoredSize));
+    const auto filesOf = [](const std::string& stamps) {
+        return std::string_view(stamps).substr(std::min(stamps.size(), FileIdentity::kStoredSize));
     };
+    const std::string stampsOfA = a.stamps.unpacked(), stampsOfB = b.stamps.unpacked();
     return a.executable == b.executable && a.sdk == b.sdk &&
            a.directory().inode == b.directory().inode &&
-           areLike(filesOf(a), filesOf(b), kStampsToLocalized);
+           areLike(filesOf(stampsOfA), filesOf(stampsOfB), kStampsToLocalized);
 }
 
 bool BundleReader::areApplicationStampsLike(std::string_view a, std::string_view b) const {
@@ -254,10 +262,10 @@ bool BundleReader::areApplicationStampsLike(std::string_view a, std::string_view
     return areLike(a, b, kStampsToLocalized);
 }
 
-void BundleReader::appendFixedStamps(const BundleFolder& folder, std::string& stamps) {
-    const FileIdentity identity = FileIdentity::at(folder.dirfd, folder.name.c_str());
-    isUnsure_ = isUnsure_ || identity == FileIdentity();
-    identity.appendTo(stamps);
+void BundleReader::appendFixedStamps(const BundleFolder& folder, const FileIdentity& directory,
+                                     std::string& stamps) {
+    isUnsure_ = isUnsure_ || directory == FileIdentity();
+    directory.appendTo(stamps);
     appendStamp(folder, kInfoPlist, stamps);
     appendStamp(folder, kEntitlements, stamps);
     appendLocalizedStamp(folder, stamps);
@@ -283,14 +291,19 @@ void BundleReader::appendNamedStamps(const BundleFolder& folder, const Fingerpri
     if (!print.sdk.empty()) stamps += sdkStamps(print.sdk);
 }
 
-bool BundleReader::isUnchanged(const BundleFolder& folder, const Fingerprint& print) {
-    return refreshed(folder, {print.executable, print.sdk, {}}).stamps == print.stamps;
+bool BundleReader::isUnchanged(const BundleFolder& folder, const FileIdentity& directory,
+                               const Fingerprint& print) {
+    std::string stamps;
+    appendFixedStamps(folder, directory, stamps);
+    appendNamedStamps(folder, print, stamps);
+    return PackedBytes(stamps) == print.stamps;
 }
 
 Fingerprint BundleReader::refreshed(const BundleFolder& folder, Fingerprint print) {
-    print.stamps.clear();
-    appendFixedStamps(folder, print.stamps);
-    appendNamedStamps(folder, print, print.stamps);
+    std::string stamps;
+    appendFixedStamps(folder, folder.identity(), stamps);
+    appendNamedStamps(folder, print, stamps);
+    print.stamps = PackedBytes(stamps);
     return print;
 }
 
@@ -315,8 +328,11 @@ BundleReader::Reading BundleReader::readPlugIn(const BundleFolder& place, bool w
     }
     const BundleFolder folder = place.reachedBy(directory->get());
     // Stamps are older than what is read, so a change in between is seen by the next walk.
-    appendFixedStamps(folder, reading.entry.print.stamps);
-    reading.refusal = fill(folder, reading.entry, withDigest);
+    std::string stamps;
+    appendFixedStamps(folder, folder.identity(), stamps);
+    reading.refusal = fill(folder, reading.entry, stamps, withDigest);
+    reading.entry.print.stamps = PackedBytes(stamps);
+    reading.entry.record->bundleIdentity = reading.entry.print.directory();
     return reading;
 }
 
@@ -357,7 +373,7 @@ Result<Dictionary> BundleReader::localizations(const BundleFolder& folder) {
 }
 
 std::optional<Error> BundleReader::fill(const BundleFolder& folder, PlugInEntry& entry,
-                                        bool withDigest) {
+                                        std::string& stamps, bool withDigest) {
     const std::string file = joinPath(folder.path, kInfoPlist);
     Result<Dictionary> read = readDictionary(folder, kInfoPlist);
     if (!read) return read.error();
@@ -370,10 +386,9 @@ std::optional<Error> BundleReader::fill(const BundleFolder& folder, PlugInEntry&
     if (executable) entry.print.executable = *executable;
     const auto* sdk = stringAt(*extension, kPointIdentifier);
     if (sdk && isSafeName(*sdk)) entry.print.sdk = *sdk;
-    const std::size_t fixedSize = entry.print.stamps.size();
-    appendNamedStamps(folder, entry.print, entry.print.stamps);
-    if (executable &&
-        (withDigest || !FileStamp::from(entry.print.stamps.substr(fixedSize)).settled))
+    const std::size_t fixedSize = stamps.size();
+    appendNamedStamps(folder, entry.print, stamps);
+    if (executable && (withDigest || !FileStamp::from(stamps.substr(fixedSize)).settled))
         entry.print.executableDigest = digestOf(folder, executable->string(), places_);
 
     if (std::optional<Error> error = complete(info, entry.print.sdk))
@@ -422,7 +437,6 @@ std::optional<Error> BundleReader::describePlugIn(const BundleFolder& folder,
 
     TDPlugInProxy& record = *entry.record;
     record.bundlePath = folder.path;
-    record.bundleIdentity = entry.print.directory();
     // Never empty: it tells the launcher whose instances a removal ends.
     record.bundleIdentifier = bundle ? *bundle : *identifier;
     record.plugInIdentifier = *identifier;

@@ -30,6 +30,10 @@ struct BundleFolder {
     BundleFolder(int directory, const std::string& parent, std::string entry);
     /// The same bundle, reached by its own open directory (borrowed).
     BundleFolder reachedBy(int directory) const;
+    /// Whether it was found as an entry of an open directory.
+    bool isEntry() const;
+    /// Which directory lies there now.
+    FileIdentity identity() const;
 
     int dirfd;
     std::string name;  // relative to `dirfd`
@@ -55,8 +59,10 @@ class BundleReader {
     /// To be called before each walk: the stamps of SDK dictionaries are taken once a walk.
     void beginPass();
 
-    /// Whether the bundle's files still have the stamps of `print`.
-    bool isUnchanged(const BundleFolder& folder, const Fingerprint& print);
+    /// Whether the bundle's files still have the stamps of `print`, and its directory, which has
+    /// just been looked at, is that one.
+    bool isUnchanged(const BundleFolder& folder, const FileIdentity& directory,
+                     const Fingerprint& print);
     /// Whether two fingerprints may be of one bundle with one content: see `FileStamp::isLike`.
     /// Reading it tells, but for the executable, of which at most a digest is known.
     bool isLike(const Fingerprint& a, const Fingerprint& b) const;
@@ -89,12 +95,14 @@ class BundleReader {
     void note(const FileStamp& stamp);
     bool appendStamp(const BundleFolder& folder, const std::string& file, std::string& stamps);
     void appendLocalizedStamp(const BundleFolder& folder, std::string& stamps);
-    void appendFixedStamps(const BundleFolder& folder, std::string& stamps);
+    void appendFixedStamps(const BundleFolder& folder, const FileIdentity& directory,
+                           std::string& stamps);
     void appendNamedStamps(const BundleFolder& folder, const Fingerprint& print,
                            std::string& stamps);
     bool areLike(std::string_view a, std::string_view b, int stampsToLocalized) const;
     const std::string& sdkStamps(const std::string& sdk);
-    std::optional<Error> fill(const BundleFolder& folder, PlugInEntry& entry, bool withDigest);
+    std::optional<Error> fill(const BundleFolder& folder, PlugInEntry& entry, std::string& stamps,
+                              bool withDigest);
     std::optional<Error> encode(const BundleFolder& folder, const Dictionary& info,
                                 PlugInEntry& entry);
     std::optional<Error> describePlugIn(const BundleFolder& folder, const Dictionary& info,

@@ -44,7 +44,7 @@ void addDirectories(RegistryState& state) {
     const auto add = [](const std::string& path, Fingerprint& print) {
         std::string stamps;
         FileIdentity::at(AT_FDCWD, path.c_str()).appendTo(stamps);
-        print.stamps.insert(0, stamps);
+        print.stamps = PackedBytes(stamps + print.stamps.unpacked());
     };
     for (auto& [path, entry] : state.plugIns) add(path, entry.print);
     for (auto& [path, forgotten] : state.forgotten) add(path, forgotten.print);
@@ -88,6 +88,7 @@ RegistryState Catalogue::load() {
         state = {};
         error = openDatabase();
     }
+    database_.releaseMemory();
     if (!error) return state;
     EVLOG_ERROR(ops(), "working without the catalogue {}: {}", pub(path_), pub(*error));
     database_.close();
@@ -199,6 +200,7 @@ std::optional<Error> Catalogue::save(const RegistryState& state, const RegistryC
     if (!isStale_ && !changes.records() && !changes.lists()) return std::nullopt;
     std::optional<Error> error = store(state, changes);
     if (error && isDamage(*error) && setAside(*error)) error = store(state, changes);
+    database_.releaseMemory();
     isStale_ = error.has_value();
     if (error) EVLOG_ERROR(ops(), "cannot write the catalogue {}: {}", pub(path_), pub(*error));
     return error;

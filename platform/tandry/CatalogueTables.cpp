@@ -55,7 +55,7 @@ std::optional<PlugInEntry> plugInOf(const SqliteStatement& row, const RegistrySt
     record->localizedName = row.optionalText(8);
     record->localizedShortName = row.optionalText(9);
     record->onSystemPartition = isOnSystemPartition(*record->bundlePath);
-    entry.print = {row.text(10), row.text(11), row.text(14)};
+    entry.print = {row.text(10), row.text(11), PackedBytes(row.bytes(14))};
     record->bundleIdentity = entry.print.directory();
     entry.points = row.text(12);
     entry.needsContainer = row.integer(13) != 0;
@@ -130,13 +130,14 @@ std::optional<Error> CatalogueTables::readLists(RegistryState& state) {
     SqliteStatement forgotten(database_, "SELECT path, executable, sdk, stamps FROM forgotten");
     while (forgotten.next())
         state.forgotten[forgotten.text(0)] = {
-            {forgotten.text(1), forgotten.text(2), forgotten.text(3)}};
+            {forgotten.text(1), forgotten.text(2), PackedBytes(forgotten.bytes(3))}};
     SqliteStatement refusal(database_,
                             "SELECT path, executable, sdk, stamps, reason, size FROM refusals");
     while (refusal.next())
-        state.refusals[refusal.text(0)] = {{refusal.text(1), refusal.text(2), refusal.text(3)},
-                                           refusal.text(4),
-                                           static_cast<std::size_t>(refusal.integer(5))};
+        state.refusals[refusal.text(0)] = {
+            {refusal.text(1), refusal.text(2), PackedBytes(refusal.bytes(3))},
+            refusal.text(4),
+            static_cast<std::size_t>(refusal.integer(5))};
     for (const SqliteStatement* statement : {&registration, &forgotten, &refusal})
         if (statement->error()) return statement->error();
     return std::nullopt;
@@ -211,6 +212,7 @@ std::optional<Error> CatalogueTables::writePlugIns(const RegistryState& state,
         auto found = state.plugIns.find(path);
         if (found == state.plugIns.end()) continue;
         const PlugInEntry& entry = found->second;
+        const std::string stamps = entry.print.stamps.unpacked();
         const TDPlugInProxy& record = *entry.record;
         std::optional<std::string> application;
         if (record.containingApplication) application = record.containingApplication->bundlePath;
@@ -219,7 +221,7 @@ std::optional<Error> CatalogueTables::writePlugIns(const RegistryState& state,
                      record.bundleVersion, record.registrationDate.secondsSince1970,
                      record.localizedName, record.localizedShortName, entry.print.executable,
                      entry.print.sdk, blob(entry.points), std::int64_t{entry.needsContainer},
-                     blob(entry.print.stamps), static_cast<std::int64_t>(entry.infoPlistSize),
+                     blob(stamps), static_cast<std::int64_t>(entry.infoPlistSize),
                      blob(*entry.dictionaries)});
     }
     return remove.error() ? remove.error() : put.error();
@@ -245,7 +247,8 @@ std::optional<Error> CatalogueTables::writeForgotten(const RegistryState& state,
             continue;
         }
         const Fingerprint& print = found->second.print;
-        put.execute({path, print.executable, print.sdk, blob(print.stamps)});
+        const std::string stamps = print.stamps.unpacked();
+        put.execute({path, print.executable, print.sdk, blob(stamps)});
     }
     return remove.error() ? remove.error() : put.error();
 }
@@ -261,7 +264,8 @@ std::optional<Error> CatalogueTables::writeRefusals(const RegistryState& state,
             continue;
         }
         const Refusal& refusal = found->second;
-        put.execute({path, refusal.print.executable, refusal.print.sdk, blob(refusal.print.stamps),
+        const std::string stamps = refusal.print.stamps.unpacked();
+        put.execute({path, refusal.print.executable, refusal.print.sdk, blob(stamps),
                      refusal.reason, static_cast<std::int64_t>(refusal.size)});
     }
     return remove.error() ? remove.error() : put.error();

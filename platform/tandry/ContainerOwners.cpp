@@ -44,6 +44,17 @@ bool isGone(const std::string& place) {
     return ::stat(place.c_str(), &status) != 0 && (errno == ENOENT || errno == ENOTDIR);
 }
 
+template <class Owner>
+const std::string& placeOf(const Owner& owner) {
+    return *owner.place;
+}
+
+/// Whether an owner's application has that bundle identifier, or neither has any.
+template <class Owner>
+bool isOf(const Owner& owner, const std::optional<std::string>& application) {
+    return owner.application ? application == *owner.application : !application;
+}
+
 const Dictionary* dictionaryAt(const Dictionary& dictionary, const char* key) {
     const Value* value = dictionary.find(key);
     return value ? value->dictionary() : nullptr;
@@ -94,11 +105,10 @@ bool ContainerOwners::take(const std::string& place, const Dictionary& entry) {
         const auto* name = container.string();
         if (!name || !isContainerOf(identifier, name->string())) return false;
         Owners& owners = owners_[identifier];
-        for (const auto& [other, owner] : owners)
+        for (const Owner& owner : owners)
             if (owner.container == *name) return false;
-        owners[place] = {name->string(), application
-                                             ? std::optional(application->string()->string())
-                                             : std::nullopt};
+        put(owners, place, name->string(),
+            application ? std::optional(application->string()->string()) : std::nullopt);
     }
     return true;
 }
@@ -107,10 +117,11 @@ Dictionary ContainerOwners::contents() const {
     std::map<std::string, std::pair<std::optional<std::string>, std::vector<Dictionary::Entry>>>
         byPlace;
     for (const auto& [identifier, owners] : owners_)
-        for (const auto& [place, owner] : owners) {
-            auto& [application, containers] = byPlace[place];
+        for (const Owner& owner : owners) {
+            auto& [application, containers] = byPlace[*owner.place];
             // One that was uninstalled before the application's name was known must not hide it.
-            if (application.value_or("").empty()) application = owner.application;
+            if (owner.application && application.value_or("").empty())
+                application = *owner.application;
             containers.emplace_back(identifier, owner.container);
         }
     std::vector<Dictionary::Entry> places;
@@ -127,54 +138,66 @@ Dictionary ContainerOwners::contents() const {
 
 std::string ContainerOwners::nameFor(const ContainerClaim& claim, const Exists& exists) {
     Owners& owners = owners_[claim.identifier];
-    const auto known = owners.find(claim.place);
+    const auto known = find(owners, claim.place);
     const bool isKnown = known != owners.end();
     const bool isNamed = !claim.application.value_or("").empty();
-    if (isKnown && (!isNamed || known->second.application == claim.application))
-        return known->second.container;
+    if (isKnown && (!isNamed || isOf(*known, claim.application))) return known->container;
     isChanged_ = true;
     // An application may have been met before its Info.plist was there: then nobody could tell
     // whose follower it is.
-    const bool mayFollow = !isKnown || (known->second.application == "" &&
-                                        known->second.container != claim.identifier);
+    const bool mayFollow = !isKnown || (isOf(*known, "") && known->container != claim.identifier);
     const auto former = mayFollow ? findFormer(owners, claim) : owners.end();
     if (former != owners.end()) {
-        std::string container = former->second.container;
+        std::string container = former->container;
         owners.erase(former);
-        owners[claim.place] = {container, claim.application};
+        put(owners, claim.place, container, claim.application);
         return container;
     }
     if (isKnown) {
-        known->second.application = claim.application;
-        return known->second.container;
+        std::string container = known->container;
+        put(owners, claim.place, container, claim.application);
+        return container;
     }
     std::string name = unownedName(claim, owners, exists);
-    owners[claim.place] = {name, claim.application};
+    put(owners, claim.place, name, claim.application);
     return name;
+}
+
+ContainerOwners::Owners::iterator ContainerOwners::find(Owners& owners, const std::string& place) {
+    const auto found = std::ranges::lower_bound(owners, place, {}, placeOf<Owner>);
+    return found != owners.end() && *found->place == place ? found : owners.end();
+}
+
+void ContainerOwners::put(Owners& owners, const std::string& place, std::string container,
+                          const std::optional<std::string>& application) {
+    auto owner = std::ranges::lower_bound(owners, place, {}, placeOf<Owner>);
+    if (owner == owners.end() || *owner->place != place) owner = owners.emplace(owner);
+    *owner = {places_.of(place), application ? applications_.of(*application) : nullptr,
+              std::move(container)};
 }
 
 /// The owner elsewhere that has become the claimant.
 ContainerOwners::Owners::iterator ContainerOwners::findFormer(Owners& owners,
                                                               const ContainerClaim& claim) {
-    return std::ranges::find_if(owners, [&claim](const auto& entry) {
-        const auto& [place, owner] = entry;
+    return std::ranges::find_if(owners, [&claim](const Owner& owner) {
+        const std::string& place = *owner.place;
         if (place == claim.place) return false;
         if (const auto leadsTo = canonicalPath(place)) return *leadsTo == claim.place;
-        return owner.application == claim.application && owner.application != "" && isGone(place);
+        return isOf(owner, claim.application) && !isOf(owner, "") && isGone(place);
     });
 }
 
 std::string ContainerOwners::unownedName(const ContainerClaim& claim, Owners& owners,
                                          const Exists& exists) {
     const auto ownerOf = [&owners](const std::string& name) {
-        return std::ranges::find_if(
-            owners, [&](const auto& entry) { return entry.second.container == name; });
+        return std::ranges::find_if(owners,
+                                    [&](const Owner& owner) { return owner.container == name; });
     };
     const std::string& plain = claim.identifier;
     const bool isThere = exists(plain);
     auto owner = ownerOf(plain);
     // Of an owner that left nothing behind there is nothing to keep.
-    if (owner != owners.end() && !isThere && isGone(owner->first)) {
+    if (owner != owners.end() && !isThere && isGone(*owner->place)) {
         owners.erase(owner);
         owner = owners.end();
     }

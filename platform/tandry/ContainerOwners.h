@@ -4,8 +4,10 @@
 #include <map>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "platform/system/Error.h"
+#include "platform/tandry/SharedTexts.h"
 #include "platform/values/Value.h"
 
 namespace platform::tandry {
@@ -56,20 +58,27 @@ class ContainerOwners {
     void save();
 
   private:
+    /// There may be one for each plug-in: what neighbours have in common is shared.
     struct Owner {
+        SharedText place;
+        SharedText application;  // null when it has none
         std::string container;
-        std::optional<std::string> application;
     };
-    using Owners = std::map<std::string, Owner>;  // of one identifier, by place
+    using Owners = std::vector<Owner>;  // of one identifier, in the order of their places
 
     std::optional<Error> read();
     bool take(const std::string& place, const Dictionary& entry);
     Dictionary contents() const;
+    static Owners::iterator find(Owners& owners, const std::string& place);
+    void put(Owners& owners, const std::string& place, std::string container,
+             const std::optional<std::string>& application);
     static Owners::iterator findFormer(Owners& owners, const ContainerClaim& claim);
     std::string unownedName(const ContainerClaim& claim, Owners& owners, const Exists& exists);
 
     const std::string file_;
     std::map<std::string, Owners> owners_;  // by plug-in identifier
+    SharedTexts places_;
+    SharedTexts applications_;
     bool isLoaded_ = false;
     bool isChanged_ = false;
     bool wasDamaged_ = false;  // once, maybe long ago: containers without an owner may be anybody's

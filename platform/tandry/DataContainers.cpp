@@ -1,5 +1,6 @@
 #include "platform/tandry/DataContainers.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -21,28 +22,32 @@ const std::string& placeOf(const TDPlugInProxy& plugIn) {
                                         : *plugIn.bundlePath;
 }
 
-/// Why what lies at a path cannot be a container, as an errno; 0 when it can.
-int faultOf(const std::string& path) {
+/// Why what lies at a path, which may start at the directory `dirfd`, cannot be a container, as an
+/// errno; 0 when it can.
+int faultAt(int dirfd, const std::string& path) {
     struct stat status;
-    if (::lstat(path.c_str(), &status) != 0) return errno;
+    if (::fstatat(dirfd, path.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0) return errno;
     if (!S_ISDIR(status.st_mode)) return ENOTDIR;
     return status.st_uid == ::geteuid() ? 0 : EPERM;
 }
 
 /// Whatever the plug-in has put there is its own business.
-bool hasTemporary(const std::string& path) {
+bool hasTemporaryAt(int dirfd, const std::string& path) {
     struct stat status;
-    return ::lstat(joinPath(path, kTemporary).c_str(), &status) == 0 || errno != ENOENT;
+    return ::fstatat(dirfd, joinPath(path, kTemporary).c_str(), &status, AT_SYMLINK_NOFOLLOW) ==
+               0 ||
+           errno != ENOENT;
 }
 
 }  // namespace
 
 std::optional<Error> makeContainer(const std::string& path) {
-    int fault = faultOf(path);
-    if (fault == 0 && hasTemporary(path)) return std::nullopt;
+    int fault = faultAt(AT_FDCWD, path);
+    if (fault == 0 && hasTemporaryAt(AT_FDCWD, path)) return std::nullopt;
     if (fault == ENOENT) {
         if (auto error = makeDirectories(std::string(parentPath(path)), kPrivate)) return error;
-        fault = ::mkdir(path.c_str(), kPrivate) == 0 || errno == EEXIST ? faultOf(path) : errno;
+        fault = ::mkdir(path.c_str(), kPrivate) == 0 || errno == EEXIST ? faultAt(AT_FDCWD, path)
+                                                                        : errno;
     }
     if (fault == 0 && ::mkdir(joinPath(path, kTemporary).c_str(), kPrivate) != 0 && errno != EEXIST)
         fault = errno;
@@ -56,6 +61,7 @@ DataContainers::DataContainers(const std::string& dataFolder)
 void DataContainers::beginWalk() {
     struct stat status;
     const bool isNoDirectory = ::stat(root_.c_str(), &status) == 0 && !S_ISDIR(status.st_mode);
+    folder_.reset(::open(root_.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
     fail(isNoDirectory ? Error::posix(ENOTDIR, root_) : owners_.load());
 }
 
@@ -76,9 +82,19 @@ void DataContainers::complain(const std::string& path, const std::string& proble
     told = problem;
 }
 
-Result<DataContainers::State> DataContainers::stateOf(const std::string& path) {
-    const int fault = faultOf(path);
-    if (fault == 0 && hasTemporary(path)) {
+int DataContainers::faultOf(const std::string& name) const {
+    return folder_ ? faultAt(folder_.get(), name) : faultAt(AT_FDCWD, joinPath(root_, name));
+}
+
+bool DataContainers::hasTemporary(const std::string& name) const {
+    return folder_ ? hasTemporaryAt(folder_.get(), name)
+                   : hasTemporaryAt(AT_FDCWD, joinPath(root_, name));
+}
+
+Result<DataContainers::State> DataContainers::stateOf(const std::string& name) {
+    const int fault = faultOf(name);
+    const std::string path = joinPath(root_, name);
+    if (fault == 0 && hasTemporary(name)) {
         told_.erase(path);
         return State::Whole;
     }
@@ -99,11 +115,10 @@ Result<std::optional<std::string>> DataContainers::locate(const TDPlugInProxy& p
     ContainerClaim claim{*plugIn.plugInIdentifier, placeOf(plugIn), std::nullopt, isRemembered};
     if (const auto& application = plugIn.containingApplication)
         claim.application = application->bundleIdentifier;
-    const std::string name = owners_.nameFor(claim, [this](const std::string& container) {
-        return faultOf(joinPath(root_, container)) != ENOENT;
-    });
+    const std::string name = owners_.nameFor(
+        claim, [this](const std::string& container) { return faultOf(container) != ENOENT; });
     std::string path = joinPath(root_, name);
-    const Result<State> state = stateOf(path);
+    const Result<State> state = stateOf(name);
     if (!state) return state.error();
     if (*state == State::Impossible) return none;
     if (*state == State::Whole) return std::optional(std::move(path));

@@ -6,6 +6,7 @@
 #include <string>
 
 #include "platform/system/Error.h"
+#include "platform/system/UniqueFd.h"
 #include "platform/tandry/ContainerOwners.h"
 #include "platform/tandry/TDPlugInProxy.h"
 
@@ -20,8 +21,7 @@ std::optional<Error> makeContainer(const std::string& path);
 /// the application that it lies in (see ContainerOwners.h), under <data>/zorvan/Containers. Belongs
 /// to the registry's thread.
 ///
-/// Everything is reached by its path each time, so that what was moved away is not used any more,
-/// and no descriptor is needed.
+/// The folder of all is opened for each walk, so that what was moved away is not used any more.
 class DataContainers {
   public:
     /// The folder of the containers is made at the first need; their owners are stored beside it.
@@ -30,6 +30,8 @@ class DataContainers {
     /// To be called before each walk, and before anything else at a start, as long as there are
     /// descriptors: learns whose containers are.
     void beginWalk();
+    /// To be called when the walk has met everything.
+    void endWalk() { folder_.reset(); }
 
     /// The path of the container of a plug-in, whose record is complete but for that. None, and an
     /// error line for each new reason, when what is there is not a directory of this user's own,
@@ -52,12 +54,15 @@ class DataContainers {
   private:
     enum class State { Whole, Missing, Impossible };
 
-    Result<State> stateOf(const std::string& path);
+    int faultOf(const std::string& name) const;
+    bool hasTemporary(const std::string& name) const;
+    Result<State> stateOf(const std::string& name);
     bool make(const std::string& path);
     void fail(std::optional<Error> failure);
     void complain(const std::string& path, const std::string& problem);
 
     std::string root_;
+    UniqueFd folder_;  // none when there is none yet, or no descriptor
     ContainerOwners owners_;
     std::optional<Error> failure_;             // why this walk has no containers
     std::set<std::string> missing_;            // paths

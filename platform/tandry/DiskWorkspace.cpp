@@ -1,6 +1,7 @@
 #include "platform/tandry/DiskWorkspace.h"
 
 #include <fmt/format.h>
+#include <malloc.h>
 
 #include <algorithm>
 #include <atomic>
@@ -220,6 +221,9 @@ void DiskWorkspace::rescan(const Scopes& touched) {
     gatherer_->walkEnded(disk().scanner.isComplete());
     published();
     makeContainers();
+    // Such a walk, and the first one before it, has used much for a while, of which the C library
+    // would keep most.
+    if (touched.contains({})) ::malloc_trim(0);
 }
 
 /// Lookups see the state; nobody has seen anything before the first time.

@@ -40,18 +40,6 @@ bool isRealDirectory(const std::string& path) {
     return ::lstat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
 }
 
-/// Whether all changes of a file system pass through this kernel. What others change on a server,
-/// or behind a program's back, is not reported; neither is it known of file systems to come.
-bool isLocal(const std::string& path) {
-    constexpr std::array<long, 9> kLocal{
-        EXT4_SUPER_MAGIC,      XFS_SUPER_MAGIC, BTRFS_SUPER_MAGIC,
-        F2FS_SUPER_MAGIC,      TMPFS_MAGIC,     RAMFS_MAGIC,
-        OVERLAYFS_SUPER_MAGIC, SQUASHFS_MAGIC,  EROFS_SUPER_MAGIC_V1};
-    struct statfs status;
-    return ::statfs(path.c_str(), &status) == 0 &&
-           std::ranges::find(kLocal, static_cast<long>(status.f_type)) != kLocal.end();
-}
-
 /// Takes the first component off a path.
 std::string takeComponent(std::string& path) {
     const std::size_t begin = path.find_first_not_of('/');
@@ -78,11 +66,11 @@ void FolderWatch::beginWalk(bool overEverything) {
 }
 
 void FolderWatch::markContents(const std::string& path, const std::string& scope) {
-    mark(path, {Kind::Contents, {}, scope});
+    mark(path, Kind::Contents, scope);
 }
 
 void FolderWatch::markEntries(const std::string& path, std::string_view suffix) {
-    mark(path, {Kind::Entries, std::string(suffix), path});
+    mark(path, Kind::Entries, suffix);
 }
 
 void FolderWatch::markWay(const std::string& path) {
@@ -98,13 +86,13 @@ void FolderWatch::markWay(const std::string& path) {
         const std::string next = joinPath(way, name);
         bool isDirectory = isRealDirectory(next);
         if (!isDirectory) {
-            mark(way, {Kind::Name, name, {}});
+            mark(way, Kind::Name, name);
             // It may have come before its directory was watched.
             isDirectory = isRealDirectory(next);
         }
         if (isDirectory) {
             // Being renamed shows on a directory itself, without the bustle around it.
-            if (!rest.empty()) mark(next, {Kind::Self, {}, {}});
+            if (!rest.empty()) mark(next, Kind::Self);
             way = next;
             continue;
         }
@@ -116,26 +104,30 @@ void FolderWatch::markWay(const std::string& path) {
     }
 }
 
-void FolderWatch::mark(const std::string& path, Reason reason) {
+bool FolderWatch::Reason::operator==(const Reason& other) const {
+    return kind == other.kind && *text == *other.text;
+}
+
+void FolderWatch::mark(const std::string& path, Kind kind, std::string_view text) {
+    const Reason reason{kind, texts_.of(text)};
     auto known = paths_.find(path);
     const Descriptor before = known == paths_.end() ? -1 : known->second;
     if (known != paths_.end()) {
         const Watched& watched = watches_.at(before);
-        if (watched.walk == walk_ && watched.reasons.contains(reason)) return;
+        if (watched.walk == walk_ && std::ranges::count(watched.reasons, reason) != 0) return;
     }
     // Asked for each time: another directory may have taken the place of the one that is known.
-    const Descriptor descriptor = add(path, reason.kind, before >= 0);
+    const Descriptor descriptor = add(path, kind, before >= 0);
     if (before >= 0 && before != descriptor) release(known);
     if (descriptor < 0) return;
     Watched& watched = watches_[descriptor];
-    if (watched.path != path) {
+    if (!watched.path || *watched.path != path) {
         // The directory was renamed, and the change of its old path is still to be read.
-        paths_.erase(watched.path);
-        watched.path = path;
-        paths_[path] = descriptor;
+        if (watched.path) paths_.erase(*watched.path);
+        watched.path = &paths_.insert_or_assign(path, descriptor).first->first;
     }
     if (std::exchange(watched.walk, walk_) != walk_ && isOverEverything_) watched.reasons.clear();
-    watched.reasons.insert(std::move(reason));
+    if (std::ranges::count(watched.reasons, reason) == 0) watched.reasons.push_back(reason);
 }
 
 FolderWatch::Descriptor FolderWatch::add(const std::string& path, Kind kind, bool isKnown) {
@@ -174,11 +166,23 @@ void FolderWatch::endWalk() {
     isShort_ = shortage_ != 0 || (isShort_ && !isOverEverything_);
 }
 
-bool FolderWatch::seesExchangeOf(const std::string& directory, const std::string& known) const {
+bool FolderWatch::watchesWayTo(const std::string& directory, const std::string& known) const {
     std::string path = directory;
     for (; path.size() > 1 && !isWithin(known, path); path = parentPath(path))
         if (!paths_.contains(path)) return false;
-    return isLocal(directory);
+    return true;
+}
+
+/// What others change on a server, or behind a program's back, is not reported; neither is it known
+/// of file systems to come.
+bool FolderWatch::isLocal(const std::string& path) {
+    constexpr std::array<long, 9> kLocal{
+        EXT4_SUPER_MAGIC,      XFS_SUPER_MAGIC, BTRFS_SUPER_MAGIC,
+        F2FS_SUPER_MAGIC,      TMPFS_MAGIC,     RAMFS_MAGIC,
+        OVERLAYFS_SUPER_MAGIC, SQUASHFS_MAGIC,  EROFS_SUPER_MAGIC_V1};
+    struct statfs status;
+    return ::statfs(path.c_str(), &status) == 0 &&
+           std::ranges::find(kLocal, static_cast<long>(status.f_type)) != kLocal.end();
 }
 
 void FolderWatch::disturb() {
@@ -232,21 +236,21 @@ void FolderWatch::take(const inotify_event& event, std::string_view name, Touche
                 if (name.empty()) touch(everything);
                 break;
             case Kind::Name:
-                if (name == reason.name || name.empty()) touch(everything);
+                if (name == *reason.text || name.empty()) touch(everything);
                 break;
             case Kind::Entries:
                 if (name.empty())
                     touch(everything);
-                else if (name.ends_with(reason.name))
-                    touch(joinPath(reason.scope, name),
+                else if (name.ends_with(*reason.text))
+                    touch(joinPath(*watched.path, name),
                           (event.mask & kDirectoryCame) == kDirectoryCame);
                 break;
             case Kind::Contents:
-                touch(reason.scope);
+                touch(*reason.text);
                 break;
         }
     if (event.mask & IN_IGNORED) {
-        paths_.erase(watched.path);
+        paths_.erase(*watched.path);
         watches_.erase(found);
     }
 }

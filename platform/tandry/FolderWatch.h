@@ -2,7 +2,6 @@
 
 #include <sys/inotify.h>
 
-#include <compare>
 #include <cstdint>
 #include <limits>
 #include <map>
@@ -11,8 +10,10 @@
 #include <string>
 #include <string_view>
 #include <unordered_map>
+#include <vector>
 
 #include "platform/system/UniqueFd.h"
+#include "platform/tandry/SharedTexts.h"
 
 namespace platform::tandry {
 
@@ -38,6 +39,7 @@ class FolderWatch {
 
     /// While it is postponed, walks mark nothing.
     void setPostponed(bool isPostponed) { isPostponed_ = isPostponed; }
+    bool isPostponed() const { return isPostponed_; }
 
     /// Begins a walk. `overEverything` says that it will mark all that still matters.
     void beginWalk(bool overEverything);
@@ -59,10 +61,12 @@ class FolderWatch {
     /// memory. Told in one error line when it begins; a walk over everything tries again.
     bool isShort() const { return isShort_; }
 
-    /// Whether whatever makes a canonical path lead to another directory shows at once: that one
-    /// and all above it are watched, and their file system is one whose changes are all made here.
-    /// `known` is one for which this was so a moment ago, or "": neighbours share most of the way.
-    bool seesExchangeOf(const std::string& directory, const std::string& known) const;
+    /// Whether a directory, by its canonical path, and all above it are watched. `known` is one for
+    /// which this was so a moment ago, or "": neighbours share most of the way.
+    bool watchesWayTo(const std::string& directory, const std::string& known) const;
+    /// Whether all changes of a file system pass through this kernel, so that its watch tells of
+    /// them.
+    static bool isLocal(const std::string& path);
 
     /// Readable when there are changes. -1 when the system has no descriptor.
     int descriptor() const { return inotify_.get(); }
@@ -78,21 +82,23 @@ class FolderWatch {
 
   private:
     enum class Kind { Self, Name, Entries, Contents };
-    /// Why a directory is watched.
+    /// Why a directory is watched. There may be many directories: what they have in common is
+    /// shared.
     struct Reason {
         Kind kind;
-        std::string name;   // the name, or the suffix of names, that matters
-        std::string scope;  // for `Entries` the directory
-        auto operator<=>(const Reason&) const = default;  // NOLINT(modernize-use-nullptr)
+        /// `Name`: which one matters, `Entries`: the suffix of those that do, `Contents`: the
+        /// scope.
+        SharedText text;
+        bool operator==(const Reason& other) const;
     };
     struct Watched {
-        std::string path;
-        std::set<Reason> reasons;
-        std::uint32_t walk = 0;  // the last that marked it
+        const std::string* path = nullptr;  // in `paths_`
+        std::vector<Reason> reasons;        // each once
+        std::uint32_t walk = 0;             // the last that marked it
     };
     using Descriptor = int;  // the kernel's, of one watched directory
 
-    void mark(const std::string& path, Reason reason);
+    void mark(const std::string& path, Kind kind, std::string_view text = {});
     Descriptor add(const std::string& path, Kind kind, bool isKnown);
     void release(std::map<std::string, Descriptor>::iterator place);
     void take(const inotify_event& event, std::string_view name, Touches& touched);
@@ -102,6 +108,7 @@ class FolderWatch {
     UniqueFd inotify_;  // the same one from the first walk that marks something
     std::unordered_map<Descriptor, Watched> watches_;
     std::map<std::string, Descriptor> paths_;
+    SharedTexts texts_;  // of reasons: neighbours have the same
     std::uint32_t walk_ = 0;
     bool isOverEverything_ = false;
     bool isPostponed_ = false;

@@ -79,11 +79,20 @@ bool ForeignPlaces::answers(const std::string& path, std::string* unseen) {
 }
 
 bool ForeignPlaces::answersWithin(const std::string& path) {
-    if (!answers(path)) return false;
-    if (avoided_.empty()) return true;
+    return answers(path) && !holdsAvoided(path);
+}
+
+bool ForeignPlaces::entryAnswersWithin(const std::string& path) {
+    if (isAvoided(path)) return false;
+    noteAt({path});
+    return !holdsAvoided(path);
+}
+
+bool ForeignPlaces::holdsAvoided(const std::string& path) const {
+    if (avoided_.empty()) return false;
     const auto inside = mounts_.within(path);
-    return std::ranges::none_of(inside,
-                                [this](const auto* mount) { return avoided_.contains(mount->id); });
+    return std::ranges::any_of(inside,
+                               [this](const auto* mount) { return avoided_.contains(mount->id); });
 }
 
 void ForeignPlaces::noteAt(std::vector<std::string> places) {

@@ -30,6 +30,8 @@ class ForeignPlaces {
     bool answers(const std::string& path, std::string* unseen = nullptr);
     /// The same for a path and all that lies within.
     bool answersWithin(const std::string& path);
+    /// The same for an entry of a directory that answers, when it is known to be no symbolic link.
+    bool entryAnswersWithin(const std::string& path);
     /// The walk gets on.
     void step() { noteAt({}); }
 
@@ -42,6 +44,7 @@ class ForeignPlaces {
 
   private:
     bool isAvoided(const std::string& path) const;
+    bool holdsAvoided(const std::string& path) const;
     void noteAt(std::vector<std::string> places);
 
     MountTable mounts_;

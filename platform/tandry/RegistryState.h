@@ -7,6 +7,7 @@
 #include <string>
 #include <string_view>
 
+#include "platform/tandry/PackedBytes.h"
 #include "platform/tandry/TDPlugInProxy.h"
 #include "platform/tandry/Workspace.h"
 
@@ -20,11 +21,11 @@ using Pass = std::uint32_t;
 struct Fingerprint {
     std::string executable;  // "QFBundleExecutable"; empty when there is none
     std::string sdk;         // its extension point, when SDK dictionaries are looked up for it
-    std::string stamps;      // the directory's identity first
+    PackedBytes stamps;      // the directory's identity first
     /// Of the executable's content, while its stamp was not settled when it was read.
     std::string executableDigest{};
 
-    FileIdentity directory() const { return FileIdentity::from(stamps); }
+    FileIdentity directory() const { return FileIdentity::from(stamps.unpacked()); }
 };
 
 /// One registered plug-in.

@@ -95,6 +95,10 @@ Result<SqliteDatabase> SqliteDatabase::open(const std::string& path) {
     return database;
 }
 
+void SqliteDatabase::releaseMemory() {
+    if (handle_) sqlite3_db_release_memory(handle_.get());
+}
+
 bool SqliteDatabase::hasMoved() const {
     int moved = 0;
     const int code = sqlite3_file_control(handle_.get(), nullptr, SQLITE_FCNTL_HAS_MOVED, &moved);

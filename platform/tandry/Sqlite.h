@@ -26,6 +26,8 @@ class SqliteDatabase {
 
     explicit operator bool() const { return bool(handle_); }
     void close() { handle_.reset(); }
+    /// Gives back what it keeps in memory of the file, for who asks nothing for long.
+    void releaseMemory();
     /// Whether its path leads to the open file no more.
     bool hasMoved() const;
 

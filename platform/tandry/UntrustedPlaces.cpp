@@ -10,10 +10,10 @@ namespace platform::tandry {
 namespace {
 
 /// Zeros for what cannot be looked at: nothing can be read below it either.
-std::pair<dev_t, ino_t> identityOf(const std::string& path) {
+FileIdentity identityOf(const std::string& path) {
     struct stat status;
     if (::stat(path.c_str(), &status) != 0) return {};
-    return {status.st_dev, status.st_ino};
+    return FileIdentity::of(status);
 }
 
 }  // namespace
@@ -30,16 +30,13 @@ void UntrustedPlaces::beginWalk() {
     for (Place& place : places_) place.identity = identityOf(place.path);
 }
 
-const char* UntrustedPlaces::at(const std::string& path) const {
-    const std::pair<dev_t, ino_t> identity = identityOf(path);
-    if (identity == std::pair<dev_t, ino_t>()) return nullptr;
-    for (const Place& place : places_)
-        if (place.identity == identity) return place.name;
-    return nullptr;
+const char* UntrustedPlaces::around(const std::string& path) {
+    return around(path, identityOf(path));
 }
 
-const char* UntrustedPlaces::around(const std::string& path) {
-    if (const char* place = at(path)) return place;
+const char* UntrustedPlaces::around(const std::string& path, const FileIdentity& directory) {
+    for (const Place& place : places_)
+        if (place.identity == directory && directory != FileIdentity()) return place.name;
     std::string folder(parentPath(path));
     if (folder == path) return nullptr;
     if (const auto known = folders_.find(folder); known != folders_.end()) return known->second;

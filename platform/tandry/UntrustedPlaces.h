@@ -1,11 +1,10 @@
 #pragma once
 
-#include <sys/types.h>
-
 #include <string>
 #include <unordered_map>
-#include <utility>
 #include <vector>
+
+#include "platform/system/FileIdentity.h"
 
 namespace platform {
 
@@ -29,15 +28,15 @@ class UntrustedPlaces {
     /// The place that a canonical path is or lies in, named for people ("a data container"); null
     /// when it lies in none.
     const char* around(const std::string& path);
+    /// The same for a path where somebody has found that very directory.
+    const char* around(const std::string& path, const FileIdentity& directory);
 
   private:
     struct Place {
         std::string path;
         const char* name;
-        std::pair<dev_t, ino_t> identity;  // zeros while it does not exist
+        FileIdentity identity;  // zeros while it does not exist
     };
-
-    const char* at(const std::string& path) const;
 
     std::vector<Place> places_;
     std::unordered_map<std::string, const char*> folders_;  // answers of this walk

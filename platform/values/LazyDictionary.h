@@ -14,7 +14,7 @@ namespace platform {
 /// use. Immutable; copies share it; usable from any thread.
 class LazyDictionary {
   public:
-    LazyDictionary() : LazyDictionary(Dictionary()) {}
+    LazyDictionary() = default;
     LazyDictionary(Dictionary dictionary);
     /// Told, once and on the thread of the first use, why bytes are no dictionary's.
     using FaultHandler = void (*)(std::string_view reason);
@@ -37,7 +37,7 @@ class LazyDictionary {
         std::atomic<bool> isDecoded = false;
         Dictionary dictionary;
     };
-    std::shared_ptr<State> state_;
+    std::shared_ptr<State> state_;  // null: empty
 };
 
 }  // namespace platform
