@@ -97,7 +97,7 @@ std::string applicationInfo(std::size_t number) {
 }
 
 std::string plugInInfo(std::size_t number, std::string_view extensionPoint,
-                       std::string_view attributes) {
+                       std::string_view attributes, bool isLean) {
     const std::string identifier =
         fmt::format("org.example.application-{}.plug-in-{}", number / 10, number);
     const std::string extension =
@@ -133,7 +133,8 @@ std::string plugInInfo(std::size_t number, std::string_view extensionPoint,
 	</dict>
 )",
                     number % 17, number % 100, attributes, extensionPoint);
-    return document(common("PlugIn", number, identifier, "PLUG") + buildFacts(number) + extension);
+    return document(common("PlugIn", number, identifier, "PLUG") +
+                    (isLean ? "" : buildFacts(number)) + extension);
 }
 
 std::string plugInEntitlements(std::size_t number) {

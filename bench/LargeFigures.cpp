@@ -1,7 +1,9 @@
+#include <sys/socket.h>
+#include <sys/time.h>
+
 #include "bench/Failure.h"
 #include "bench/Figures.h"
 #include "bench/Frames.h"
-#include "bench/Interrupt.h"
 #include "bench/Measure.h"
 #include "bench/Questions.h"
 
@@ -11,16 +13,14 @@ namespace {
 
 constexpr std::size_t kLarge = 100'000;
 
-/// A connection to a daemon that has made its first scan.
+/// A connection to a daemon that has made its first scan: the first match waits for that.
 FrameClient connectAfterScan(const World& world, const Child& daemon) {
-    constexpr double kPatience = 300e6;
+    constexpr timeval kPatience{600, 0};
     FrameClient client(waitForSocket(world.socketPath(), daemon));
+    ::setsockopt(client.socket(), SOL_SOCKET, SO_RCVTIMEO, &kPatience, sizeof kPatience);
     const Question question = Question::byPoint(10);
-    for (const double end = now() + kPatience; now() < end;) {
-        checkInterrupted();
-        if (isAnswered(question, client.exchange(question.frame))) return client;
-    }
-    fail("no correct match of {} plug-ins within five minutes", world.plugIns());
+    expectAnswered(question, client.exchange(question.frame));
+    return client;
 }
 
 }  // namespace

@@ -21,6 +21,9 @@ namespace fs = std::filesystem;
 namespace {
 
 constexpr std::size_t kPlugInsPerApplication = 10;
+constexpr std::string_view kOtherPoint = "org.example.other-point-";
+/// The registry keeps 128 MiB of dictionaries, and so no hundred thousand plug-ins of full size.
+constexpr std::size_t kMostOfFullSize = 50'000;
 
 }  // namespace
 
@@ -112,7 +115,9 @@ void World::makePlugIn(const std::string& application, std::size_t number) {
     const bool isRare = isOneOf(10, 4, number);
     const std::string rare =
         isRare ? fmt::format("<key>{}</key><string>{}</string>", kRareAttribute, kRareValue) : "";
-    writeFile(path + "/Info.plist", plugInInfo(number, pointOfPlugIn(number), rare), true);
+    const std::string point = pointOfPlugIn(number);
+    const bool isLean = plugIns_ > kMostOfFullSize && point.starts_with(kOtherPoint);
+    writeFile(path + "/Info.plist", plugInInfo(number, point, rare, isLean), true);
     if (number % 50 == 0) writeFile(path + "/Entitlements.plist", plugInEntitlements(number), true);
     const std::string executable = fmt::format("{}/PlugIn{:05}", path, number);
     // Says something as soon as it runs: to its host, or wherever else it may.
@@ -131,7 +136,7 @@ std::string World::pointOfPlugIn(std::size_t number) const {
     for (std::size_t matches : {1000, 100, 10}) {
         if (isOneOf(matches, offset++, number)) return pointOf(matches);
     }
-    return fmt::format("org.example.other-point-{}", number % 23);
+    return fmt::format("{}{}", kOtherPoint, number % 23);
 }
 
 void World::writeFile(const std::string& path, const std::string& text, bool isRead) {

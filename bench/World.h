@@ -24,8 +24,8 @@ class TemporaryDirectory {
 ///
 /// Plug-ins lie in applications of ten, each with an Info.plist of about 3 KB. Of N plug-ins, 10
 /// (and 100 and 1 000 where N is at least ten times that) belong to the extension point
-/// `pointOf(10)` and so on, spread evenly; the rest belong to other points. Ten plug-ins of any N
-/// carry the attribute `kRareAttribute`.
+/// `pointOf(10)` and so on, spread evenly; the rest belong to other points, and are smaller where
+/// they are too many for the registry. Ten plug-ins of any N carry the attribute `kRareAttribute`.
 class World {
   public:
     static constexpr const char* kRareAttribute = "ExampleSpeciality";
