@@ -85,6 +85,8 @@ void PeerConnection::start() {
     watch_.emplace(loop_, socket_.fd());
     awaitHangup();
     if (socket_.held() > 0) awaitWritable();
+    // Who has connected has mostly asked already.
+    if (mayReadOn()) receiveSome();
     proceed();
 }
 
