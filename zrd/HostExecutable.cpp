@@ -3,6 +3,7 @@
 #include <utility>
 
 #include "Zorvan/LogHandles.h"
+#include "platform/system/Files.h"
 
 namespace zorvan {
 
@@ -26,11 +27,28 @@ HostExecutable HostExecutable::of(const AuditToken& token, platform::CodeSigning
     return executable;
 }
 
-void HostExecutable::find(const AuditToken& token, std::shared_ptr<platform::CodeSigning> signing,
+std::optional<HostExecutable> HostExecutable::atOnce(const AuditToken& token,
+                                                     platform::CodeSigning& signing) {
+    const auto folder = token.openFolderAtOnce();
+    if (!folder) return std::nullopt;
+    const std::string& path = *token.executablePath();
+    if (path.size() >= kMaxExecutablePath) return std::nullopt;
+    auto task = signing.makeTaskAtOnce(token, folder->get());
+    if (!task) return std::nullopt;
+    const bool isInBundle = platform::LumBundle::isAt(folder->get());
+    auto bundle =
+        ZRBundle::initWithPath(isInBundle ? std::string(platform::parentPath(path)) : path);
+    return HostExecutable{path, std::move(bundle), std::move(task)};
+}
+
+void HostExecutable::find(const platform::Connection& host,
+                          std::shared_ptr<platform::CodeSigning> signing,
                           platform::PeerLooks& looks, std::function<void(HostExecutable)> use) {
+    const AuditToken& token = host.auditToken();
+    if (auto executable = atOnce(token, *signing)) return use(*std::move(executable));
     auto found = std::make_shared<HostExecutable>();
     looks.look(
-        platform::Origin::of(token),
+        host.origin(),
         [found, token, signing = std::move(signing)](platform::PeerLooks::Pace&) {
             *found = of(token, *signing);
         },

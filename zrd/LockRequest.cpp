@@ -98,9 +98,8 @@ bool Transaction::areIdle(const ZRDPlugInList& plugIns) {
 
 void Transaction::takeHold(HoldSubject subject) {
     // What a hold costs is the daemon's, and so is each place, which need not hold anything.
-    const auto token = client_->auditToken();
-    auto share = server().holdPool().draw(token ? platform::Origin::of(*token) : platform::Origin(),
-                                          std::max<std::size_t>(subject.applications.size(), 1));
+    auto share =
+        server().holdPool().draw(origin(), std::max<std::size_t>(subject.applications.size(), 1));
     if (!share) return fail(kZRErrorDenied, "too many holds");
     auto hold = std::make_shared<ZRDPlugInHold>(std::move(subject), client_, *std::move(share),
                                                 *server().services().launcher);

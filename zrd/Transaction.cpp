@@ -51,8 +51,7 @@ ZRDServer& Transaction::server() const {
 }
 
 platform::Origin Transaction::origin() const {
-    const auto token = client_->auditToken();
-    return token ? platform::Origin::of(*token) : platform::Origin();
+    return client_->origin();
 }
 
 std::uint64_t Transaction::unsignedUnder(const char* key) const {

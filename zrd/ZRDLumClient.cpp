@@ -49,6 +49,11 @@ std::optional<platform::AuditToken> ZRDLumClient::auditToken() const {
     return connection ? std::optional(connection->auditToken()) : std::nullopt;
 }
 
+platform::Origin ZRDLumClient::origin() const {
+    auto connection = connection_.lock();
+    return connection ? connection->origin() : platform::Origin();
+}
+
 void ZRDLumClient::handleEvent(const platform::ConnectionEvent& event) {
     if (const auto* message = std::get_if<Message>(&event)) {
         receive(*message);
@@ -79,10 +84,10 @@ void ZRDLumClient::receive(const Message& message) {
 /// Its next request comes only after this one, so that it is the only one to wait.
 void ZRDLumClient::resolvePaths(const std::shared_ptr<Transaction>& transaction) {
     auto client = shared_from_this();
-    const auto token = auditToken();
-    if (!token) return;  // nobody is there to be answered
+    auto connection = connection_.lock();
+    if (!connection) return;  // nobody is there to be answered
     server_->services().pathLooks->look(
-        platform::Origin::of(*token),
+        connection->origin(),
         [client, paths = transaction->paths()](platform::PeerLooks::Pace& pace) {
             paths->resolve(pace, [&] { return client->acceptWork(); });
         },

@@ -30,6 +30,8 @@ class ZRDLumClient final : public HostProcess, public std::enable_shared_from_th
 
     pid_t pid() const override;
     std::optional<platform::AuditToken> auditToken() const override;
+    /// As when its connection was accepted; nobody's when that is gone.
+    platform::Origin origin() const;
     const std::string& path() const override { return executable_.path; }
     const std::shared_ptr<ZRBundle>& bundle() const override { return executable_.bundle; }
     std::optional<platform::Value> entitlementValueForKey(const std::string& name) const override;

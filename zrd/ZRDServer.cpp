@@ -73,7 +73,7 @@ bool ZRDServer::listen(const std::string& serviceName) {
 
 /// Nothing is heard of the connection before: it is resumed once its record is there.
 void ZRDServer::admit(const std::shared_ptr<platform::Connection>& connection) {
-    HostExecutable::find(connection->auditToken(), services().codeSigning, *services().looks,
+    HostExecutable::find(*connection, services().codeSigning, *services().looks,
                          [weak = weak_from_this(), connection](HostExecutable executable) {
                              if (auto self = weak.lock())
                                  ZRDLumClient::initWithConnection(connection, self,

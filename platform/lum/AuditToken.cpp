@@ -17,6 +17,9 @@
 #include <string_view>
 #include <utility>
 
+#include "platform/system/Files.h"
+#include "platform/system/OpenBeneath.h"
+#include "platform/system/OwnMounts.h"
 #include "platform/system/UniqueFd.h"
 
 namespace platform {
@@ -79,7 +82,8 @@ struct FileId {
 /// that the peer serves itself, and nothing is asked of that.
 std::optional<FileId> fileAt(int directory, const char* path) {
     struct statx status {};
-    if (statx(directory, path, AT_STATX_DONT_SYNC, STATX_TYPE | STATX_INO, &status) != 0)
+    if (statx(directory, path, AT_STATX_DONT_SYNC | AT_EMPTY_PATH, STATX_TYPE | STATX_INO,
+              &status) != 0)
         return std::nullopt;
     return FileId{status.stx_dev_major, status.stx_dev_minor, status.stx_ino};
 }
@@ -174,6 +178,19 @@ const std::optional<std::string>& AuditToken::executablePath() const {
             state.executable = state.running->path;
     });
     return state.executable;
+}
+std::optional<UniqueFd> AuditToken::openFolderAtOnce() const {
+    const State& state = *state_;
+    if (!state.running) return std::nullopt;
+    const std::string& path = state.running->path;
+    auto folder = openWithoutLinks(AT_FDCWD, std::string(parentPath(path)), O_PATH | O_DIRECTORY,
+                                   Wait::Never);
+    if (!folder || !isOnOwnMount(folder->get())) return std::nullopt;
+    const auto file =
+        openBeneath(folder->get(), std::string(lastPathComponent(path)), O_PATH | O_NOFOLLOW);
+    if (!file || fileAt(file->get(), "") != state.running->file) return std::nullopt;
+    std::call_once(state.looked, [&] { state.executable = path; });
+    return std::move(*folder);
 }
 
 }  // namespace platform

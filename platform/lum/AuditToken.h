@@ -6,6 +6,8 @@
 #include <optional>
 #include <string>
 
+#include "platform/system/UniqueFd.h"
+
 namespace platform {
 
 /// Who a peer process is, pinned: its process id cannot come to mean another process while a token
@@ -32,6 +34,10 @@ class AuditToken {
     /// file (device and inode) that it ran when the token was made; otherwise, or when that could
     /// not be read, none. Looked at by the first call, which may hang with the file system.
     const std::optional<std::string>& executablePath() const;
+    /// Learns the same without waiting for anybody, and opens (O_PATH) the directory that the
+    /// executable lies in: when the kernel knows the way there, that lies on a file system of the
+    /// kernel's own, and the executable is there. None when only `executablePath` can tell.
+    std::optional<UniqueFd> openFolderAtOnce() const;
 
   private:
     struct State;

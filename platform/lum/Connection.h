@@ -9,6 +9,7 @@
 
 #include "platform/lum/AuditToken.h"
 #include "platform/lum/Message.h"
+#include "platform/lum/Origin.h"
 
 namespace platform {
 
@@ -49,6 +50,8 @@ class Connection {
 
     virtual pid_t pid() const = 0;
     virtual const AuditToken& auditToken() const = 0;
+    /// Where its peer came from when it was accepted.
+    virtual Origin origin() const = 0;
 
     /// Keeps `context` alive until the connection is destroyed, or its listener closed.
     virtual void setContext(std::shared_ptr<void> context) = 0;

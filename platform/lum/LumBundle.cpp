@@ -56,9 +56,11 @@ std::shared_ptr<LumBundle> LumBundle::make(const std::string& path, Mode mode) {
 }
 
 bool LumBundle::isAt(int directory) {
-    struct stat status;
-    return ::fstatat(directory, kInfoPlist, &status, AT_SYMLINK_NOFOLLOW) == 0 &&
-           (S_ISREG(status.st_mode) || S_ISLNK(status.st_mode));
+    // Whoever mounts a file there is not asked.
+    struct statx status {};
+    return ::statx(directory, kInfoPlist, AT_SYMLINK_NOFOLLOW | AT_STATX_DONT_SYNC, STATX_TYPE,
+                   &status) == 0 &&
+           (S_ISREG(status.stx_mode) || S_ISLNK(status.stx_mode));
 }
 
 std::shared_ptr<LumBundle> LumBundle::mainBundle() {

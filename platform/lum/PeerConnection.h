@@ -42,6 +42,7 @@ class PeerConnection final : public Connection,
 
     pid_t pid() const override { return token_.pid(); }
     const AuditToken& auditToken() const override { return token_; }
+    Origin origin() const override { return share_.origin(); }
     void setContext(std::shared_ptr<void> context) override { context_ = std::move(context); }
     void setEventHandler(EventHandler handler) override { handler_ = std::move(handler); }
     void resume() override;

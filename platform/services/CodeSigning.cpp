@@ -1,5 +1,6 @@
 #include "platform/services/CodeSigning.h"
 
+#include <fcntl.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -12,6 +13,7 @@
 #include "platform/plist/PropertyList.h"
 #include "platform/sandbox/Sandbox.h"
 #include "platform/system/Files.h"
+#include "platform/system/OpenBeneath.h"
 #include "platform/system/PinnedDirectory.h"
 
 namespace platform {
@@ -39,12 +41,17 @@ Result<Entitlements> orMissing(const Error& error) {
     return error;
 }
 
+/// Of an executable in an open directory.
+std::string entitlementsName(int directory, const std::string& executable) {
+    return LumBundle::isAt(directory)
+               ? std::string("Entitlements.plist")
+               : std::string(lastPathComponent(executable)) + ".entitlements";
+}
+
 Result<Entitlements> readEntitlements(const std::string& executable) {
     const auto directory = PinnedDirectory::open(std::string(parentPath(executable)), ::geteuid());
     if (!directory) return orMissing(directory.error());
-    const std::string name = LumBundle::isAt(directory->descriptor())
-                                 ? std::string("Entitlements.plist")
-                                 : std::string(lastPathComponent(executable)) + ".entitlements";
+    const std::string name = entitlementsName(directory->descriptor(), executable);
     const auto file = directory->file(name);
     if (!file) return orMissing(file.error());
 
@@ -61,6 +68,8 @@ Result<Entitlements> readEntitlements(const std::string& executable) {
 
 class FileTask : public CodeSigningTask {
   public:
+    /// Holds nothing.
+    FileTask() = default;
     explicit FileTask(const AuditToken& token) { read(token); }
     explicit FileTask(Error error) : error_(std::move(error)) {}
 
@@ -113,6 +122,12 @@ class FileCodeSigning : public CodeSigning {
   public:
     std::unique_ptr<CodeSigningTask> makeTask(const AuditToken& token) override {
         return std::make_unique<FileTask>(token);
+    }
+    std::unique_ptr<CodeSigningTask> makeTaskAtOnce(const AuditToken& token, int folder) override {
+        const std::string name = entitlementsName(folder, token.executablePath().value_or(""));
+        const auto file = openBeneath(folder, name, O_PATH | O_NOFOLLOW);
+        const bool isMissing = !file && file.error().code == ENOENT;
+        return isMissing ? std::make_unique<FileTask>() : nullptr;
     }
 };
 

@@ -28,6 +28,11 @@ class CodeSigning {
     virtual ~CodeSigning() = default;
     /// Reads what is asked for later: may hang with the file system of the process's executable.
     virtual std::unique_ptr<CodeSigningTask> makeTask(const AuditToken& token) = 0;
+    /// The same without waiting for anybody, for a process whose executable lies in an open
+    /// directory (borrowed, see `AuditToken::openFolderAtOnce`). Null when there is something to
+    /// read.
+    virtual std::unique_ptr<CodeSigningTask> makeTaskAtOnce(const AuditToken& token,
+                                                            int folder) = 0;
 };
 
 /// Entitlements from files. A process's are those of `Entitlements.plist` of the bundle around its

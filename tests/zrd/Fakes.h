@@ -301,6 +301,10 @@ struct FakeCodeSigning final : platform::CodeSigning {
     std::unique_ptr<platform::CodeSigningTask> makeTask(const platform::AuditToken&) override {
         return std::make_unique<Task>(*this);
     }
+    std::unique_ptr<platform::CodeSigningTask> makeTaskAtOnce(const platform::AuditToken&,
+                                                              int) override {
+        return std::make_unique<Task>(*this);
+    }
     Dictionary entitlements;
     std::optional<platform::Error> error;
 };
@@ -318,6 +322,7 @@ struct FakeConnection final : platform::Connection {
         return id;
     }
     const platform::AuditToken& auditToken() const override { return token; }
+    platform::Origin origin() const override { return platform::Origin::of(token); }
     void setContext(std::shared_ptr<void> value) override { context = std::move(value); }
     void setEventHandler(EventHandler value) override { handler = std::move(value); }
     void resume() override { resumed = true; }

@@ -177,6 +177,33 @@ TEST_F(Tool, EntitlementsLieBesideABareToolOrInItsBundle) {
     EXPECT_EQ(task->entitlement("com.example.other").value, std::nullopt);
 }
 
+TEST_F(Tool, WithoutEntitlementsItIsLookedAtAtOnce) {
+    const auto isAtOnce = [&] {
+        const Peer peer(files_, tool_, unconfined);
+        const auto folder = peer.token()->openFolderAtOnce();
+        return folder && makeFileCodeSigning()->makeTaskAtOnce(*peer.token(), folder->get());
+    };
+    writeEntitlements("bin/Entitlements.plist");
+    EXPECT_TRUE(isAtOnce()) << "it is in no bundle";
+    writeEntitlements("bin/Info.plist");
+    EXPECT_FALSE(isAtOnce());
+    std::filesystem::remove(files_.path("bin/Entitlements.plist"));
+    writeEntitlements("bin/tool.entitlements");
+    EXPECT_TRUE(isAtOnce()) << "it is in a bundle";
+    std::filesystem::remove(files_.path("bin/Info.plist"));
+    EXPECT_FALSE(isAtOnce());
+
+    const Peer peer(files_, tool_, unconfined);
+    const std::string folder = files_.path("bin"), away = files_.path("away");
+    std::filesystem::rename(folder, away);
+    std::filesystem::create_directory_symlink(away, folder);
+    EXPECT_FALSE(peer.token()->openFolderAtOnce()) << "a link may lead anywhere";
+    std::filesystem::remove(folder);
+    files_.write("bin/tool", "another");
+    EXPECT_FALSE(peer.token()->openFolderAtOnce());
+    EXPECT_EQ(peer.token()->executablePath(), std::nullopt);
+}
+
 TEST_F(Tool, OnlyTheRestrictionCountsInFilesThatOthersMayWrite) {
     writeEntitlements("bin/tool.entitlements");
     const std::string file = files_.path("bin/tool.entitlements");
