@@ -109,9 +109,12 @@ void World::makePlugIn(const std::string& application, std::size_t number) {
     const std::string path = fmt::format("{}/PlugIns/PlugIn{:05}.appex", application, number);
     fs::create_directory(path);
     const bool isRare = isOneOf(10, 4, number);
-    const std::string rare =
-        isRare ? fmt::format("<key>{}</key><string>{}</string>", kRareAttribute, kRareValue) : "";
-    writeFile(path + "/Info.plist", plugInInfo(number, pointOfPlugIn(number), rare), true);
+    const auto attribute = [](const char* key, const auto& value) {
+        return fmt::format("<key>{}</key><string>{}</string>", key, value);
+    };
+    const std::string attributes =
+        attribute(kNumberAttribute, number) + (isRare ? attribute(kRareAttribute, kRareValue) : "");
+    writeFile(path + "/Info.plist", plugInInfo(number, pointOfPlugIn(number), attributes), true);
     if (number % 50 == 0) writeFile(path + "/Entitlements.plist", plugInEntitlements(number), true);
     const std::string executable = fmt::format("{}/PlugIn{:05}", path, number);
     // Says something as soon as it runs: to its host, or wherever else it may.
