@@ -7,6 +7,7 @@
 #include "bench/Frames.h"
 #include "bench/World.h"
 #include "platform/values/Cbor.h"
+#include "platform/values/VersionText.h"
 
 namespace bench {
 
@@ -79,6 +80,12 @@ platform::Array formsIn(std::string_view frame) {
     return *forms->array();
 }
 
+bool isRight(const Question& question, const Value& attribute) {
+    if (!question.pattern.starts_with('<')) return attribute == Value(question.pattern);
+    const std::string_view operand = std::string_view(question.pattern).substr(1);
+    return attribute.string() && platform::compareVersionString(*attribute.string(), operand) < 0;
+}
+
 /// How many answers a reply holds, and how many of them were asked for.
 struct Count {
     std::size_t answers = 0;
@@ -90,7 +97,7 @@ Count countAnswers(const Question& question, std::string_view frame) {
     for (const Value& form : formsIn(frame)) {
         ++count.answers;
         const Value* attribute = attributeOf(form, question.key);
-        if (attribute && *attribute == Value(question.pattern)) ++count.right;
+        if (attribute && isRight(question, *attribute)) ++count.right;
     }
     return count;
 }
@@ -111,6 +118,10 @@ Question Question::ofAll(std::size_t answers) {
 
 Question Question::byRareAttribute() {
     return question(World::kRareAttribute, World::kRareValue, 10);
+}
+
+Question Question::byOrder() {
+    return question(World::kNumberAttribute, "<10", 10);
 }
 
 std::string smallRequest() {

@@ -11,7 +11,7 @@ namespace bench {
 
 /// A match that is asked for, and how many plug-ins must be in its reply.
 struct Question {
-    std::string key;  // the rule's key and pattern: every answer has this attribute
+    std::string key;  // the rule's key and pattern: every answer has such an attribute
     std::string pattern;
     std::size_t answers;
     platform::Dictionary rules;
@@ -19,6 +19,8 @@ struct Question {
 
     static Question byPoint(std::size_t answers);
     static Question byRareAttribute();
+    /// By order, on an attribute that all have: no equality narrows it.
+    static Question byOrder();
     static Question byPointNamed(std::string point, std::size_t answers);
     /// Every plug-in there is: without rules, so only the number of answers can be checked.
     static Question ofAll(std::size_t answers);

@@ -259,6 +259,8 @@ void measureReplies(const Run& run) {
     }
     measureDecoded(run, library, Question::byRareAttribute(), "match-10-by-rule",
                    {Target::Kind::ValueAtMost, 20e3}, {Target::Kind::ValueAtMost, 1e3});
+    measureDecoded(run, library, Question::byOrder(), "match-10-by-rule/order",
+                   {Target::Kind::ValueAtMost, 20e3}, {Target::Kind::ValueAtMost, 3e3});
     measureSizes(run);
 }
 

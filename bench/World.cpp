@@ -113,11 +113,14 @@ void World::makePlugIn(const std::string& application, std::size_t number) {
     const std::string path = fmt::format("{}/PlugIns/PlugIn{:05}.appex", application, number);
     fs::create_directory(path);
     const bool isRare = isOneOf(10, 4, number);
-    const std::string rare =
-        isRare ? fmt::format("<key>{}</key><string>{}</string>", kRareAttribute, kRareValue) : "";
+    const auto attribute = [](const char* key, const auto& value) {
+        return fmt::format("<key>{}</key><string>{}</string>", key, value);
+    };
+    const std::string attributes =
+        attribute(kNumberAttribute, number) + (isRare ? attribute(kRareAttribute, kRareValue) : "");
     const std::string point = pointOfPlugIn(number);
     const bool isLean = plugIns_ > kMostOfFullSize && point.starts_with(kOtherPoint);
-    writeFile(path + "/Info.plist", plugInInfo(number, point, rare, isLean), true);
+    writeFile(path + "/Info.plist", plugInInfo(number, point, attributes, isLean), true);
     if (number % 50 == 0) writeFile(path + "/Entitlements.plist", plugInEntitlements(number), true);
     const std::string executable = fmt::format("{}/PlugIn{:05}", path, number);
     // Says something as soon as it runs: to its host, or wherever else it may.

@@ -25,11 +25,13 @@ class TemporaryDirectory {
 /// Plug-ins lie in applications of ten, each with an Info.plist of about 3 KB. Of N plug-ins, 10
 /// (and 100 and 1 000 where N is at least ten times that) belong to the extension point
 /// `pointOf(10)` and so on, spread evenly; the rest belong to other points, and are smaller where
-/// they are too many for the registry. Ten plug-ins of any N carry the attribute `kRareAttribute`.
+/// they are too many for the registry. Ten plug-ins of any N carry the attribute `kRareAttribute`;
+/// all carry their number as `kNumberAttribute`.
 class World {
   public:
     static constexpr const char* kRareAttribute = "ExampleSpeciality";
     static constexpr const char* kRareValue = "rare";
+    static constexpr const char* kNumberAttribute = "ExampleNumber";
     static std::string pointOf(std::size_t matches);
 
     /// Makes the plug-ins in a new directory under `parent`.

@@ -13,7 +13,7 @@ using namespace platform;
 
 namespace {
 
-/// A plug-in of an application, and one of the system.
+/// A plug-in of an application, one of the system, and so many more that keys get an index.
 struct Candidates {
     Candidates() {
         const auto proxy = zorvan::makeProxy("com.a", {{"V", "1.10"},
@@ -30,6 +30,10 @@ struct Candidates {
         system->bundlePath = "/System/b.appex";
         system->containingApplication = nullptr;
         add(system, "q");
+        for (int i = 0; i < 66; ++i) {
+            const std::string name = "com.c" + std::to_string(i);
+            add(zorvan::makeProxy(name, {{"V", std::to_string(i)}, {"No", i % 3}}), "");
+        }
     }
     void add(const std::shared_ptr<TDPlugInProxy>& proxy, const std::string& point) {
         tandry::PlugInEntry entry;

@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "platform/tandry/TextIndex.h"
+#include "platform/tandry/TextList.h"
 #include "platform/tandry/Workspace.h"
 
 namespace platform::tandry {
@@ -17,22 +18,33 @@ namespace platform::tandry {
 /// What plug-ins have under one key that rules ask for. Immutable once shared.
 class RuleIndex {
   public:
-    /// Of those at `positions`, which are in order.
-    RuleIndex(std::string key, const TDPlugInProxyList& plugIns, const Positions& positions);
-    /// Takes over what an index of the same key knows of those that have moved.
+    /// Of those at `positions`, which are in order. `isOrdered`: for patterns that compare for
+    /// order as well, for which the texts themselves are kept.
+    RuleIndex(std::string key, const TDPlugInProxyList& plugIns, const Positions& positions,
+              bool isOrdered);
+    /// Takes over what an index of the same key and kind knows of those that have moved.
     void takeOver(const RuleIndex& before, const Moves& moves);
 
     const std::string& key() const { return key_; }
-    /// All plug-ins under whose key something satisfies the pattern, and hardly any others, in
-    /// order. None: the pattern takes plug-ins that have nothing there.
-    std::optional<Positions> find(const Value& pattern, std::size_t plugIns) const;
+    bool isOrdered() const { return isOrdered_; }
+    /// All plug-ins that satisfy the pattern, and hardly any others, in order.
+    Positions find(const Value& pattern) const;
 
   private:
     void add(const TDPlugInProxy& plugIn, Position position);
+    void addText(std::string_view text, Position position);
+    void dropExcess();
+    Positions withoutTruth() const;
 
     std::string key_;
-    Positions present_;  // who has anything there, in order
+    bool isOrdered_;
+    std::size_t plugIns_;   // that there are
+    Positions present_;     // who has anything there, in order
+    Positions false_;       // and who has what equals false
+    bool hasTexts_ = true;  // not when they were too many
     TextIndex texts_;
+    bool hasTextList_ = true;  // likewise
+    TextList textList_;
 };
 
 /// The indexes of a snapshot's plug-ins by keys that rules have asked for: each is made when it is
@@ -57,8 +69,8 @@ class RuleIndexes {
     };
 
     static bool isIndexed(std::string_view key);
-    Shared known(std::string_view key) const;
-    Shared make(std::string_view key) const;
+    Shared known(std::string_view key, const Value& pattern) const;
+    Shared make(std::string_view key, const Value& pattern) const;
 
     const TDPlugInProxyList& plugIns_;
     mutable std::mutex mutex_;  // guards what follows

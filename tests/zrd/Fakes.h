@@ -28,7 +28,7 @@ using platform::Value;
 
 struct FakeAnnotations final : AnnotationReader {
     std::optional<Dictionary> annotationForPlugIn(const ZRDPlugIn& plugIn) override {
-        auto found = stored.find(plugIn.annotationKey());
+        auto found = stored.find(std::string(plugIn.annotationKey()));
         return found == stored.end() ? std::nullopt : std::optional(found->second);
     }
     std::map<std::string, Dictionary> stored;

@@ -137,7 +137,7 @@ TEST_F(ZRDPlugInTest, AnnotationKeyIsTheReplacedIdentifierWhenItIsText) {
     auto key = [&](Dictionary entitlements) {
         auto proxy = makeProxy("com.a");
         proxy->entitlements = std::move(entitlements);
-        return world_.record(proxy)->annotationKey();
+        return std::string(world_.record(proxy)->annotationKey());
     };
     EXPECT_EQ(key({}), "com.a");
     EXPECT_EQ(key({{"com.orbel.developer.replace-plugin", "com.b"}}), "com.b");

@@ -1,8 +1,10 @@
+#include <map>
 #include <random>
-#include <regex>
 #include <set>
 
 #include "platform/tandry/CurrentSnapshot.h"
+#include "platform/tandry/RuleIndexes.h"
+#include "platform/values/VersionText.h"
 #include "tests/platform/tandry/RegistryFixture.h"
 
 namespace platform::tandry {
@@ -47,7 +49,8 @@ class Dice {
         }
     }
     std::string stringPattern() {
-        static const char* const operators[] = {"", "", "", "=", "=", "<>", ">=", "?UT-IS:"};
+        static const char* const operators[] = {"",  "",  "=",  "=",  "<>",
+                                                "<", ">", ">=", "<=", "?UT-IS:"};
         return operators[roll(std::size(operators))] + text();
     }
     Value pattern() {
@@ -69,12 +72,7 @@ class Dice {
     std::mt19937 engine_{7};
 };
 
-std::string normalised(const std::string& text) {
-    static const std::regex zeros("(^|[^0-9])0+(?=[0-9])");
-    return std::regex_replace(text, zeros, "$1");
-}
-
-/// What may be accepted; comparisons but for equality count as accepting all that is there.
+/// What may be accepted; types count as accepting all that is there.
 bool accepts(const Value& pattern, const Value* value) {
     if (equalsFalse(pattern)) return !value || equalsFalse(*value);
     if (equalsTrue(pattern)) return value && !equalsFalse(*value);
@@ -85,13 +83,24 @@ bool accepts(const Value& pattern, const Value* value) {
             alternatives->begin(), alternatives->end(),
             [value](const Value& element) { return element.string() && accepts(element, value); });
     const auto* text = pattern.string();
-    if (!text || std::string("<>?").find(text->view().front()) != std::string::npos) return true;
+    if (!text || text->view().starts_with('?')) return true;
     if (const Array* array = value->array())
         return std::any_of(array->begin(), array->end(),
                            [&](const Value& element) { return accepts(pattern, &element); });
-    const std::string operand =
-        text->view().front() == '=' ? std::string(text->view().substr(1)) : text->string();
-    return value->string() && normalised(value->string()->string()) == normalised(operand);
+    const std::string_view all = text->view();
+    const auto prefix = std::min(all.find_first_not_of("<>="), all.size());
+    const int order =
+        value->string() ? compareVersionString(*value->string(), all.substr(prefix)) : 9;
+    for (const auto& [operation, orders] :
+         std::map<std::string_view, std::set<int>>{{"", {0}},
+                                                   {"=", {0}},
+                                                   {"<>", {-1, 1}},
+                                                   {"<", {-1}},
+                                                   {"<=", {-1, 0}},
+                                                   {">", {1}},
+                                                   {">=", {0, 1}}})
+        if (all.substr(0, prefix) == operation) return orders.contains(order);
+    return false;
 }
 
 bool accepts(const TDPlugInProxy& plugIn, const Dictionary& query) {
@@ -154,6 +163,24 @@ TEST_F(RegistryTest, NarrowingNeverDropsAMatch) {
         }
         EXPECT_GT(dropped, 600 * all.size() / 3);
     }
+}
+
+TEST(RuleIndex, StaysCompleteWithoutTheTextsThatWereTooMany) {
+    std::vector<Value> many;
+    for (int i = 0; i < 40; ++i) many.emplace_back(fmt::format("t{}", i));
+    TDPlugInProxyList plugIns;
+    for (const Value& value : {Value(Array(many)), Value("t1")}) {
+        const auto plugIn = std::make_shared<TDPlugInProxy>();
+        plugIn->infoPlist = Dictionary{{"K", value}};
+        plugIns.push_back(plugIn);
+    }
+    const RuleIndex before("K", {plugIns[0]}, {0}, true);
+    RuleIndex index("K", plugIns, {1}, true);
+    EXPECT_EQ(index.find("<t2"), Positions{1});
+    index.takeOver(before, {0});
+    for (const char* pattern : {"t39", ">t38"})
+        EXPECT_EQ(index.find(pattern), (Positions{0, 1})) << pattern;
+    EXPECT_TRUE(index.find(false).empty());
 }
 
 TEST_F(RegistryTest, TheFilterSeesIdentifierAndEntitlements) {
