@@ -413,6 +413,7 @@ std::optional<Error> BundleReader::encode(const BundleFolder& folder, const Dict
     entry.infoPlistSize = dictionaries->size();
     if (auto error = append(kEntitlements, entitlements ? *entitlements : Dictionary()))
         return error;
+    dictionaries->shrink_to_fit();
     entry.dictionaries = std::move(dictionaries);
     entry.attachDictionaries();
     return std::nullopt;

@@ -217,13 +217,15 @@ void DiskWorkspace::rescan(const Scopes& touched) {
         changes = walk<RegistryChanges>(
             [scopes](Disk& disk) { return disk.scanner.scanTouched(scopes); });
     }
-    if (changes->records() || changes->lists()) return static_cast<void>(apply(*changes));
-    gatherer_->walkEnded(disk().scanner.isComplete());
-    published();
-    makeContainers();
-    // Such a walk, and the first one before it, has used much for a while, of which the C library
-    // would keep most.
-    if (touched.contains({})) ::malloc_trim(0);
+    if (changes->records() || changes->lists()) {
+        static_cast<void>(apply(*changes));
+    } else {
+        gatherer_->walkEnded(disk().scanner.isComplete());
+        published();
+        makeContainers();
+    }
+    // A walk uses much for a while, of which the C library would keep most.
+    ::malloc_trim(0);
 }
 
 /// Lookups see the state; nobody has seen anything before the first time.

@@ -154,6 +154,7 @@ void keepCborEncoded(const Dictionary& dictionary) {
     if (dictionary.encoded()) return;
     std::string bytes;
     encodeCbor(dictionary, bytes);
+    bytes.shrink_to_fit();
     auto owner = std::make_shared<const std::string>(std::move(bytes));
     dictionary.keepEncoded({owner, *owner});
 }
