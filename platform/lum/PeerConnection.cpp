@@ -85,9 +85,6 @@ void PeerConnection::start() {
     watch_.emplace(loop_, socket_.fd());
     awaitHangup();
     if (socket_.held() > 0) awaitWritable();
-    // Who has connected has mostly asked already. A receive would drop out-of-band data, which the
-    // watch is to find.
-    if (mayReadOn() && !socket_.hasOutOfBandData()) receiveSome();
     proceed();
 }
 
