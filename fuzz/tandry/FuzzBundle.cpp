@@ -128,7 +128,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     const BundleFolder folder(bundle);
     const auto application = reader.readApplication(folder);
     const auto reading = reader.readPlugIn(folder);
-    (void)reader.isUnchanged(folder, reading.entry.print);
+    (void)reader.isUnchanged(folder, reading.entry.print.directory(), reading.entry.print);
     fuzz::require(reader.isLike(reading.entry.print, reading.entry.print));
     if (!reading.refusal) {
         fuzz::require(reading.entry.dictionaries->size() <= kMaxRecordSize);
