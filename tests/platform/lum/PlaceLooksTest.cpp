@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 #include <sched.h>
 
+#include <atomic>
 #include <future>
 #include <optional>
 
@@ -64,13 +65,18 @@ class AloneOnItsCpu {
 };
 
 TEST(PlaceLooksTest, WhatIsGivenUpJustBeforeItBeginsIsNotMadeAndHoldsUpNobody) {
+    constexpr int kMostAttempts = 20;
     RunLoop loop;
     PlaceLooks looks(loop, std::chrono::milliseconds(40));
-    bool isMade = false;
+    std::atomic<bool> isMade = true;
     std::optional<std::vector<bool>> result;
-    looks.make({{"/proc/absent", [&] { isMade = true; }}},
-               [&](const std::vector<bool>& done) { result = done; });
-    {
+    for (int attempt = 0; isMade; ++attempt) {
+        // The thread sanitizer has a thread run before whoever makes it goes on.
+        if (attempt == kMostAttempts) GTEST_SKIP() << "what is made begins at once";
+        isMade = false;
+        result.reset();
+        looks.make({{"/proc/absent", [&] { isMade = true; }}},
+                   [&](const std::vector<bool>& done) { result = done; });
         const AloneOnItsCpu alone;
         if (!alone.isThere) GTEST_SKIP() << "may not keep others from a CPU";
         while (!result) loop.poll();
