@@ -47,9 +47,10 @@ double startBarely(const std::string& executable, const std::string& fifo, int o
 }
 
 void measureReady(const Run& run, FrameClient& client, const std::string& request) {
-    if (!run.report.wants({"ready/p50"})) return;
+    // Once at least: only what was made ready may be started.
     const std::string reply(client.exchange(request));
     expectSuccess(reply);
+    if (!run.report.wants({"ready/p50"})) return;
     const EchoServer server(run.scratch, "ready", reply, EchoKind::Blocking);
     FrameClient echo(server.socketPath());
     const Plan plan{3000, 20, run.quick ? 0.3 : 2.5};

@@ -100,6 +100,19 @@ std::string World::logTail() const {
     return text;
 }
 
+std::string World::sanitizerReport() const {
+    constexpr std::size_t kMostReport = 8000;
+    std::ifstream file(root_ + "/zrd.log");
+    std::string report;
+    for (std::string line; report.size() < kMostReport && std::getline(file, line);) {
+        const bool begins = line.find("WARNING: ThreadSanitizer") != std::string::npos ||
+                            line.find("ERROR: AddressSanitizer") != std::string::npos ||
+                            line.find(": runtime error: ") != std::string::npos;
+        if (begins || !report.empty()) report += line + "\n";
+    }
+    return report;
+}
+
 void World::makeApplication(std::size_t number) {
     const std::string path = fmt::format("{}/Application{:04}.app", applications(), number);
     fs::create_directories(path + "/PlugIns");

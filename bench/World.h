@@ -54,6 +54,8 @@ class World {
     void forget(bool keepContainers) const;
     /// The end of what the daemons here have logged.
     std::string logTail() const;
+    /// What a sanitizer has said among it, from its first report on; empty if it has said nothing.
+    std::string sanitizerReport() const;
 
   private:
     void makeApplication(std::size_t number);

@@ -110,9 +110,12 @@ bool soak(double minutes) {
                   fmt::format("descriptors: {} before, {} now", descriptors, nowDescriptors)) &&
            good;
     const double nowMemory = daemon.residentMegabytes();
-    return expect(kIsSanitized || nowMemory <= kMostMemory * memory,
+    good = expect(kIsSanitized || nowMemory <= kMostMemory * memory,
                   fmt::format("resident memory: {:.1f} MB before, {:.1f} MB now", memory,
                               nowMemory)) &&
+           good;
+    const std::string report = world.sanitizerReport();
+    return expect(report.empty(), report.empty() ? "no sanitizer has reported anything" : report) &&
            good;
 }
 
