@@ -51,7 +51,8 @@ struct World {
         set("$");
     }
 
-    /// "a" to "k" are plug-ins of many kinds; an input can name them.
+    /// "a" to "q" are plug-ins of many kinds; an input can name them. So many share resources that
+    /// a match does not give them all their tokens at once.
     void install() const {
         const Dictionary plain{{"VXExtensionProtocol", "P"}, {"PrincipalClass", "C"}};
         const auto with = [&](const char* key, const Value& value) {
@@ -74,6 +75,8 @@ struct World {
         add("com.j", "j", {}, plain)->entitlements =
             Dictionary{{"com.orbel.developer.replace-plugin", Array{"com.g", 1}}};
         add("com.k", "k", {}, plain)->bundlePath = "/usr/k";
+        for (const char name : std::string_view("lmnopq"))
+            add(fmt::format("com.{}", name).c_str(), {name}, {}, with("Shared", "x"));
     }
 
     std::shared_ptr<TDPlugInProxy> add(const char* identifier, const std::string& name,
@@ -104,6 +107,9 @@ struct World {
         workspace->lostContainers = has('l');
         workspace->refused.clear();
         if (has('r')) workspace->refused = {fuzz::home().path("a"), fuzz::home().path("b")};
+        sandbox->distant.clear();
+        if (has('d')) sandbox->distant.insert({fuzz::home().path("a"), fuzz::home().path("q")});
+        launcher->renews = has('R');
         launcher->refused.clear();
         if (has('L')) launcher->refused.insert(fuzz::home().path("a/run"));
         assertions->reports.clear();
