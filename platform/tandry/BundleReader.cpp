@@ -296,7 +296,7 @@ bool BundleReader::isUnchanged(const BundleFolder& folder, const FileIdentity& d
     std::string stamps;
     appendFixedStamps(folder, directory, stamps);
     appendNamedStamps(folder, print, stamps);
-    return PackedBytes(stamps) == print.stamps;
+    return print.stamps == stamps;
 }
 
 Fingerprint BundleReader::refreshed(const BundleFolder& folder, Fingerprint print) {

@@ -56,7 +56,7 @@ std::optional<PlugInEntry> plugInOf(const SqliteStatement& row, const RegistrySt
     record->localizedShortName = row.optionalText(9);
     record->onSystemPartition = isOnSystemPartition(*record->bundlePath);
     entry.print = {row.text(10), row.text(11), PackedBytes(row.bytes(14))};
-    record->bundleIdentity = entry.print.directory();
+    record->bundleIdentity = FileIdentity::from(row.bytes(14));
     entry.points = row.text(12);
     entry.needsContainer = row.integer(13) != 0;
     entry.infoPlistSize = static_cast<std::size_t>(row.integer(15));

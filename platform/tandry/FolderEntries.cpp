@@ -28,12 +28,12 @@ bool isLink(int directory, const dirent& entry) {
            S_ISLNK(status.st_mode);
 }
 
-void add(FolderEntries& found, const std::filesystem::path& folder, const dirent& entry,
-         FolderWatch& watch, ForeignPlaces& places, Complaints& complaints) {
+void add(FolderEntries& found, const std::string& folder, const dirent& entry, FolderWatch& watch,
+         ForeignPlaces& places, Complaints& complaints) {
     if (entry.d_name[0] == '.' ||
         (entry.d_type != DT_DIR && entry.d_type != DT_LNK && entry.d_type != DT_UNKNOWN))
         return;
-    std::string path = joinPath(folder.native(), entry.d_name);
+    std::string path = joinPath(folder, entry.d_name);
     std::string target;
     std::string unseen;
     if (entry.d_type != DT_DIR && !places.answers(path, &unseen)) {
@@ -47,7 +47,8 @@ void add(FolderEntries& found, const std::filesystem::path& folder, const dirent
             complaints.add(path, "skipping", path + ": a link that cannot be resolved");
             std::error_code ignored;
             const auto missing = std::filesystem::weakly_canonical(
-                folder / std::filesystem::read_symlink(path, ignored), ignored);
+                std::filesystem::path(folder) / std::filesystem::read_symlink(path, ignored),
+                ignored);
             found.nowhere.push_back(missing.string());
             return;
         }

@@ -1,7 +1,11 @@
 #include "platform/tandry/ForeignPlaces.h"
 
+#include <unistd.h>
+
 #include <algorithm>
-#include <filesystem>
+#include <cerrno>
+#include <climits>
+#include <optional>
 #include <string_view>
 #include <utility>
 
@@ -24,6 +28,14 @@ std::string takeComponent(std::string& path) {
     std::string component = path.substr(0, path.find('/'));
     path.erase(0, component.size());
     return component;
+}
+
+/// Where a symbolic link leads; none, with errno set, where there is none.
+std::optional<std::string> targetOf(const std::string& path) {
+    char target[PATH_MAX];
+    const ssize_t size = ::readlink(path.c_str(), target, sizeof target);
+    if (size < 0) return std::nullopt;
+    return std::string(target, static_cast<std::size_t>(size));
 }
 
 }  // namespace
@@ -61,17 +73,16 @@ bool ForeignPlaces::answers(const std::string& path, std::string* unseen) {
         }
         places.push_back(next);
         noteAt(places);
-        std::error_code failure;
-        const std::filesystem::path target = std::filesystem::read_symlink(next, failure);
-        if (failure) {
-            if (!rest.empty() && failure == std::errc::invalid_argument) known_.insert(next);
+        const std::optional<std::string> target = targetOf(next);
+        if (!target) {
+            if (!rest.empty() && errno == EINVAL) known_.insert(next);
             places.pop_back();
             way = next;
             continue;
         }
         if (places.size() > kMostLinks) break;  // whoever looks finds that out
-        if (target.is_absolute()) way.assign(1, '/');
-        rest.insert(0, '/' + target.string());
+        if (target->starts_with('/')) way.assign(1, '/');
+        rest.insert(0, '/' + *target);
     }
     places.push_back(way);
     noteAt(std::move(places));

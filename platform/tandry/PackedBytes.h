@@ -15,8 +15,14 @@ class PackedBytes {
     std::string unpacked() const;
 
     friend bool operator==(const PackedBytes&, const PackedBytes&) = default;
+    /// Whether these bytes are what was packed.
+    friend bool operator==(const PackedBytes& packed, std::string_view bytes) {
+        return packed.holds(bytes);
+    }
 
   private:
+    bool holds(std::string_view bytes) const;
+
     std::string packed_;  // behind each zero stands how many more follow it
 };
 
