@@ -6,6 +6,7 @@
 #include <random>
 
 #include "Zorvan/Keys.h"
+#include "bench/Failure.h"
 #include "bench/Frames.h"
 #include "bench/Questions.h"
 #include "bench/soak/Player.h"
@@ -118,6 +119,8 @@ Work hoard(const World& world) {
     const Dictionary annotations{{"extension", Dictionary{{"hoard", std::string(100'000, 'x')}}}};
     Array plugIns;
     for (const auto& uuid : uuidsIn(found)) plugIns.append(uuid);
+    // Somebody holds them. What is stored has to be there before memory is looked at first.
+    if (plugIns.empty()) fail("nothing to store anything with");
     const std::string request = requestFrame({{"request", "annotate"},
                                               {"version", kProtocolVersion},
                                               {"uuids", plugIns},
