@@ -147,10 +147,11 @@ void Listener::State::admit(UniqueFd connected) {
     if (!token) return refuse(*peer, "it cannot be told who it is");
     auto share = drawFor(*token);
     if (!share) return;
-    auto connection = std::make_shared<lum::PeerConnection>(std::move(connected), std::move(*token),
-                                                            std::move(*share), queue, common);
+    // Not in one piece with its count: what is remembered of it would keep its memory.
+    const std::shared_ptr<lum::PeerConnection> connection(new lum::PeerConnection(
+        std::move(connected), std::move(*token), std::move(*share), queue, common));
     remember(connection);
-    handler(std::move(connection));
+    handler(connection);
 }
 
 /// None when those of the peer's origin have their part already.
