@@ -54,6 +54,18 @@ TEST_F(Zrctl, ChoicesReachThePlugInsThatAreNamed) {
     EXPECT_THAT(run({"-S", "nobody", "elect", "use", unknown}), HasSubstr("3 zrctl: zrd is not"));
 }
 
+TEST_F(Zrctl, WhatCannotBeWrittenLeavesTheStatus) {
+    start();
+    const auto inShell = [&](const std::string& rest) {
+        const auto shell = spawn("/bin/sh", {"-c", "'" + zrctlProgram_ + "' " + rest});
+        const int status = shell->wait();
+        return std::to_string(status) + ' ' + shell->err();
+    };
+    EXPECT_EQ(inShell("elect use none 2> /dev/full"), "1 ");
+    EXPECT_THAT(inShell("match > /dev/full"), HasSubstr("3 zrctl: cannot write: "));
+    EXPECT_THAT(inShell("--help > /dev/full"), HasSubstr("3 zrctl: cannot write: "));
+}
+
 TEST_F(Zrctl, AnnotationsJoinThoseThatAreThereOrReplaceThem) {
     start();
     const auto extension = [](Dictionary pairs) {

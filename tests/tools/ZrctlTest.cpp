@@ -23,7 +23,7 @@ namespace zrctl {
 
 namespace {
 
-std::variant<Options, int> parse(std::vector<const char*> arguments) {
+std::variant<Options, Outcome> parse(std::vector<const char*> arguments) {
     arguments.insert(arguments.begin(), "zrctl");
     return Options::parse(static_cast<int>(arguments.size()), arguments.data());
 }
@@ -127,12 +127,12 @@ TEST(CommandLine, WrongUsageIsStatusTwo) {
                                                {"annotate"},
                                                {"exclude"},
                                                {"exclude", "add"}})
-        EXPECT_EQ(std::get<int>(parse(arguments)), kUsageError);
+        EXPECT_EQ(std::get<Outcome>(parse(arguments)).status, kUsageError);
     testing::internal::GetCapturedStderr();
-    testing::internal::CaptureStdout();
-    EXPECT_EQ(std::get<int>(parse({"match", "--help"})), kDone);
-    EXPECT_EQ(std::get<int>(parse({"--version"})), kDone);
-    EXPECT_THAT(testing::internal::GetCapturedStdout(), HasSubstr("KEY=PATTERN"));
+    const auto help = std::get<Outcome>(parse({"match", "--help"}));
+    EXPECT_EQ(help.status, kDone);
+    EXPECT_THAT(help.output, HasSubstr("KEY=PATTERN"));
+    EXPECT_EQ(std::get<Outcome>(parse({"--version"})).status, kDone);
 }
 
 TEST(CommandLine, RelativePathsStandInTheCurrentDirectoryUnresolved) {

@@ -2,10 +2,11 @@
 
 #include <CLI/CLI.hpp>
 
+#include <iostream>
+#include <sstream>
 #include <string>
 
 #include "Zorvan/Keys.h"
-#include "tools/zrctl/Outcome.h"
 
 namespace zrctl {
 
@@ -221,7 +222,7 @@ void addExclude(CLI::App& app, Options& options) {
 
 }  // namespace
 
-std::variant<Options, int> Options::parse(int argc, const char* const* argv) {
+std::variant<Options, Outcome> Options::parse(int argc, const char* const* argv) {
     Options options;
     options.service = zorvan::kDefaultServiceName;
 
@@ -252,7 +253,9 @@ std::variant<Options, int> Options::parse(int argc, const char* const* argv) {
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& error) {
-        return app.exit(error) == 0 ? kDone : kUsageError;
+        std::ostringstream help;
+        const int status = app.exit(error, help, std::cerr);
+        return Outcome{status == 0 ? kDone : kUsageError, help.str(), {}};
     }
     return options;
 }

@@ -6,6 +6,8 @@
 #include <variant>
 #include <vector>
 
+#include "tools/zrctl/Outcome.h"
+
 namespace zrctl {
 
 /// How the plug-ins of a match are written.
@@ -56,9 +58,9 @@ struct Options {
     std::vector<std::string> arguments;  // run
     std::vector<std::string> tokens;     // release
 
-    /// Reads the command line; or, when there is nothing (more) to do, the exit status: the help,
-    /// the version or the complaint has been written then.
-    static std::variant<Options, int> parse(int argc, const char* const* argv);
+    /// Reads the command line; or, when there is nothing (more) to do, what that comes to: the
+    /// help, the version, or wrong usage, of which standard error has been told then.
+    static std::variant<Options, Outcome> parse(int argc, const char* const* argv);
 };
 
 }  // namespace zrctl

@@ -55,8 +55,10 @@ zrctl::Outcome run(const zrctl::Options& options) {
 int finish(zrctl::Outcome outcome) {
     const zrctl::Outcome written = zrctl::writeOut(outcome.output);
     if (written.status != zrctl::kDone) outcome = written;
-    if (!outcome.complaint.empty())
-        fmt::print(stderr, "zrctl: {}\n", zrctl::terminal::safe(outcome.complaint));
+    if (outcome.complaint.empty()) return outcome.status;
+    const std::string line = fmt::format("zrctl: {}\n", zrctl::terminal::safe(outcome.complaint));
+    // Where nobody can be told the status says enough.
+    std::fwrite(line.data(), 1, line.size(), stderr);
     return outcome.status;
 }
 
@@ -69,6 +71,6 @@ int main(int argc, char** argv) {
     // The library's lines about connections would say again what the commands say themselves.
     setenv("ZR_LOG", "off", 0);
     const auto parsed = zrctl::Options::parse(argc, argv);
-    if (const int* status = std::get_if<int>(&parsed)) return *status;
+    if (const auto* outcome = std::get_if<zrctl::Outcome>(&parsed)) return finish(*outcome);
     return finish(run(std::get<zrctl::Options>(parsed)));
 }
