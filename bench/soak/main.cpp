@@ -27,7 +27,9 @@ constexpr bool kIsSanitized = false;
 #endif
 constexpr double kMostSlower = 10;
 constexpr double kQuietSeconds = 10;
-constexpr double kWarmUpSeconds = 20;
+/// Of the time: until all have met often enough for the most threads and the largest crowd, the
+/// allocator takes memory that is no leak.
+constexpr double kWarmUpPart = 0.25;
 
 std::size_t descriptorsOf(const Child& daemon) {
     const auto folder =
@@ -92,7 +94,7 @@ bool soak(double minutes) {
     const Child daemon = world.startDaemon();
     waitForSocket(world.socketPath(), daemon);
     const auto everybody = those({&honestParts(), &hostileParts()});
-    play(everybody, world, daemon, kWarmUpSeconds);
+    play(everybody, world, daemon, kWarmUpPart * minutes * 60);
     daemon.waitUntilIdle();
 
     // The other honest ones use the processors, too: what is asked is what the attack adds.

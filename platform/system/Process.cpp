@@ -44,6 +44,8 @@ void prepareDaemonProcess() {
     // Left alone, the allocator keeps ever more for itself once something large has been freed.
     mallopt(M_MMAP_THRESHOLD, kMostKeptMemory);
     mallopt(M_TRIM_THRESHOLD, kMostKeptMemory);
+    // Nor does it give back much of what each of many threads frees, if each has a heap of its own.
+    mallopt(M_ARENA_MAX, 2);
     umask(077);
     std::signal(SIGPIPE, SIG_IGN);
     std::signal(SIGXFSZ, SIG_IGN);
