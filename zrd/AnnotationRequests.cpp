@@ -98,15 +98,17 @@ void Transaction::annotateNext(const std::shared_ptr<Annotating>& annotating) {
     const bool completed = processUuidList(
         [&](const std::shared_ptr<ZRDPlugIn>& plugIn) {
             ++annotating->next;
-            // A plug-in named again has the change already.
-            if (!annotating->changed.insert(plugIn->uuid()).second) return Walk::Continue;
-            if (!hasShareFor(change, *plugIn) || !hasRoomFor(change, *plugIn)) return Walk::Stop;
+            const bool isFirst = annotating->changed.insert(plugIn->uuid()).second;
+            if (isFirst && (!hasShareFor(change, *plugIn) || !hasRoomFor(change, *plugIn)))
+                return Walk::Stop;
             EVLOG_DEBUG(ops(), "client {} plug-in {}({}) annotation change: {}", client_->pid(),
                         plugIn->identifier(), pub(plugIn->uuid()), change);
             if (const Value* election = change.find(annotation::kElection)) {
                 EVLOG_INFO(ops(), "client {} plug-in {}({}) election := {}", client_->pid(),
                            plugIn->identifier(), pub(plugIn->uuid()), *election);
             }
+            // A plug-in named again has the change already.
+            if (!isFirst) return Walk::Continue;
             annotate(change, *plugIn, [=, this] { annotateNext(annotating); });
             return Walk::Stop;
         },
@@ -146,11 +148,12 @@ void Transaction::bulkAnnotateNext(const std::shared_ptr<BulkAnnotating>& annota
         if (!uuid) return fail(kZRErrorAnnotation, "invalid plug-in UUID value");
         auto plugIn = server().findPlugIn(*uuid);
         if (!plugIn) return fail(kZRErrorRegistration, "no plug-in with the requested uuid");
-        if (annotating->lastOf[*uuid] != &value) continue;
+        const bool isLast = annotating->lastOf[*uuid] == &value;
         const Dictionary change{{annotation::kExtension, value}};
-        if (!hasShareFor(change, *plugIn) || !hasRoomFor(change, *plugIn)) return;
+        if (isLast && (!hasShareFor(change, *plugIn) || !hasRoomFor(change, *plugIn))) return;
         EVLOG_DEBUG(ops(), "client {} bulk plug-in {}({}) annotation change: {}", client_->pid(),
                     plugIn->identifier(), pub(plugIn->uuid()), value);
+        if (!isLast) continue;
         return annotate(change, *plugIn, [=, this] { bulkAnnotateNext(annotating); });
     }
     finishAnnotating();
