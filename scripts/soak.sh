@@ -1,7 +1,7 @@
 #!/usr/bin/env bash
 # Builds the daemon and has honest clients, hostile ones, applications that come and go, and plug-ins use
-# it at once, for so many minutes (besides half a minute to warm up). Fails when it has lost descriptors or
-# memory, or when somebody honest was refused, cut off or kept waiting.
+# it at once, for so many minutes (besides a quarter of that to warm up). Fails when it has lost descriptors
+# or memory, or when somebody honest was refused, cut off or kept waiting.
 # Usage: scripts/soak.sh MINUTES [PRESET, default release]
 set -euo pipefail
 cd "$(dirname "$0")/.."
